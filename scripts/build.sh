@@ -1,0 +1,26 @@
+#!/usr/bin/env bash
+# Configures and builds one flavour of the tree into build/<flavour>.
+#   gcc      g++, warnings as errors (the default)
+#   clang    clang++, warnings as errors
+#   asan     clang++ with AddressSanitizer and UndefinedBehaviorSanitizer
+#   tsan     clang++ with ThreadSanitizer
+#   release  g++ optimised, for the tools and benchmarks
+set -euo pipefail
+cd "$(dirname "$0")/.."
+
+flavour=${1:-gcc}
+args=(-G Ninja -DSWSEC_WERROR=ON)
+case "$flavour" in
+  gcc)     args+=(-DCMAKE_CXX_COMPILER=g++ -DCMAKE_C_COMPILER=gcc -DCMAKE_BUILD_TYPE=RelWithDebInfo) ;;
+  clang)   args+=(-DCMAKE_CXX_COMPILER=clang++ -DCMAKE_C_COMPILER=clang -DCMAKE_BUILD_TYPE=RelWithDebInfo) ;;
+  asan)    args+=(-DCMAKE_CXX_COMPILER=clang++ -DCMAKE_C_COMPILER=clang -DCMAKE_BUILD_TYPE=Debug
+                  "-DSWSEC_SANITIZE=address;undefined") ;;
+  tsan)    args+=(-DCMAKE_CXX_COMPILER=clang++ -DCMAKE_C_COMPILER=clang -DCMAKE_BUILD_TYPE=RelWithDebInfo
+                  -DSWSEC_SANITIZE=thread) ;;
+  release) args+=(-DCMAKE_CXX_COMPILER=g++ -DCMAKE_C_COMPILER=gcc -DCMAKE_BUILD_TYPE=Release) ;;
+  *) echo "build: unknown flavour '$flavour' (gcc, clang, asan, tsan, release)" >&2; exit 2 ;;
+esac
+
+dir="build/$flavour"
+cmake -S . -B "$dir" "${args[@]}" >/dev/null
+ninja -C "$dir" -j "$(nproc)"

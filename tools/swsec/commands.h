@@ -1,0 +1,29 @@
+// The subcommands of the swsec tool.
+#pragma once
+
+#include <map>
+#include <string>
+#include <vector>
+
+namespace CLI {
+class App;
+}
+
+namespace swsec::tools {
+
+// Exit statuses shared by every subcommand.
+inline constexpr int kExitOk = 0;
+inline constexpr int kExitFailure = 1;   // the module refused or failed
+inline constexpr int kExitUsage = 2;     // bad command line or bad input
+
+struct InfoOptions {
+   bool json = false;
+   bool verbose = false;
+   std::vector<std::string> parameters;  // NAME=VALUE
+   std::string modulePath;
+};
+
+void addInfoOptions(CLI::App &command, InfoOptions &options);
+int runInfo(const InfoOptions &options);
+
+}  // namespace swsec::tools

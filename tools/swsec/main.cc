@@ -1,0 +1,34 @@
+// swsec: puts the switch-security module to work in the user-space host.
+#include "commands.h"
+
+#include <CLI/CLI.hpp>
+
+#include <cstdio>
+#include <exception>
+
+int main(int argc, char **argv)
+{
+   CLI::App app{"swsec: the switch-security fast path, run in a user-space host"};
+   app.require_subcommand(1);
+
+   swsec::tools::InfoOptions info;
+   CLI::App *infoCommand =
+      app.add_subcommand("info", "load the module, show what it registered, unload it");
+   swsec::tools::addInfoOptions(*infoCommand, info);
+
+   try {
+      app.parse(argc, argv);
+   } catch (const CLI::ParseError &e) {
+      return app.exit(e) == 0 ? 0 : swsec::tools::kExitUsage;
+   }
+
+   try {
+      if (infoCommand->parsed()) {
+         return swsec::tools::runInfo(info);
+      }
+   } catch (const std::exception &e) {
+      std::fprintf(stderr, "swsec: %s\n", e.what());
+      return swsec::tools::kExitFailure;
+   }
+   return swsec::tools::kExitUsage;
+}

@@ -29,6 +29,11 @@ function(swsec_module_flags target)
   target_compile_options(${target} PRIVATE ${SWSEC_WARNINGS}
     -fno-exceptions -fno-rtti -fno-threadsafe-statics -fno-common
     -fvisibility=hidden -fvisibility-inlines-hidden -fno-builtin-malloc)
+  if(CMAKE_CXX_COMPILER_ID STREQUAL "GNU")
+    # A unique global would keep the image mapped after it is closed, and a
+    # reload must start from fresh globals.
+    target_compile_options(${target} PRIVATE -fno-gnu-unique)
+  endif()
   if(CMAKE_CXX_COMPILER_ID STREQUAL "Clang")
     target_compile_options(${target} PRIVATE -Wglobal-constructors -Wexit-time-destructors
       -Wthread-safety)

@@ -102,6 +102,8 @@ public:
    virtual bool isVirtual() const = 0;
    // Pending timers (one-shot or periodic) on all queues.
    virtual size_t pendingTimers() const = 0;
+   // Calls of orr_WorldSleep so far.
+   virtual uint64_t sleeps() const = 0;
 };
 
 // ---------------------------------------------------------------- locks
@@ -143,6 +145,98 @@ struct FastPathInfo {
    orr_SifraAgentHandle agent = nullptr;
 };
 
+// ---------------------------------------------------------------- frames
+
+// A frame the host builds for a test. Bytes are laid out in scatter-gather
+// elements of the lengths in `split` (zero-length elements allowed); bytes
+// left over after them form one last element; an empty `split` is one
+// element. Each element is its own exact-size allocation, so an overread
+// is caught by AddressSanitizer. Split lengths beyond the frame throw
+// std::invalid_argument.
+struct FrameSpec {
+   std::vector<uint8_t> bytes;
+   // VLAN ID metadata (orr_PktVlanIDGet).
+   uint16_t vlanId = 0;
+   // Untag as a virtual switch does: an 802.1Q tag in the bytes is removed
+   // and its VLAN ID becomes the metadata (split applies to the result).
+   bool untag = false;
+   std::vector<uint32_t> split;
+   // The mapped length. Default: the first element's length, raised to the
+   // filter's minimum mapped length, capped at the frame length. The mapped
+   // bytes are their own exact-size contiguous buffer.
+   std::optional<uint32_t> mappedLen;
+};
+
+// Frames the host made and handed out as one list (orr_PktList). Destroying
+// it returns the list to the host: every frame still in it is freed; a
+// frame with header mappings outstanding, or taken out of the list and
+// never released, is a violation.
+class FrameList {
+public:
+   virtual ~FrameList() = default;
+   virtual orr_PktList *list() = 0;
+   // The `index`th input frame, or null once it has been released.
+   virtual orr_Pkt *frame(size_t index) = 0;
+   // Indices of the input frames still in the list, in list order.
+   virtual std::vector<size_t> kept() const = 0;
+   // Frames released with orr_PktRelease.
+   virtual size_t released() const = 0;
+};
+
+class Frames {
+public:
+   virtual ~Frames() = default;
+   // Builds the frames as a list; `minMappedLen` raises the default mapped
+   // length as a filter's minimum would.
+   virtual std::unique_ptr<FrameList> makeList(const std::vector<FrameSpec> &frames, uint32_t minMappedLen = 0) = 0;
+   // Header mappings (orr_PktHeaderDataGet) not yet given back, over all frames.
+   virtual uint64_t outstandingMappings() const = 0;
+   // Frames released with orr_PktRelease since the host was made.
+   virtual uint64_t releases() const = 0;
+};
+
+// ---------------------------------------------------------------- Sifra filters
+
+using FilterId = uint64_t;
+
+// A filter's configuration as the module reads it through orr_SifraGet*.
+struct FilterConfig {
+   std::string name = "filter";
+   uint32_t failurePolicy = 0;
+   uint32_t endPointType = 0;               // 0: a VM's vNIC
+   std::optional<std::string> vmUuid;       // none: ORR_NO_VM_UUID
+   int32_t vnicIndex = 0;
+};
+
+struct FilterInfo {
+   FilterId id = 0;
+   std::string agent;                       // the fast path's name
+   uint32_t portID = 0;
+   FilterConfig config;
+   orr_SifraFilterHandle handle = nullptr;  // the host's handle, given to the module
+   orr_SifraFilter record = nullptr;        // the module's record, from createFilter
+   // orr_SifraSetMinPktMappedLen: length and directions (bit mask of ORR_SIFRA_DIR_*).
+   uint32_t minMappedLen = 0;
+   uint32_t minMappedDirections = 0;
+};
+
+struct DestroyResult {
+   orr_Status status = ORR_OK;   // the last call's status
+   uint32_t attempts = 0;        // calls made
+};
+
+struct IoctlReply {
+   FilterId filter = 0;
+   uint32_t requestId = 0;
+   std::vector<uint8_t> bytes;
+};
+
+struct PacketsResult {
+   orr_Status status = ORR_OK;
+   std::vector<size_t> kept;     // indices of the input frames still in the list, in order
+   size_t released = 0;          // frames the module released
+};
+
 class Sifra {
 public:
    virtual ~Sifra() = default;
@@ -151,6 +245,88 @@ public:
    virtual std::optional<FastPathInfo> fastPath(std::string_view name) const = 0;
    // Registered per-filter property names, in registration order.
    virtual std::vector<std::string> properties() const = 0;
+
+   // ---- filters, as the hypervisor drives them
+
+   // Creates a filter of the fast path registered as `agent` on the port
+   // `portID` (which must exist in a portset): calls the module's
+   // createFilter(agent handle, host handle, &record, 0) and keeps the
+   // record it returns. On success `*id` names the filter; on failure the
+   // module's status is returned and no filter exists. ORR_NOT_FOUND: no
+   // such fast path or port.
+   virtual orr_Status createFilter(std::string_view agent, uint32_t portID, const FilterConfig &config,
+                                   FilterId *id) = 0;
+   // One destroyFilter call; ORR_OK forgets the filter, any other status
+   // keeps it (the hypervisor would call again).
+   virtual orr_Status destroyFilter(FilterId id) = 0;
+   // Destroys as the hypervisor does: calls again while the module answers
+   // ORR_BUSY, advancing virtual time by 1 ms between calls, at most
+   // `maxAttempts` calls.
+   virtual DestroyResult destroyFilterAsHypervisor(FilterId id, uint32_t maxAttempts = 100) = 0;
+   // Replaces the filter's configuration, then calls configurationChanged.
+   virtual orr_Status changeConfiguration(FilterId id, const FilterConfig &config) = 0;
+   virtual std::optional<FilterInfo> filter(FilterId id) const = 0;
+   // Live filters, in creation order.
+   virtual std::vector<FilterInfo> filters() const = 0;
+
+   // Sends a filter ioctl: the payload is copied into an exact-size buffer
+   // and handed to processFilterIoctl; returns the module's status.
+   virtual orr_Status sendIoctl(FilterId id, uint32_t requestId, const std::vector<uint8_t> &payload) = 0;
+   // Every orr_SifraSendFilterIoctlReply accepted so far, in order.
+   virtual std::vector<IoctlReply> ioctlReplies() const = 0;
+   virtual void clearIoctlReplies() = 0;
+
+   // Hands the frames, as one list, to the filter's processPackets in
+   // `direction` (ORR_SIFRA_DIR_RX or ORR_SIFRA_DIR_TX); the filter's
+   // minimum mapped length for that direction applies. Thread-safe: several
+   // threads may hand lists to the same filter at once.
+   virtual PacketsResult processPackets(FilterId id, uint32_t direction, const std::vector<FrameSpec> &frames) = 0;
+};
+
+// ---------------------------------------------------------------- portsets
+
+struct MessageListenerInfo {
+   orr_PortsetMessageCBHandle handle = 0;
+   const orr_Portset *portset = nullptr;   // null: any portset
+   uint32_t portID = 0;                    // 0: any port
+   uint64_t msgClass = 0;
+   orr_PortsetMessageCB callback = nullptr;
+   void *priv = nullptr;
+};
+
+// A message as it was posted: class, name and payload copied at the post.
+struct PostedMessage {
+   std::string portset;          // the portset's name
+   uint32_t portID = 0;
+   uint64_t msgClass = 0;
+   std::string name;
+   std::vector<uint8_t> payload;
+};
+
+class Portsets {
+public:
+   virtual ~Portsets() = default;
+   // Registered message listeners, in registration order.
+   virtual std::vector<MessageListenerInfo> listeners() const = 0;
+
+   // Adds a portset (virtual switch); throws std::invalid_argument when the
+   // name is taken.
+   virtual orr_Portset *addPortset(std::string_view name) = 0;
+   // Adds a port to a portset; throws std::invalid_argument for an unknown
+   // portset, a port ID of 0 or one already in use.
+   virtual void addPort(std::string_view portset, uint32_t portID) = 0;
+   virtual orr_Portset *portset(std::string_view name) const = 0;
+   // orr_PortsetAcquireByPortID holds not yet released.
+   virtual uint64_t outstandingAcquisitions() const = 0;
+
+   // Every message posted, in order (delivered or not).
+   virtual std::vector<PostedMessage> posted() const = 0;
+   virtual void clearPosted() = 0;
+   // Messages posted and not yet delivered (the posting threads still hold locks).
+   virtual size_t pendingDeliveries() const = 0;
+   // The next post on a thread holding a portset shared turns the hold
+   // exclusive, as a post on a real switch may.
+   virtual void upgradeHoldOnNextPost() = 0;
 };
 
 // ---------------------------------------------------------------- loader
@@ -221,6 +397,8 @@ public:
    Locks &locks();
    Plex &plex();
    Sifra &sifra();
+   Portsets &portsets();
+   Frames &frames();
 
    struct State;
    State &state();

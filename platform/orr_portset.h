@@ -44,3 +44,25 @@ ORR_API orr_Status orr_PortsetRegisterMessageCB(orr_Portset *portset, uint32_t p
                                                 uint64_t msgClass, orr_PortsetMessageCB callback,
                                                 void *priv, orr_PortsetMessageCBHandle *handle);
 ORR_API void orr_PortsetUnregisterMessageCB(orr_PortsetMessageCBHandle handle);
+
+/*
+ * The portset lock as a poster of messages sees it. A message may be posted
+ * only while the calling CPU holds its portset's lock, shared or exclusive.
+ * A thread that does not hold it takes it shared for the post and lets it go
+ * afterwards according to the hold it then has (a post may turn a shared
+ * hold into an exclusive one).
+ */
+enum orr_PortsetHold : uint32_t {
+   ORR_PORTSET_HOLD_NONE = 0,
+   ORR_PORTSET_HOLD_EXCL = 1,
+   ORR_PORTSET_HOLD_SHARED = 2,
+};
+
+/* The calling CPU's hold on the portset's lock. */
+ORR_API orr_PortsetHold orr_PortsetHoldState(const orr_Portset *portset);
+/* Takes the portset's lock shared (the caller holds no hold on it). */
+ORR_API void orr_PortsetLockShared(orr_Portset *portset);
+/* Runs the portset work deferred while the lock was held, then leaves the shared hold. */
+ORR_API void orr_PortsetUnlockShared(orr_Portset *portset);
+/* Releases an exclusive hold together with the global portset lock it implies. */
+ORR_API void orr_PortsetUnlockExcl(orr_Portset *portset);

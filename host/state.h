@@ -1,0 +1,49 @@
+// The host's state: one instance per Host, reached by the platform's C
+// functions as the current host's.
+#pragma once
+
+#include "host/faults.h"
+#include "host/frames.h"
+#include "host/hash.h"
+#include "host/heap.h"
+#include "host/host.h"
+#include "host/loader.h"
+#include "host/locks.h"
+#include "host/log.h"
+#include "host/plex.h"
+#include "host/portsets.h"
+#include "host/sifra_registry.h"
+#include "host/symbolizer.h"
+#include "host/timers.h"
+#include "host/violations.h"
+
+namespace swsec::host {
+
+// Members are destroyed in reverse order: the loader first, the heaps last,
+// the timers (and their thread) before the locks their callbacks take; the
+// filters before the frames and portsets they use.
+struct Host::State {
+   Violations violations;
+   FaultTable faults;
+   Symbolizer symbolizer;
+   HeapRegistry heaps{violations, faults, symbolizer};
+   LogBook logs{violations, faults, heaps};
+   LockRegistry locks{violations, faults, heaps};
+   TimerService timers{violations, faults, heaps, locks, symbolizer};
+   PlexRegistry plex{violations, faults};
+   PortsetService portsets{violations, faults, locks};
+   FrameStore frames{violations, faults};
+   SifraRegistry sifra{violations, faults, portsets, frames, timers};
+   HashTables hashTables{violations, faults, heaps};
+   Loader loader{*this};
+};
+
+namespace detail {
+
+// The current host's state. A platform function called with no Host alive
+// has nothing to act on: it prints which one it was and aborts.
+Host::State &requireState(const char *operation);
+
+}  // namespace detail
+
+}  // namespace swsec::host

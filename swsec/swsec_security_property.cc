@@ -1,0 +1,125 @@
+/* The security property of the built-in agent. */
+#include "swsec/swsec_security_property.h"
+
+#include "framework/sifra_generic_filter.h"
+#include "framework/sifra_generic_log.h"
+#include "platform/orr_text.h"
+#include "swsec/config_record.h"
+
+#include <cstddef>
+
+constinit const orr_SifraPropertyOps securityPropOps = {
+   .write = SWSecPropWrite,
+   .read = SWSecPropRead,
+   .poll = SWSecPropPoll,
+   .cleanup = SWSecPropCleanup,
+};
+
+#define SWSEC_PROPERTY_NAME_LEN 128
+
+orr_Status SifraGenericFWInitProperty(SifraGenericFastPathAgent *agent)
+{
+   agent->propHandle = nullptr;
+   if (orr_Strncmp(agent->name, SIFRAGENERIC_BUILTIN_AGENT_NAME, SIFRAGENERIC_AGENT_NAME_LEN) != 0) {
+      return ORR_OK;
+   }
+
+   char propertyName[SWSEC_PROPERTY_NAME_LEN];
+   orr_Status status =
+      orr_StringFormat(propertyName, sizeof(propertyName), 0, "%s.security", agent->name);
+   if (status == ORR_OK) {
+      orr_SifraPropertyHandle handle = nullptr;
+      status = orr_SifraPropertyRegister(&handle, propertyName, &securityPropOps);
+      if (status == ORR_OK) {
+         agent->propHandle = handle;
+         SG_LOG(ORR_LOG_INFO, "%s: Registered security rules property handler", agent->name);
+         return ORR_OK;
+      }
+   }
+   SG_LOG(ORR_LOG_ERROR, "%s: Failed to register security property handler (%#x): %s",
+          agent->name, SifraGenericStatusValue(status), orr_StatusToString(status));
+   return status;
+}
+
+void SifraGenericFWCleanupProperty(SifraGenericFastPathAgent *agent)
+{
+   if (agent->propHandle == nullptr) {
+      return;
+   }
+   SG_LOG(ORR_LOG_INFO, "%s: Unregistering security property handler", agent->name);
+   orr_SifraPropertyUnregister(agent->propHandle);
+   agent->propHandle = nullptr;
+}
+
+/* The port context of a filter record, or null when there is none. */
+static void *SWSecPropContext(orr_SifraFilter filter)
+{
+   if (filter == nullptr) {
+      return nullptr;
+   }
+   return static_cast<SifraGenericFilter *>(filter)->agentData;
+}
+
+orr_Status SWSecPropWrite(orr_SifraFilter filter, void * /* extra */, const void *data,
+                          uint32_t length)
+{
+   /* An empty write carries no record, like a missing one. */
+   if (data == nullptr || length == 0) {
+      SG_LOG(ORR_LOG_ERROR, "Invalid security config");
+      return ORR_BAD_PARAM;
+   }
+   const auto *bytes = static_cast<const uint8_t *>(data);
+
+   const uint8_t version = bytes[offsetof(SwSecConfig, version)];
+   if (version != SWSEC_CONFIG_VERSION) {
+      SG_LOG(ORR_LOG_ERROR, "Invalid version. Got %d, expecting %d", version,
+             SWSEC_CONFIG_VERSION);
+      return ORR_BAD_PARAM;
+   }
+
+   /*
+    * numStatic is read only when the write holds it; a shorter write is
+    * measured against the bare header, the least a record can be.
+    */
+   uint32_t numStatic = 0;
+   if (length >= offsetof(SwSecConfig, numStatic) + sizeof(numStatic)) {
+      orr_Memcpy(&numStatic, bytes + offsetof(SwSecConfig, numStatic), sizeof(numStatic));
+   }
+   const uint64_t expected = SwSecConfigLength(numStatic);
+   if (length != expected) {
+      SG_LOG(ORR_LOG_ERROR, "Invalid security config length for version %u. Got %u, expecting %lu",
+             static_cast<unsigned>(SWSEC_CONFIG_VERSION), length,
+             static_cast<unsigned long>(expected));
+      return ORR_BAD_PARAM;
+   }
+
+   if (SWSecPropContext(filter) == nullptr) {
+      SG_LOG(ORR_LOG_ERROR, "Filter not found: %p", filter);
+      return ORR_INVALID_HANDLE;
+   }
+   /* Applying the record needs the port context, which comes with the filters. */
+   return ORR_NOT_SUPPORTED;
+}
+
+orr_Status SWSecPropRead(orr_SifraFilter filter, void * /* extra */, void * /* buffer */,
+                         uint32_t /* length */)
+{
+   if (SWSecPropContext(filter) == nullptr) {
+      return ORR_INVALID_HANDLE;
+   }
+   /* Reading the active record needs the port context, which comes with the filters. */
+   return ORR_NOT_SUPPORTED;
+}
+
+bool SWSecPropPoll(orr_SifraFilter filter, void * /* extra */, uint32_t * /* length */)
+{
+   if (SWSecPropContext(filter) == nullptr) {
+      return false;
+   }
+   /* The record's length needs the port context, which comes with the filters. */
+   return false;
+}
+
+void SWSecPropCleanup(void)
+{
+}

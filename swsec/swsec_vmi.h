@@ -1,0 +1,82 @@
+/*
+ * The records of a port database: the identity of a virtual machine
+ * interface (VMI: VLAN, MAC, IPv4 address), a database entry with how it was
+ * learned, and a pending DHCP request.
+ */
+#pragma once
+
+#include "platform/orr_hash.h"
+
+#include <cstddef>
+#include <cstdint>
+
+/* How a VMI was learned; bits, so that classes test by mask. */
+enum SwSecDiscMethod : uint8_t {
+   SwSecDiscDhcpSnooping = 1,
+   SwSecDiscStatic = 2,
+   SwSecDiscTofu = 4,
+   SwSecDiscApSnooping = 8,
+};
+
+constexpr uint8_t SwSecDiscAuthoritativeMask = SwSecDiscDhcpSnooping | SwSecDiscStatic;
+constexpr uint8_t SwSecDiscNonAuthoritativeMask = SwSecDiscTofu | SwSecDiscApSnooping;
+constexpr uint8_t SwSecDiscAllMask = SwSecDiscAuthoritativeMask | SwSecDiscNonAuthoritativeMask;
+
+/* The identity of a VMI: hash key, static entry and clear request layout. */
+struct __attribute__((packed)) SwSecVmiKey {
+   uint16_t vlanId;          /* host order */
+   uint8_t macAddr[6];
+   uint32_t ipAddr;          /* network order */
+};
+static_assert(sizeof(SwSecVmiKey) == 12);
+static_assert(offsetof(SwSecVmiKey, vlanId) == 0);
+static_assert(offsetof(SwSecVmiKey, macAddr) == 2);
+static_assert(offsetof(SwSecVmiKey, ipAddr) == 8);
+
+/*
+ * A port database entry, a zeroed heap record.
+ *
+ * Made by its learner (configuration, IP discovery, restore), owned by the
+ * database from a successful SwSecAddVmi to SwSecDelVmi, which frees it with
+ * its clientIdStr. Guarded by the port's configLock.
+ */
+struct SwSecVmi {
+   orr_ListLinks hashLinks;  /* in a portDbHash bucket; unlinked with a single entry */
+   orr_ListLinks listLinks;  /* in portDbList */
+   uint16_t vlanId;
+   uint8_t macAddr[6];
+   uint32_t ipAddr;          /* network order */
+   uint8_t discoveryMethod;  /* SwSecDiscMethod */
+   int64_t expiryTime;       /* uptime in seconds; 0 and unused for static entries */
+   /* DHCP entries only; the client identity group shared with SwSecDhcpReq. */
+   uint8_t chaddr[6];
+   uint8_t clientIdLen;
+   uint8_t *clientIdStr;     /* clientIdLen bytes, owned; null when clientIdLen is 0 */
+   uint32_t serverIp;        /* network order */
+   uint32_t leaseTime;       /* seconds, host order */
+};
+
+/*
+ * A DHCP request seen from the VM and not yet answered, a zeroed heap
+ * record in dhcpReqList; aged with the database.
+ */
+struct SwSecDhcpReq {
+   orr_ListLinks links;
+   uint16_t vlanId;
+   uint32_t xid;             /* byte order of the message */
+   uint8_t chaddr[6];
+   uint8_t clientIdLen;
+   uint8_t *clientIdStr;
+   int64_t expiryTime;
+};
+
+/* The client identity group has one shape in both records. */
+static_assert(offsetof(SwSecVmi, clientIdLen) - offsetof(SwSecVmi, chaddr) ==
+              offsetof(SwSecDhcpReq, clientIdLen) - offsetof(SwSecDhcpReq, chaddr));
+static_assert(offsetof(SwSecVmi, clientIdStr) - offsetof(SwSecVmi, chaddr) ==
+              offsetof(SwSecDhcpReq, clientIdStr) - offsetof(SwSecDhcpReq, chaddr));
+
+/* The most VMIs a port database may hold. */
+constexpr uint32_t SWSEC_PORT_DB_SIZE_MIN = 1;
+constexpr uint32_t SWSEC_PORT_DB_SIZE_MAX = 32;
+constexpr uint32_t SWSEC_PORT_DB_HASH_BUCKETS = 16;

@@ -1,0 +1,346 @@
+// Frames, frame lists and header lookup through the platform functions.
+#include "host_unit.h"
+#include "support/frames.h"
+
+#include <arpa/inet.h>
+#include <gmock/gmock.h>
+
+#include <array>
+#include <cstring>
+
+using ::testing::ElementsAre;
+using ::testing::HasSubstr;
+
+namespace swsec::testing {
+namespace {
+
+using host::FrameSpec;
+
+const Mac kVm = Mac::parse("02:00:00:00:00:01");
+const Mac kPeer = Mac::parse("02:00:00:00:00:02");
+
+Bytes sampleUdp(std::optional<uint16_t> vlanTag = std::nullopt)
+{
+   return udpFrame({.src = kVm, .dst = kPeer, .ipSrc = Ip4::parse("10.0.0.1"), .ipDst = Ip4::parse("10.0.0.2"),
+                    .srcPort = 68, .dstPort = 67, .vlanTag = vlanTag});
+}
+
+// Takes the only frame of a fresh list out of it.
+orr_Pkt *takeOut(host::FrameList &frames)
+{
+   alignas(void *) std::array<uint8_t, ORR_PKT_LIST_ITER_MAX_SIZE> storage{};
+   auto *iter = reinterpret_cast<orr_PktListIter *>(storage.data());
+   orr_PktListIterStart(frames.list(), iter);
+   return orr_PktListIterRemovePkt(iter);
+}
+
+void releaseTwice(host::FrameList &frames)
+{
+   orr_Pkt *pkt = takeOut(frames);
+   orr_PktRelease(pkt);
+   orr_PktRelease(pkt);
+}
+
+void releaseUnknownMapping(orr_Pkt *pkt)
+{
+   orr_PktHeaderEntry *entry = nullptr;
+   (void)orr_PktHeaderFind(pkt, ORR_PKT_LAYER_2, ORR_PKT_HEADER_CLASS_L2, 1, &entry, 0);
+   uint8_t unknown = 0;
+   orr_PktHeaderDataRelease(pkt, entry, &unknown, 0);
+}
+
+class FramesTest : public HostUnitTest {
+public:
+   orr_Pkt *single(FrameSpec spec, uint32_t minMappedLen = 0)
+   {
+      list = host.frames().makeList({std::move(spec)}, minMappedLen);
+      return list->frame(0);
+   }
+
+   std::unique_ptr<host::FrameList> list;
+};
+
+// ---- scatter-gather and mapped length
+
+TEST_F(FramesTest, SplitBecomesElementsAndTheRestOneLastElement)
+{
+   const Bytes bytes = sampleUdp();   // 14 + 20 + 8 + 18 = 60 bytes
+   orr_Pkt *pkt = single({.bytes = bytes, .split = {10, 0, 20}});
+   ASSERT_EQ(orr_PktSgArrayGet(pkt)->numElems, 4);
+   std::vector<uint32_t> lengths;
+   Bytes joined;
+   for (uint16_t index = 0; index < 4; ++index) {
+      const orr_SgElem *element = orr_PktSgElemGet(pkt, index);
+      ASSERT_NE(element, nullptr);
+      lengths.push_back(element->length);
+      void *va = nullptr;
+      ASSERT_EQ(orr_MA2VA(element->addr, element->length, &va), ORR_OK);
+      joined.insert(joined.end(), static_cast<uint8_t *>(va), static_cast<uint8_t *>(va) + element->length);
+   }
+   EXPECT_THAT(lengths, ElementsAre(10u, 0u, 20u, 30u));
+   EXPECT_EQ(joined, bytes);
+   EXPECT_EQ(orr_PktSgElemGet(pkt, 4), nullptr);
+   EXPECT_EQ(orr_PktFrameLenGet(pkt), 60u);
+}
+
+TEST_F(FramesTest, SplitLongerThanTheFrameIsRefused)
+{
+   EXPECT_THROW(host.frames().makeList({{.bytes = Bytes(20, 1), .split = {15, 6}}}), std::invalid_argument);
+   EXPECT_THROW(host.frames().makeList({{.bytes = Bytes(20, 1), .mappedLen = 21}}), std::invalid_argument);
+}
+
+TEST_F(FramesTest, MappedLengthRules)
+{
+   struct Case {
+      const char *what;
+      std::vector<uint32_t> split;
+      uint32_t minimum;
+      std::optional<uint32_t> override;
+      uint32_t expected;
+   };
+   const Case cases[] = {
+      {"one element maps the whole frame", {}, 0, std::nullopt, 60},
+      {"the first element by default", {14, 46}, 0, std::nullopt, 14},
+      {"raised to the filter's minimum", {14, 46}, 42, std::nullopt, 42},
+      {"capped at the frame", {14, 46}, 66, std::nullopt, 60},
+      {"a test override wins", {14, 46}, 42, 20, 20},
+      {"zero-length first element", {0, 60}, 0, std::nullopt, 0},
+   };
+   const Bytes bytes = sampleUdp();
+   for (const Case &c : cases) {
+      SCOPED_TRACE(c.what);
+      orr_Pkt *pkt = single({.bytes = bytes, .split = c.split, .mappedLen = c.override}, c.minimum);
+      ASSERT_EQ(orr_PktFrameMappedLenGet(pkt), c.expected);
+      EXPECT_EQ(0, std::memcmp(orr_PktFrameMappedPointerGet(pkt), bytes.data(), c.expected));
+   }
+}
+
+TEST_F(FramesTest, UntaggingMovesTheVlanIdIntoTheMetadata)
+{
+   const Bytes tagged = sampleUdp(uint16_t{42});
+   orr_Pkt *pkt = single({.bytes = tagged, .untag = true});
+   EXPECT_EQ(orr_PktVlanIDGet(pkt), 42);
+   EXPECT_EQ(orr_PktFrameLenGet(pkt), tagged.size() - 4);
+   Bytes copy(orr_PktFrameLenGet(pkt));
+   ASSERT_EQ(orr_PktCopyBytesOut(pkt, 0, static_cast<uint32_t>(copy.size()), copy.data()), ORR_OK);
+   EXPECT_EQ(copy, sampleUdp());
+
+   pkt = single({.bytes = tagged, .vlanId = 7});
+   EXPECT_EQ(orr_PktVlanIDGet(pkt), 7) << "without untagging the metadata is the test's";
+   EXPECT_EQ(orr_PktFrameLenGet(pkt), tagged.size());
+}
+
+// ---- copy-out and machine addresses
+
+TEST_F(FramesTest, CopyBytesOutIsBoundedByTheFrame)
+{
+   const Bytes bytes = sampleUdp();
+   orr_Pkt *pkt = single({.bytes = bytes, .split = {7, 7}});
+   std::array<uint8_t, 8> out{};
+   EXPECT_EQ(orr_PktCopyBytesOut(pkt, 52, 8, out.data()), ORR_OK);
+   EXPECT_EQ(0, std::memcmp(out.data(), bytes.data() + 52, 8));
+   EXPECT_EQ(orr_PktCopyBytesOut(pkt, 53, 8, out.data()), ORR_BAD_PARAM);
+   EXPECT_EQ(orr_PktCopyBytesOut(pkt, 61, 0, out.data()), ORR_BAD_PARAM);
+   EXPECT_EQ(orr_PktCopyBytesOut(pkt, 0xffffffffu, 2, out.data()), ORR_BAD_PARAM) << "no wrap-around";
+   EXPECT_EQ(orr_PktCopyBytesOut(pkt, 60, 0, out.data()), ORR_OK);
+   host.faults().failOnce("orr_PktCopyBytesOut", ORR_NO_MEMORY);
+   EXPECT_EQ(orr_PktCopyBytesOut(pkt, 0, 8, out.data()), ORR_NO_MEMORY);
+}
+
+TEST_F(FramesTest, MachineAddressesMapOnlyWithinOneLiveElement)
+{
+   orr_Pkt *pkt = single({.bytes = sampleUdp(), .split = {20}});
+   const orr_SgElem first = *orr_PktSgElemGet(pkt, 0);
+   const orr_SgElem second = *orr_PktSgElemGet(pkt, 1);
+   void *va = nullptr;
+   EXPECT_EQ(orr_MA2VA(first.addr + 4, 16, &va), ORR_OK);
+   EXPECT_EQ(0, std::memcmp(va, sampleUdp().data() + 4, 16));
+   EXPECT_NE(va, orr_PktFrameMappedPointerGet(pkt) + 4) << "an element is not the mapped buffer";
+   EXPECT_EQ(orr_MA2VA(first.addr + 4, 17, &va), ORR_BAD_PARAM) << "runs past the element";
+   EXPECT_EQ(orr_MA2VA(second.addr - 1, 2, &va), ORR_BAD_PARAM);
+   EXPECT_EQ(orr_MA2VA(1234, 1, &va), ORR_BAD_PARAM) << "not a machine address of a frame";
+   host.faults().failOnce("orr_MA2VA", ORR_FAILURE);
+   EXPECT_EQ(orr_MA2VA(second.addr, 1, &va), ORR_FAILURE);
+   list.reset();
+   EXPECT_EQ(orr_MA2VA(second.addr, 1, &va), ORR_BAD_PARAM) << "the frame went back to the host";
+}
+
+// ---- header lookup
+
+struct Layers {
+   std::optional<orr_PktHeaderEntry> l2, l3, l4;
+};
+
+Layers lookUp(orr_Pkt *pkt)
+{
+   Layers found;
+   const uint32_t classes[] = {ORR_PKT_HEADER_CLASS_L2, ORR_PKT_HEADER_CLASS_L3, ORR_PKT_HEADER_CLASS_L4};
+   std::optional<orr_PktHeaderEntry> *slots[] = {&found.l2, &found.l3, &found.l4};
+   for (uint32_t layer = 0; layer < 3; ++layer) {
+      orr_PktHeaderEntry *entry = nullptr;
+      if (orr_PktHeaderFind(pkt, static_cast<orr_PktLayer>(layer), classes[layer], 1, &entry, 0) == ORR_OK) {
+         *slots[layer] = *entry;
+      }
+   }
+   return found;
+}
+
+bool sameEntry(const std::optional<orr_PktHeaderEntry> &entry, std::optional<std::array<uint16_t, 4>> expected)
+{
+   if (!entry || !expected) {
+      return !entry && !expected;
+   }
+   return entry->offset == (*expected)[0] && entry->length == (*expected)[1] &&
+          entry->nextProto == (*expected)[2] && entry->nextHdrOffset == (*expected)[3];
+}
+
+TEST_F(FramesTest, HeaderLookupByFrameKind)
+{
+   using E = std::array<uint16_t, 4>;   // offset, length, nextProto, nextHdrOffset
+   const Arp arp{.senderMac = kVm, .senderIp = Ip4::parse("10.0.0.1"), .targetIp = Ip4::parse("10.0.0.2")};
+   const Bytes fragment = ethernet({.dst = kPeer, .src = kVm},
+                                   ipv4({.protocol = 17, .fragmentOffset = 4}, udp({}, Bytes(8, 0))));
+   const Bytes whole = sampleUdp();
+   const Bytes truncated(whole.begin(), whole.begin() + 30);
+   const Bytes tcp = ethernet({.dst = kPeer, .src = kVm}, ipv4({.protocol = 6}, Bytes(20, 0x50)));
+   struct Case {
+      const char *what;
+      Bytes bytes;
+      std::optional<E> l2, l3, l4;
+   };
+   const Case cases[] = {
+      {"UDP over IPv4", sampleUdp(), E{0, 14, htons(0x0800), 14}, E{14, 20, 17, 34}, E{34, 8, 0, 42}},
+      {"tagged UDP over IPv4", sampleUdp(uint16_t{5}), E{0, 18, htons(0x0800), 18}, E{18, 20, 17, 38},
+       E{38, 8, 0, 46}},
+      {"ARP", arpFrame(kVm, kBroadcastMac, arp), E{0, 14, htons(0x0806), 14}, E{14, 28, 0, 42}, std::nullopt},
+      {"UDP over IPv6", udp6Frame({.src = kVm, .dst = kPeer}), E{0, 14, htons(0x86dd), 14}, E{14, 40, 17, 54},
+       E{54, 8, 0, 62}},
+      {"802.3 BPDU", bpduFrame(kVm), E{0, 14, htons(38), 14}, std::nullopt, std::nullopt},
+      {"non-first IPv4 fragment", fragment, E{0, 14, htons(0x0800), 14}, E{14, 20, 17, 34}, std::nullopt},
+      {"TCP over IPv4", tcp, E{0, 14, htons(0x0800), 14}, E{14, 20, 6, 34}, E{34, 20, 0, 54}},
+      {"truncated IPv4", truncated, E{0, 14, htons(0x0800), 14},
+       std::nullopt, std::nullopt},
+      {"runt", Bytes(13, 0), std::nullopt, std::nullopt, std::nullopt},
+   };
+   for (const Case &c : cases) {
+      SCOPED_TRACE(c.what);
+      const Layers found = lookUp(single({.bytes = c.bytes}));
+      EXPECT_TRUE(sameEntry(found.l2, c.l2));
+      EXPECT_TRUE(sameEntry(found.l3, c.l3));
+      EXPECT_TRUE(sameEntry(found.l4, c.l4));
+   }
+}
+
+TEST_F(FramesTest, HeaderFindHonoursClassInstanceAndFaults)
+{
+   orr_Pkt *pkt = single({.bytes = sampleUdp()});
+   orr_PktHeaderEntry *entry = nullptr;
+   EXPECT_EQ(orr_PktHeaderFind(pkt, ORR_PKT_LAYER_3, ORR_PKT_HEADER_CLASS_L2, 1, &entry, 0), ORR_NOT_FOUND);
+   EXPECT_EQ(orr_PktHeaderFind(pkt, ORR_PKT_LAYER_3, ORR_PKT_HEADER_CLASS_L3, 2, &entry, 0), ORR_NOT_FOUND);
+   host.faults().failOnce("orr_PktHeaderFind", ORR_FAILURE);
+   EXPECT_EQ(orr_PktHeaderFind(pkt, ORR_PKT_LAYER_3, ORR_PKT_HEADER_CLASS_L3, 1, &entry, 0), ORR_FAILURE);
+   EXPECT_EQ(orr_PktHeaderFind(pkt, ORR_PKT_LAYER_3, ORR_PKT_HEADER_CLASS_L3, 1, &entry, 0), ORR_OK);
+}
+
+TEST_F(FramesTest, HeaderDataComesFromMappedPartElementOrCopy)
+{
+   const Bytes bytes = sampleUdp();
+   // Mapped: 14 bytes; elements 14 | 30 | 16: IPv4 header (14..34) lies in
+   // the second element, UDP (34..42) is spread over the second and third.
+   orr_Pkt *pkt = single({.bytes = bytes, .split = {14, 30}});
+   orr_PktHeaderEntry *entries[3] = {};
+   uint8_t *data[3] = {};
+   const uint32_t classes[] = {ORR_PKT_HEADER_CLASS_L2, ORR_PKT_HEADER_CLASS_L3, ORR_PKT_HEADER_CLASS_L4};
+   for (uint32_t layer = 0; layer < 3; ++layer) {
+      ASSERT_EQ(orr_PktHeaderFind(pkt, static_cast<orr_PktLayer>(layer), classes[layer], 1, &entries[layer], 0),
+                ORR_OK);
+      ASSERT_EQ(orr_PktHeaderDataGet(pkt, entries[layer], &data[layer]), ORR_OK);
+      EXPECT_EQ(0, std::memcmp(data[layer], bytes.data() + entries[layer]->offset, entries[layer]->length));
+   }
+   EXPECT_EQ(data[0], orr_PktFrameMappedPointerGet(pkt));
+   void *second = nullptr;
+   ASSERT_EQ(orr_MA2VA(orr_PktSgElemGet(pkt, 1)->addr, 30, &second), ORR_OK);
+   EXPECT_EQ(data[1], second);
+   EXPECT_EQ(host.frames().outstandingMappings(), 3u);
+   for (uint32_t layer = 3; layer-- > 0;) {
+      orr_PktHeaderDataRelease(pkt, entries[layer], data[layer], 0);
+   }
+   EXPECT_EQ(host.frames().outstandingMappings(), 0u);
+   host.faults().failOnce("orr_PktHeaderDataGet", ORR_NO_MEMORY);
+   EXPECT_EQ(orr_PktHeaderDataGet(pkt, entries[0], &data[0]), ORR_NO_MEMORY);
+   EXPECT_EQ(host.frames().outstandingMappings(), 0u);
+}
+
+// ---- lists, removal and release
+
+TEST_F(FramesTest, IteratorRemovalAndReleaseAccounting)
+{
+   ASSERT_LE(orr_PktListIterSizeOf(), ORR_PKT_LIST_ITER_MAX_SIZE);
+   list = host.frames().makeList({{.bytes = Bytes(60, 0)}, {.bytes = Bytes(61, 0)}, {.bytes = Bytes(62, 0)},
+                                  {.bytes = Bytes(63, 0)}});
+   alignas(void *) std::array<uint8_t, ORR_PKT_LIST_ITER_MAX_SIZE> storage{};
+   auto *iter = reinterpret_cast<orr_PktListIter *>(storage.data());
+   orr_PktListIterStart(list->list(), iter);
+   std::vector<uint32_t> seen;
+   while (!orr_PktListIterIsAtEnd(iter)) {
+      orr_Pkt *pkt = orr_PktListIterGetPkt(iter);
+      seen.push_back(orr_PktFrameLenGet(pkt));
+      if (orr_PktFrameLenGet(pkt) % 2 == 0) {
+         EXPECT_EQ(orr_PktListIterRemovePkt(iter), pkt);
+         orr_PktRelease(pkt);
+      } else {
+         orr_PktListIterMove(iter);
+      }
+   }
+   EXPECT_THAT(seen, ElementsAre(60u, 61u, 62u, 63u)) << "removal moves to the next frame";
+   EXPECT_THAT(list->kept(), ElementsAre(1u, 3u));
+   EXPECT_EQ(list->released(), 2u);
+   EXPECT_EQ(list->frame(0), nullptr);
+   EXPECT_EQ(host.frames().releases(), 2u);
+}
+
+TEST_F(FramesTest, ReturningFramesWithWorkOutstandingIsAViolation)
+{
+   list = host.frames().makeList({{.bytes = sampleUdp()}, {.bytes = sampleUdp()}});
+   orr_PktHeaderEntry *entry = nullptr;
+   uint8_t *data = nullptr;
+   ASSERT_EQ(orr_PktHeaderFind(list->frame(0), ORR_PKT_LAYER_2, ORR_PKT_HEADER_CLASS_L2, 1, &entry, 0), ORR_OK);
+   ASSERT_EQ(orr_PktHeaderDataGet(list->frame(0), entry, &data), ORR_OK);
+   alignas(void *) std::array<uint8_t, ORR_PKT_LIST_ITER_MAX_SIZE> storage{};
+   auto *iter = reinterpret_cast<orr_PktListIter *>(storage.data());
+   orr_PktListIterStart(list->list(), iter);
+   orr_PktListIterMove(iter);
+   (void)orr_PktListIterRemovePkt(iter);   // taken out, never released
+   list.reset();
+   const auto violations = takeViolations();
+   ASSERT_EQ(violations.size(), 2u);
+   EXPECT_THAT(violations[0], HasSubstr("header mapping(s) outstanding"));
+   EXPECT_THAT(violations[1], HasSubstr("never released"));
+   EXPECT_EQ(host.frames().outstandingMappings(), 0u);
+}
+
+TEST_F(FramesTest, ReleasingWithAMappingOutstandingIsAViolation)
+{
+   orr_Pkt *pkt = single({.bytes = sampleUdp()});
+   orr_PktHeaderEntry *entry = nullptr;
+   uint8_t *data = nullptr;
+   ASSERT_EQ(orr_PktHeaderFind(pkt, ORR_PKT_LAYER_2, ORR_PKT_HEADER_CLASS_L2, 1, &entry, 0), ORR_OK);
+   ASSERT_EQ(orr_PktHeaderDataGet(pkt, entry, &data), ORR_OK);
+   orr_PktRelease(takeOut(*list));
+   const auto violations = takeViolations();
+   ASSERT_EQ(violations.size(), 1u);
+   EXPECT_THAT(violations[0], HasSubstr("released with 1 header mapping(s) outstanding"));
+}
+
+using FramesDeathTest = FramesTest;
+
+TEST_F(FramesDeathTest, MisusedFramesAbortWithAMessage)
+{
+   GTEST_FLAG_SET(death_test_style, "threadsafe");
+   EXPECT_DEATH(orr_PktRelease(single({.bytes = Bytes(60, 0)})), "still in a list");
+   EXPECT_DEATH(releaseTwice(*host.frames().makeList({{.bytes = Bytes(60, 0)}})), "released twice");
+   EXPECT_DEATH(releaseUnknownMapping(single({.bytes = sampleUdp()})), "is not a mapping of header");
+}
+
+}  // namespace
+}  // namespace swsec::testing

@@ -1,0 +1,121 @@
+// Log components and the records the host keeps of what was written.
+#include "host_unit.h"
+
+#include <gmock/gmock.h>
+
+using ::testing::HasSubstr;
+
+namespace swsec::testing {
+namespace {
+
+class LogTest : public HostUnitTest {
+protected:
+   orr_LogHandle makeLog(const char *name, int32_t level = 0)
+   {
+      orr_LogProps props{};
+      orr_NameInitialize(&props.name, name);
+      props.level = level;
+      orr_LogHandle log = nullptr;
+      EXPECT_EQ(orr_LogRegister(&props, &log), ORR_OK);
+      return log;
+   }
+};
+
+TEST_F(LogTest, ComponentMessageIsFormattedAndCarriesTheComponentName)
+{
+   orr_LogHandle log = makeLog("swsec");
+   orr_LogLevel(ORR_LOG_ERROR, log, orr_LogGetCurrentLogLevel(log), "%s: value %d (%#x)\n", orr_LogGetName(log), 42,
+                0x0bad0014u);
+   auto records = host.log().records();
+   ASSERT_EQ(records.size(), 1u);
+   EXPECT_EQ(records[0].severity, 2u);
+   EXPECT_TRUE(records[0].hasComponent);
+   EXPECT_FALSE(records[0].viaNoLevel);
+   EXPECT_EQ(records[0].component, "swsec");
+   EXPECT_EQ(records[0].text, "swsec: value 42 (0xbad0014)\n");
+   orr_LogUnregister(log);
+}
+
+TEST_F(LogTest, MessageAboveTheComponentLevelIsNotWritten)
+{
+   orr_LogHandle log = makeLog("quiet", 1);
+   EXPECT_EQ(orr_LogGetCurrentLogLevel(log), 1);
+   orr_LogLevel(ORR_LOG_INFO, log, 2, "too detailed\n");
+   orr_LogLevel(ORR_LOG_INFO, log, 1, "at the level\n");
+   orr_LogLevel(ORR_LOG_INFO, log, 0, "below the level\n");
+   EXPECT_FALSE(host.log().contains("too detailed"));
+   EXPECT_TRUE(host.log().contains("at the level"));
+   EXPECT_TRUE(host.log().contains("below the level"));
+   orr_LogUnregister(log);
+}
+
+TEST_F(LogTest, MessagesWithoutAComponentAreKeptAndMarked)
+{
+   orr_LogLevel(ORR_LOG_INFO, nullptr, 0, "before the log exists\n");
+   orr_LogNoLevel(ORR_LOG_ERROR, "Registration failed (%#x): %s\n", 0x0bad0001u, "Failure");
+   auto records = host.log().records();
+   ASSERT_EQ(records.size(), 2u);
+   EXPECT_FALSE(records[0].hasComponent);
+   EXPECT_FALSE(records[0].viaNoLevel) << "went nowhere a user would see";
+   EXPECT_EQ(records[0].severity, 1u);
+   EXPECT_FALSE(records[1].hasComponent);
+   EXPECT_TRUE(records[1].viaNoLevel);
+   EXPECT_EQ(records[1].text, "Registration failed (0xbad0001): Failure\n");
+}
+
+TEST_F(LogTest, LongMessagesAreKeptWhole)
+{
+   const std::string long_text(5000, 'x');
+   orr_LogNoLevel(ORR_LOG_ERROR, "%s|\n", long_text.c_str());
+   auto records = host.log().records();
+   ASSERT_EQ(records.size(), 1u);
+   EXPECT_EQ(records[0].text, long_text + "|\n");
+}
+
+TEST_F(LogTest, RegistrationRefusesASecondComponentOfTheSameName)
+{
+   orr_LogHandle log = makeLog("twice");
+   orr_LogProps props{};
+   orr_NameInitialize(&props.name, "twice");
+   orr_LogHandle second = nullptr;
+   EXPECT_EQ(orr_LogRegister(&props, &second), ORR_EXISTS);
+   EXPECT_EQ(second, nullptr);
+   orr_LogUnregister(log);
+   EXPECT_EQ(orr_LogRegister(&props, &second), ORR_OK) << "the name is free again";
+   orr_LogUnregister(second);
+}
+
+TEST_F(LogTest, RegistrationRefusesAnExtraSettingAndAnUnknownHeap)
+{
+   orr_LogProps props{};
+   orr_NameInitialize(&props.name, "refused");
+   int extra = 0;
+   props.extra = &extra;
+   orr_LogHandle log = nullptr;
+   EXPECT_EQ(orr_LogRegister(&props, &log), ORR_BAD_PARAM);
+   props.extra = nullptr;
+   orr_HeapID heap = makeHeap("gone");
+   orr_HeapDestroy(heap);
+   props.heap = heap;
+   EXPECT_EQ(orr_LogRegister(&props, &log), ORR_INVALID_HANDLE);
+}
+
+TEST_F(LogTest, WritingThroughAnUnregisteredHandleIsAViolation)
+{
+   orr_LogHandle log = makeLog("stale");
+   orr_LogUnregister(log);
+   orr_LogLevel(ORR_LOG_ERROR, log, 0, "into freed memory\n");
+   auto violations = takeViolations();
+   ASSERT_EQ(violations.size(), 1u);
+   EXPECT_THAT(violations[0], HasSubstr("orr_LogLevel: unknown log handle"));
+   EXPECT_FALSE(host.log().contains("into freed memory"));
+}
+
+TEST_F(LogTest, SeverityOutsideOneAndTwoIsAViolation)
+{
+   orr_LogNoLevel(3, "what kind\n");
+   EXPECT_EQ(takeViolations().size(), 1u);
+}
+
+}  // namespace
+}  // namespace swsec::testing

@@ -1,0 +1,197 @@
+// Portsets, ports and holds; message posting, queueing and delivery.
+#include "host_unit.h"
+
+#include <gmock/gmock.h>
+
+#include <cstring>
+
+using ::testing::ElementsAre;
+using ::testing::HasSubstr;
+
+namespace swsec::testing {
+namespace {
+
+constexpr uint64_t kClass = 1ull << 51;
+
+struct Delivery {
+   uint32_t portID;
+   std::string name;
+   std::string payload;
+   bool posterHeldLocks;
+};
+std::vector<Delivery> deliveries;
+
+void recordDelivery(uint32_t portID, uint64_t msgClass, const orr_PortsetMessageHeader *message)
+{
+   EXPECT_EQ(msgClass, kClass);
+   const auto *payload = reinterpret_cast<const char *>(message + 1);
+   deliveries.push_back({portID, message->name, std::string(payload, message->payloadLength),
+                         orr_PortsetHoldState(host::Host::current().portsets().portset("vswitch0")) !=
+                            ORR_PORTSET_HOLD_NONE});
+}
+
+// A message with its payload following the header.
+struct Message {
+   orr_PortsetMessageHeader header{};
+   char payload[16] = {};
+
+   Message(const char *name, const char *text)
+   {
+      orr_NameInitialize(reinterpret_cast<orr_Name *>(header.name), name);
+      header.payloadLength = std::strlen(text);
+      std::memcpy(payload, text, header.payloadLength);
+   }
+};
+static_assert(offsetof(Message, payload) == sizeof(orr_PortsetMessageHeader));
+
+class PortsetsTest : public HostUnitTest {
+public:
+   PortsetsTest()
+   {
+      deliveries.clear();
+      vswitch = host.portsets().addPortset("vswitch0");
+      host.portsets().addPort("vswitch0", 10);
+      host.portsets().addPort("vswitch0", 11);
+   }
+
+   orr_PortsetMessageCBHandle listen(orr_Portset *portset, uint32_t portID, uint64_t msgClass = kClass)
+   {
+      orr_PortsetMessageCBHandle handle = 0;
+      EXPECT_EQ(orr_PortsetRegisterMessageCB(portset, portID, msgClass, recordDelivery, nullptr, &handle), ORR_OK);
+      return handle;
+   }
+
+   orr_Portset *vswitch = nullptr;
+};
+
+TEST_F(PortsetsTest, AcquireByPortFindsThePortsetAndCountsHolds)
+{
+   orr_PortsetHandle handle{};
+   EXPECT_EQ(orr_PortsetAcquireByPortID(99, ORR_PORTSET_ACQUIRE_SHARED, &handle), ORR_NOT_FOUND);
+   EXPECT_EQ(orr_PortsetAcquireByPortID(10, 0, &handle), ORR_BAD_PARAM);
+   ASSERT_EQ(orr_PortsetAcquireByPortID(11, ORR_PORTSET_ACQUIRE_SHARED, &handle), ORR_OK);
+   EXPECT_EQ(handle.portset, vswitch);
+   EXPECT_EQ(host.portsets().outstandingAcquisitions(), 1u);
+   orr_PortsetRelease(&handle);
+   EXPECT_EQ(host.portsets().outstandingAcquisitions(), 0u);
+   host.faults().failOnce("orr_PortsetAcquireByPortID", ORR_NO_MEMORY);
+   EXPECT_EQ(orr_PortsetAcquireByPortID(10, ORR_PORTSET_ACQUIRE_SHARED, &handle), ORR_NO_MEMORY);
+
+   orr_PortsetRelease(&handle);   // released twice
+   ASSERT_EQ(takeViolations().size(), 1u);
+}
+
+TEST_F(PortsetsTest, PortsAndPortsetsAreUnique)
+{
+   EXPECT_THROW(host.portsets().addPortset("vswitch0"), std::invalid_argument);
+   EXPECT_THROW(host.portsets().addPort("vswitch0", 10), std::invalid_argument);
+   EXPECT_THROW(host.portsets().addPort("nowhere", 12), std::invalid_argument);
+   EXPECT_THROW(host.portsets().addPort("vswitch0", 0), std::invalid_argument);
+}
+
+TEST_F(PortsetsTest, MessagesWaitUntilThePosterLetsGoOfItsLocks)
+{
+   const orr_PortsetMessageCBHandle listener = listen(vswitch, 0);
+   const orr_LockDomainID domain = makeDomain();
+   const orr_Spinlock config = makeLock(domain, "test.config", 4, ORR_SPINLOCK_RW);
+
+   orr_SpinlockWriteLock(config);
+   orr_PortsetLockShared(vswitch);
+   EXPECT_EQ(orr_PortsetHoldState(vswitch), ORR_PORTSET_HOLD_SHARED);
+   const Message first("portdb.entry.added", "one");
+   const Message second("portdb.entry.removed", "two");
+   EXPECT_EQ(orr_PortsetPostMessage(vswitch, 10, kClass, &first.header), ORR_OK);
+   EXPECT_EQ(orr_PortsetPostMessage(vswitch, 11, kClass, &second.header), ORR_OK);
+   orr_PortsetUnlockShared(vswitch);
+   EXPECT_TRUE(deliveries.empty()) << "still under the poster's spinlock";
+   EXPECT_EQ(host.portsets().pendingDeliveries(), 2u);
+   orr_SpinlockWriteUnlock(config);
+
+   ASSERT_EQ(deliveries.size(), 2u);
+   EXPECT_EQ(deliveries[0].portID, 10u);
+   EXPECT_EQ(deliveries[0].name, "portdb.entry.added");
+   EXPECT_EQ(deliveries[0].payload, "one");
+   EXPECT_FALSE(deliveries[0].posterHeldLocks);
+   EXPECT_EQ(deliveries[1].name, "portdb.entry.removed");
+   EXPECT_EQ(deliveries[1].payload, "two");
+   EXPECT_EQ(host.portsets().pendingDeliveries(), 0u);
+
+   const auto posted = host.portsets().posted();
+   ASSERT_EQ(posted.size(), 2u);
+   EXPECT_EQ(posted[1].portset, "vswitch0");
+   EXPECT_EQ(posted[1].portID, 11u);
+   EXPECT_EQ(posted[1].msgClass, kClass);
+   EXPECT_EQ(std::string(posted[1].payload.begin(), posted[1].payload.end()), "two");
+
+   orr_PortsetUnregisterMessageCB(listener);
+   orr_SpinlockDestroy(config);
+   orr_LockDomainDestroy(domain);
+}
+
+TEST_F(PortsetsTest, ListenersMatchPortsetPortAndClass)
+{
+   orr_Portset *other = host.portsets().addPortset("vswitch1");
+   host.portsets().addPort("vswitch1", 20);
+   const orr_PortsetMessageCBHandle handles[] = {
+      listen(vswitch, 10),          // this port only
+      listen(nullptr, 0),           // anything of the class
+      listen(other, 0),             // another portset
+      listen(vswitch, 0, kClass >> 1),   // another class
+   };
+   const Message message("m", "x");
+   orr_PortsetLockShared(vswitch);
+   EXPECT_EQ(orr_PortsetPostMessage(vswitch, 11, kClass, &message.header), ORR_OK);
+   EXPECT_EQ(orr_PortsetPostMessage(vswitch, 10, kClass, &message.header), ORR_OK);
+   orr_PortsetUnlockShared(vswitch);
+   ASSERT_EQ(deliveries.size(), 3u) << "port 11: the catch-all; port 10: both";
+   EXPECT_EQ(deliveries[0].portID, 11u);
+   EXPECT_EQ(deliveries[1].portID, 10u);
+   EXPECT_EQ(deliveries[2].portID, 10u);
+   for (auto handle : handles) {
+      orr_PortsetUnregisterMessageCB(handle);
+   }
+}
+
+TEST_F(PortsetsTest, PostingNeedsTheLockAndCanFail)
+{
+   const Message message("m", "x");
+   EXPECT_EQ(orr_PortsetPostMessage(vswitch, 10, kClass, &message.header), ORR_FAILURE);
+   auto violations = takeViolations();
+   ASSERT_EQ(violations.size(), 1u);
+   EXPECT_THAT(violations[0], HasSubstr("without holding its lock"));
+
+   orr_PortsetLockShared(vswitch);
+   host.faults().failOnce("orr_PortsetPostMessage", ORR_NO_MEMORY);
+   EXPECT_EQ(orr_PortsetPostMessage(vswitch, 10, kClass, &message.header), ORR_NO_MEMORY);
+   orr_PortsetUnlockShared(vswitch);
+   EXPECT_TRUE(host.portsets().posted().empty());
+}
+
+TEST_F(PortsetsTest, APostMayTurnTheHoldExclusive)
+{
+   const Message message("m", "x");
+   host.portsets().upgradeHoldOnNextPost();
+   orr_PortsetLockShared(vswitch);
+   EXPECT_EQ(orr_PortsetPostMessage(vswitch, 10, kClass, &message.header), ORR_OK);
+   EXPECT_EQ(orr_PortsetHoldState(vswitch), ORR_PORTSET_HOLD_EXCL);
+   orr_PortsetUnlockExcl(vswitch);
+   EXPECT_EQ(orr_PortsetHoldState(vswitch), ORR_PORTSET_HOLD_NONE);
+   EXPECT_EQ(host.portsets().pendingDeliveries(), 0u);
+}
+
+using PortsetsDeathTest = PortsetsTest;
+
+TEST_F(PortsetsDeathTest, UnlockingAHoldNotHeldAborts)
+{
+   GTEST_FLAG_SET(death_test_style, "threadsafe");
+   EXPECT_DEATH(orr_PortsetUnlockShared(vswitch), "not held shared");
+   EXPECT_DEATH(
+      {
+         orr_PortsetLockShared(vswitch);
+         orr_PortsetUnlockExcl(vswitch);
+      },
+      "not held exclusive");
+}
+
+}  // namespace
+}  // namespace swsec::testing

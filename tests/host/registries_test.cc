@@ -1,0 +1,204 @@
+// Registrations by name: Plex client-port properties, Sifra fast paths and
+// per-filter properties, portset message listeners.
+#include "host_unit.h"
+
+#include <gmock/gmock.h>
+
+using ::testing::ElementsAre;
+using ::testing::HasSubstr;
+
+namespace swsec::testing {
+namespace {
+
+// What the last write handler call received.
+struct WriteSeen {
+   int calls = 0;
+   bool contextWasNull = false;
+   std::string bytes;
+   int32_t count = -1;
+   orr_Status answer = ORR_OK;
+};
+WriteSeen seen;
+
+orr_Status recordWrite(void *portset, void *port, void *extra, const char *bytes, int32_t count)
+{
+   ++seen.calls;
+   seen.contextWasNull = portset == nullptr && port == nullptr && extra == nullptr;
+   seen.bytes.assign(bytes, static_cast<size_t>(count));
+   seen.count = count;
+   return seen.answer;
+}
+
+const orr_PlexClientPortOps writeOps = {.write = recordWrite, .read = nullptr, .poll = nullptr, .cleanup = nullptr};
+
+class PlexTest : public HostUnitTest {
+public:
+   PlexTest() { seen = WriteSeen{}; }
+};
+
+TEST_F(PlexTest, WriteHandsTheBytesAndTheirCountToTheHandler)
+{
+   orr_PlexClientPortHandle handle = nullptr;
+   ASSERT_EQ(orr_PlexClientPortRegister(&handle, 0, "com.example.agents", &writeOps), ORR_OK);
+   seen.answer = ORR_TRY_AGAIN;
+   EXPECT_EQ(host.plex().write("com.example.agents", "a b:c"), ORR_TRY_AGAIN) << "the handler's status comes back";
+   EXPECT_EQ(seen.calls, 1);
+   EXPECT_TRUE(seen.contextWasNull);
+   EXPECT_EQ(seen.bytes, "a b:c");
+   EXPECT_EQ(seen.count, 5);
+   EXPECT_EQ(host.plex().write("com.example.agents", ""), ORR_TRY_AGAIN);
+   EXPECT_EQ(seen.count, 0);
+   EXPECT_EQ(orr_PlexClientPortUnregister(handle), ORR_OK);
+   EXPECT_EQ(host.plex().write("com.example.agents", "x"), ORR_NOT_FOUND);
+   EXPECT_EQ(seen.calls, 2);
+}
+
+TEST_F(PlexTest, NamesAreUniqueAndListedInRegistrationOrder)
+{
+   orr_PlexClientPortHandle first = nullptr;
+   orr_PlexClientPortHandle second = nullptr;
+   orr_PlexClientPortHandle again = nullptr;
+   ASSERT_EQ(orr_PlexClientPortRegister(&first, 0, "port.b", &writeOps), ORR_OK);
+   ASSERT_EQ(orr_PlexClientPortRegister(&second, 0, "port.a", &writeOps), ORR_OK);
+   EXPECT_EQ(orr_PlexClientPortRegister(&again, 0, "port.b", &writeOps), ORR_EXISTS);
+   EXPECT_EQ(again, nullptr);
+   EXPECT_THAT(host.plex().clientPorts(), ElementsAre("port.b", "port.a"));
+   EXPECT_EQ(orr_PlexClientPortUnregister(first), ORR_OK);
+   EXPECT_EQ(orr_PlexClientPortUnregister(second), ORR_OK);
+   EXPECT_TRUE(host.plex().clientPorts().empty());
+}
+
+TEST_F(PlexTest, RegistrationNeedsAWriteOperationAndNoFlags)
+{
+   const orr_PlexClientPortOps noWrite = {};
+   orr_PlexClientPortHandle handle = nullptr;
+   EXPECT_EQ(orr_PlexClientPortRegister(&handle, 0, "port", &noWrite), ORR_BAD_PARAM);
+   EXPECT_EQ(orr_PlexClientPortRegister(&handle, 1, "port", &writeOps), ORR_BAD_PARAM);
+   EXPECT_TRUE(host.plex().clientPorts().empty());
+}
+
+TEST_F(PlexTest, UnregisteringNothingIsRefused)
+{
+   EXPECT_EQ(orr_PlexClientPortUnregister(nullptr), ORR_INVALID_HANDLE);
+   orr_PlexClientPortHandle handle = nullptr;
+   ASSERT_EQ(orr_PlexClientPortRegister(&handle, 0, "port", &writeOps), ORR_OK);
+   ASSERT_EQ(orr_PlexClientPortUnregister(handle), ORR_OK);
+   EXPECT_EQ(orr_PlexClientPortUnregister(handle), ORR_INVALID_HANDLE);
+   auto violations = takeViolations();
+   ASSERT_EQ(violations.size(), 1u) << "a stale handle is a violation, a null one is not";
+   EXPECT_THAT(violations[0], HasSubstr("unknown registration"));
+}
+
+// ---------------------------------------------------------------- Sifra
+
+const orr_SifraFastPathOps opsA = {};
+const orr_SifraFastPathOps opsB = {};
+const orr_SifraPropertyOps propertyOps = {};
+
+using SifraTest = HostUnitTest;
+
+TEST_F(SifraTest, FastPathsAreListedWithTheirOperationsAndAgent)
+{
+   int agentA = 0;
+   int agentB = 0;
+   orr_SifraFastPath a = nullptr;
+   orr_SifraFastPath b = nullptr;
+   ASSERT_EQ(orr_SifraRegisterFastPath("agent-a", 0x1010000, 0x1010000, 77, &opsA, &agentA, &a), ORR_OK);
+   ASSERT_EQ(orr_SifraRegisterFastPath("agent-b", 0x1010000, 0x1010000, 77, &opsB, &agentB, &b), ORR_OK);
+   auto fastPaths = host.sifra().fastPaths();
+   ASSERT_EQ(fastPaths.size(), 2u);
+   EXPECT_EQ(fastPaths[0].name, "agent-a");
+   EXPECT_EQ(fastPaths[0].ops, &opsA);
+   EXPECT_EQ(fastPaths[0].agent, &agentA);
+   EXPECT_EQ(fastPaths[0].module, 77u);
+   EXPECT_EQ(fastPaths[0].revision, 0x1010000u);
+   EXPECT_EQ(fastPaths[1].name, "agent-b");
+   auto found = host.sifra().fastPath("agent-b");
+   ASSERT_TRUE(found.has_value());
+   EXPECT_EQ(found->agent, &agentB);
+   orr_SifraUnregisterFastPath(a);
+   EXPECT_FALSE(host.sifra().fastPath("agent-a").has_value());
+   orr_SifraUnregisterFastPath(b);
+}
+
+TEST_F(SifraTest, ASecondFastPathOfTheSameNameIsRefused)
+{
+   int first = 0;
+   int second = 0;
+   orr_SifraFastPath a = nullptr;
+   orr_SifraFastPath again = nullptr;
+   ASSERT_EQ(orr_SifraRegisterFastPath("same", 0x1010000, 0x1010000, 1, &opsA, &first, &a), ORR_OK);
+   EXPECT_EQ(orr_SifraRegisterFastPath("same", 0x1010000, 0x1010000, 1, &opsB, &second, &again), ORR_EXISTS);
+   EXPECT_EQ(again, nullptr);
+   ASSERT_EQ(host.sifra().fastPaths().size(), 1u);
+   EXPECT_EQ(host.sifra().fastPaths()[0].agent, &first) << "the first registration stands";
+   orr_SifraUnregisterFastPath(a);
+}
+
+TEST_F(SifraTest, AFastPathNeedingANewerHostIsRefused)
+{
+   orr_SifraFastPath fastPath = nullptr;
+   EXPECT_EQ(orr_SifraRegisterFastPath("future", 0x2000000, 0x2000000, 1, &opsA, nullptr, &fastPath),
+             ORR_NOT_SUPPORTED);
+   EXPECT_TRUE(host.sifra().fastPaths().empty());
+}
+
+TEST_F(SifraTest, UnregisteringAnUnknownFastPathIsAViolation)
+{
+   orr_SifraFastPath fastPath = nullptr;
+   ASSERT_EQ(orr_SifraRegisterFastPath("once", 0x1010000, 0x1010000, 1, &opsA, nullptr, &fastPath), ORR_OK);
+   orr_SifraUnregisterFastPath(fastPath);
+   orr_SifraUnregisterFastPath(fastPath);
+   auto violations = takeViolations();
+   ASSERT_EQ(violations.size(), 1u);
+   EXPECT_THAT(violations[0], HasSubstr("orr_SifraUnregisterFastPath: unknown fast path"));
+}
+
+TEST_F(SifraTest, PropertiesAreUniqueByName)
+{
+   orr_SifraPropertyHandle first = nullptr;
+   orr_SifraPropertyHandle again = nullptr;
+   orr_SifraPropertyHandle other = nullptr;
+   ASSERT_EQ(orr_SifraPropertyRegister(&first, "agent-a.security", &propertyOps), ORR_OK);
+   EXPECT_EQ(orr_SifraPropertyRegister(&again, "agent-a.security", &propertyOps), ORR_EXISTS);
+   ASSERT_EQ(orr_SifraPropertyRegister(&other, "agent-b.security", &propertyOps), ORR_OK);
+   EXPECT_THAT(host.sifra().properties(), ElementsAre("agent-a.security", "agent-b.security"));
+   orr_SifraPropertyUnregister(first);
+   EXPECT_THAT(host.sifra().properties(), ElementsAre("agent-b.security"));
+   orr_SifraPropertyUnregister(first);
+   EXPECT_EQ(takeViolations().size(), 1u);
+   orr_SifraPropertyUnregister(other);
+}
+
+// ---------------------------------------------------------------- portsets
+
+void listener(uint32_t, uint64_t, const orr_PortsetMessageHeader *) {}
+
+using PortsetListenerTest = HostUnitTest;
+
+TEST_F(PortsetListenerTest, RegistrationsAreKeptUntilWithdrawn)
+{
+   int priv = 0;
+   orr_PortsetMessageCBHandle first = 0;
+   orr_PortsetMessageCBHandle second = 0;
+   ASSERT_EQ(orr_PortsetRegisterMessageCB(nullptr, 0, 0x0008000000000000ull, listener, &priv, &first), ORR_OK);
+   ASSERT_EQ(orr_PortsetRegisterMessageCB(nullptr, 12, 1, listener, nullptr, &second), ORR_OK);
+   EXPECT_NE(first, 0u);
+   EXPECT_NE(first, second);
+   auto listeners = host.portsets().listeners();
+   ASSERT_EQ(listeners.size(), 2u);
+   EXPECT_EQ(listeners[0].handle, first);
+   EXPECT_EQ(listeners[0].msgClass, 0x0008000000000000ull);
+   EXPECT_EQ(listeners[0].callback, &listener);
+   EXPECT_EQ(listeners[0].priv, &priv);
+   EXPECT_EQ(listeners[1].portID, 12u);
+   orr_PortsetUnregisterMessageCB(first);
+   ASSERT_EQ(host.portsets().listeners().size(), 1u);
+   EXPECT_EQ(host.portsets().listeners()[0].handle, second);
+   orr_PortsetUnregisterMessageCB(first);
+   EXPECT_EQ(takeViolations().size(), 1u);
+   orr_PortsetUnregisterMessageCB(second);
+}
+
+}  // namespace
+}  // namespace swsec::testing

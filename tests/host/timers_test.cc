@@ -1,0 +1,301 @@
+// Virtual time and timers: one time base for uptime and cycles, timers
+// fired in due-time order, periodic re-arming, removal (also from inside a
+// callback and while a callback runs elsewhere), sleeps that move time.
+#include "host_unit.h"
+
+#include <gmock/gmock.h>
+
+#include <atomic>
+#include <future>
+#include <thread>
+
+using ::testing::ElementsAre;
+using ::testing::HasSubstr;
+using namespace std::chrono_literals;
+
+namespace swsec::testing {
+namespace {
+
+int64_t uptimeUs()
+{
+   orr_TimeVal now{};
+   orr_GetUptime(&now);
+   return now.sec * 1'000'000 + now.usec;
+}
+
+// What a timer callback saw: which timer it was and when it ran.
+struct Firing {
+   int id;
+   int64_t uptimeUs;
+   bool operator==(const Firing &) const = default;
+};
+
+struct Recorder {
+   std::vector<Firing> firings;
+   struct Tag {
+      Recorder *recorder;
+      int id;
+   };
+   std::vector<std::unique_ptr<Tag>> tags;
+
+   void *tag(int id)
+   {
+      tags.push_back(std::make_unique<Tag>(Tag{this, id}));
+      return tags.back().get();
+   }
+   static void callback(void *data)
+   {
+      auto *tag = static_cast<Tag *>(data);
+      tag->recorder->firings.push_back(Firing{tag->id, uptimeUs()});
+   }
+   std::vector<int> ids() const
+   {
+      std::vector<int> result;
+      for (const auto &firing : firings) {
+         result.push_back(firing.id);
+      }
+      return result;
+   }
+};
+
+class TimerTest : public HostUnitTest {
+public:
+   TimerTest() : domain(makeDomain()), queue(makeQueue()), start(uptimeUs()) {}
+
+   orr_Timer schedule(void *data, int64_t timeoutUs, int64_t periodUs = ORR_TIMER_ONE_SHOT,
+                      orr_TimerCallback callback = Recorder::callback)
+   {
+      orr_Timer timer = 0;
+      EXPECT_EQ(orr_TimerSchedule(queue, callback, data, timeoutUs, periodUs, 0, domain, 1, &timer), ORR_OK);
+      EXPECT_NE(timer, 0u);
+      return timer;
+   }
+
+   orr_LockDomainID domain;
+   orr_TimerQueue queue;
+   int64_t start;
+   Recorder recorder;
+};
+
+TEST_F(TimerTest, UptimeAndCyclesDeriveFromOneVirtualClock)
+{
+   EXPECT_EQ(start, 1000 * 1'000'000) << "time starts at a non-zero uptime";
+   const uint64_t cyclesPerSecond = orr_TimerCyclesPerSecond();
+   const uint64_t cyclesBefore = orr_GetTimerCycles();
+   EXPECT_EQ(cyclesBefore, 1000 * cyclesPerSecond);
+   EXPECT_EQ(uptimeUs(), start) << "virtual time stands still on its own";
+
+   host.clock().advance(2'500'000us);
+   orr_TimeVal now{};
+   orr_GetUptime(&now);
+   EXPECT_EQ(now.sec, 1002);
+   EXPECT_EQ(now.usec, 500'000);
+   EXPECT_EQ(orr_GetTimerCycles() - cyclesBefore, cyclesPerSecond * 5 / 2);
+   EXPECT_EQ(host.clock().now(), 2'500'000us);
+}
+
+TEST_F(TimerTest, AdvanceFiresDueTimersInDueOrderAtTheirDueTimes)
+{
+   schedule(recorder.tag(3), 300);
+   schedule(recorder.tag(1), 100);
+   schedule(recorder.tag(2), 200);
+   host.clock().advance(250us);
+   EXPECT_THAT(recorder.firings, ElementsAre(Firing{1, start + 100}, Firing{2, start + 200}));
+   EXPECT_EQ(uptimeUs(), start + 250);
+   EXPECT_EQ(host.clock().pendingTimers(), 1u);
+   host.clock().advance(50us);
+   EXPECT_THAT(recorder.ids(), ElementsAre(1, 2, 3));
+   EXPECT_EQ(host.clock().pendingTimers(), 0u);
+}
+
+TEST_F(TimerTest, TimersDueTogetherFireInTheOrderTheyWereAdded)
+{
+   schedule(recorder.tag(1), 50, 50);
+   schedule(recorder.tag(2), 100);
+   orr_Timer system = 0;
+   ASSERT_EQ(orr_TimerAdd(Recorder::callback, recorder.tag(3), 100, false, 0, &system), ORR_OK);
+   host.clock().advance(100us);
+   EXPECT_THAT(recorder.firings,
+               ElementsAre(Firing{1, start + 50}, Firing{1, start + 100}, Firing{2, start + 100}, Firing{3, start + 100}));
+}
+
+TEST_F(TimerTest, PeriodicTimerFiresEveryPeriod)
+{
+   orr_Timer timer = 0;
+   ASSERT_EQ(orr_TimerAdd(Recorder::callback, recorder.tag(7), 10'000'000, true, 0x2001, &timer), ORR_OK);
+   host.clock().advance(35s);
+   EXPECT_THAT(recorder.firings, ElementsAre(Firing{7, start + 10'000'000}, Firing{7, start + 20'000'000},
+                                             Firing{7, start + 30'000'000}));
+   host.clock().advance(4s);
+   host.clock().advance(1s);
+   EXPECT_EQ(recorder.firings.size(), 4u);
+   EXPECT_EQ(recorder.firings.back().uptimeUs, start + 40'000'000);
+   EXPECT_TRUE(orr_TimerRemoveSync(timer));
+}
+
+TEST_F(TimerTest, ZeroTimeoutIsDueAtOnceButFiresOnlyWhenAsked)
+{
+   schedule(recorder.tag(1), 0);
+   EXPECT_TRUE(recorder.firings.empty()) << "never inside the scheduling call";
+   host.clock().runDue();
+   EXPECT_THAT(recorder.firings, ElementsAre(Firing{1, start}));
+   EXPECT_EQ(host.clock().now(), 0us);
+}
+
+struct SelfRemoving {
+   orr_Timer timer = 0;
+   int calls = 0;
+   bool removed = false;
+   static void callback(void *data)
+   {
+      auto *self = static_cast<SelfRemoving *>(data);
+      if (++self->calls == 2) {
+         self->removed = orr_TimerRemoveSync(self->timer);
+      }
+   }
+};
+
+TEST_F(TimerTest, CallbackRemovingItsOwnTimerStopsItWithoutWaitingForItself)
+{
+   SelfRemoving self;
+   self.timer = schedule(&self, 10, 10, SelfRemoving::callback);
+   host.clock().advance(100us);
+   EXPECT_EQ(self.calls, 2);
+   EXPECT_TRUE(self.removed);
+   EXPECT_EQ(host.clock().pendingTimers(), 0u);
+}
+
+TEST_F(TimerTest, RemoveSyncTellsWhetherTheTimerWasStillPending)
+{
+   orr_Timer pending = schedule(recorder.tag(1), 100);
+   orr_Timer fired = schedule(recorder.tag(2), 10);
+   host.clock().advance(50us);
+   EXPECT_TRUE(orr_TimerRemoveSync(pending));
+   EXPECT_FALSE(orr_TimerRemoveSync(fired)) << "a one-shot timer that fired is gone";
+   EXPECT_FALSE(orr_TimerRemoveSync(0));
+   host.clock().advance(100us);
+   EXPECT_THAT(recorder.ids(), ElementsAre(2));
+}
+
+struct Blocking {
+   std::promise<void> entered;
+   std::shared_future<void> release;
+   std::atomic<bool> finished{false};
+   static void callback(void *data)
+   {
+      auto *self = static_cast<Blocking *>(data);
+      self->entered.set_value();
+      self->release.wait();
+      self->finished = true;
+   }
+};
+
+TEST_F(TimerTest, RemoveSyncWaitsForACallbackRunningOnAnotherThread)
+{
+   std::promise<void> release;
+   Blocking blocking;
+   blocking.release = release.get_future().share();
+   orr_Timer timer = schedule(&blocking, 10, ORR_TIMER_ONE_SHOT, Blocking::callback);
+   std::thread advancer([&] { host.clock().advance(10us); });
+   blocking.entered.get_future().wait();
+
+   std::atomic<bool> removerStarted{false};
+   bool removed = false;
+   bool finishedWhenRemoved = false;
+   std::thread remover([&] {
+      removerStarted = true;
+      removed = orr_TimerRemoveSync(timer);
+      finishedWhenRemoved = blocking.finished;
+   });
+   while (!removerStarted) {
+      std::this_thread::yield();
+   }
+   release.set_value();
+   remover.join();
+   advancer.join();
+   EXPECT_TRUE(blocking.finished);
+   // The remover either waited for the running callback, or came after it
+   // had finished and found nothing left to remove.
+   if (removed) {
+      EXPECT_TRUE(finishedWhenRemoved);
+   }
+   EXPECT_EQ(host.clock().pendingTimers(), 0u);
+}
+
+TEST_F(TimerTest, SleepMovesVirtualTimeAndFiresWhatFallsDue)
+{
+   schedule(recorder.tag(1), 5000);
+   schedule(recorder.tag(2), 20000);
+   orr_WorldSleep(10000);
+   EXPECT_THAT(recorder.firings, ElementsAre(Firing{1, start + 5000}));
+   EXPECT_EQ(uptimeUs(), start + 10000);
+   EXPECT_EQ(host.clock().sleeps(), 1u);
+}
+
+struct RankedWork {
+   orr_Spinlock lock;
+   bool done = false;
+   static void callback(void *data)
+   {
+      auto *self = static_cast<RankedWork *>(data);
+      orr_SpinlockLock(self->lock);
+      self->done = true;
+      orr_SpinlockUnlock(self->lock);
+   }
+};
+
+TEST_F(TimerTest, CallbackMayTakeLocksAboveItsRank)
+{
+   RankedWork work{makeLock(domain, "sifg.fastpath", 2)};
+   schedule(&work, 0, ORR_TIMER_ONE_SHOT, RankedWork::callback);
+   host.clock().runDue();
+   EXPECT_TRUE(work.done);
+   orr_SpinlockDestroy(work.lock);
+}
+
+TEST_F(TimerTest, DestroyingAQueueWithPendingTimersIsAViolationAndCancelsThem)
+{
+   orr_TimerQueue other = makeQueue("doomed.queue");
+   orr_Timer timer = 0;
+   ASSERT_EQ(orr_TimerSchedule(other, Recorder::callback, recorder.tag(1), 10, ORR_TIMER_ONE_SHOT, 0, domain, 1, &timer),
+             ORR_OK);
+   orr_TimerQueueDestroy(other);
+   auto violations = takeViolations();
+   ASSERT_EQ(violations.size(), 1u);
+   EXPECT_THAT(violations[0], HasSubstr("'doomed.queue' destroyed with 1 pending timer"));
+   host.clock().advance(100us);
+   EXPECT_TRUE(recorder.firings.empty());
+}
+
+TEST_F(TimerTest, SchedulingRefusesWhatCannotBeHonoured)
+{
+   orr_Timer timer = 0;
+   EXPECT_EQ(orr_TimerSchedule(queue, Recorder::callback, nullptr, -1, ORR_TIMER_ONE_SHOT, 0, domain, 1, &timer),
+             ORR_BAD_PARAM);
+   EXPECT_EQ(orr_TimerSchedule(queue, Recorder::callback, nullptr, 0, 0, 0, domain, 1, &timer), ORR_BAD_PARAM)
+      << "a period of 0 would fire for ever";
+   EXPECT_EQ(orr_TimerSchedule(queue, Recorder::callback, nullptr, 0, ORR_TIMER_ONE_SHOT, 0, domain + 99, 1, &timer),
+             ORR_INVALID_HANDLE);
+   EXPECT_EQ(orr_TimerAdd(Recorder::callback, nullptr, 0, true, 0, &timer), ORR_BAD_PARAM);
+   EXPECT_EQ(timer, 0u);
+   EXPECT_EQ(host.clock().pendingTimers(), 0u);
+}
+
+TEST_F(TimerTest, RealTimeFiresTimersOnAHostThread)
+{
+   host.clock().useRealTime();
+   EXPECT_FALSE(host.clock().isVirtual());
+   EXPECT_THROW(host.clock().advance(1us), std::logic_error);
+   EXPECT_GE(uptimeUs(), start) << "time does not jump back at the switch";
+   std::promise<std::thread::id> ran;
+   orr_Timer timer = 0;
+   ASSERT_EQ(orr_TimerAdd([](void *data) { static_cast<std::promise<std::thread::id> *>(data)->set_value(std::this_thread::get_id()); },
+                          &ran, 0, false, 0, &timer),
+             ORR_OK);
+   auto fired = ran.get_future();
+   ASSERT_EQ(fired.wait_for(10s), std::future_status::ready);
+   EXPECT_NE(fired.get(), std::this_thread::get_id());
+}
+
+}  // namespace
+}  // namespace swsec::testing

@@ -186,15 +186,15 @@ FrameStore::Frame &FrameStore::checked(const orr_Pkt *pkt, const char *op)
    return *frame;
 }
 
-std::unique_ptr<FrameList> FrameStore::makeList(const std::vector<FrameSpec> &specs, uint32_t minMappedLen)
+std::unique_ptr<FrameList> FrameStore::makeList(const std::vector<FrameSpec> &frameSpecs, uint32_t minMappedLen)
 {
    auto list = std::make_unique<List>(*this);
-   for (const FrameSpec &spec : specs) {
+   for (const FrameSpec &frameSpec : frameSpecs) {
       auto frame = std::make_unique<Frame>();
-      frame->bytes = spec.bytes;
-      frame->vlanId = spec.vlanId;
+      frame->bytes = frameSpec.bytes;
+      frame->vlanId = frameSpec.vlanId;
       auto &bytes = frame->bytes;
-      if (spec.untag && bytes.size() >= 18 && ((bytes[12] << 8) | bytes[13]) == kEtherVlan) {
+      if (frameSpec.untag && bytes.size() >= 18 && ((bytes[12] << 8) | bytes[13]) == kEtherVlan) {
          frame->vlanId = static_cast<uint16_t>(((bytes[14] << 8) | bytes[15]) & 0x0fff);
          bytes.erase(bytes.begin() + 12, bytes.begin() + 16);
       }
@@ -203,7 +203,7 @@ std::unique_ptr<FrameList> FrameStore::makeList(const std::vector<FrameSpec> &sp
       }
       const auto length = static_cast<uint32_t>(bytes.size());
 
-      std::vector<uint32_t> split = spec.split;
+      std::vector<uint32_t> split = frameSpec.split;
       uint64_t total = 0;
       for (uint32_t part : split) {
          total += part;
@@ -230,11 +230,11 @@ std::unique_ptr<FrameList> FrameStore::makeList(const std::vector<FrameSpec> &sp
       }
       frame->sgArray.numElems = static_cast<uint16_t>(split.size());
 
-      if (spec.mappedLen) {
-         if (*spec.mappedLen > length) {
+      if (frameSpec.mappedLen) {
+         if (*frameSpec.mappedLen > length) {
             throw std::invalid_argument("mapped length beyond the frame");
          }
-         frame->mappedLen = *spec.mappedLen;
+         frame->mappedLen = *frameSpec.mappedLen;
       } else {
          frame->mappedLen = std::min(std::max(split.front(), minMappedLen), length);
       }

@@ -51,9 +51,9 @@ void releaseUnknownMapping(orr_Pkt *pkt)
 
 class FramesTest : public HostUnitTest {
 public:
-   orr_Pkt *single(FrameSpec spec, uint32_t minMappedLen = 0)
+   orr_Pkt *single(FrameSpec frameSpec, uint32_t minMappedLen = 0)
    {
-      list = host.frames().makeList({std::move(spec)}, minMappedLen);
+      list = host.frames().makeList({std::move(frameSpec)}, minMappedLen);
       return list->frame(0);
    }
 

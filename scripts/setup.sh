@@ -2,6 +2,10 @@
 # Installs the Debian packages that swsec needs to build, test and run.
 # Idempotent and quick when everything is already there. Works as root on a
 # fresh Debian 12; as another user it needs sudo.
+#
+#   --capture-tools  also the real DHCP servers and clients, tcpdump and
+#                    scapy that regenerate the test captures (tests/data/);
+#                    the tests themselves replay committed captures.
 set -euo pipefail
 
 packages=(
@@ -12,6 +16,9 @@ packages=(
   # the swsec tool
   libcli11-dev nlohmann-json3-dev libpcap-dev
 )
+if [ "${1:-}" = "--capture-tools" ]; then
+  packages+=(iproute2 dnsmasq isc-dhcp-client udhcpc tcpdump tshark python3-scapy)
+fi
 
 missing=()
 for p in "${packages[@]}"; do

@@ -281,6 +281,19 @@ public:
    // minimum mapped length for that direction applies. Thread-safe: several
    // threads may hand lists to the same filter at once.
    virtual PacketsResult processPackets(FilterId id, uint32_t direction, const std::vector<FrameSpec> &frames) = 0;
+
+   // ---- per-filter properties, as the management plane uses them
+
+   // Writes a registered property of a filter (no filter: the operation gets
+   // a null record). The bytes are handed over in an exact-size buffer.
+   // ORR_NOT_FOUND when no property of that name is registered.
+   virtual orr_Status writeProperty(std::string_view property, std::optional<FilterId> filter,
+                                    const std::vector<uint8_t> &bytes) = 0;
+   // Reads into `buffer`, whose size is the length offered to the module.
+   virtual orr_Status readProperty(std::string_view property, std::optional<FilterId> filter,
+                                   std::vector<uint8_t> &buffer) = 0;
+   // The length a read needs, or nothing when the module has no value.
+   virtual std::optional<uint32_t> pollProperty(std::string_view property, std::optional<FilterId> filter) = 0;
 };
 
 // ---------------------------------------------------------------- portsets

@@ -5,6 +5,9 @@
 #include "host/state.h"
 
 #include <algorithm>
+#include <memory>
+#include <stdexcept>
+#include <string>
 
 namespace swsec::host {
 
@@ -194,3 +197,79 @@ ORR_API void orr_SifraPropertyUnregister(orr_SifraPropertyHandle handle)
 {
    requireState("orr_SifraPropertyUnregister").sifra.unregisterProperty(handle);
 }
+
+namespace swsec::host {
+
+std::optional<SifraRegistry::PropertyCall> SifraRegistry::propertyCallOf(std::string_view property,
+                                                                       std::optional<FilterId> filter) const
+{
+   PropertyCall call;
+   {
+      std::lock_guard guard(mutex_);
+      for (const auto &[key, record] : properties_) {
+         if (record->name == property) {
+            call.ops = record->ops;
+         }
+      }
+   }
+   if (call.ops == nullptr) {
+      return std::nullopt;
+   }
+   if (filter) {
+      auto filterCall = callOf(*filter);
+      if (!filterCall) {
+         throw std::invalid_argument("property '" + std::string(property) + "': no filter " +
+                                     std::to_string(*filter));
+      }
+      call.record = filterCall->record;
+   }
+   return call;
+}
+
+orr_Status SifraRegistry::writeProperty(std::string_view property, std::optional<FilterId> filter,
+                                        const std::vector<uint8_t> &bytes)
+{
+   auto call = propertyCallOf(property, filter);
+   if (!call || call->ops->write == nullptr) {
+      return ORR_NOT_FOUND;
+   }
+   // An exact-size copy, so that a read past the written bytes is caught.
+   auto buffer = std::make_unique<uint8_t[]>(bytes.size());
+   std::copy(bytes.begin(), bytes.end(), buffer.get());
+   const orr_Status status = call->ops->write(call->record, nullptr, bytes.empty() ? nullptr : buffer.get(),
+                                              static_cast<uint32_t>(bytes.size()));
+   afterModuleCall();
+   return status;
+}
+
+orr_Status SifraRegistry::readProperty(std::string_view property, std::optional<FilterId> filter,
+                                       std::vector<uint8_t> &buffer)
+{
+   auto call = propertyCallOf(property, filter);
+   if (!call || call->ops->read == nullptr) {
+      return ORR_NOT_FOUND;
+   }
+   auto exact = std::make_unique<uint8_t[]>(buffer.size());
+   const orr_Status status =
+      call->ops->read(call->record, nullptr, exact.get(), static_cast<uint32_t>(buffer.size()));
+   std::copy(exact.get(), exact.get() + buffer.size(), buffer.begin());
+   afterModuleCall();
+   return status;
+}
+
+std::optional<uint32_t> SifraRegistry::pollProperty(std::string_view property, std::optional<FilterId> filter)
+{
+   auto call = propertyCallOf(property, filter);
+   if (!call || call->ops->poll == nullptr) {
+      return std::nullopt;
+   }
+   uint32_t length = 0;
+   const bool hasValue = call->ops->poll(call->record, nullptr, &length);
+   afterModuleCall();
+   if (!hasValue) {
+      return std::nullopt;
+   }
+   return length;
+}
+
+}  // namespace swsec::host

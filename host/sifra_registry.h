@@ -61,6 +61,11 @@ public:
    std::vector<IoctlReply> ioctlReplies() const override;
    void clearIoctlReplies() override;
    PacketsResult processPackets(FilterId id, uint32_t direction, const std::vector<FrameSpec> &frames) override;
+   orr_Status writeProperty(std::string_view property, std::optional<FilterId> filter,
+                            const std::vector<uint8_t> &bytes) override;
+   orr_Status readProperty(std::string_view property, std::optional<FilterId> filter,
+                           std::vector<uint8_t> &buffer) override;
+   std::optional<uint32_t> pollProperty(std::string_view property, std::optional<FilterId> filter) override;
 
    struct FastPath;
    struct Property;
@@ -74,6 +79,13 @@ private:
       uint32_t minMappedLen = 0;
    };
    std::optional<Call> callOf(FilterId id, uint32_t direction = 0) const;
+   // The operations of a registered property and the record of `filter`
+   // (null without one); nothing when either is unknown.
+   struct PropertyCall {
+      const orr_SifraPropertyOps *ops = nullptr;
+      orr_SifraFilter record = nullptr;
+   };
+   std::optional<PropertyCall> propertyCallOf(std::string_view property, std::optional<FilterId> filter) const;
    // The filter of a handle with `guard` holding the registry's lock, or
    // null (reported, lock released).
    Filter *lockedFilter(std::unique_lock<std::mutex> &guard, orr_SifraFilterHandle handle, const char *op);

@@ -1,0 +1,617 @@
+#!/usr/bin/python3
+"""Writes MANIFEST.md and manifest.json for the captures of this folder.
+
+    /usr/bin/python3 tests/data/make-manifest.py
+
+For every capture it lists the frames (tshark's one-line summary) and works out
+what a correct port must do with them, by running a small reference model of
+the port's per-frame rules over the frames in order, under two port
+configurations:
+
+  learning   features 0x04 (IP discovery), trusted port            (the default)
+  enforcing  features 0x1f (BPDU filter, DHCP server block, IP discovery,
+             ARP inspection, IP source guard), untrusted port,
+             arpRateLimit 10, errRateLimit 5, errRateLimitPeriod 10
+
+Times: the port's clock is the capture's time; each capture starts 0.5 s after
+the port was configured, so the rate limiters' first interval opens with the
+first counted frame. VLAN: untagged frames are VLAN 0, 802.1Q-tagged frames
+carry their VID. No capture is long enough (all under 60 s) for a pending
+request or a lease to age out, and no error-rate-limit state can end before
+the capture does (it lasts at least 10 s, the flood capture ends 4 s later).
+"""
+import json
+import os
+import struct
+import subprocess
+
+HERE = os.path.dirname(os.path.abspath(__file__))
+
+SRV = {"serverMac": "02:00:5e:c0:00:fe", "serverIp": "192.0.2.1"}
+FOREIGN_MAC = "02:00:5e:c0:00:99"
+
+CAPTURES = [
+    ("dhclient-lease-renew-release", "02:00:5e:c0:00:01", "real",
+     "make-captures.sh: dhclient (isc-dhcp-client 4.4.3, Debian's default dhclient.conf, so no client "
+     "identifier) against dnsmasq 2.90 (lease 120 s, T1 10 s, T2 20 s, dhcp-host pins 192.0.2.101); "
+     "a ping to the server after the ACK, the renewal at T1, then `dhclient -r`."),
+    ("dhclient-reboot-nak", "02:00:5e:c0:00:02", "real",
+     "make-captures.sh: dhclient started with a remembered lease of 198.51.100.50 (another network); its "
+     "INIT-REBOOT REQUEST is answered with DHCPNAK by the authoritative dnsmasq; the client starts over "
+     "(DISCOVER..ACK for 192.0.2.102) and is then released."),
+    ("udhcpc-no-clientid", "02:00:5e:c0:00:03", "real",
+     "make-captures.sh: busybox 1.35 udhcpc -C -a (no client identifier, ARP check of the address): "
+     "exchange for 192.0.2.104, renewal on SIGUSR1, release on SIGUSR2."),
+    ("udhcpc-custom-clientid", "02:00:5e:c0:00:04", "real",
+     "make-captures.sh: udhcpc -x 0x3d:ff00000001000100015ec00004 (client identifier type 255, "
+     "IAID+DUID style, not the MAC): exchange for 192.0.2.105, renewal (SIGUSR1), release (SIGUSR2)."),
+    ("udhcpc-renew-nak", "02:00:5e:c0:00:05", "real",
+     "make-captures.sh: udhcpc with its default client identifier (01 + MAC) bound to 192.0.2.103; "
+     "dnsmasq is restarted with the MAC pinned to 192.0.2.113, so the renewal (SIGUSR1) is answered "
+     "with DHCPNAK ('wrong address'); the client starts over, gets .113, and is released."),
+    ("arp-probe-announce", "02:00:5e:c0:00:06", "real",
+     "make-captures.sh: VM with the static address 192.0.2.60 and no DHCP: busybox arping -D (probes), "
+     "address configured, arping -U (gratuitous requests), arping -A (gratuitous replies), ping to "
+     "the server (kernel ARP), the server's arping for the VM and the VM's kernel reply."),
+    ("attack-ip-spoof", "02:00:5e:c0:00:10", "crafted",
+     "make-attacks.py: the VM is bound to 192.0.2.110 by a REQUEST/ACK, then sends IPv4 with its own and "
+     "with spoofed source addresses (and once with a foreign source MAC)."),
+    ("attack-arp-spoof", "02:00:5e:c0:00:10", "crafted",
+     "make-attacks.py: VM bound to 192.0.2.110, then ARP claiming other hosts' addresses."),
+    ("attack-arp-flood", "02:00:5e:c0:00:10", "crafted",
+     "make-attacks.py: VM bound to 192.0.2.110; 50 ARP requests from the VM in 0.98 s, 8 ICMP frames "
+     "from the VM 0.5 s later, 15 ARP requests to the VM in 0.7 s, one ICMP reply to the VM."),
+    ("attack-rogue-dhcp-server", "02:00:5e:c0:00:10", "crafted",
+     "make-attacks.py: DHCPOFFER/DHCPACK sent by the VM (UDP 67->68) and DHCPv6 ADVERTISE/REPLY sent by "
+     "the VM (UDP 547->546); last, a real server's OFFER to the VM."),
+    ("attack-bpdu", "02:00:5e:c0:00:10", "crafted",
+     "make-attacks.py: STP (01:80:c2:00:00:00) and PVST+ (01:00:0c:cc:cc:cd) BPDUs from the VM and to "
+     "the VM, then an ARP probe."),
+    ("attack-unsolicited-ack", "02:00:5e:c0:00:10", "crafted",
+     "make-attacks.py: a DHCPACK to the VM with no request; a REQUEST; ACKs with a wrong xid, a wrong "
+     "chaddr, and finally the matching one."),
+    ("attack-chaddr-mismatch", "02:00:5e:c0:00:10", "crafted",
+     "make-attacks.py: a DHCPREQUEST from the VM whose chaddr is 02:00:5e:c0:00:99, the server's ACK "
+     "for it, then a DISCOVER with the same chaddr."),
+    ("attack-malformed-dhcp", "02:00:5e:c0:00:10", "crafted",
+     "make-attacks.py: REQUESTs with a bad cookie, htype 6, UDP length 247, no end option, each "
+     "followed by an ACK for its xid; then a good REQUEST, an ACK without lease time, the good ACK."),
+    ("attack-ip-fragments", "02:00:5e:c0:00:10", "crafted",
+     "make-attacks.py: a DHCPREQUEST from the VM split into a first (MF, offset 0) and a non-first "
+     "(offset 128) IPv4 fragment, the matching ACK unfragmented, then an ACK to the VM in two fragments."),
+    ("attack-vlan100", "02:00:5e:c0:00:10", "crafted",
+     "make-attacks.py: a DHCP exchange on 802.1Q VLAN 100, then ICMP and ARP from the VM on VLAN 100 and "
+     "untagged."),
+    ("example-dhcp-then-spoof", "02:00:5e:c0:00:01", "crafted",
+     "make-attacks.py: dhclient-lease-renew-release.pcap without its DHCPRELEASE, then, 1 s after, "
+     "ICMP from the leased address, spoofed IPv4 sources and ARP replies claiming the server's address."),
+]
+EXTRA_VM_SRC_MACS = {"attack-ip-spoof": [FOREIGN_MAC]}
+
+CONFIGS = [
+    {"name": "learning", "featuresEnabled": 0x04, "trusted": 1, "portDbSize": 32,
+     "arpRateLimit": 0, "errRateLimit": 0, "errRateLimitPeriod": 0},
+    {"name": "enforcing", "featuresEnabled": 0x1F, "trusted": 0, "portDbSize": 32,
+     "arpRateLimit": 10, "errRateLimit": 5, "errRateLimitPeriod": 10},
+]
+MSG = {1: "DHCPDISCOVER", 2: "DHCPOFFER", 3: "DHCPREQUEST", 4: "DHCPDECLINE", 5: "DHCPACK",
+       6: "DHCPNAK", 7: "DHCPRELEASE", 8: "DHCPINFORM"}
+BPDU_MACS = {"01:80:c2:00:00:00", "01:00:0c:cc:cc:cd"}
+
+
+def read_pcap(path):
+    """(time, bytes) for every record of a classic little-endian pcap file."""
+    data = open(path, "rb").read()
+    magic = struct.unpack_from("<I", data, 0)[0]
+    assert magic in (0xA1B2C3D4, 0xA1B23C4D), path
+    nano = magic == 0xA1B23C4D
+    off, out = 24, []
+    while off + 16 <= len(data):
+        sec, frac, incl, _ = struct.unpack_from("<IIII", data, off)
+        out.append((sec + frac / (1e9 if nano else 1e6), data[off + 16: off + 16 + incl]))
+        off += 16 + incl
+    return out
+
+
+def mac(b):
+    return ":".join(f"{x:02x}" for x in b)
+
+
+def ip(b):
+    return ".".join(str(x) for x in b)
+
+
+def parse(frame):
+    """The fields the port's rules look at."""
+    p = {"len": len(frame), "dst": mac(frame[0:6]), "src": mac(frame[6:12]), "vlan": 0}
+    etype, l3 = struct.unpack_from("!H", frame, 12)[0], 14
+    if etype == 0x8100:
+        p["vlan"] = struct.unpack_from("!H", frame, 14)[0] & 0xFFF
+        etype, l3 = struct.unpack_from("!H", frame, 16)[0], 18
+    p["etype"], p["l3"] = etype, l3
+    if etype == 0x0806 and len(frame) >= l3 + 28:
+        a = frame[l3:l3 + 28]
+        p["arp"] = {"ok": a[0:6] == bytes([0, 1, 8, 0, 6, 4]), "op": struct.unpack_from("!H", a, 6)[0],
+                    "sha": mac(a[8:14]), "spa": ip(a[14:18]), "tpa": ip(a[24:28])}
+    elif etype == 0x0800:
+        ihl = (frame[l3] & 0xF) * 4
+        fl = struct.unpack_from("!H", frame, l3 + 6)[0]
+        p["ipv4"] = {"src": ip(frame[l3 + 12:l3 + 16]), "dst": ip(frame[l3 + 16:l3 + 20]),
+                     "proto": frame[l3 + 9], "frag": bool(fl & 0x2000) or (fl & 0x1FFF) != 0,
+                     "firstFrag": (fl & 0x1FFF) == 0}
+        if frame[l3 + 9] == 17:
+            l4 = l3 + ihl
+            sp, dp, ulen = struct.unpack_from("!HHH", frame, l4)
+            p["udp"] = {"sport": sp, "dport": dp, "len": ulen, "off": l4}
+    elif etype == 0x86DD and frame[l3 + 6] == 17:
+        l4 = l3 + 40
+        sp, dp, ulen = struct.unpack_from("!HHH", frame, l4)
+        p["ipv6"] = True
+        p["udp"] = {"sport": sp, "dport": dp, "len": ulen, "off": l4}
+    return p
+
+
+def parse_dhcp(frame, udp):
+    """The DHCP message of a UDP frame, or (None, why) when it is refused."""
+    if udp["len"] < 248 or udp["off"] + udp["len"] > len(frame):
+        return None, "Invalid frame len"
+    h = udp["off"] + 8
+    if h + 240 > len(frame):
+        return None, "Can't access DHCP hdr"
+    if frame[h + 1] != 1 or frame[h + 2] != 6:
+        return None, f"Invalid htype/hlen: [{frame[h + 1]} {frame[h + 2]}]"
+    if frame[h + 236:h + 240] != bytes([99, 130, 83, 99]):
+        return None, "Invalid cookie"
+    d = {"xid": struct.unpack_from("!I", frame, h + 4)[0], "ciaddr": ip(frame[h + 12:h + 16]),
+         "yiaddr": ip(frame[h + 16:h + 20]), "siaddr": ip(frame[h + 20:h + 24]),
+         "chaddr": mac(frame[h + 28:h + 34]), "type": None, "cid": b"", "lease": None}
+    o = h + 240
+    while o < len(frame):
+        code = frame[o]
+        if code == 0:
+            o += 1
+            continue
+        if code == 255:
+            if d["type"] is None:
+                return None, "Invalid options: 1"
+            if d["type"] == 5 and d["lease"] is None:
+                return None, "No lease time option in DHCPACK"
+            return d, None
+        if o + 2 > len(frame) or o + 2 + frame[o + 1] > len(frame):
+            return None, "Can't access DHCP option"
+        val = frame[o + 2:o + 2 + frame[o + 1]]
+        if code == 53:
+            d["type"] = val[0]
+        elif code == 61:
+            d["cid"] = bytes(val)
+        elif code == 51:
+            d["lease"] = struct.unpack("!I", val)[0]
+        o += 2 + frame[o + 1]
+    return None, "Invalid options: 0"
+
+
+def kind(p, frame):
+    if p["dst"] in BPDU_MACS:
+        return "STP BPDU" if p["dst"] == "01:80:c2:00:00:00" else "PVST+ BPDU"
+    if "arp" in p:
+        a = p["arp"]
+        if a["op"] == 1:
+            if a["spa"] == "0.0.0.0":
+                return "ARP probe"
+            return "ARP gratuitous request" if a["spa"] == a["tpa"] else "ARP request"
+        return "ARP gratuitous reply" if a["spa"] == a["tpa"] else "ARP reply"
+    if "ipv6" in p:
+        u = p["udp"]
+        return {2: "DHCPv6 ADVERTISE", 7: "DHCPv6 REPLY"}.get(frame[u["off"] + 8], "IPv6 UDP")
+    if "ipv4" in p:
+        v = p["ipv4"]
+        if v["frag"]:
+            return "IPv4 fragment (first)" if v["firstFrag"] else "IPv4 fragment (non-first)"
+        if "udp" in p and (p["udp"]["sport"] in (67, 68) or p["udp"]["dport"] in (67, 68)):
+            d, why = parse_dhcp(frame, p["udp"])
+            return MSG.get(d["type"], "DHCP") if d else f"DHCP malformed ({why})"
+        return {1: "ICMP", 6: "TCP", 17: "UDP"}.get(v["proto"], "IPv4")
+    return "other"
+
+
+class Limiter:
+    def __init__(self, limit, now):
+        self.limit, self.end, self.count = limit, now, 0
+
+    def reached(self, now):
+        if now > self.end:
+            self.end, self.count = now + 1.0, 1
+        else:
+            self.count += 1
+        return self.count > self.limit
+
+
+class Port:
+    """Reference model of one port's per-frame rules and its port database."""
+
+    def __init__(self, cfg, t_start):
+        self.cfg, self.vmis, self.reqs, self.events = cfg, [], [], []
+        self.counters = {k: 0 for k in ("daiDropCnt", "txRateLimitDropCnt", "txRateLimitErrEntryCnt",
+                                        "rxRateLimitDropCnt", "ipSrcGuardDropCnt", "dhcpSnoopingDropCnt")}
+        self.tx = Limiter(cfg["arpRateLimit"], t_start)
+        self.rx = Limiter(cfg["arpRateLimit"], t_start)
+        self.err = False
+
+    def find(self, vlan, m, a):
+        return next((v for v in self.vmis if (v["vlan"], v["mac"], v["ip"]) == (vlan, m, a)), None)
+
+    def find_client(self, vlan, chaddr, cid):
+        return next((v for v in self.vmis if v["vlan"] == vlan and v["method"] == "DHCP Snooping"
+                     and same_client(v, chaddr, cid)), None)
+
+    def delete(self, v, idx):
+        self.vmis.remove(v)
+        self.events.append({"index": idx, "event": "portdb.entry.removed", **key(v)})
+
+    def add(self, v, idx):
+        if self.find(v["vlan"], v["mac"], v["ip"]) or len(self.vmis) >= self.cfg["portDbSize"]:
+            return
+        self.vmis.append(v)
+        self.events.append({"index": idx, "event": "portdb.entry.added", **key(v)})
+
+    def judge(self, idx, t, frame, p, from_vm):
+        """Returns None (pass) or the rule that drops the frame."""
+        f, c = self.cfg["featuresEnabled"], self.counters
+        is_arp = p["etype"] == 0x0806
+        if f & 0x8:
+            if self.cfg["arpRateLimit"]:
+                if not from_vm and is_arp and self.rx.reached(t):
+                    c["rxRateLimitDropCnt"] += 1
+                    return "ARP rate limit, to the VM (rxRateLimitDropCnt)"
+                if from_vm:
+                    if self.err:
+                        if self.tx.reached(t):
+                            c["txRateLimitDropCnt"] += 1
+                            return "error-rate-limit state (txRateLimitDropCnt)"
+                    elif is_arp and self.tx.reached(t):
+                        self.tx, self.err = Limiter(self.cfg["errRateLimit"], t), True
+                        c["txRateLimitErrEntryCnt"] += 1
+                        c["txRateLimitDropCnt"] += 1
+                        return "ARP rate limit exceeded, port enters the error-rate-limit state"
+            a = p.get("arp")
+            if from_vm and is_arp and a and a["ok"] and a["spa"] != "0.0.0.0":
+                if not self.find(p["vlan"], a["sha"], a["spa"]):
+                    c["daiDropCnt"] += 1
+                    return "ARP inspection: sender MAC/IP not bound on its VLAN (daiDropCnt)"
+        if f & 0x1 and p["dst"] in BPDU_MACS:
+            return "BPDU filter"
+        u = p.get("udp")
+        if f & 0x2 and from_vm and u and u["sport"] == (547 if "ipv6" in p else 67):
+            return "DHCP server block"
+        if f & 0x4:
+            why = self.discover(idx, t, frame, p, from_vm)
+            if why:
+                return why
+        v4 = p.get("ipv4")
+        if f & 0x10 and from_vm and v4:
+            if not (u and u["dport"] == 67) and not self.find(p["vlan"], p["src"], v4["src"]):
+                c["ipSrcGuardDropCnt"] += 1
+                return "IP source guard: source MAC/IP not bound on its VLAN (ipSrcGuardDropCnt)"
+        return None
+
+    def discover(self, idx, t, frame, p, from_vm):
+        v4, u = p.get("ipv4"), p.get("udp")
+        if v4 and u and not v4["frag"]:
+            if from_vm and u["dport"] == 67:
+                return self.client_dhcp(idx, frame, p)
+            if not from_vm:
+                return self.server_dhcp(idx, frame, p) if u["dport"] == 68 else None
+        if not from_vm or not self.cfg["trusted"]:
+            return None
+        a = p.get("arp")
+        if p["etype"] == 0x0806:
+            if a and a["ok"] and a["spa"] != "0.0.0.0" and (a["op"] == 1 or (a["op"] == 2 and a["spa"] == a["tpa"])):
+                if not self.find(p["vlan"], a["sha"], a["spa"]):
+                    self.add({"vlan": p["vlan"], "mac": a["sha"], "ip": a["spa"], "method": "ARP Snooping",
+                              "leaseSeconds": 180}, idx)
+        return None
+
+    def client_dhcp(self, idx, frame, p):
+        d, _ = parse_dhcp(frame, p["udp"])
+        if not d:
+            return None
+        if not self.cfg["trusted"] and d["chaddr"] != p["src"]:
+            self.counters["dhcpSnoopingDropCnt"] += 1
+            return "DHCP from the VM with chaddr not its source MAC, untrusted port (dhcpSnoopingDropCnt)"
+        vlan = p["vlan"]
+        req = next((r for r in self.reqs if r["vlan"] == vlan and same_client(r, d["chaddr"], d["cid"])), None)
+        if d["type"] in (1, 4, 7):
+            if req:
+                self.reqs.remove(req)
+            v = self.find_client(vlan, d["chaddr"], d["cid"])
+            if v:
+                self.delete(v, idx)
+        elif d["type"] == 3:
+            if p["ipv4"]["dst"] == "255.255.255.255" and d["ciaddr"] == "0.0.0.0":
+                v = self.find_client(vlan, d["chaddr"], d["cid"])
+                if v:
+                    self.delete(v, idx)
+            if req:
+                req["xid"] = d["xid"]
+            else:
+                self.reqs.append({"vlan": vlan, "xid": d["xid"], "chaddr": d["chaddr"], "cid": d["cid"]})
+        return None
+
+    def server_dhcp(self, idx, frame, p):
+        d, _ = parse_dhcp(frame, p["udp"])
+        if not d or d["type"] not in (5, 6):
+            return None
+        req = next((r for r in self.reqs if r["vlan"] == p["vlan"] and r["xid"] == d["xid"]
+                    and r["chaddr"] == d["chaddr"]), None)
+        if not req:
+            return "DHCPACK answers no pending request of the port" if d["type"] == 5 else None
+        v = self.find_client(req["vlan"], req["chaddr"], req["cid"])
+        if d["type"] == 6:
+            if v:
+                self.delete(v, idx)
+        elif not v:
+            self.add({"vlan": req["vlan"], "mac": req["chaddr"], "ip": d["yiaddr"], "method": "DHCP Snooping",
+                      "leaseSeconds": d["lease"], "chaddr": req["chaddr"], "cid": req["cid"],
+                      "serverIp": d["siaddr"]}, idx)
+        else:
+            v["leaseSeconds"] = d["lease"]
+            if v["ip"] != d["yiaddr"]:
+                self.events.append({"index": idx, "event": "portdb.entry.removed", **key(v)})
+                v["ip"] = d["yiaddr"]
+                self.events.append({"index": idx, "event": "portdb.entry.added", **key(v)})
+        self.reqs.remove(req)
+        return None
+
+
+def same_client(stored, chaddr, cid):
+    if len(stored["cid"]) != len(cid):
+        return False
+    return stored["cid"] == cid if cid else stored["chaddr"] == chaddr
+
+
+def key(v):
+    return {"vlan": v["vlan"], "mac": v["mac"], "ip": v["ip"], "method": v["method"]}
+
+
+def tshark_lines(path):
+    out = subprocess.run(["tshark", "-r", path, "-o", "ip.defragment:FALSE", "-T", "fields",
+                          "-e", "_ws.col.Info"], capture_output=True, text=True, check=True).stdout
+    return [" ".join(line.split()) for line in out.splitlines()]
+
+
+def dhcp_facts(records, vm_mac):
+    """Addresses, lease and client identifiers as they appear in the DHCP messages."""
+    facts = {"leases": [], "clientIds": set()}
+    for _, frame in records:
+        p = parse(frame)
+        if "udp" not in p or "ipv4" not in p or p["ipv4"]["frag"]:
+            continue
+        if 67 not in (p["udp"]["sport"], p["udp"]["dport"]):
+            continue
+        d, _ = parse_dhcp(frame, p["udp"])
+        if not d:
+            continue
+        if d["type"] == 5:
+            facts["leases"].append({"ip": d["yiaddr"], "leaseSeconds": d["lease"], "xid": f"{d['xid']:#010x}"})
+        if p["src"] == vm_mac:
+            facts["clientIds"].add(d["cid"].hex() if d["cid"] else "")
+    facts["clientIds"] = sorted(facts["clientIds"])
+    return facts
+
+
+def main():
+    manifest, md = [], []
+    for name, vm_mac, origin, how in CAPTURES:
+        path = os.path.join(HERE, name + ".pcap")
+        records = read_pcap(path)
+        infos = tshark_lines(path)
+        assert len(infos) == len(records), name
+        t0 = records[0][0]
+        vm_macs = {vm_mac, *EXTRA_VM_SRC_MACS.get(name, [])}
+        frames = []
+        for i, (t, frame) in enumerate(records, 1):
+            p = parse(frame)
+            frames.append({"index": i, "time": round(t - t0, 6), "fromVm": p["src"] in vm_macs,
+                           "vlan": p["vlan"], "kind": kind(p, frame), "info": infos[i - 1]})
+        results = []
+        for cfg in CONFIGS:
+            port = Port(cfg, -0.5)
+            dropped = []
+            for (t, frame), fr in zip(records, frames):
+                why = port.judge(fr["index"], t - t0, frame, parse(frame), fr["fromVm"])
+                if why:
+                    dropped.append({"index": fr["index"], "rule": why})
+            results.append({**cfg, "dropped": dropped, "events": port.events,
+                            "bindings": [{**key(v), "leaseSeconds": v["leaseSeconds"]} for v in port.vmis],
+                            "counters": {k: n for k, n in port.counters.items() if n},
+                            "pendingRequests": [{"vlan": r["vlan"], "xid": f"{r['xid']:#010x}", "chaddr": r["chaddr"]}
+                                                for r in port.reqs]})
+        facts = dhcp_facts(records, vm_mac)
+        entry = {"file": name + ".pcap", "origin": origin, "how": how, "vmMac": vm_mac,
+                 "dhcp": {**SRV, **facts} if facts["leases"] or facts["clientIds"] else None,
+                 "frames": frames,
+                 "expected": {"bindings": results[0]["bindings"], "notes": NOTES.get(name, ""),
+                              "configs": results}}
+        manifest.append(entry)
+        md.append(markdown(entry, os.path.getsize(path)))
+    with open(os.path.join(HERE, "manifest.json"), "w") as f:
+        json.dump(manifest, f, indent=1)
+        f.write("\n")
+    with open(os.path.join(HERE, "MANIFEST.md"), "w") as f:
+        f.write(HEADER + "\n".join(md))
+    print(f"make-manifest: {len(manifest)} captures")
+
+
+def markdown(e, size):
+    lines = [f"## {e['file']}", "", f"{e['how']}", "",
+             f"- VM MAC: {e['vmMac']}; {len(e['frames'])} frames, {size} bytes"]
+    if e["dhcp"]:
+        d = e["dhcp"]
+        ids = ", ".join(x or "(none)" for x in d["clientIds"]) or "-"
+        leases = "; ".join(f"{x['ip']} for {x['leaseSeconds']} s (xid {x['xid']})" for x in d["leases"]) or "-"
+        lines.append(f"- DHCP server {d['serverIp']} ({d['serverMac']}); ACKs: {leases}; "
+                     f"client identifiers sent by the VM: {ids}")
+    lines += ["", "| # | t (s) | dir | VLAN | kind | tshark |", "|---|---|---|---|---|---|"]
+    for fr in e["frames"]:
+        info = fr["info"].replace("|", "\\|")
+        lines.append(f"| {fr['index']} | {fr['time']:.6f} | {'from VM' if fr['fromVm'] else 'to VM'} | "
+                     f"{fr['vlan']} | {fr['kind']} | {info} |")
+    lines.append("")
+    if e["expected"]["notes"]:
+        lines += [e["expected"]["notes"], ""]
+    for r in e["expected"]["configs"]:
+        lines.append(f"**{r['name']}** (features {r['featuresEnabled']:#04x}, "
+                     f"{'trusted' if r['trusted'] else 'untrusted'}"
+                     + (f", arpRateLimit {r['arpRateLimit']}, errRateLimit {r['errRateLimit']}" if r["arpRateLimit"] else "")
+                     + "):")
+        lines.append("")
+        drops = r["dropped"]
+        if drops:
+            groups = []
+            for dr in drops:
+                if groups and groups[-1][2] == dr["rule"] and groups[-1][1] == dr["index"] - 1:
+                    groups[-1][1] = dr["index"]
+                else:
+                    groups.append([dr["index"], dr["index"], dr["rule"]])
+            for a, b, rule in groups:
+                lines.append(f"- drop {a if a == b else f'{a}-{b}'}: {rule}")
+        else:
+            lines.append("- every frame passes")
+        for ev in r["events"]:
+            lines.append(f"- frame {ev['index']}: {ev['event']} VLAN {ev['vlan']} {ev['mac']} {ev['ip']} ({ev['method']})")
+        b = ", ".join(f"VLAN {x['vlan']} {x['mac']} {x['ip']} {x['method']} {x['leaseSeconds']} s"
+                      for x in r["bindings"]) or "none"
+        lines.append(f"- port database at the end: {b}")
+        if r["pendingRequests"]:
+            lines.append("- pending requests at the end: " + ", ".join(
+                f"VLAN {x['vlan']} xid {x['xid']} chaddr {x['chaddr']}" for x in r["pendingRequests"]))
+        if r["counters"]:
+            lines.append("- counters: " + ", ".join(f"{k} {n}" for k, n in r["counters"].items()))
+        lines.append("")
+    return "\n".join(lines)
+
+
+NOTES = {
+    "dhclient-lease-renew-release":
+        "dhclient sends no client identifier, so the binding is keyed by chaddr. The renewal is a unicast "
+        "REQUEST with ciaddr set and the same xid as the first exchange: it becomes a pending request and "
+        "its ACK only extends the lease (no event). The VM's ARP request for the server carries the leased "
+        "address, which the database already holds by DHCP, so ARP snooping leaves it alone. The "
+        "DHCPRELEASE removes the binding.",
+    "dhclient-reboot-nak":
+        "The INIT-REBOOT REQUEST (broadcast, ciaddr 0) is recorded as pending; the NAK (sent to the "
+        "broadcast MAC and IP) matches it by xid and chaddr and removes it (there is no binding to "
+        "delete). The DISCOVER clears nothing; the second REQUEST/ACK binds 192.0.2.102; the release "
+        "removes it.",
+    "udhcpc-no-clientid":
+        "udhcpc -a sends an ARP probe (sender 0.0.0.0) for its address after every ACK, also after the "
+        "renewal; probes pass inspection and teach nothing. The renewal reuses the xid of the first "
+        "exchange.",
+    "udhcpc-custom-clientid":
+        "Every message of the VM carries the client identifier ff00000001000100015ec00004; the binding "
+        "is keyed by it, and the renewal and release find it through it.",
+    "udhcpc-renew-nak":
+        "The renewal (unicast, ciaddr 192.0.2.103) is pending when the NAK arrives; the NAK matches it "
+        "and removes the binding (removed event at the NAK). The new exchange binds 192.0.2.113 under "
+        "the same client identifier 01+MAC.",
+    "arp-probe-announce":
+        "Learning: the probes (sender 0.0.0.0) teach nothing; the first gratuitous request creates an "
+        "ARP Snooping entry (180 s), later gratuitous requests/replies and the kernel's request refresh "
+        "it; the VM's ordinary reply to the server (last frame) teaches nothing by itself. Enforcing: "
+        "an untrusted port learns nothing from ARP, so every ARP frame of the VM with a sender address "
+        "fails inspection and its ICMP fails source guard; only the probes and the frames to the VM pass.",
+    "attack-ip-spoof":
+        "Frame 8 is sent by the VM with a MAC it does not own (02:00:5e:c0:00:99) and its leased address: "
+        "it is from the VM (the port it arrives on), and source guard drops it because the key is "
+        "VLAN+MAC+IP. The UDP frame from 0.0.0.0 to port 53 is not a DHCP client frame (only "
+        "destination port 67 is exempt) and is dropped. ICMP to the VM from any address passes.",
+    "attack-arp-spoof":
+        "Learning (trusted): the gratuitous request claiming 192.0.2.20 is learned as an ARP Snooping "
+        "entry of the VM, as the rule for trusted ports says; the gratuitous reply refreshes it; the "
+        "reply claiming the server's address is not gratuitous and teaches nothing. Enforcing: every "
+        "ARP from the VM whose sender MAC+IP is not bound is dropped, including the one whose sender "
+        "MAC is not the frame's source MAC; the probe and the spoofed reply towards the VM pass.",
+    "attack-arp-flood":
+        "Enforcing: ARP frames 1-10 of the flood pass (frames 3-12); the 11th (frame 13) is over the "
+        "limit of 10, the port enters the error-rate-limit state (txRateLimitErrEntryCnt 1) and the "
+        "limiter restarts with errRateLimit 5, so frames 14-18 pass and 19-52 are dropped within that "
+        "interval; of the 8 ICMP frames in the next interval 5 pass and 3 are dropped (every kind of "
+        "frame counts in the error state). To the VM, the 11th to 15th ARP frame within one second "
+        "are dropped (rxRateLimitDropCnt 5) and the ICMP reply is not counted.",
+    "attack-rogue-dhcp-server":
+        "The listed ACK is the rogue one sent by the VM (server id 192.0.2.110). Nothing is learned from "
+        "server messages sent by the VM (IP discovery reads ACKs only towards the VM). Enforcing: the "
+        "DHCP server block drops UDP source port 67 over IPv4 and 547 over IPv6 from the VM; the real "
+        "server's OFFER to the VM passes.",
+    "attack-bpdu":
+        "IEEE 802.3 frames with LLC (STP) or LLC/SNAP (PVST+). The BPDU filter drops them in both "
+        "directions; nothing else looks at them.",
+    "attack-unsolicited-ack":
+        "An ACK must match a pending request by VLAN, xid and chaddr: the ACK without any request, the "
+        "one with another xid and the one with another chaddr are dropped in both configurations; the "
+        "matching one binds. A dropped ACK does not consume the pending request.",
+    "attack-chaddr-mismatch":
+        "Learning (trusted): the request is accepted and the binding is made for the chaddr "
+        "02:00:5e:c0:00:99 (the MAC of a binding comes from the request's chaddr, not from the frame's "
+        "source); the DISCOVER with that chaddr removes it. Enforcing (untrusted): both client messages "
+        "are dropped (dhcpSnoopingDropCnt 2) and, with no pending request, the ACK is dropped too.",
+    "attack-malformed-dhcp":
+        "A client message that does not parse passes and records nothing, so the ACK for its xid is "
+        "dropped. The ACK without a lease time (frame 10) does not parse either: it passes, learns "
+        "nothing and leaves the pending request in place, so the good ACK (frame 11) binds.",
+    "attack-ip-fragments":
+        "Fragments are never read as DHCP (more-fragments bit or offset set). The request therefore "
+        "leaves no pending request and the unfragmented ACK for its xid is dropped; the fragmented ACK "
+        "to the VM passes unread. Enforcing: the first fragment carries the UDP header with destination "
+        "port 67 and passes source guard; the non-first fragment (source 0.0.0.0) does not (its bytes "
+        "where a UDP header would be are zero) and is dropped.",
+    "attack-vlan100":
+        "Bindings are per VLAN: the DHCP binding is on VLAN 100. Enforcing: the untagged ICMP and ARP "
+        "from the same MAC and address (VLAN 0) are dropped, the tagged ones pass. Learning: the "
+        "untagged ARP request creates a separate ARP Snooping entry on VLAN 0.",
+    "example-dhcp-then-spoof":
+        "The README's example: a real dhclient lease (and renewal), then spoofing from the same VM. "
+        "Enforcing: ICMP from the leased address passes; IPv4 from 192.0.2.66 and from the server's "
+        "address is dropped by source guard; the ARP replies claiming 192.0.2.1 are dropped by "
+        "inspection; the ARP request from the leased address passes. Learning (trusted): the "
+        "gratuitous reply claiming 192.0.2.1 is learned as an ARP Snooping entry of the VM, which is "
+        "what a trusted port does.",
+}
+
+HEADER = """# Test captures
+
+Regenerate (as root, about a minute):
+
+    bash scripts/setup.sh --capture-tools
+    bash tests/data/make-captures.sh          # real clients and server in network namespaces
+    /usr/bin/python3 tests/data/make-attacks.py  # crafted attacks and the combined example
+    /usr/bin/python3 tests/data/make-manifest.py # this file and manifest.json
+
+Directions: every capture is taken on (or stands for) the VM's port; "from VM"
+frames are the ones the VM sends (direction 2, transmit), "to VM" the ones
+delivered to it (direction 1, receive). Untagged frames are VLAN 0; tagged
+frames carry their 802.1Q VID. Frame numbers start at 1, as in tshark.
+
+The expectations below are computed by make-manifest.py from the frames with a
+reference model of the port's rules: the checks run in the order ARP rate limit
+and ARP inspection, BPDU filter, DHCP server block, IP discovery (DHCP
+snooping, ARP snooping), IP source guard. Two port configurations:
+
+- **learning**: features 0x04 (IP discovery alone), trusted port, the
+  configuration every new port starts with. DHCP and ARP snooping learn;
+  only DHCPACKs that answer no pending request are dropped.
+- **enforcing**: features 0x1f (BPDU filter 0x1, DHCP server block 0x2,
+  IP discovery 0x4, ARP inspection 0x8, IP source guard 0x10), untrusted
+  port (required by inspection and source guard, and so no ARP learning),
+  arpRateLimit 10, errRateLimit 5, errRateLimitPeriod 10.
+
+The port's clock is the capture's clock (the port configured 0.5 s before the
+first frame). No capture lasts long enough for ageing (pending requests 60 s,
+leases 120 s, ARP entries 180 s) or for the error-rate-limit state to end.
+DHCP bindings are keyed by VLAN, chaddr and client identifier (option 61) when
+present, which is how a renewal, release or NAK finds the client's entry.
+
+"""
+
+if __name__ == "__main__":
+    main()

@@ -21,6 +21,9 @@ struct SifraGenericSlowPath;
 #define SIFRAGENERIC_FILTER_NAME_LEN 100
 #define SIFRAGENERIC_VM_UUID_LEN 128
 
+/* The endpoint type of a VM's vNIC, the one endpoint with a VM UUID and a vNIC index. */
+#define SIFRAGENERIC_ENDPOINT_VM_VNIC 0u
+
 /* Attach states of a filter. */
 enum SifraGenericAttachState : uint32_t {
    SifraGenericAttachDetaching = 1,
@@ -83,6 +86,14 @@ static inline bool SifraGenericFilterIsValid(const void *filter)
    return filter != nullptr &&
           static_cast<const SifraGenericFilter *>(filter)->magic == SIFRAGENERIC_FILTER_MAGIC;
 }
+
+/*
+ * Reads the filter's name, failure policy, endpoint type and, for a VM's
+ * vNIC, its VM UUID (none is tolerated) and vNIC index from the host. At
+ * creation and at every configuration change; the first failure is logged
+ * and returned, and what was read before it stays.
+ */
+orr_Status SifraGenericReadConfiguration(SifraGenericFilter *filter);
 
 /*
  * The address of the frame's bytes [startOffset, endOffset) when one

@@ -1,5 +1,7 @@
 /* Slow path registration and the attachment of filters to slow paths. */
 #include "framework/sifra_generic_agent.h"
+#include "framework/sifra_generic_filter.h"
+#include "framework/sifra_generic_list.h"
 #include "framework/sifra_generic_log.h"
 #include "framework/sifra_generic_ops.h"
 #include "framework/sifra_generic_slow_path.h"
@@ -24,4 +26,13 @@ orr_Status SifraGenericUnregisterSlowPath(orr_SifraSlowPath slowPath)
    }
    /* Slow path records are built with the filters; no live one can exist yet. */
    return ORR_NOT_SUPPORTED;
+}
+
+void SifraGenericAttachSlowPath(SifraGenericFilter *filter)
+{
+   /* No slow path to choose: the filter stays detached. */
+   if (SifraGenericListIsEmpty(&filter->agent->slowPathList)) {
+      return;
+   }
+   /* Slow path registration makes no records yet, so the list above is always empty. */
 }

@@ -14,6 +14,7 @@
 #include <cstddef>
 
 struct SifraGenericFastPathAgent;
+struct SifraGenericFilter;
 
 struct SifraGenericSlowPath {
    uint64_t magic;                       /* SIFRAGENERIC_SLOWPATH_MAGIC while registered */
@@ -37,3 +38,10 @@ static inline bool SifraGenericSlowPathIsValid(const void *slowPath)
    return slowPath != nullptr &&
           static_cast<const SifraGenericSlowPath *>(slowPath)->magic == SIFRAGENERIC_SLOWPATH_MAGIC;
 }
+
+/*
+ * Attaches a new filter to the least loaded slow path of its agent; with
+ * no slow path registered the filter stays detached. Agent lock and filter
+ * lock held; the filter is detached.
+ */
+void SifraGenericAttachSlowPath(SifraGenericFilter *filter);

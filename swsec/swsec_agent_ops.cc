@@ -1,19 +1,22 @@
 /* The switch-security agent's callback table. */
 #include "swsec/swsec_agent.h"
 
+#include "swsec/swsec_filter.h"
+
 /*
- * The switch-security callbacks come with the per-port context; until then
- * every slot is empty and the framework treats each event as unhandled.
+ * Slow path frames, slow path ioctls, configuration changes and attach
+ * state changes are not the agent's business: those slots stay empty. The
+ * saved-state slots stay empty until the port database can be saved.
  */
 constinit const SifraGenericAgentOps sifraGenericFwFastPathOps = {
-   .createFilter = nullptr,
-   .destroyFilter = nullptr,
+   .createFilter = SwSecCreateFilter,
+   .destroyFilter = SwSecDestroyFilter,
    .getSavedStateLen = nullptr,
    .saveState = nullptr,
    .restoreState = nullptr,
-   .processPackets = nullptr,
+   .processPackets = SwSecProcessPackets,
    .processSlowPathPackets = nullptr,
-   .filterIoctlRequest = nullptr,
+   .filterIoctlRequest = SwSecFilterIoctlRequest,
    .slowPathIoctlRequest = nullptr,
    .configurationChanged = nullptr,
    .attachStateChanged = nullptr,

@@ -36,6 +36,12 @@ void SwSecPortDbTimerCb(SwSecContext *ctx);
  * rest of the header; on failure nothing changed.
  */
 orr_Status SwSecConfigPortDb(SwSecContext *ctx, const SwSecConfig *config);
+/*
+ * Frees what a port database may still hold once it is empty: the hash
+ * table parked by a reconfiguration. Called by the context's destruction
+ * after the database was disabled.
+ */
+void SwSecPortDbDestroy(SwSecContext *ctx);
 
 /* Record formats of SwSecQueryPortDb. */
 enum SwSecQueryFormat : uint32_t {

@@ -5,6 +5,9 @@
 #include "framework/sifra_generic_log.h"
 #include "platform/orr_text.h"
 #include "swsec/config_record.h"
+#include "swsec/swsec_config.h"
+#include "swsec/swsec_context.h"
+#include "swsec/swsec_port_db.h"
 
 #include <cstddef>
 
@@ -52,12 +55,12 @@ void SifraGenericFWCleanupProperty(SifraGenericFastPathAgent *agent)
 }
 
 /* The port context of a filter record, or null when there is none. */
-static void *SWSecPropContext(orr_SifraFilter filter)
+static SwSecContext *SWSecPropContext(orr_SifraFilter filter)
 {
    if (filter == nullptr) {
       return nullptr;
    }
-   return static_cast<SifraGenericFilter *>(filter)->agentData;
+   return static_cast<SwSecContext *>(static_cast<SifraGenericFilter *>(filter)->agentData);
 }
 
 orr_Status SWSecPropWrite(orr_SifraFilter filter, void * /* extra */, const void *data,
@@ -93,31 +96,54 @@ orr_Status SWSecPropWrite(orr_SifraFilter filter, void * /* extra */, const void
       return ORR_BAD_PARAM;
    }
 
-   if (SWSecPropContext(filter) == nullptr) {
+   SwSecContext *ctx = SWSecPropContext(filter);
+   if (ctx == nullptr) {
       SG_LOG(ORR_LOG_ERROR, "Filter not found: %p", filter);
       return ORR_INVALID_HANDLE;
    }
-   /* Applying the record needs the port context, which comes with the filters. */
-   return ORR_NOT_SUPPORTED;
+   orr_SpinlockWriteLock(ctx->configLock);
+   const orr_Status status = SwSecConfigFeatures(ctx, reinterpret_cast<const SwSecConfig *>(bytes));
+   orr_SpinlockWriteUnlock(ctx->configLock);
+   return status;
 }
 
-orr_Status SWSecPropRead(orr_SifraFilter filter, void * /* extra */, void * /* buffer */,
-                         uint32_t /* length */)
+orr_Status SWSecPropRead(orr_SifraFilter filter, void * /* extra */, void *buffer,
+                         uint32_t length)
 {
-   if (SWSecPropContext(filter) == nullptr) {
+   SwSecContext *ctx = SWSecPropContext(filter);
+   if (ctx == nullptr) {
       return ORR_INVALID_HANDLE;
    }
-   /* Reading the active record needs the port context, which comes with the filters. */
-   return ORR_NOT_SUPPORTED;
+   orr_SpinlockReadLock(ctx->configLock);
+   const uint64_t needed = SwSecConfigLength(ctx->config.numStatic);
+   if (length < needed) {
+      SG_LOG(ORR_LOG_INFO,
+             "%s: Invalid security config read length for version %u. Got %u, expecting %lu",
+             ctx->filter->name, static_cast<unsigned>(ctx->config.version), length,
+             static_cast<unsigned long>(needed));
+      orr_SpinlockReadUnlock(ctx->configLock);
+      return ORR_BAD_PARAM;
+   }
+   auto *out = static_cast<uint8_t *>(buffer);
+   orr_Memcpy(out, &ctx->config, sizeof(SwSecConfig));
+   if (ctx->config.numStatic != 0) {
+      SwSecQueryPortDb(ctx, out + sizeof(SwSecConfig), SWSEC_QUERY_KEY, SwSecDiscStatic);
+   }
+   orr_SpinlockReadUnlock(ctx->configLock);
+   return ORR_OK;
 }
 
-bool SWSecPropPoll(orr_SifraFilter filter, void * /* extra */, uint32_t * /* length */)
+bool SWSecPropPoll(orr_SifraFilter filter, void * /* extra */, uint32_t *length)
 {
-   if (SWSecPropContext(filter) == nullptr) {
+   SwSecContext *ctx = SWSecPropContext(filter);
+   if (ctx == nullptr) {
       return false;
    }
-   /* The record's length needs the port context, which comes with the filters. */
-   return false;
+   orr_SpinlockReadLock(ctx->configLock);
+   /* At most 32 static entries: the length fits in 32 bits. */
+   *length = static_cast<uint32_t>(SwSecConfigLength(ctx->config.numStatic));
+   orr_SpinlockReadUnlock(ctx->configLock);
+   return true;
 }
 
 void SWSecPropCleanup(void)

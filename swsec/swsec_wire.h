@@ -1,0 +1,37 @@
+/* Reading multi-byte fields of frames and records at any alignment. */
+#pragma once
+
+#include <cstdint>
+
+static_assert(__BYTE_ORDER__ == __ORDER_LITTLE_ENDIAN__, "the host's byte order is little-endian");
+
+/* A 16-bit field in network order, as a number. */
+static inline uint16_t SwSecLoadBe16(const uint8_t *bytes)
+{
+   return static_cast<uint16_t>(bytes[0] << 8 | bytes[1]);
+}
+
+/* A u16 that was loaded from network-order bytes as it lay in memory, as a number. */
+static inline uint16_t SwSecNetToHost16(uint16_t raw)
+{
+   return __builtin_bswap16(raw);
+}
+
+/* Four bytes as a u32 in memory order (an IPv4 address stays in network order). */
+static inline uint32_t SwSecLoadRaw32(const uint8_t *bytes)
+{
+   uint32_t value;
+   __builtin_memcpy(&value, bytes, sizeof(value));
+   return value;
+}
+
+/* A u32 in the host's byte order at any alignment. */
+static inline uint32_t SwSecLoadHost32(const uint8_t *bytes)
+{
+   return SwSecLoadRaw32(bytes);
+}
+
+static inline void SwSecStoreHost32(uint8_t *bytes, uint32_t value)
+{
+   __builtin_memcpy(bytes, &value, sizeof(value));
+}

@@ -1,0 +1,525 @@
+// IP discovery as a port sees it: DHCP exchanges between a VM and a server
+// and ARP from the VM, judged first under the shared lock and again under
+// the exclusive one when discovery asks for it, as the frame loop does.
+#include "unit/discovery_port.h"
+
+#include "swsec/swsec_ip_discovery.h"
+
+#include <ostream>
+#include <string>
+
+namespace swsec::testing {
+namespace {
+
+const Mac kVmMac = Mac::parse("02:00:00:00:00:01");
+const Mac kOtherMac = Mac::parse("02:00:00:00:00:09");
+const Mac kServerMac = Mac::parse("02:00:00:00:00:fe");
+const Ip4 kServerIp = Ip4::parse("10.0.0.254");
+const Ip4 kLeased = Ip4::parse("10.0.0.10");
+const Ip4 kRenumbered = Ip4::parse("10.0.0.20");
+const Ip4 kVmIp = Ip4::parse("10.0.0.5");
+const Ip4 kPeerIp = Ip4::parse("10.0.0.6");
+
+struct Outcome {
+   orr_Status status = ORR_OK;   // of the last pass
+   uint32_t verdict = 0;
+   bool askedForWriteLock = false;
+};
+
+class IpDiscoveryTest : public DiscoveryTest {
+protected:
+   // Judges one frame as the frame loop does: shared first, exclusive on ORR_BUSY.
+   Outcome judge(const Bytes &bytes, uint32_t direction, uint16_t vlanId = 0)
+   {
+      auto frame = wrap(bytes, vlanId);
+      Outcome out;
+      frame->info.readLocked = 1;
+      out.status = SwSecIpDiscovery(&ctx_, frame->pkt, &frame->info, direction, &out.verdict);
+      if (out.status == ORR_BUSY) {
+         out.askedForWriteLock = true;
+         frame->releaseCopy();
+         frame->info.readLocked = 0;
+         out.status = SwSecIpDiscovery(&ctx_, frame->pkt, &frame->info, direction, &out.verdict);
+      }
+      return out;
+   }
+
+   Outcome fromVm(const Dhcp &dhcp, const Mac &src = kVmMac, Ip4 ipDst = Ip4{{255, 255, 255, 255}})
+   {
+      return judge(dhcpFrame({.src = src, .ipDst = ipDst, .dhcp = dhcp}), SwSecDirectionTx);
+   }
+
+   Outcome fromServer(const Dhcp &dhcp)
+   {
+      return judge(dhcpFrame({.src = kServerMac, .dst = kVmMac, .ipSrc = kServerIp,
+                              .ipDst = dhcp.yiaddr, .fromServer = true, .dhcp = dhcp}),
+                   SwSecDirectionRx);
+   }
+
+   static Dhcp clientMsg(uint8_t type, uint32_t xid, std::optional<Bytes> clientId = std::nullopt)
+   {
+      return Dhcp{.op = 1, .xid = xid, .chaddr = kVmMac, .type = type, .clientId = clientId};
+   }
+
+   static Dhcp serverMsg(uint8_t type, uint32_t xid, Ip4 yiaddr, uint32_t lease = 3600)
+   {
+      return Dhcp{.op = 2, .xid = xid, .yiaddr = yiaddr, .siaddr = kServerIp, .chaddr = kVmMac,
+                  .type = type, .leaseTime = lease};
+   }
+
+   // Request and ACK: a bound client.
+   void bind(Ip4 address, uint32_t xid = 0x100, uint32_t lease = 3600,
+             std::optional<Bytes> clientId = std::nullopt)
+   {
+      ASSERT_EQ(fromVm(clientMsg(kDhcpRequest, xid, clientId)).status, ORR_OK);
+      const Outcome ack = fromServer(serverMsg(kDhcpAck, xid, address, lease));
+      ASSERT_EQ(ack.status, ORR_OK);
+      ASSERT_EQ(ack.verdict, SwSecVerdictPass);
+   }
+
+   // A bound client's renewing request: unicast to the server, ciaddr set.
+   Outcome renew(uint32_t xid, Ip4 current = kLeased)
+   {
+      Dhcp dhcp = clientMsg(kDhcpRequest, xid);
+      dhcp.ciaddr = current;
+      return fromVm(dhcp, kVmMac, kServerIp);
+   }
+
+   SwSecVmi *find(Ip4 address, const Mac &mac = kVmMac, uint16_t vlan = 0)
+   {
+      return SwSecFindVmi(&ctx_, vlan, mac.bytes.data(), address.raw());
+   }
+
+   // The names of the posted messages, in order.
+   std::vector<std::string> posts()
+   {
+      std::vector<std::string> out;
+      for (const auto &message : host().portsets().posted()) {
+         out.push_back(message.name);
+      }
+      return out;
+   }
+
+   Bytes arp(uint16_t op, Ip4 sender, Ip4 target, const Mac &src = kVmMac)
+   {
+      return arpFrame(src, kBroadcastMac,
+                      {.op = op, .senderMac = src, .senderIp = sender, .targetIp = target});
+   }
+
+   void addNonDhcp(Ip4 address, uint8_t method)
+   {
+      auto *vmi = static_cast<SwSecVmi *>(SifraGenericAlloc(sizeof(SwSecVmi)));
+      std::memcpy(vmi->macAddr, kVmMac.bytes.data(), 6);
+      vmi->ipAddr = address.raw();
+      vmi->discoveryMethod = method;
+      vmi->expiryTime = method == SwSecDiscStatic ? 0 : uptime() + 180;
+      ASSERT_EQ(SwSecAddVmi(&ctx_, vmi), 0);
+   }
+};
+
+// ---------------------------------------------------------------- DHCP snooping
+
+TEST_F(IpDiscoveryTest, full_exchange_creates_one_dhcp_binding_with_the_lease)
+{
+   advanceSeconds(5);
+   EXPECT_EQ(fromVm(clientMsg(kDhcpDiscover, 0x77)).verdict, SwSecVerdictPass);
+   EXPECT_EQ(fromServer(serverMsg(kDhcpOffer, 0x77, kLeased)).verdict, SwSecVerdictPass);
+   EXPECT_EQ(fromVm(clientMsg(kDhcpRequest, 0x77)).verdict, SwSecVerdictPass);
+   EXPECT_EQ(ctx_.numDhcpReqs, 1u);
+   const Outcome ack = fromServer(serverMsg(kDhcpAck, 0x77, kLeased, 3600));
+   EXPECT_EQ(ack.status, ORR_OK);
+   EXPECT_EQ(ack.verdict, SwSecVerdictPass);
+
+   ASSERT_EQ(vmis().size(), 1u);
+   const SwSecVmi *vmi = vmis()[0];
+   EXPECT_EQ(vmi->discoveryMethod, SwSecDiscDhcpSnooping);
+   EXPECT_EQ(vmi->ipAddr, kLeased.raw());
+   EXPECT_EQ(0, std::memcmp(vmi->macAddr, kVmMac.bytes.data(), 6));
+   EXPECT_EQ(0, std::memcmp(vmi->chaddr, kVmMac.bytes.data(), 6));
+   EXPECT_EQ(vmi->serverIp, kServerIp.raw());
+   EXPECT_EQ(vmi->leaseTime, 3600u);
+   EXPECT_EQ(vmi->expiryTime, uptime() + 3600);
+   EXPECT_EQ(ctx_.numDhcpReqs, 0u);
+   EXPECT_EQ(posts(), (std::vector<std::string>{"portdb.entry.added"}));
+}
+
+TEST_F(IpDiscoveryTest, renewal_keeping_the_address_only_extends_the_lease)
+{
+   bind(kLeased, 0x100, 600);
+   host().portsets().clearPosted();
+   advanceSeconds(300);
+   ASSERT_EQ(renew(0x101).status, ORR_OK);
+   ASSERT_EQ(vmis().size(), 1u) << "a renewing request keeps the binding";
+   ASSERT_EQ(fromServer(serverMsg(kDhcpAck, 0x101, kLeased, 900)).verdict, SwSecVerdictPass);
+
+   ASSERT_EQ(vmis().size(), 1u);
+   EXPECT_EQ(vmis()[0]->leaseTime, 900u);
+   EXPECT_EQ(vmis()[0]->expiryTime, uptime() + 900);
+   EXPECT_TRUE(posts().empty());
+}
+
+TEST_F(IpDiscoveryTest, renewal_changing_the_address_refiles_the_entry_under_the_new_one)
+{
+   addNonDhcp(Ip4::parse("10.0.0.99"), SwSecDiscApSnooping);   // so that the hash table is in use
+   bind(kLeased);
+   host().portsets().clearPosted();
+   host().log().clear();
+
+   ASSERT_EQ(renew(0x200).status, ORR_OK);
+   ASSERT_EQ(fromServer(serverMsg(kDhcpAck, 0x200, kRenumbered)).status, ORR_OK);
+
+   EXPECT_EQ(posts(), (std::vector<std::string>{"portdb.entry.removed", "portdb.entry.added"}));
+   EXPECT_EQ(find(kLeased), nullptr);
+   ASSERT_NE(find(kRenumbered), nullptr);
+   EXPECT_EQ(find(kRenumbered)->discoveryMethod, SwSecDiscDhcpSnooping);
+   EXPECT_EQ(vmis().size(), 2u);
+   EXPECT_TRUE(logged("port-7: IP address change on renewal: 0 02:00:00:00:00:01 "
+                      "10.0.0.10->10.0.0.20"));
+}
+
+TEST_F(IpDiscoveryTest, renewal_onto_an_arp_learned_address_replaces_that_entry)
+{
+   bind(kLeased);
+   addNonDhcp(kRenumbered, SwSecDiscApSnooping);
+   ASSERT_EQ(renew(0x300).status, ORR_OK);
+   ASSERT_EQ(fromServer(serverMsg(kDhcpAck, 0x300, kRenumbered)).status, ORR_OK);
+
+   ASSERT_EQ(vmis().size(), 1u) << "one key, one entry";
+   EXPECT_EQ(vmis()[0]->discoveryMethod, SwSecDiscDhcpSnooping);
+   EXPECT_EQ(find(kRenumbered), vmis()[0]);
+   EXPECT_EQ(ctx_.numNonAuthVmiEntries, 0u);
+}
+
+TEST_F(IpDiscoveryTest, renewal_onto_a_static_address_retires_the_dhcp_entry)
+{
+   bind(kLeased);
+   addNonDhcp(kRenumbered, SwSecDiscStatic);
+   ASSERT_EQ(renew(0x300).status, ORR_OK);
+   ASSERT_EQ(fromServer(serverMsg(kDhcpAck, 0x300, kRenumbered)).status, ORR_OK);
+
+   ASSERT_EQ(vmis().size(), 1u);
+   EXPECT_EQ(vmis()[0]->discoveryMethod, SwSecDiscStatic);
+   EXPECT_EQ(find(kLeased), nullptr);
+   EXPECT_EQ(ctx_.numDhcpReqs, 0u);
+}
+
+struct RemovalCase {
+   const char *name;
+   uint8_t type;
+   bool fromServer;
+};
+
+void PrintTo(const RemovalCase &c, std::ostream *os)
+{
+   *os << c.name;
+}
+
+class IpDiscoveryRemovalTest : public IpDiscoveryTest,
+                               public ::testing::WithParamInterface<RemovalCase> {};
+
+TEST_P(IpDiscoveryRemovalTest, message_ends_the_binding_and_the_pending_request)
+{
+   const RemovalCase &c = GetParam();
+   bind(kLeased);
+   // A pending renewal, which the message ends too.
+   ASSERT_EQ(fromVm(clientMsg(kDhcpRequest, 0x400), kVmMac, kServerIp).status, ORR_OK);
+   ASSERT_EQ(ctx_.numDhcpReqs, 1u);
+   host().portsets().clearPosted();
+
+   const Outcome out = c.fromServer ? fromServer(serverMsg(c.type, 0x400, kLeased))
+                                    : fromVm(clientMsg(c.type, 0x400));
+   EXPECT_EQ(out.status, ORR_OK);
+   EXPECT_EQ(out.verdict, SwSecVerdictPass);
+   EXPECT_TRUE(vmis().empty());
+   EXPECT_EQ(ctx_.numDhcpReqs, 0u);
+   EXPECT_EQ(posts(), (std::vector<std::string>{"portdb.entry.removed"}));
+}
+
+INSTANTIATE_TEST_SUITE_P(Messages, IpDiscoveryRemovalTest,
+                         ::testing::Values(RemovalCase{"release", kDhcpRelease, false},
+                                           RemovalCase{"decline", kDhcpDecline, false},
+                                           RemovalCase{"discover", kDhcpDiscover, false},
+                                           RemovalCase{"nak", kDhcpNak, true}),
+                         [](const auto &test) { return std::string(test.param.name); });
+
+TEST_F(IpDiscoveryTest, broadcast_request_without_ciaddr_ends_the_old_binding_at_once)
+{
+   bind(kLeased);
+   ASSERT_EQ(fromVm(clientMsg(kDhcpRequest, 0x500)).status, ORR_OK);
+   EXPECT_TRUE(vmis().empty());
+   EXPECT_EQ(ctx_.numDhcpReqs, 1u);
+}
+
+TEST_F(IpDiscoveryTest, ack_without_a_request_is_dropped_and_teaches_nothing)
+{
+   const Outcome out = fromServer(serverMsg(kDhcpAck, 0x600, kLeased));
+   EXPECT_EQ(out.status, ORR_OK);
+   EXPECT_EQ(out.verdict, SwSecVerdictDrop);
+   EXPECT_TRUE(vmis().empty());
+
+   // Nor does an ACK for another client's hardware address or another xid.
+   ASSERT_EQ(fromVm(clientMsg(kDhcpRequest, 0x601)).status, ORR_OK);
+   Dhcp otherClient = serverMsg(kDhcpAck, 0x601, kLeased);
+   otherClient.chaddr = kOtherMac;
+   EXPECT_EQ(fromServer(otherClient).verdict, SwSecVerdictDrop);
+   EXPECT_EQ(fromServer(serverMsg(kDhcpAck, 0x602, kLeased)).verdict, SwSecVerdictDrop);
+   EXPECT_TRUE(vmis().empty());
+   EXPECT_EQ(ctx_.numDhcpReqs, 1u);
+}
+
+TEST_F(IpDiscoveryTest, nak_without_a_request_passes_and_changes_nothing)
+{
+   bind(kLeased);
+   const Outcome out = fromServer(serverMsg(kDhcpNak, 0x999, kLeased));
+   EXPECT_EQ(out.verdict, SwSecVerdictPass);
+   EXPECT_EQ(vmis().size(), 1u);
+}
+
+TEST_F(IpDiscoveryTest, foreign_chaddr_is_dropped_on_an_untrusted_port_only)
+{
+   Dhcp spoofed = clientMsg(kDhcpRequest, 0x700);
+   spoofed.chaddr = kOtherMac;
+
+   ctx_.config.trusted = 0;
+   const Outcome untrusted = fromVm(spoofed);
+   EXPECT_EQ(untrusted.verdict, SwSecVerdictDrop);
+   EXPECT_EQ(ctx_.counters.dhcpSnoopingDropCnt, 1u);
+   EXPECT_EQ(ctx_.numDhcpReqs, 0u);
+
+   ctx_.config.trusted = 1;
+   const Outcome trusted = fromVm(spoofed);
+   EXPECT_EQ(trusted.verdict, SwSecVerdictPass);
+   EXPECT_EQ(ctx_.counters.dhcpSnoopingDropCnt, 1u);
+   EXPECT_EQ(ctx_.numDhcpReqs, 1u);
+}
+
+TEST_F(IpDiscoveryTest, client_with_an_identifier_and_without_one_are_two_clients)
+{
+   bind(kLeased, 0x800, 3600, Bytes{1, 0xaa, 0xbb});
+   ASSERT_EQ(vmis().size(), 1u);
+   EXPECT_EQ(vmis()[0]->clientIdLen, 3u);
+
+   // Without the identifier: a new pending request, and a release does not
+   // touch the binding made with it.
+   ASSERT_EQ(renew(0x801).status, ORR_OK);
+   EXPECT_EQ(ctx_.numDhcpReqs, 1u);
+   ASSERT_EQ(fromVm(clientMsg(kDhcpRelease, 0x802)).status, ORR_OK);
+   EXPECT_EQ(vmis().size(), 1u);
+   EXPECT_EQ(ctx_.numDhcpReqs, 0u);
+
+   ASSERT_EQ(fromVm(clientMsg(kDhcpRelease, 0x803, Bytes{1, 0xaa, 0xbb})).status, ORR_OK);
+   EXPECT_TRUE(vmis().empty());
+}
+
+TEST_F(IpDiscoveryTest, repeated_request_takes_the_new_xid_but_not_a_new_lifetime)
+{
+   ASSERT_EQ(fromVm(clientMsg(kDhcpRequest, 0x900)).status, ORR_OK);
+   const int64_t firstExpiry = requests().at(0)->expiryTime;
+   advanceSeconds(30);
+   ASSERT_EQ(fromVm(clientMsg(kDhcpRequest, 0x901)).status, ORR_OK);
+   ASSERT_EQ(requests().size(), 1u);
+   EXPECT_EQ(requests()[0]->expiryTime, firstExpiry);
+
+   EXPECT_EQ(fromServer(serverMsg(kDhcpAck, 0x900, kLeased)).verdict, SwSecVerdictDrop);
+   // 61 s after the first request the pending request has aged out.
+   advanceSeconds(31);
+   SwSecPortDbTimerCb(&ctx_);
+   EXPECT_EQ(ctx_.numDhcpReqs, 0u);
+   EXPECT_EQ(fromServer(serverMsg(kDhcpAck, 0x901, kLeased)).verdict, SwSecVerdictDrop);
+   EXPECT_TRUE(vmis().empty());
+}
+
+TEST_F(IpDiscoveryTest, dhcp_under_the_shared_lock_asks_for_the_write_lock_before_parsing)
+{
+   auto frame = wrap(dhcpFrame({.src = kVmMac, .dhcp = clientMsg(kDhcpRequest, 0xa00)}));
+   uint8_t sentinel = 0;
+   frame->info.dhcpHdr = &sentinel;
+   frame->info.readLocked = 1;
+   uint32_t verdict = 0;
+   EXPECT_EQ(SwSecIpDiscovery(&ctx_, frame->pkt, &frame->info, SwSecDirectionTx, &verdict),
+             ORR_BUSY);
+   EXPECT_EQ(verdict, SwSecVerdictPass);
+   EXPECT_EQ(frame->info.dhcpHdr, &sentinel) << "parsed under the shared lock";
+   EXPECT_EQ(ctx_.numDhcpReqs, 0u);
+
+   // Even a malformed message: the parse comes after the upgrade.
+   Bytes broken = dhcpFrame({.src = kServerMac, .fromServer = true, .dhcp = serverMsg(kDhcpAck, 1, kLeased)});
+   broken[42 + 1] = 6;
+   EXPECT_TRUE(judge(broken, SwSecDirectionRx).askedForWriteLock);
+   EXPECT_TRUE(logged("port-7: Invalid htype/hlen: [6 6]"));
+}
+
+TEST_F(IpDiscoveryTest, fragments_are_never_taken_for_dhcp)
+{
+   for (const uint8_t fragmentByte : {uint8_t{0x20}, uint8_t{0x00}}) {
+      Bytes bytes = dhcpFrame({.src = kVmMac, .dhcp = clientMsg(kDhcpRequest, 0xb00)});
+      bytes[14 + 6] = fragmentByte;
+      bytes[14 + 7] = fragmentByte == 0 ? 0x10 : 0x00;   // more fragments, or offset 16
+      const Outcome out = judge(bytes, SwSecDirectionTx);
+      EXPECT_FALSE(out.askedForWriteLock);
+      EXPECT_EQ(out.verdict, SwSecVerdictPass);
+   }
+   EXPECT_EQ(ctx_.numDhcpReqs, 0u);
+   EXPECT_FALSE(logged("DHCP"));
+}
+
+TEST_F(IpDiscoveryTest, dhcp_to_the_wrong_port_or_direction_is_not_examined)
+{
+   // A client message arriving at the VM, and a server message leaving it.
+   const Outcome toVm = judge(dhcpFrame({.src = kVmMac, .dhcp = clientMsg(kDhcpRequest, 1)}),
+                              SwSecDirectionRx);
+   const Outcome fromVmToClientPort = judge(
+      dhcpFrame({.src = kVmMac, .fromServer = true, .dhcp = serverMsg(kDhcpAck, 1, kLeased)}),
+      SwSecDirectionTx);
+   EXPECT_FALSE(toVm.askedForWriteLock);
+   EXPECT_FALSE(fromVmToClientPort.askedForWriteLock);
+   EXPECT_EQ(fromVmToClientPort.verdict, SwSecVerdictPass);
+   EXPECT_EQ(ctx_.numDhcpReqs, 0u);
+}
+
+TEST_F(IpDiscoveryTest, failed_allocations_leave_nothing_half_made)
+{
+   // The pending request: nothing recorded, the frame still passes.
+   host().faults().failOnce("orr_HeapAllocWithRA", ORR_NO_MEMORY);
+   Outcome out = fromVm(clientMsg(kDhcpRequest, 0xc00, Bytes{7, 7}));
+   EXPECT_EQ(out.status, ORR_NO_MEMORY);
+   EXPECT_EQ(out.verdict, SwSecVerdictPass);
+   EXPECT_EQ(ctx_.numDhcpReqs, 0u);
+   host().faults().failOnce("orr_HeapAllocWithRA", ORR_NO_MEMORY, 2);   // its identifier
+   EXPECT_EQ(fromVm(clientMsg(kDhcpRequest, 0xc00, Bytes{7, 7})).status, ORR_NO_MEMORY);
+   EXPECT_EQ(ctx_.numDhcpReqs, 0u);
+   EXPECT_TRUE(logged("port-7: Alloc of dhcpReq failed"));
+   EXPECT_TRUE(logged("port-7: Alloc of dhcpReq clientIdStr failed"));
+
+   // The binding: the request is consumed all the same.
+   for (const uint64_t nth : {uint64_t{1}, uint64_t{2}}) {
+      ASSERT_EQ(fromVm(clientMsg(kDhcpRequest, 0xc01, Bytes{7, 7})).status, ORR_OK);
+      host().faults().failOnce("orr_HeapAllocWithRA", ORR_NO_MEMORY, nth);
+      out = fromServer(serverMsg(kDhcpAck, 0xc01, kLeased));
+      EXPECT_EQ(out.status, ORR_NO_MEMORY);
+      EXPECT_EQ(out.verdict, SwSecVerdictPass);
+      EXPECT_TRUE(vmis().empty());
+      EXPECT_EQ(ctx_.numDhcpReqs, 0u);
+   }
+   EXPECT_TRUE(logged("port-7: Vmi alloc failed"));
+   EXPECT_TRUE(logged("port-7: Vmi clientIdStr alloc failed"));
+
+   // An ARP binding.
+   host().faults().failOnce("orr_HeapAllocWithRA", ORR_NO_MEMORY);
+   EXPECT_EQ(judge(arp(1, kLeased, kPeerIp), SwSecDirectionTx).status, ORR_NO_MEMORY);
+   EXPECT_TRUE(vmis().empty());
+}
+
+// ---------------------------------------------------------------- ARP snooping
+
+struct ArpCase {
+   const char *name;
+   uint16_t op;
+   Ip4 sender;
+   Ip4 target;
+   bool learns;
+};
+
+void PrintTo(const ArpCase &c, std::ostream *os)
+{
+   *os << c.name;
+}
+
+class ArpSnoopTest : public IpDiscoveryTest, public ::testing::WithParamInterface<ArpCase> {};
+
+TEST_P(ArpSnoopTest, trusted_port_learns_from_requests_and_gratuitous_replies_only)
+{
+   const ArpCase &c = GetParam();
+   const Outcome out = judge(arp(c.op, c.sender, c.target), SwSecDirectionTx, 12);
+   EXPECT_EQ(out.status, ORR_OK);
+   EXPECT_EQ(out.verdict, SwSecVerdictPass);
+   EXPECT_EQ(out.askedForWriteLock, c.learns);
+   ASSERT_EQ(vmis().size(), c.learns ? 1u : 0u);
+   if (c.learns) {
+      const SwSecVmi *vmi = vmis()[0];
+      EXPECT_EQ(vmi->discoveryMethod, SwSecDiscApSnooping);
+      EXPECT_EQ(vmi->vlanId, 12);
+      EXPECT_EQ(vmi->ipAddr, c.sender.raw());
+      EXPECT_EQ(vmi->expiryTime, uptime() + 180);
+   }
+}
+
+const Ip4 kZero{};
+
+INSTANTIATE_TEST_SUITE_P(
+   Frames, ArpSnoopTest,
+   ::testing::Values(ArpCase{"request", 1, kVmIp, kPeerIp, true},
+                     ArpCase{"gratuitous_request", 1, kVmIp, kVmIp, true},
+                     ArpCase{"gratuitous_reply", 2, kVmIp, kVmIp, true},
+                     ArpCase{"ordinary_reply", 2, kVmIp, kPeerIp, false},
+                     ArpCase{"probe_from_0_0_0_0", 1, kZero, kVmIp, false},
+                     ArpCase{"unknown_operation", 3, kVmIp, kVmIp, false}),
+   [](const auto &test) { return std::string(test.param.name); });
+
+TEST_F(IpDiscoveryTest, arp_for_another_protocol_or_a_short_packet_teaches_nothing)
+{
+   Bytes ipx = arpFrame(kVmMac, kBroadcastMac,
+                        {.op = 1, .senderMac = kVmMac, .senderIp = kVmIp, .protocolType = 0x8137});
+   Bytes shortArp = arp(1, kVmIp, kPeerIp);
+   shortArp.resize(14 + 27);
+   EXPECT_FALSE(judge(ipx, SwSecDirectionTx).askedForWriteLock);
+   EXPECT_FALSE(judge(shortArp, SwSecDirectionTx).askedForWriteLock);
+   EXPECT_TRUE(vmis().empty());
+}
+
+TEST_F(IpDiscoveryTest, traffic_refreshes_non_authoritative_entries_under_the_shared_lock)
+{
+   ASSERT_TRUE(judge(arp(1, kVmIp, kPeerIp), SwSecDirectionTx).askedForWriteLock);
+   advanceSeconds(100);
+   const Outcome again = judge(arp(1, kVmIp, kPeerIp), SwSecDirectionTx);
+   EXPECT_FALSE(again.askedForWriteLock);
+   EXPECT_EQ(vmis().at(0)->expiryTime, uptime() + 180);
+
+   advanceSeconds(100);
+   const Outcome ip = judge(udpFrame({.src = kVmMac, .dst = kServerMac, .ipSrc = kVmIp, .ipDst = kServerIp}),
+                            SwSecDirectionTx);
+   EXPECT_FALSE(ip.askedForWriteLock);
+   EXPECT_EQ(vmis().at(0)->expiryTime, uptime() + 180);
+}
+
+TEST_F(IpDiscoveryTest, traffic_leaves_authoritative_entries_alone)
+{
+   bind(kLeased, 0x100, 500);
+   const int64_t expiry = vmis().at(0)->expiryTime;
+   advanceSeconds(100);
+   EXPECT_FALSE(judge(arp(1, kLeased, kPeerIp), SwSecDirectionTx).askedForWriteLock);
+   EXPECT_FALSE(judge(udpFrame({.src = kVmMac, .dst = kServerMac, .ipSrc = kLeased, .ipDst = kServerIp}),
+                      SwSecDirectionTx)
+                   .askedForWriteLock);
+   ASSERT_EQ(vmis().size(), 1u);
+   EXPECT_EQ(vmis()[0]->discoveryMethod, SwSecDiscDhcpSnooping);
+   EXPECT_EQ(vmis()[0]->expiryTime, expiry);
+}
+
+TEST_F(IpDiscoveryTest, untrusted_port_learns_and_refreshes_nothing)
+{
+   ASSERT_TRUE(judge(arp(1, kVmIp, kPeerIp), SwSecDirectionTx).askedForWriteLock);
+   const int64_t expiry = vmis().at(0)->expiryTime;
+   ctx_.config.trusted = 0;
+   advanceSeconds(100);
+   EXPECT_FALSE(judge(arp(1, kVmIp, kPeerIp), SwSecDirectionTx).askedForWriteLock);
+   EXPECT_FALSE(judge(arp(1, kPeerIp, kVmIp, kOtherMac), SwSecDirectionTx).askedForWriteLock);
+   judge(udpFrame({.src = kVmMac, .dst = kServerMac, .ipSrc = kVmIp, .ipDst = kServerIp}),
+         SwSecDirectionTx);
+   ASSERT_EQ(vmis().size(), 1u);
+   EXPECT_EQ(vmis()[0]->expiryTime, expiry);
+
+   // ... so the entry ages out.
+   advanceSeconds(90);
+   SwSecPortDbTimerCb(&ctx_);
+   EXPECT_TRUE(vmis().empty());
+}
+
+TEST_F(IpDiscoveryTest, arp_towards_the_vm_teaches_nothing)
+{
+   EXPECT_FALSE(judge(arp(1, kVmIp, kPeerIp), SwSecDirectionRx).askedForWriteLock);
+   EXPECT_TRUE(vmis().empty());
+}
+
+}  // namespace
+}  // namespace swsec::testing

@@ -1,0 +1,219 @@
+// Port database messages on the portset, and reading a database out: the
+// query formats and the exported functions' paths that need no loaded module.
+#include "port_db_fixture.h"
+
+#include <functional>
+
+namespace swsec::testing {
+namespace {
+
+constexpr uint32_t kOn = SwSecFeatureIpDiscovery;
+constexpr uint8_t kStatic = SwSecDiscStatic;
+constexpr uint8_t kArp = SwSecDiscApSnooping;
+
+std::vector<Notice> *delivered = nullptr;
+
+void collect(uint32_t portID, uint64_t msgClass, const orr_PortsetMessageHeader *message)
+{
+   EXPECT_EQ(portID, 7u);
+   EXPECT_EQ(msgClass, SWSEC_PORTSET_MSG_PORTDB);
+   EXPECT_EQ(message->payloadLength, 40u);
+   const auto *p = reinterpret_cast<const uint8_t *>(message + 1);
+   Notice n;
+   n.name = message->name;
+   std::memcpy(&n.op, p, 4);
+   std::memcpy(&n.key.vlan, p + 8, 2);
+   n.key.mac = p[15];
+   n.key.ip = p[23];
+   n.authoritative = p[36];
+   delivered->push_back(n);
+}
+
+class PortDbNotifyTest : public PortDbTest {
+protected:
+   void SetUp() override
+   {
+      PortDbTest::SetUp();
+      delivered = &delivered_;
+      ASSERT_EQ(orr_PortsetRegisterMessageCB(ctx_.portset, kPortId, SWSEC_PORTSET_MSG_PORTDB, collect,
+                                             nullptr, &listener_),
+                ORR_OK);
+   }
+   void TearDown() override
+   {
+      orr_PortsetUnregisterMessageCB(listener_);
+      PortDbTest::TearDown();
+      delivered = nullptr;
+   }
+
+   std::vector<Notice> delivered_;
+   orr_PortsetMessageCBHandle listener_ = 0;
+};
+
+TEST_F(PortDbNotifyTest, a_listener_hears_every_change_once_in_order)
+{
+   ASSERT_EQ(add({1, 1, 1}, kArp), 0);
+   ASSERT_EQ(add({1, 1, 1}, SwSecDiscDhcpSnooping), 0);
+   ASSERT_EQ(add({2, 2, 2}, kStatic), 0);
+   SwSecDelVmi(&ctx_, find({1, 1, 1}));
+
+   EXPECT_EQ(delivered_, (std::vector<Notice>{added({1, 1, 1}, 0), removed({1, 1, 1}, 0),
+                                              added({1, 1, 1}, 1), added({2, 2, 2}, 1),
+                                              removed({1, 1, 1}, 1)}));
+   EXPECT_EQ(notices().size(), 5u);
+   EXPECT_EQ(orr_PortsetHoldState(ctx_.portset), ORR_PORTSET_HOLD_NONE);
+}
+
+TEST_F(PortDbNotifyTest, a_failed_post_is_logged_and_leaves_the_change_and_the_portset_free)
+{
+   host().faults().failOnce("orr_PortsetPostMessage", ORR_NO_MEMORY);
+
+   EXPECT_EQ(add({1, 1, 1}, kArp), 0);
+
+   EXPECT_NE(find({1, 1, 1}), nullptr);
+   EXPECT_TRUE(logged("port-7: Could not post message:7:portdb.entry.added:Out of memory"));
+   EXPECT_EQ(orr_PortsetHoldState(ctx_.portset), ORR_PORTSET_HOLD_NONE);
+   EXPECT_TRUE(delivered_.empty());
+   // The next change is announced again.
+   SwSecDelVmi(&ctx_, find({1, 1, 1}));
+   EXPECT_EQ(delivered_, (std::vector<Notice>{removed({1, 1, 1}, 0)}));
+}
+
+TEST_F(PortDbNotifyTest, a_caller_holding_the_portset_keeps_its_hold_and_delivery_waits)
+{
+   orr_PortsetLockShared(ctx_.portset);
+   ASSERT_EQ(add({1, 1, 1}, kArp), 0);
+   EXPECT_EQ(orr_PortsetHoldState(ctx_.portset), ORR_PORTSET_HOLD_SHARED);
+   EXPECT_TRUE(delivered_.empty());
+   EXPECT_EQ(host().portsets().pendingDeliveries(), 1u);
+   orr_PortsetUnlockShared(ctx_.portset);
+
+   EXPECT_EQ(delivered_, (std::vector<Notice>{added({1, 1, 1}, 0)}));
+}
+
+TEST_F(PortDbNotifyTest, a_hold_turned_exclusive_by_the_post_is_released_as_exclusive)
+{
+   host().portsets().upgradeHoldOnNextPost();
+
+   ASSERT_EQ(add({1, 1, 1}, kArp), 0);
+
+   EXPECT_EQ(orr_PortsetHoldState(ctx_.portset), ORR_PORTSET_HOLD_NONE);
+   EXPECT_EQ(delivered_, (std::vector<Notice>{added({1, 1, 1}, 0)}));
+}
+
+using PortDbQueryTest = PortDbTest;
+
+// Two statics and three ARP entries, interleaved in list order.
+void fillFive(PortDbTest &test, std::function<int(Key, uint8_t)> addFn)
+{
+   (void)test;
+   ASSERT_EQ(addFn({1, 1, 1}, kArp), 0);
+   ASSERT_EQ(addFn({1, 2, 2}, kStatic), 0);
+   ASSERT_EQ(addFn({1, 3, 3}, kArp), 0);
+   ASSERT_EQ(addFn({1, 4, 4}, kStatic), 0);
+   ASSERT_EQ(addFn({1, 5, 5}, kArp), 0);
+}
+
+TEST_F(PortDbQueryTest, each_format_writes_the_selected_entries_in_list_order)
+{
+   fillFive(*this, [this](Key k, uint8_t m) { return add(k, m, 1000); });
+   struct Row {
+      uint8_t mask;
+      std::vector<uint8_t> macs;
+   };
+   const Row rows[] = {{SwSecDiscAuthoritativeMask, {2, 4}},
+                       {SwSecDiscNonAuthoritativeMask, {1, 3, 5}},
+                       {SwSecDiscAllMask, {1, 2, 3, 4, 5}}};
+   for (const Row &row : rows) {
+      SCOPED_TRACE(int(row.mask));
+      const size_t n = row.macs.size();
+      // One record more than needed, filled with a canary, shows nothing is written past the end.
+      std::vector<uint8_t> entries(32 * (n + 1), 0xee);
+      std::vector<uint8_t> keys(12 * (n + 1), 0xee);
+      std::vector<SwSecVmi> vmis(n + 1);
+      SwSecQueryPortDb(&ctx_, entries.data(), SWSEC_QUERY_ENTRY, row.mask);
+      SwSecQueryPortDb(&ctx_, keys.data(), SWSEC_QUERY_KEY, row.mask);
+      SwSecQueryPortDb(&ctx_, vmis.data(), SWSEC_QUERY_VMI, row.mask);
+      for (size_t i = 0; i < n; i++) {
+         const Key want{1, row.macs[i], row.macs[i]};
+         const uint8_t *e = entries.data() + 32 * i;
+         uint16_t vlan = 0;
+         std::memcpy(&vlan, e, 2);
+         EXPECT_EQ(vlan, 1u);
+         EXPECT_EQ(e[7], want.mac);
+         EXPECT_EQ(e[8], 1u);
+         uint32_t ip = 0;
+         std::memcpy(&ip, e + 12, 4);
+         EXPECT_EQ(ip, want.ipAddr());
+         EXPECT_EQ(e[28], row.macs[i] % 2 == 0 ? 1u : 0u);
+         for (size_t b : {9u, 10u, 11u, 16u, 20u, 27u, 29u, 31u}) {
+            EXPECT_EQ(e[b], 0u) << "entry byte " << b;
+         }
+         SwSecVmiKey key{};
+         std::memcpy(&key, keys.data() + 12 * i, 12);
+         const SwSecVmiKey wantKey = want.raw();
+         EXPECT_EQ(std::memcmp(&key, &wantKey, 12), 0);
+         EXPECT_EQ(keyOf(&vmis[i]), want);
+         EXPECT_EQ(vmis[i].discoveryMethod, row.macs[i] % 2 == 0 ? kStatic : kArp);
+      }
+      EXPECT_EQ(entries[32 * n], 0xee);
+      EXPECT_EQ(keys[12 * n], 0xee);
+   }
+}
+
+TEST_F(PortDbQueryTest, exported_queries_answer_counts_and_refuse_unknown_ports)
+{
+   uint32_t count = 99;
+   void *entries = &count;
+   void *buffer = &count;
+   EXPECT_EQ(SwSec_PortDBGetNumEntries(kPortId, 2, &count), ORR_NOT_FOUND);
+   EXPECT_EQ(SwSec_PortDBGetEntries(kPortId, 2, &entries, &count, &buffer), ORR_NOT_FOUND);
+
+   ASSERT_EQ(configure(config(kOn, 1, 32)), ORR_OK);
+   // An empty database: count 0, null pointers, nothing to release.
+   EXPECT_EQ(SwSec_PortDBGetEntries(kPortId, 2, &entries, &count, &buffer), ORR_OK);
+   EXPECT_EQ(count, 0u);
+   EXPECT_EQ(entries, nullptr);
+   EXPECT_EQ(buffer, nullptr);
+
+   fillFive(*this, [this](Key k, uint8_t m) { return add(k, m, 1000); });
+   const uint32_t want[] = {2, 3, 5, 0};
+   for (uint32_t selector = 0; selector <= 3; selector++) {
+      EXPECT_EQ(SwSec_PortDBGetNumEntries(kPortId, selector, &count), ORR_OK);
+      EXPECT_EQ(count, want[selector]) << selector;
+   }
+   entries = buffer = &count;
+   EXPECT_EQ(SwSec_PortDBGetEntries(kPortId, 3, &entries, &count, &buffer), ORR_OK);
+   EXPECT_EQ(count, 0u);
+   EXPECT_EQ(entries, nullptr);
+   EXPECT_EQ(buffer, nullptr);
+   EXPECT_EQ(SwSec_PortDBGetNumEntries(kPortId + 1, 0, &count), ORR_NOT_FOUND);
+   EXPECT_EQ(SwSec_PortDBGetNumEntries(kPortId, 0, nullptr), ORR_BAD_PARAM);
+   EXPECT_EQ(SwSec_PortDBReleaseBuf(nullptr), ORR_BAD_PARAM);
+}
+
+TEST_F(PortDbQueryTest, failed_reads_free_the_buffer_and_drop_the_reference)
+{
+   ASSERT_EQ(configure(config(kOn, 1, 32, {{1, 1, 1}})), ORR_OK);
+   uint32_t count = 0;
+   void *entries = nullptr;
+   void *buffer = nullptr;
+   const uint64_t blocks = host().heap().liveBlocks();
+
+   host().faults().failOnce("orr_HeapAllocWithRA", ORR_NO_MEMORY);
+   EXPECT_EQ(SwSec_PortDBGetEntries(kPortId, 0, &entries, &count, &buffer), ORR_NO_MEMORY);
+   EXPECT_TRUE(logged("port-7: Dbentry alloc failed"));
+
+   // No module is loaded here, so the use count cannot be raised.
+   host().faults().failOnce("orr_ModuleIncUseCount", ORR_FAILURE);
+   EXPECT_EQ(SwSec_PortDBGetEntries(kPortId, 0, &entries, &count, &buffer), ORR_FAILURE);
+   EXPECT_TRUE(logged("port-7: portId= 7: ModIncUseCnt() failed: Failure"));
+   EXPECT_EQ(buffer, nullptr);
+
+   EXPECT_EQ(host().heap().liveBlocks(), blocks);
+   // No reference is left behind: the disable goes through.
+   EXPECT_EQ(configure(config(0, 0, 0)), ORR_OK);
+}
+
+}  // namespace
+}  // namespace swsec::testing

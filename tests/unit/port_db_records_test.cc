@@ -1,0 +1,270 @@
+// The port database's records: replacement on add, the size limit, the
+// hash table's life, ageing, pending requests and clearing, with the
+// messages each change posts.
+#include "port_db_fixture.h"
+
+namespace swsec::testing {
+namespace {
+
+constexpr uint8_t kDhcp = SwSecDiscDhcpSnooping;
+constexpr uint8_t kStatic = SwSecDiscStatic;
+constexpr uint8_t kTofu = SwSecDiscTofu;
+constexpr uint8_t kArp = SwSecDiscApSnooping;
+
+uint8_t authOf(uint8_t method)
+{
+   return (method & SwSecDiscAuthoritativeMask) != 0 ? 1 : 0;
+}
+
+using PortDbRecordsTest = PortDbTest;
+
+struct ReplacementRow {
+   uint8_t existing;
+   uint8_t added;
+   bool replaces;
+};
+
+TEST_F(PortDbRecordsTest, add_of_a_known_key_follows_the_replacement_table)
+{
+   const ReplacementRow rows[] = {
+      {kStatic, kStatic, false}, {kStatic, kDhcp, false}, {kStatic, kTofu, false},
+      {kStatic, kArp, false},    {kDhcp, kStatic, true},  {kDhcp, kDhcp, false},
+      {kDhcp, kTofu, false},     {kDhcp, kArp, false},    {kTofu, kStatic, true},
+      {kTofu, kDhcp, true},      {kTofu, kTofu, false},   {kTofu, kArp, false},
+      {kArp, kStatic, true},     {kArp, kDhcp, true},     {kArp, kTofu, false},
+      {kArp, kArp, false},
+   };
+   // Each row with the key alone, and with a neighbour so that the hash table is in play.
+   for (bool withNeighbour : {false, true}) {
+      for (const auto &row : rows) {
+         SCOPED_TRACE(::testing::Message() << "existing " << int(row.existing) << " new "
+                                           << int(row.added) << " neighbour " << withNeighbour);
+         const Key key{5, 0x11, 0x21};
+         const Key neighbour{5, 0x12, 0x22};
+         if (withNeighbour) {
+            ASSERT_EQ(add(neighbour, kArp), 0);
+         }
+         ASSERT_EQ(add(key, row.existing), 0);
+         notices();
+
+         EXPECT_EQ(add(key, row.added), row.replaces ? 0 : -1);
+
+         ASSERT_NE(find(key), nullptr);
+         EXPECT_EQ(find(key)->discoveryMethod, row.replaces ? row.added : row.existing);
+         if (row.replaces) {
+            EXPECT_EQ(notices(), (std::vector<Notice>{removed(key, authOf(row.existing)),
+                                                      added(key, authOf(row.added))}));
+         } else {
+            EXPECT_TRUE(notices().empty());
+         }
+         EXPECT_EQ(ctx_.numVmiEntries, withNeighbour ? 2u : 1u);
+         expectCountersAgree();
+         if (withNeighbour) {
+            EXPECT_NE(find(neighbour), nullptr);
+         }
+
+         while (!SifraGenericListIsEmpty(&ctx_.portDbList)) {
+            SwSecDelVmi(&ctx_, vmiAt(ctx_.portDbList.next));
+         }
+         notices();
+      }
+   }
+}
+
+TEST_F(PortDbRecordsTest, replacement_needs_no_allocation_even_at_two_entries)
+{
+   ASSERT_EQ(add({1, 1, 1}, kArp), 0);
+   ASSERT_EQ(add({1, 2, 2}, kTofu), 0);
+   SwSecVmi *vmi = newVmi({1, 1, 1}, kDhcp);
+   host().faults().failFrom("orr_HeapAllocWithRA", ORR_NO_MEMORY);
+   host().faults().failFrom("Hash_Alloc", ORR_NO_MEMORY);
+
+   EXPECT_EQ(SwSecAddVmi(&ctx_, vmi), 0);
+
+   host().faults().clear();
+   EXPECT_EQ(find({1, 1, 1}), vmi);
+   EXPECT_NE(find({1, 2, 2}), nullptr);
+   expectCountersAgree();
+}
+
+TEST_F(PortDbRecordsTest, the_entry_beyond_the_port_size_is_refused)
+{
+   for (uint8_t i = 1; i <= 32; i++) {
+      ASSERT_EQ(add({1, i, i}, kArp), 0);
+   }
+   notices();
+
+   EXPECT_EQ(add({1, 33, 33}, kDhcp), -1);
+
+   EXPECT_EQ(ctx_.numVmiEntries, 32u);
+   EXPECT_EQ(find({1, 33, 33}), nullptr);
+   EXPECT_TRUE(notices().empty());
+   EXPECT_TRUE(logged("port-7: Exceeding the max portDbSize 32"));
+   // A replacement still fits: it removes first.
+   EXPECT_EQ(add({1, 32, 32}, kDhcp), 0);
+   EXPECT_EQ(ctx_.numVmiEntries, 32u);
+   expectCountersAgree();
+}
+
+TEST_F(PortDbRecordsTest, lookups_agree_while_the_hash_table_comes_and_goes)
+{
+   for (uint8_t n : {1, 2, 16, 32}) {
+      SCOPED_TRACE(::testing::Message() << n << " entries");
+      std::vector<Key> keys;
+      for (uint8_t i = 1; i <= n; i++) {
+         // Same MAC on two VLANs and two addresses for one MAC: all distinct keys.
+         keys.push_back({static_cast<uint16_t>(1 + i % 2), static_cast<uint8_t>(i / 2), i});
+         ASSERT_EQ(add(keys.back(), i % 2 ? kArp : kDhcp), 0);
+         EXPECT_EQ(ctx_.portDbHash != nullptr, keys.size() >= 2);
+         for (const Key &k : keys) {
+            ASSERT_NE(find(k), nullptr);
+            EXPECT_EQ(keyOf(find(k)), k);
+         }
+         EXPECT_EQ(find({3, 0, 0}), nullptr);
+         EXPECT_EQ(find({keys.back().vlan, keys.back().mac, static_cast<uint8_t>(keys.back().ip + 100)}),
+                   nullptr);
+      }
+      // Remove from the middle outwards until empty.
+      while (!keys.empty()) {
+         const size_t at = keys.size() / 2;
+         SwSecDelVmi(&ctx_, find(keys[at]));
+         const Key gone = keys[at];
+         keys.erase(keys.begin() + static_cast<std::ptrdiff_t>(at));
+         EXPECT_EQ(find(gone), nullptr);
+         for (const Key &k : keys) {
+            EXPECT_NE(find(k), nullptr);
+         }
+         expectCountersAgree();
+      }
+      EXPECT_EQ(ctx_.sparePortDbHash, nullptr);   // freed, not parked, outside a reconfiguration
+      notices();
+   }
+}
+
+TEST_F(PortDbRecordsTest, a_failed_hash_table_refuses_the_second_entry_and_keeps_the_first)
+{
+   ASSERT_EQ(add({1, 1, 1}, kDhcp), 0);
+   notices();
+   host().faults().failOnce("Hash_Alloc", ORR_NO_MEMORY);
+
+   EXPECT_EQ(add({1, 2, 2}, kArp), -1);
+
+   EXPECT_EQ(ctx_.numVmiEntries, 1u);
+   EXPECT_EQ(ctx_.portDbHash, nullptr);
+   EXPECT_NE(find({1, 1, 1}), nullptr);
+   EXPECT_TRUE(notices().empty());
+   EXPECT_EQ(add({1, 2, 2}, kArp), 0);
+   expectCountersAgree();
+}
+
+TEST_F(PortDbRecordsTest, a_parked_table_is_taken_by_the_next_second_entry)
+{
+   ASSERT_EQ(add({1, 1, 1}, kArp), 0);
+   ASSERT_EQ(add({1, 2, 2}, kArp), 0);
+   Hash_Table *table = ctx_.portDbHash;
+   ctx_.keepPortDbHash = 1;
+   SwSecDelVmi(&ctx_, find({1, 2, 2}));
+   ctx_.keepPortDbHash = 0;
+   EXPECT_EQ(ctx_.sparePortDbHash, table);
+   EXPECT_EQ(ctx_.portDbHash, nullptr);
+
+   host().faults().failOnce("Hash_Alloc", ORR_NO_MEMORY);
+   EXPECT_EQ(add({1, 3, 3}, kArp), 0);
+   EXPECT_EQ(ctx_.portDbHash, table);
+   EXPECT_EQ(ctx_.sparePortDbHash, nullptr);
+}
+
+TEST_F(PortDbRecordsTest, counters_and_client_ids_follow_adds_and_deletes)
+{
+   ASSERT_EQ(add({1, 1, 1}, kDhcp, 100, 5), 0);
+   ASSERT_EQ(add({1, 2, 2}, kDhcp, 100, 3), 0);
+   ASSERT_EQ(add({1, 3, 3}, kStatic), 0);
+   ASSERT_EQ(add({1, 4, 4}, kTofu, 100), 0);
+   EXPECT_EQ(ctx_.totalClientIdLen, 8u);
+   expectCountersAgree();
+
+   SwSecDelVmi(&ctx_, find({1, 1, 1}));
+   EXPECT_EQ(ctx_.totalClientIdLen, 3u);
+   expectCountersAgree();
+   SwSecDelVmi(&ctx_, find({1, 3, 3}));
+   expectCountersAgree();
+}
+
+TEST_F(PortDbRecordsTest, ageing_keeps_an_entry_until_the_pass_after_its_expiry)
+{
+   host().clock().advance(std::chrono::seconds(100));
+   const int64_t now = uptime();
+   ASSERT_EQ(add({1, 1, 1}, kDhcp, now), 0);
+   ASSERT_EQ(add({1, 2, 2}, kArp, now + 1), 0);
+   ASSERT_EQ(add({1, 3, 3}, kTofu, now - 1), 0);
+   ASSERT_EQ(add({1, 4, 4}, kStatic, 0), 0);
+   addRequest(now);
+   addRequest(now - 1, 4);
+   notices();
+
+   SwSecPortDbTimerCb(&ctx_);
+   EXPECT_EQ(entries(), (std::vector<std::pair<Key, uint8_t>>{
+                           {{1, 1, 1}, kDhcp}, {{1, 2, 2}, kArp}, {{1, 4, 4}, kStatic}}));
+   EXPECT_EQ(ctx_.numDhcpReqs, 1u);
+   EXPECT_EQ(notices(), (std::vector<Notice>{removed({1, 3, 3}, 0)}));
+
+   host().clock().advance(std::chrono::seconds(1));
+   SwSecPortDbTimerCb(&ctx_);
+   EXPECT_EQ(entries(), (std::vector<std::pair<Key, uint8_t>>{{{1, 2, 2}, kArp}, {{1, 4, 4}, kStatic}}));
+   EXPECT_EQ(ctx_.numDhcpReqs, 0u);
+   EXPECT_TRUE(SifraGenericListIsEmpty(&ctx_.dhcpReqList));
+
+   host().clock().advance(std::chrono::hours(24 * 365));
+   SwSecPortDbTimerCb(&ctx_);
+   EXPECT_EQ(entries(), (std::vector<std::pair<Key, uint8_t>>{{{1, 4, 4}, kStatic}}));
+   expectCountersAgree();
+}
+
+TEST_F(PortDbRecordsTest, clear_all_leaves_exactly_the_static_entries)
+{
+   ASSERT_EQ(add({1, 1, 1}, kDhcp), 0);
+   ASSERT_EQ(add({1, 2, 2}, kStatic), 0);
+   ASSERT_EQ(add({1, 3, 3}, kArp), 0);
+   ASSERT_EQ(add({1, 4, 4}, kStatic), 0);
+   ASSERT_EQ(add({1, 5, 5}, kTofu), 0);
+   notices();
+
+   EXPECT_EQ(SwSecClearVmi(&ctx_, true, 0, nullptr), ORR_OK);
+
+   EXPECT_EQ(entries(), (std::vector<std::pair<Key, uint8_t>>{{{1, 2, 2}, kStatic}, {{1, 4, 4}, kStatic}}));
+   EXPECT_EQ(notices(), (std::vector<Notice>{removed({1, 1, 1}, 1), removed({1, 3, 3}, 0),
+                                             removed({1, 5, 5}, 0)}));
+   expectCountersAgree();
+}
+
+TEST_F(PortDbRecordsTest, clear_by_key_skips_absent_keys_and_keeps_static_ones)
+{
+   ASSERT_EQ(add({1, 1, 1}, kDhcp), 0);
+   ASSERT_EQ(add({300, 0xab, 2}, kStatic), 0);
+   ASSERT_EQ(add({1, 3, 3}, kArp), 0);
+   notices();
+   const SwSecVmiKey keys[] = {Key{300, 0xab, 2}.raw(), Key{9, 9, 9}.raw(), Key{1, 3, 3}.raw()};
+
+   EXPECT_EQ(SwSecClearVmi(&ctx_, false, 3, keys), ORR_OK);
+
+   EXPECT_EQ(entries(), (std::vector<std::pair<Key, uint8_t>>{{{1, 1, 1}, kDhcp}, {{300, 0xab, 2}, kStatic}}));
+   EXPECT_EQ(notices(), (std::vector<Notice>{removed({1, 3, 3}, 0)}));
+   EXPECT_TRUE(logged("port-7: Trying to delete a static entry: 300 02:00:00:00:00:ab 10.0.0.2"))
+      << ::testing::PrintToString(logTexts());
+}
+
+TEST_F(PortDbRecordsTest, clear_does_nothing_on_a_disabled_database)
+{
+   ASSERT_EQ(add({1, 1, 1}, kArp), 0);
+   ctx_.config.featuresEnabled = 0;
+   const SwSecVmiKey key = Key{1, 1, 1}.raw();
+
+   EXPECT_EQ(SwSecClearVmi(&ctx_, true, 0, nullptr), ORR_OK);
+   EXPECT_EQ(SwSecClearVmi(&ctx_, false, 1, &key), ORR_OK);
+
+   EXPECT_EQ(ctx_.numVmiEntries, 1u);
+   ctx_.config.featuresEnabled = SwSecFeatureIpDiscovery;
+}
+
+}  // namespace
+}  // namespace swsec::testing

@@ -1,0 +1,140 @@
+// The frame loop's upgrade from the shared to the exclusive configLock,
+// judged by a test double of the per-packet policy (a link seam: this
+// program defines SwSecProcessPkt, so the module's policy is not linked).
+#include "support/frames.h"
+#include "support/host_fixture.h"
+
+#include "framework/sifra_generic.h"
+#include "framework/sifra_generic_filter.h"
+#include "framework/sifra_generic_lock.h"
+#include "swsec/swsec_context.h"
+#include "swsec/swsec_filter.h"
+#include "swsec/swsec_pkt_info.h"
+#include "swsec/swsec_policy.h"
+
+#include <gmock/gmock.h>
+
+#include <utility>
+#include <vector>
+
+using ::testing::ElementsAre;
+using ::testing::Pair;
+
+namespace swsec::testing {
+namespace {
+
+// How the double answers a frame, chosen by the last byte of its source MAC.
+struct PolicyDouble {
+   uint8_t busyTag = 0;      // ORR_BUSY while only the shared lock is held
+   uint8_t failTag = 0;      // ORR_NO_MEMORY (with a drop verdict) under the exclusive lock
+   std::vector<std::pair<uint8_t, bool>> calls;   // tag, readLocked
+};
+PolicyDouble policy;
+
+}  // namespace
+}  // namespace swsec::testing
+
+// Test double: odd tags are dropped, even ones passed.
+orr_Status SwSecProcessPkt(SwSecContext *, orr_Pkt *, SwSecPktInfo *info, uint32_t, uint32_t *verdict)
+{
+   auto &p = swsec::testing::policy;
+   const uint8_t tag = info->ethHdr[11];
+   p.calls.emplace_back(tag, info->readLocked != 0);
+   if (tag == p.busyTag && info->readLocked != 0) {
+      return ORR_BUSY;
+   }
+   if (tag == p.failTag && info->readLocked == 0) {
+      *verdict = SwSecVerdictDrop;
+      return ORR_NO_MEMORY;
+   }
+   *verdict = (tag & 1) != 0 ? SwSecVerdictDrop : SwSecVerdictPass;
+   return ORR_OK;
+}
+
+namespace swsec::testing {
+namespace {
+
+class FrameLoopTest : public HostTest {
+protected:
+   void SetUp() override
+   {
+      HostTest::SetUp();
+      policy = {};
+      orr_HeapProps props{};
+      orr_NameInitialize(&props.name, "frameloop");
+      props.initialSize = 4096;
+      props.maximumSize = 1u << 20;
+      ASSERT_EQ(orr_HeapCreate(&props, &sifraGenericHeapID), ORR_OK);
+      ASSERT_EQ(orr_LockDomainCreate(orr_ModuleCurrentID, sifraGenericHeapID, &props.name,
+                                     &sifraGenericLockDomain),
+                ORR_OK);
+      ASSERT_EQ(SifraGenericCreateSpinlock("sifg.sec.config", ORR_SPINLOCK_RW, SifraGenericLockRank::PortConfig,
+                                           &ctx_.configLock),
+                ORR_OK);
+      filter_.magic = SIFRAGENERIC_FILTER_MAGIC;
+      filter_.agentData = &ctx_;
+      ctx_.filter = &filter_;
+      ctx_.config.featuresEnabled = SwSecFeatureBpduFilter;
+   }
+
+   void TearDown() override
+   {
+      orr_SpinlockDestroy(ctx_.configLock);
+      orr_LockDomainDestroy(sifraGenericLockDomain);
+      sifraGenericLockDomain = ORR_INVALID_LOCK_DOMAIN;
+      orr_HeapDestroy(sifraGenericHeapID);
+      sifraGenericHeapID = nullptr;
+      HostTest::TearDown();
+   }
+
+   // Frames tagged by the last byte of their source MAC.
+   std::vector<size_t> run(const std::vector<uint8_t> &tags)
+   {
+      std::vector<host::FrameSpec> specs;
+      for (uint8_t tag : tags) {
+         UdpFrame f;
+         f.src = Mac{{2, 0, 0, 0, 0, tag}};
+         f.dst = Mac{{2, 0, 0, 0, 0, 0xee}};
+         host::FrameSpec spec;
+         spec.bytes = udpFrame(f);
+         specs.push_back(spec);
+      }
+      auto list = host().frames().makeList(specs);
+      EXPECT_EQ(SwSecProcessPackets(&filter_, list->list(), SwSecDirectionTx), ORR_OK);
+      EXPECT_EQ(host().frames().outstandingMappings(), 0u);
+      EXPECT_EQ(list->released(), tags.size() - list->kept().size());
+      return list->kept();
+   }
+
+   SifraGenericFilter filter_{};
+   SwSecContext ctx_{};
+};
+
+TEST_F(FrameLoopTest, a_frame_that_asks_for_the_write_lock_finishes_the_list_under_it)
+{
+   policy.busyTag = 4;
+   // The host aborts if the loop releases a lock mode it does not hold.
+   EXPECT_THAT(run({1, 2, 4, 5, 6}), ElementsAre(1u, 2u, 4u));
+   EXPECT_THAT(policy.calls, ElementsAre(Pair(1, true), Pair(2, true), Pair(4, true), Pair(4, false),
+                                         Pair(5, false), Pair(6, false)));
+   // The lock is free again: a writer gets it.
+   orr_SpinlockWriteLock(ctx_.configLock);
+   orr_SpinlockWriteUnlock(ctx_.configLock);
+}
+
+TEST_F(FrameLoopTest, a_failure_under_the_write_lock_keeps_the_frame_and_goes_on)
+{
+   policy.busyTag = 2;
+   policy.failTag = 3;
+   EXPECT_THAT(run({2, 3, 4}), ElementsAre(0u, 1u, 2u));
+   EXPECT_THAT(policy.calls, ElementsAre(Pair(2, true), Pair(2, false), Pair(3, false), Pair(4, false)));
+}
+
+TEST_F(FrameLoopTest, lists_without_an_upgrade_stay_under_the_shared_lock)
+{
+   EXPECT_THAT(run({1, 3, 2}), ElementsAre(2u));
+   EXPECT_THAT(policy.calls, ElementsAre(Pair(1, true), Pair(3, true), Pair(2, true)));
+}
+
+}  // namespace
+}  // namespace swsec::testing

@@ -1,6 +1,7 @@
 /* What the module image publishes to the host loader. */
 #include "framework/module_entry.h"
 #include "framework/sifra_generic.h"
+#include "mgmt/swsec_nexo.h"
 #include "platform/orr_module.h"
 #include "swsec/swsec_port_db_export.h"
 
@@ -58,4 +59,5 @@ ORR_MODULE_EXPORT const orr_ModuleInfo orr_moduleInfo = {
    .currentID = &orr_moduleCurrentID,
    .initModule = sifraGenericInitModule,
    .cleanupModule = sifraGenericCleanupModule,
+   .nexoTree = &swsecNexoTree,
 };

@@ -14,6 +14,14 @@ namespace {
 // New fault points are added here.
 constexpr std::array kFaultPoints = {
    std::string_view{"Hash_Alloc"},
+   std::string_view{"Net_StrToMac"},
+   std::string_view{"Nexo_NULL_Get"},
+   std::string_view{"Nexo_NULL_Set"},
+   std::string_view{"Nexo_ParamListAddInt"},
+   std::string_view{"Nexo_ParamListGetInt32"},
+   std::string_view{"Nexo_ParamListGetString"},
+   std::string_view{"Nexo_ParamListGetUInt32"},
+   std::string_view{"Nexo_ParamListUsedCount"},
    std::string_view{"orr_HeapAllocWithRA"},
    std::string_view{"orr_HeapCreate"},
    std::string_view{"orr_LockDomainCreate"},

@@ -142,6 +142,11 @@ Frames &Host::frames()
    return state_->frames;
 }
 
+Nexo &Host::nexo()
+{
+   return state_->nexo;
+}
+
 Host::State &Host::state()
 {
    return *state_;

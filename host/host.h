@@ -342,6 +342,50 @@ public:
    virtual void upgradeHoldOnNextPost() = 0;
 };
 
+// ---------------------------------------------------------------- Nexo
+
+// A field of an output record, rendered: its value as text (u8 as "%u",
+// char[N] up to its terminator, an enumeration by its element's label).
+struct NexoField {
+   std::string name;
+   std::string label;       // as the module gives it, padding included
+   std::string value;
+};
+
+struct NexoRecord {
+   std::string name;
+   std::string label;
+   std::vector<NexoField> fields;
+
+   // The record's label on the first line, then "<label>: <value>" a line.
+   std::string text() const;
+   // Field name -> value, for machines (JSON).
+   std::map<std::string, std::string, std::less<>> values() const;
+   // The value of a field by name; throws std::out_of_range when there is none.
+   const std::string &value(std::string_view field) const;
+};
+
+// The node tree that loaded modules declare. Paths are node names from the
+// module's root, with an instance key (a number) after each list node:
+// "/security", "/security/7/vmi", "/security/7/vmi/0". A path that names no
+// node, or an operation the node does not offer, throws
+// std::invalid_argument; otherwise each call returns the handler's status.
+class Nexo {
+public:
+   virtual ~Nexo() = default;
+   // True while a loaded module's branch is installed.
+   virtual bool installed() const = 0;
+   // Paths of the installed nodes, list nodes shown with "<key>" ("/security/<key>/vmi").
+   virtual std::vector<std::string> paths() const = 0;
+   // The instance keys of a list node.
+   virtual orr_Status list(std::string_view path, std::vector<int64_t> *instances) = 0;
+   // Gets a node into its output record (zero-filled on a failure status).
+   virtual orr_Status get(std::string_view path, NexoRecord *record) = 0;
+   // Sets a node with text arguments. A count outside the node's rule is
+   // refused with ORR_BAD_PARAM without calling the handler.
+   virtual orr_Status set(std::string_view path, const std::vector<std::string> &args) = 0;
+};
+
 // ---------------------------------------------------------------- loader
 
 struct LoadOptions {
@@ -412,6 +456,7 @@ public:
    Sifra &sifra();
    Portsets &portsets();
    Frames &frames();
+   Nexo &nexo();
 
    struct State;
    State &state();

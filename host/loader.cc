@@ -78,6 +78,9 @@ int Loader::load(const LoadOptions &options)
        (info->numRequiredNamespaces != 0 && info->requiredNamespaces == nullptr)) {
       throw std::runtime_error("module image '" + path + "' has incomplete module information");
    }
+   if (info->nexoTree != nullptr) {
+      NexoRegistry::validate(*info->nexoTree);
+   }
 
    // Every requested parameter must exist before any is set.
    for (const auto &[name, value] : options.parameters) {
@@ -137,8 +140,12 @@ int Loader::load(const LoadOptions &options)
 
    const int result = info->initModule();
    if (result == 0) {
-      std::lock_guard guard(mutex_);
-      phase_ = Phase::Ready;
+      {
+         std::lock_guard guard(mutex_);
+         phase_ = Phase::Ready;
+      }
+      // The module's branch is data declared with it: visible while it is loaded.
+      state_.nexo.install(info->nexoTree);
       return 0;
    }
    if (result != 1) {
@@ -167,6 +174,8 @@ orr_Status Loader::unload()
       phase_ = Phase::Unloading;
       info = info_;
    }
+   // No handler may run into a module that is going.
+   state_.nexo.remove();
    const orr_Status status = info->cleanupModule();
    purgeLeftovers("at unload");
    closeImage();

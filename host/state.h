@@ -10,6 +10,7 @@
 #include "host/loader.h"
 #include "host/locks.h"
 #include "host/log.h"
+#include "host/nexo.h"
 #include "host/plex.h"
 #include "host/portsets.h"
 #include "host/sifra_registry.h"
@@ -35,6 +36,7 @@ struct Host::State {
    FrameStore frames{violations, faults};
    SifraRegistry sifra{violations, faults, portsets, frames, timers};
    HashTables hashTables{violations, faults, heaps};
+   NexoRegistry nexo{violations, faults};
    Loader loader{*this};
 };
 

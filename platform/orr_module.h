@@ -5,6 +5,7 @@
 #pragma once
 
 #include "platform/orr_base.h"
+#include "platform/orr_nexo.h"
 
 /* Interface revision a module registers with. */
 #define ORR_MODULE_INTERFACE_REVISION 0x2020000u
@@ -60,6 +61,8 @@ typedef struct orr_ModuleInfo {
    orr_ModuleID *currentID;               /* where the loader writes the module's identity */
    int (*initModule)(void);               /* 0 when ready, 1 on failure */
    orr_Status (*cleanupModule)(void);
+   /* The module's branch of the Nexo tree; null: none. Installed while loaded. */
+   const Nexo_Tree *nexoTree;
 } orr_ModuleInfo;
 
 #define ORR_MODULE_INFO_SYMBOL "orr_moduleInfo"

@@ -17,3 +17,9 @@ ORR_API int orr_Sprintf(char *buffer, size_t size, const char *format, ...) ORR_
 /* Formats into `buffer` of `size` bytes; `flags` is 0. */
 ORR_API orr_Status orr_StringFormat(char *buffer, size_t size, uint32_t flags,
                                     const char *format, ...) ORR_PRINTF(4, 5);
+
+/*
+ * Parses a MAC address "xx:xx:xx:xx:xx:xx" (one or two hex digits a group)
+ * into 6 bytes. ORR_BAD_PARAM for any other text.
+ */
+ORR_API orr_Status Net_StrToMac(const char *text, uint8_t *mac);

@@ -7,6 +7,7 @@
 #include "platform/orr_lock.h"
 #include "platform/orr_log.h"
 #include "platform/orr_module.h"
+#include "platform/orr_nexo.h"
 #include "platform/orr_pkt.h"
 #include "platform/orr_plex.h"
 #include "platform/orr_portset.h"

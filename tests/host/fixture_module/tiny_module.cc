@@ -124,4 +124,5 @@ ORR_MODULE_EXPORT const orr_ModuleInfo orr_moduleInfo = {
    .currentID = &orr_moduleCurrentID,
    .initModule = TinyInit,
    .cleanupModule = TinyCleanup,
+   .nexoTree = nullptr,
 };

@@ -1,0 +1,152 @@
+// The port database test hooks, switched through the "startTest" and
+// "stopTest" nodes: while on, each port database change reads the port
+// through the exported queries once per selector.
+#include "support/frames.h"
+#include "support/host_fixture.h"
+
+#include <cstdint>
+#include <string>
+
+namespace swsec::testing {
+namespace {
+
+constexpr const char *kAgent = "sifra-generic-tarlin-swsec";
+constexpr uint32_t kPort = 7;
+constexpr uint64_t kPortDbClass = 0x0008000000000000ull;
+
+Bytes arpRequestFrom(const char *mac, const char *ip)
+{
+   Arp arp;
+   arp.op = 1;
+   arp.senderMac = Mac::parse(mac);
+   arp.senderIp = Ip4::parse(ip);
+   arp.targetIp = Ip4::parse("10.0.0.254");
+   return arpFrame(arp.senderMac, kBroadcastMac, arp);
+}
+
+class TestHooksTest : public ModuleTest {
+protected:
+   void SetUp() override
+   {
+      ModuleTest::SetUp();
+      host().portsets().addPortset("vs0");
+      host().portsets().addPort("vs0", kPort);
+      ASSERT_EQ(host().sifra().createFilter(kAgent, kPort, {}, &filter_), ORR_OK);
+   }
+
+   void TearDown() override
+   {
+      EXPECT_EQ(host().sifra().destroyFilterAsHypervisor(filter_).status, ORR_OK);
+      ModuleTest::TearDown();
+   }
+
+   size_t portDbListeners()
+   {
+      size_t count = 0;
+      for (const auto &listener : host().portsets().listeners()) {
+         count += listener.msgClass == kPortDbClass && listener.portset == nullptr && listener.portID == 0 ? 1 : 0;
+      }
+      return count;
+   }
+
+   // The traffic one learned VMI causes: portset holds taken by port ID and
+   // exported-query buffers (module use count increments).
+   struct Traffic {
+      uint64_t acquisitions;
+      uint64_t useCountIncrements;
+   };
+   Traffic learnOneVmi(const char *mac, const char *ip)
+   {
+      const uint64_t acquisitions = host().faults().calls("orr_PortsetAcquireByPortID");
+      const uint64_t increments = host().faults().calls("orr_ModuleIncUseCount");
+      host::FrameSpec spec;
+      spec.bytes = arpRequestFrom(mac, ip);
+      (void)host().sifra().processPackets(filter_, ORR_SIFRA_DIR_TX, {spec});
+      EXPECT_EQ(host().portsets().pendingDeliveries(), 0u);
+      return {host().faults().calls("orr_PortsetAcquireByPortID") - acquisitions,
+              host().faults().calls("orr_ModuleIncUseCount") - increments};
+   }
+
+   host::FilterId filter_ = 0;
+};
+
+TEST_F(TestHooksTest, stop_without_start_succeeds_and_changes_nothing)
+{
+   EXPECT_EQ(host().nexo().set("/stopTest", {}), ORR_OK);
+   EXPECT_EQ(portDbListeners(), 0u);
+}
+
+TEST_F(TestHooksTest, start_twice_registers_one_listener_and_one_stop_removes_it)
+{
+   EXPECT_EQ(host().nexo().set("/startTest", {}), ORR_OK);
+   EXPECT_EQ(host().nexo().set("/startTest", {}), ORR_OK);
+   EXPECT_EQ(portDbListeners(), 1u);
+   EXPECT_EQ(host().nexo().set("/stopTest", {}), ORR_OK);
+   EXPECT_EQ(portDbListeners(), 0u);
+   EXPECT_EQ(host().nexo().set("/stopTest", {}), ORR_OK);
+}
+
+TEST_F(TestHooksTest, a_refused_registration_is_returned_and_leaves_the_hooks_off)
+{
+   host().faults().failOnce("orr_PortsetRegisterMessageCB", ORR_NO_MEMORY);
+   EXPECT_EQ(host().nexo().set("/startTest", {}), ORR_NO_MEMORY);
+   EXPECT_EQ(portDbListeners(), 0u);
+   EXPECT_EQ(host().nexo().set("/startTest", {}), ORR_OK);
+   EXPECT_EQ(portDbListeners(), 1u);
+}
+
+TEST_F(TestHooksTest, each_vmi_added_while_on_reads_the_port_once_per_selector)
+{
+   const Traffic off = learnOneVmi("02:00:00:00:00:01", "10.0.0.1");
+   EXPECT_EQ(off.acquisitions, 0u);
+   EXPECT_EQ(off.useCountIncrements, 0u);
+
+   ASSERT_EQ(host().nexo().set("/startTest", {}), ORR_OK);
+   // Two non-authoritative VMIs then: selector 0 finds none, 1 and 2 both
+   // hand out a buffer (one use count each, given back at once).
+   const Traffic on = learnOneVmi("02:00:00:00:00:02", "10.0.0.2");
+   EXPECT_EQ(on.acquisitions, 1u);
+   EXPECT_EQ(on.useCountIncrements, 2u);
+   EXPECT_EQ(host().useCount(), 0u);
+   EXPECT_EQ(host().portsets().outstandingAcquisitions(), 0u);
+
+   ASSERT_EQ(host().nexo().set("/stopTest", {}), ORR_OK);
+   const Traffic stopped = learnOneVmi("02:00:00:00:00:03", "10.0.0.3");
+   EXPECT_EQ(stopped.acquisitions, 0u);
+}
+
+TEST_F(TestHooksTest, messages_of_another_class_or_without_a_message_are_ignored)
+{
+   ASSERT_EQ(host().nexo().set("/startTest", {}), ORR_OK);
+   orr_PortsetMessageCB callback = nullptr;
+   for (const auto &listener : host().portsets().listeners()) {
+      if (listener.msgClass == kPortDbClass) {
+         callback = listener.callback;
+      }
+   }
+   ASSERT_NE(callback, nullptr);
+   const uint64_t before = host().faults().calls("orr_PortsetAcquireByPortID");
+   orr_PortsetMessageHeader message{};
+   callback(kPort, kPortDbClass << 1, &message);
+   callback(kPort, kPortDbClass, nullptr);
+   EXPECT_EQ(host().faults().calls("orr_PortsetAcquireByPortID"), before);
+
+   // A port the host does not know: the hold is refused and nothing is read.
+   const uint64_t increments = host().faults().calls("orr_ModuleIncUseCount");
+   callback(4242, kPortDbClass, &message);
+   EXPECT_EQ(host().faults().calls("orr_ModuleIncUseCount"), increments);
+}
+
+TEST_F(TestHooksTest, unloading_with_the_hooks_on_withdraws_the_listener)
+{
+   ASSERT_EQ(host().nexo().set("/startTest", {}), ORR_OK);
+   EXPECT_EQ(host().sifra().destroyFilterAsHypervisor(filter_).status, ORR_OK);
+   ASSERT_EQ(host().unload(), ORR_OK);
+   EXPECT_EQ(portDbListeners(), 0u);
+   EXPECT_TRUE(host().violations().empty());
+   ASSERT_EQ(host().load(), 0);
+   ASSERT_EQ(host().sifra().createFilter(kAgent, kPort, {}, &filter_), ORR_OK);
+}
+
+}  // namespace
+}  // namespace swsec::testing

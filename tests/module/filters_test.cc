@@ -240,10 +240,10 @@ TEST_F(FilterTest, a_new_port_has_ip_discovery_on_a_trusted_port_and_its_timer)
    const size_t timers = host().clock().pendingTimers();
    const host::FilterId id = create();
    const SwSecContext *ctx = context(id);
-   EXPECT_EQ(ctx->config.version, 1);
-   EXPECT_EQ(ctx->config.featuresEnabled, SwSecFeatureIpDiscovery);
-   EXPECT_EQ(ctx->config.trusted, 1);
-   EXPECT_EQ(ctx->config.portDbSize, 32u);
+   EXPECT_EQ(+ctx->config.version, 1);
+   EXPECT_EQ(+ctx->config.featuresEnabled, SwSecFeatureIpDiscovery);
+   EXPECT_EQ(+ctx->config.trusted, 1);
+   EXPECT_EQ(+ctx->config.portDbSize, 32u);
    EXPECT_EQ(ctx->portId, kPortId);
    EXPECT_EQ(ctx->portset, host().portsets().portset("vs0"));
    EXPECT_EQ(host().clock().pendingTimers(), timers + 1);
@@ -355,7 +355,7 @@ TEST_F(FilterTest, short_unknown_and_reply_types_are_ignored)
       EXPECT_EQ(host().sifra().sendIoctl(id, 3, payload), ORR_OK);
    }
    EXPECT_TRUE(host().sifra().ioctlReplies().empty());
-   EXPECT_EQ(context(id)->config.featuresEnabled, SwSecFeatureIpDiscovery);
+   EXPECT_EQ(+context(id)->config.featuresEnabled, SwSecFeatureIpDiscovery);
 }
 
 TEST_F(FilterTest, set_features_replies_whether_it_was_accepted_and_keeps_the_old_one_on_refusal)
@@ -363,10 +363,10 @@ TEST_F(FilterTest, set_features_replies_whether_it_was_accepted_and_keeps_the_ol
    const host::FilterId id = create();
    EXPECT_EQ(configure(id, {.features = SwSecFeatureBpduFilter | SwSecFeatureBlockDhcpServer}), 1u);
    EXPECT_TRUE(logged("Received set features via Sifra IOCTL, payloadSize: 30"));
-   EXPECT_EQ(context(id)->config.featuresEnabled, 0x3u);
+   EXPECT_EQ(+context(id)->config.featuresEnabled, 0x3u);
 
    EXPECT_EQ(configure(id, {.features = SwSecFeatureDai, .trusted = 0}), 0u);
-   EXPECT_EQ(context(id)->config.featuresEnabled, 0x3u);
+   EXPECT_EQ(+context(id)->config.featuresEnabled, 0x3u);
 }
 
 TEST_F(FilterTest, set_features_and_clear_payloads_shorter_than_their_records_are_refused)
@@ -386,7 +386,7 @@ TEST_F(FilterTest, set_features_and_clear_payloads_shorter_than_their_records_ar
       hugeCount[i] = 0xff;
    }
    EXPECT_EQ(configureRaw(id, hugeCount), 0u);
-   EXPECT_EQ(context(id)->config.featuresEnabled, SwSecFeatureBpduFilter);
+   EXPECT_EQ(+context(id)->config.featuresEnabled, SwSecFeatureBpduFilter);
 
    // Clear requests: no count, or fewer keys than counted.
    ASSERT_EQ(configure(id, {.features = SwSecFeatureIpDiscovery, .statics = {{0, kVmMac, kVmIp}}}), 1u);
@@ -397,7 +397,7 @@ TEST_F(FilterTest, set_features_and_clear_payloads_shorter_than_their_records_ar
    clear.resize(clear.size() + 12);
    EXPECT_EQ(host().sifra().sendIoctl(id, 4, clear), ORR_OK);
    EXPECT_EQ(host().log().count("Clear VMI payload of"), 2u);
-   EXPECT_EQ(context(id)->config.numStatic, 1u);
+   EXPECT_EQ(+context(id)->config.numStatic, 1u);
 }
 
 TEST_F(FilterTest, get_vmi_lists_every_entry_and_an_empty_database_as_count_zero)
@@ -446,12 +446,12 @@ TEST_P(ConfigTest, validates_before_anything_changes)
 
    EXPECT_EQ(configure(id, c.config), c.accepted ? 1u : 0u);
    if (c.accepted) {
-      EXPECT_EQ(ctx->config.featuresEnabled, c.config.features);
+      EXPECT_EQ(+ctx->config.featuresEnabled, c.config.features);
       EXPECT_EQ(ctx->counters.daiDropCnt, 0u);
       EXPECT_EQ(ctx->counters.ipSrcGuardDropCnt, 0u);
       EXPECT_TRUE(logged("Configured successfully"));
    } else {
-      EXPECT_EQ(ctx->config.featuresEnabled, SwSecFeatureIpDiscovery);
+      EXPECT_EQ(+ctx->config.featuresEnabled, SwSecFeatureIpDiscovery);
       EXPECT_EQ(ctx->counters.daiDropCnt, 5u);
       EXPECT_EQ(ctx->counters.ipSrcGuardDropCnt, 6u);
       EXPECT_TRUE(logged("filter: " + c.message + "\n")) << ::testing::PrintToString(logTexts());
@@ -483,7 +483,7 @@ TEST_F(FilterTest, switching_features_off_twice_succeeds)
 {
    const host::FilterId id = create();
    ASSERT_EQ(configure(id, {.features = 0}), 1u);
-   EXPECT_EQ(context(id)->config.featuresEnabled, 0u);
+   EXPECT_EQ(+context(id)->config.featuresEnabled, 0u);
    ASSERT_EQ(configure(id, {.features = 0}), 1u);
 }
 

@@ -36,8 +36,8 @@ TEST_F(PortDbConfigTest, sizes_outside_one_to_thirty_two_are_refused_with_the_ra
       EXPECT_TRUE(logged("port-7: Invalid portDbSize: " + std::to_string(size) +
                          ". Expected in the range [1 32]"));
       EXPECT_EQ(entries(), (Entries{{{1, 1, 1}, kStatic}}));
-      EXPECT_EQ(ctx_.config.portDbSize, 32u);
-      EXPECT_EQ(ctx_.config.trusted, 1u);
+      EXPECT_EQ(+ctx_.config.portDbSize, 32u);
+      EXPECT_EQ(+ctx_.config.trusted, 1u);
       EXPECT_TRUE(notices().empty());
    }
 }
@@ -54,13 +54,13 @@ TEST_F(PortDbConfigTest, shrinking_below_the_surviving_entries_changes_nothing)
    EXPECT_EQ(configure(config(kOn, 1, 3, {{1, 4, 4}, {1, 5, 5}})), ORR_FAILURE);
    EXPECT_TRUE(logged("port-7: Invalid portDbSize: 3 4"));
    EXPECT_EQ(entries(), before);
-   EXPECT_EQ(ctx_.config.portDbSize, 32u);
+   EXPECT_EQ(+ctx_.config.portDbSize, 32u);
    EXPECT_TRUE(notices().empty());
 
    // Leaving trusted mode drops the ARP entry, so 3 fit.
    EXPECT_EQ(configure(config(kOn, 0, 3, {{1, 4, 4}, {1, 5, 5}})), ORR_OK);
    EXPECT_EQ(entries(), (Entries{{{1, 2, 2}, kDhcp}, {{1, 4, 4}, kStatic}, {{1, 5, 5}, kStatic}}));
-   EXPECT_EQ(ctx_.config.portDbSize, 3u);
+   EXPECT_EQ(+ctx_.config.portDbSize, 3u);
    expectCountersAgree();
 }
 
@@ -77,7 +77,7 @@ TEST_F(PortDbConfigTest, leaving_trusted_mode_drops_learned_non_authoritative_en
    EXPECT_EQ(entries(), (Entries{{{1, 2, 2}, kDhcp}, {{1, 1, 1}, kStatic}}));
    EXPECT_EQ(notices(), (std::vector<Notice>{removed({1, 1, 1}, 1), removed({1, 3, 3}, 0),
                                              removed({1, 4, 4}, 0), added({1, 1, 1}, 1)}));
-   EXPECT_EQ(ctx_.config.trusted, 0u);
+   EXPECT_EQ(+ctx_.config.trusted, 0u);
    EXPECT_TRUE(logged("port-7: Config success: trusted = 0 portDbSize = 32 numStatic = 1"));
 
    // Back to trusted: only the statics are replaced.
@@ -163,7 +163,7 @@ TEST_F(PortDbConfigTest, disabling_under_a_reference_is_busy_until_it_is_release
    EXPECT_EQ(notices(), (std::vector<Notice>{removed({1, 1, 1}, 1), removed({1, 2, 2}, 0)}));
    // The timer stays; size and mode keep their last values.
    EXPECT_NE(ctx_.portDbTimer, 0u);
-   EXPECT_EQ(ctx_.config.portDbSize, 32u);
+   EXPECT_EQ(+ctx_.config.portDbSize, 32u);
 }
 
 TEST_F(PortDbConfigTest, disabling_empties_pending_requests)
@@ -211,7 +211,7 @@ TEST_F(PortDbConfigTest, every_failing_step_leaves_the_old_configuration_in_forc
          EXPECT_EQ(status, c.status);
          EXPECT_TRUE(logged(c.message));
          EXPECT_EQ(entries(), before);
-         EXPECT_EQ(ctx_.config.trusted, 1u);
+         EXPECT_EQ(+ctx_.config.trusted, 1u);
          EXPECT_TRUE(notices().empty());
          EXPECT_EQ(host().heap().liveBlocks(), blocks);
       }

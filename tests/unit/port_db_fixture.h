@@ -214,7 +214,7 @@ protected:
       EXPECT_EQ(ctx_.numVmiEntries, all);
       EXPECT_EQ(ctx_.numAuthVmiEntries, auth);
       EXPECT_EQ(ctx_.numNonAuthVmiEntries, nonAuth);
-      EXPECT_EQ(ctx_.config.numStatic, statics);
+      EXPECT_EQ(+ctx_.config.numStatic, statics);
       EXPECT_EQ(ctx_.portDbHash != nullptr, all >= 2);
    }
 

@@ -396,6 +396,11 @@ struct LoadOptions {
    std::string moduleName = "swsec";
    // Module parameters set at load, by name.
    std::map<std::string, int, std::less<>> parameters;
+   // A module linked into the calling program instead of an image to open
+   // (white-box tests that also call the module's internal functions).
+   // Its globals are not renewed between loads: only its own teardown
+   // resets them.
+   const orr_ModuleInfo *linkedModule = nullptr;
 };
 
 struct ModuleParamInfo {

@@ -57,13 +57,15 @@ int Loader::load(const LoadOptions &options)
          throw std::logic_error("Host::load: a module is already loaded");
       }
    }
-   const std::string path = modulePath(options);
-   ImageGuard image{dlopen(path.c_str(), RTLD_NOW | RTLD_LOCAL)};
-   if (image.image == nullptr) {
+   const bool linked = options.linkedModule != nullptr;
+   const std::string path = linked ? std::string("(linked into the program)") : modulePath(options);
+   ImageGuard image{linked ? nullptr : dlopen(path.c_str(), RTLD_NOW | RTLD_LOCAL)};
+   if (!linked && image.image == nullptr) {
       const char *error = dlerror();
       throw std::runtime_error("cannot open module image '" + path + "': " + textOf(error));
    }
-   const auto *info = static_cast<const orr_ModuleInfo *>(dlsym(image.image, ORR_MODULE_INFO_SYMBOL));
+   const auto *info = linked ? options.linkedModule
+                             : static_cast<const orr_ModuleInfo *>(dlsym(image.image, ORR_MODULE_INFO_SYMBOL));
    if (info == nullptr) {
       throw std::runtime_error("module image '" + path + "' has no " ORR_MODULE_INFO_SYMBOL);
    }
@@ -217,6 +219,11 @@ void Loader::closeImage()
       phase_ = Phase::Unloaded;
       registered_ = false;
       useCount_ = 0;
+   }
+   if (image == nullptr) {
+      // A linked module: there is no image to close.
+      state_.symbolizer.forget();
+      return;
    }
    if (dlclose(image) != 0) {
       const char *error = dlerror();

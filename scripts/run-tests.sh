@@ -1,6 +1,7 @@
 #!/usr/bin/env bash
 # Sets everything up and runs the tests: the suite built with g++, the build
-# with clang, and the suite again under AddressSanitizer + UndefinedBehaviorSanitizer.
+# with clang, and the suite again under AddressSanitizer +
+# UndefinedBehaviorSanitizer and under ThreadSanitizer.
 set -euo pipefail
 cd "$(dirname "$0")/.."
 
@@ -20,3 +21,7 @@ bash scripts/build.sh clang
 
 bash scripts/build.sh asan
 ASAN_OPTIONS=detect_leaks=1:abort_on_error=1 UBSAN_OPTIONS=print_stacktrace=1 run_suite asan
+
+# Frames are judged by several threads at once; the host's locks are real.
+bash scripts/build.sh tsan
+TSAN_OPTIONS=halt_on_error=1 run_suite tsan

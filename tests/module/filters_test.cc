@@ -92,7 +92,7 @@ uint32_t get32(const Bytes &b, size_t offset)
    return v;
 }
 
-host::FrameSpec spec(Bytes bytes)
+host::FrameSpec frameSpecOf(Bytes bytes)
 {
    host::FrameSpec s;
    s.bytes = std::move(bytes);
@@ -177,11 +177,11 @@ protected:
 
    std::vector<size_t> kept(host::FilterId id, uint32_t direction, const std::vector<Bytes> &frames)
    {
-      std::vector<host::FrameSpec> specs;
+      std::vector<host::FrameSpec> frameSpecs;
       for (const Bytes &f : frames) {
-         specs.push_back(spec(f));
+         frameSpecs.push_back(frameSpecOf(f));
       }
-      return host().sifra().processPackets(id, direction, specs).kept;
+      return host().sifra().processPackets(id, direction, frameSpecs).kept;
    }
    bool passes(host::FilterId id, uint32_t direction, const Bytes &frame)
    {
@@ -278,7 +278,7 @@ TEST_F(FilterTest, calls_with_a_bad_magic_never_reach_the_agent)
    const size_t echoes = host().sifra().ioctlReplies().size();
    const Bytes echo = {1, 0, 0, 0, 'a', 0};
    EXPECT_EQ(host().sifra().sendIoctl(id, 5, echo), ORR_BAD_PARAM);
-   const auto frames = host().sifra().processPackets(id, kTx, {spec(bpduFrame(kVmMac))});
+   const auto frames = host().sifra().processPackets(id, kTx, {frameSpecOf(bpduFrame(kVmMac))});
    EXPECT_EQ(frames.status, ORR_BAD_PARAM);
    host::FilterConfig renamed;
    renamed.name = "renamed";
@@ -309,7 +309,7 @@ TEST_F(FilterTest, dropped_frames_leave_the_list_and_are_released)
    ASSERT_EQ(configure(id, {.features = SwSecFeatureBpduFilter}), 1u);
    const uint64_t releases = host().frames().releases();
    const auto result = host().sifra().processPackets(
-      id, kTx, {spec(udpFrom(kVmIp)), spec(bpduFrame(kVmMac)), spec(arpProbe()), spec(bpduFrame(kVmMac, kPvstMac))});
+      id, kTx, {frameSpecOf(udpFrom(kVmIp)), frameSpecOf(bpduFrame(kVmMac)), frameSpecOf(arpProbe()), frameSpecOf(bpduFrame(kVmMac, kPvstMac))});
    EXPECT_EQ(result.status, ORR_OK);
    EXPECT_THAT(result.kept, ElementsAre(0u, 2u));
    EXPECT_EQ(result.released, 2u);
@@ -687,7 +687,7 @@ TEST_F(FilterTest, two_threads_judge_lists_while_a_third_rewrites_the_configurat
    auto judge = [&](uint32_t direction) {
       while (!stop) {
          const auto result = host().sifra().processPackets(
-            id, direction, {spec(udpFrom(kVmIp)), spec(bpduFrame(kVmMac)), spec(arpProbe())});
+            id, direction, {frameSpecOf(udpFrom(kVmIp)), frameSpecOf(bpduFrame(kVmMac)), frameSpecOf(arpProbe())});
          // Whatever configuration is active, the UDP and ARP frames pass.
          if (result.kept.empty() || result.kept.front() != 0 || result.kept.back() != 2) {
             ++wrongVerdicts;

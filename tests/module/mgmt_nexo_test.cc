@@ -116,9 +116,9 @@ protected:
 
    void sendFromVm(host::FilterId id, const Bytes &frame)
    {
-      host::FrameSpec spec;
-      spec.bytes = frame;
-      (void)host().sifra().processPackets(id, ORR_SIFRA_DIR_TX, {spec});
+      host::FrameSpec frameSpec;
+      frameSpec.bytes = frame;
+      (void)host().sifra().processPackets(id, ORR_SIFRA_DIR_TX, {frameSpec});
    }
 
    host::NexoRecord get(const std::string &path, orr_Status expected = ORR_OK)

@@ -59,9 +59,9 @@ protected:
    {
       const uint64_t acquisitions = host().faults().calls("orr_PortsetAcquireByPortID");
       const uint64_t increments = host().faults().calls("orr_ModuleIncUseCount");
-      host::FrameSpec spec;
-      spec.bytes = arpRequestFrom(mac, ip);
-      (void)host().sifra().processPackets(filter_, ORR_SIFRA_DIR_TX, {spec});
+      host::FrameSpec frameSpec;
+      frameSpec.bytes = arpRequestFrom(mac, ip);
+      (void)host().sifra().processPackets(filter_, ORR_SIFRA_DIR_TX, {frameSpec});
       EXPECT_EQ(host().portsets().pendingDeliveries(), 0u);
       return {host().faults().calls("orr_PortsetAcquireByPortID") - acquisitions,
               host().faults().calls("orr_ModuleIncUseCount") - increments};

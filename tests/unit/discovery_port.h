@@ -139,12 +139,12 @@ protected:
                                       std::optional<uint32_t> mappedLen = std::nullopt)
    {
       auto frame = std::make_unique<WrappedFrame>();
-      host::FrameSpec spec;
-      spec.bytes = bytes;
-      spec.vlanId = vlanId;
-      spec.split = std::move(split);
-      spec.mappedLen = mappedLen.value_or(static_cast<uint32_t>(bytes.size()));
-      frame->list = host().frames().makeList({spec});
+      host::FrameSpec frameSpec;
+      frameSpec.bytes = bytes;
+      frameSpec.vlanId = vlanId;
+      frameSpec.split = std::move(split);
+      frameSpec.mappedLen = mappedLen.value_or(static_cast<uint32_t>(bytes.size()));
+      frame->list = host().frames().makeList({frameSpec});
       frame->pkt = frame->list->frame(0);
 
       SwSecPktInfo &info = frame->info;

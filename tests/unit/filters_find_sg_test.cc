@@ -30,13 +30,13 @@ class FindSGEntryTest : public HostTest, public ::testing::WithParamInterface<Ra
 TEST_P(FindSGEntryTest, maps_the_element_that_holds_the_whole_range)
 {
    const RangeCase &c = GetParam();
-   host::FrameSpec spec;
-   spec.bytes.resize(c.frameLen);
+   host::FrameSpec frameSpec;
+   frameSpec.bytes.resize(c.frameLen);
    for (uint32_t i = 0; i < c.frameLen; i++) {
-      spec.bytes[i] = static_cast<uint8_t>(i * 7 + i / 256);   // each offset tells itself apart
+      frameSpec.bytes[i] = static_cast<uint8_t>(i * 7 + i / 256);   // each offset tells itself apart
    }
-   spec.split = c.split;
-   auto list = host().frames().makeList({spec});
+   frameSpec.split = c.split;
+   auto list = host().frames().makeList({frameSpec});
    orr_Pkt *pkt = list->frame(0);
 
    const uint8_t *found = SifraGenericFindSGEntry(pkt, c.start, c.end);
@@ -47,7 +47,7 @@ TEST_P(FindSGEntryTest, maps_the_element_that_holds_the_whole_range)
    ASSERT_NE(found, nullptr);
    // The bytes there are the frame's bytes from the start offset to the end.
    EXPECT_EQ(std::vector<uint8_t>(found, found + (c.end - c.start)),
-             std::vector<uint8_t>(spec.bytes.begin() + c.start, spec.bytes.begin() + c.end));
+             std::vector<uint8_t>(frameSpec.bytes.begin() + c.start, frameSpec.bytes.begin() + c.end));
 }
 
 INSTANTIATE_TEST_SUITE_P(

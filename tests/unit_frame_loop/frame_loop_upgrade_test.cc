@@ -90,16 +90,16 @@ protected:
    // Frames tagged by the last byte of their source MAC.
    std::vector<size_t> run(const std::vector<uint8_t> &tags)
    {
-      std::vector<host::FrameSpec> specs;
+      std::vector<host::FrameSpec> frameSpecs;
       for (uint8_t tag : tags) {
          UdpFrame f;
          f.src = Mac{{2, 0, 0, 0, 0, tag}};
          f.dst = Mac{{2, 0, 0, 0, 0, 0xee}};
-         host::FrameSpec spec;
-         spec.bytes = udpFrame(f);
-         specs.push_back(spec);
+         host::FrameSpec frameSpec;
+         frameSpec.bytes = udpFrame(f);
+         frameSpecs.push_back(frameSpec);
       }
-      auto list = host().frames().makeList(specs);
+      auto list = host().frames().makeList(frameSpecs);
       EXPECT_EQ(SwSecProcessPackets(&filter_, list->list(), SwSecDirectionTx), ORR_OK);
       EXPECT_EQ(host().frames().outstandingMappings(), 0u);
       EXPECT_EQ(list->released(), tags.size() - list->kept().size());

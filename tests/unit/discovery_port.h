@@ -6,6 +6,7 @@
 
 #include "support/frames.h"
 #include "support/host_fixture.h"
+#include "unit/hand_made_port.h"
 
 #include "framework/sifra_generic.h"
 #include "framework/sifra_generic_filter.h"
@@ -49,35 +50,12 @@ struct WrappedFrame {
    ~WrappedFrame() { releaseCopy(); }
 };
 
-class DiscoveryTest : public HostTest {
+class DiscoveryTest : public HandMadePortTest {
 protected:
-   static constexpr uint32_t kPortId = 7;
-
    void SetUp() override
    {
       HostTest::SetUp();
-      // The module heap and log, as start-up makes them.
-      orr_HeapProps props{};
-      orr_NameInitialize(&props.name, "discovery");
-      props.initialSize = 4096;
-      props.maximumSize = 1u << 20;
-      ASSERT_EQ(orr_HeapCreate(&props, &sifraGenericHeapID), ORR_OK);
-      orr_LogProps logProps{};
-      logProps.name = props.name;
-      logProps.heap = sifraGenericHeapID;
-      ASSERT_EQ(orr_LogRegister(&logProps, &sifraGenericLogHandle), ORR_OK);
-
-      std::strcpy(filter_.name, "port-7");
-      filter_.magic = SIFRAGENERIC_FILTER_MAGIC;
-      ctx_.filter = &filter_;
-      ctx_.config.featuresEnabled = SwSecFeatureIpDiscovery;
-      ctx_.config.trusted = 1;
-      ctx_.config.portDbSize = 32;
-      SifraGenericListInit(&ctx_.portDbList);
-      SifraGenericListInit(&ctx_.dhcpReqList);
-      ctx_.portset = host().portsets().addPortset("vswitch0");
-      host().portsets().addPort("vswitch0", kPortId);
-      ctx_.portId = kPortId;
+      makePort("discovery");
    }
 
    void TearDown() override
@@ -92,44 +70,8 @@ protected:
       if (ctx_.sparePortDbHash != nullptr) {
          Hash_Free(ctx_.sparePortDbHash);
       }
-      if (sifraGenericLogHandle != nullptr) {
-         orr_LogUnregister(sifraGenericLogHandle);
-         sifraGenericLogHandle = nullptr;
-      }
-      if (sifraGenericHeapID != nullptr) {
-         orr_HeapDestroy(sifraGenericHeapID);   // a block left behind is reported as a leak
-         sifraGenericHeapID = nullptr;
-      }
+      releasePort();
       HostTest::TearDown();
-   }
-
-   static SwSecVmi *vmiAt(orr_ListLinks *links)
-   {
-      return reinterpret_cast<SwSecVmi *>(reinterpret_cast<uint8_t *>(links) -
-                                          offsetof(SwSecVmi, listLinks));
-   }
-   static SwSecDhcpReq *reqAt(orr_ListLinks *links)
-   {
-      return reinterpret_cast<SwSecDhcpReq *>(reinterpret_cast<uint8_t *>(links) -
-                                              offsetof(SwSecDhcpReq, links));
-   }
-
-   // Every VMI, oldest first.
-   std::vector<SwSecVmi *> vmis()
-   {
-      std::vector<SwSecVmi *> out;
-      for (orr_ListLinks *l = ctx_.portDbList.next; l != &ctx_.portDbList; l = l->next) {
-         out.push_back(vmiAt(l));
-      }
-      return out;
-   }
-   std::vector<SwSecDhcpReq *> requests()
-   {
-      std::vector<SwSecDhcpReq *> out;
-      for (orr_ListLinks *l = ctx_.dhcpReqList.next; l != &ctx_.dhcpReqList; l = l->next) {
-         out.push_back(reqAt(l));
-      }
-      return out;
    }
 
    // Wraps `bytes` as one host frame with its parse record filled as the
@@ -175,18 +117,6 @@ protected:
       }
       return frame;
    }
-
-   void advanceSeconds(int64_t seconds) { host().clock().advance(std::chrono::seconds(seconds)); }
-
-   int64_t uptime()
-   {
-      orr_TimeVal now{};
-      orr_GetUptime(&now);
-      return now.sec;
-   }
-
-   SifraGenericFilter filter_{};
-   SwSecContext ctx_{};
 
 };
 

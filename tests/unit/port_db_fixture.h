@@ -5,6 +5,7 @@
 #pragma once
 
 #include "support/host_fixture.h"
+#include "unit/hand_made_port.h"
 
 #include "framework/sifra_generic.h"
 #include "framework/sifra_generic_agent.h"
@@ -61,40 +62,18 @@ struct Notice {
    bool operator==(const Notice &) const = default;
 };
 
-class PortDbTest : public HostTest {
+class PortDbTest : public HandMadePortTest {
 protected:
-   static constexpr uint32_t kPortId = 7;
-
    void SetUp() override
    {
       HostTest::SetUp();
-      orr_HeapProps props{};
-      orr_NameInitialize(&props.name, "portdb");
-      props.initialSize = 4096;
-      props.maximumSize = 1u << 20;
-      ASSERT_EQ(orr_HeapCreate(&props, &sifraGenericHeapID), ORR_OK);
-      orr_LogProps logProps{};
-      logProps.name = props.name;
-      logProps.heap = sifraGenericHeapID;
-      ASSERT_EQ(orr_LogRegister(&logProps, &sifraGenericLogHandle), ORR_OK);
-      ASSERT_EQ(orr_LockDomainCreate(orr_ModuleCurrentID, sifraGenericHeapID, &props.name,
+      makePort("portdb");
+      ASSERT_EQ(orr_LockDomainCreate(orr_ModuleCurrentID, sifraGenericHeapID, &moduleName(),
                                      &sifraGenericLockDomain),
                 ORR_OK);
       ASSERT_EQ(SwSecInitPortFilterMap(), ORR_OK);
-
       std::strcpy(agent_.name, SIFRAGENERIC_BUILTIN_AGENT_NAME);
-      std::strcpy(filter_.name, "port-7");
-      filter_.magic = SIFRAGENERIC_FILTER_MAGIC;
       filter_.agent = &agent_;
-      ctx_.filter = &filter_;
-      ctx_.config.featuresEnabled = SwSecFeatureIpDiscovery;
-      ctx_.config.trusted = 1;
-      ctx_.config.portDbSize = 32;
-      SifraGenericListInit(&ctx_.portDbList);
-      SifraGenericListInit(&ctx_.dhcpReqList);
-      ctx_.portset = host().portsets().addPortset("vswitch0");
-      host().portsets().addPort("vswitch0", kPortId);
-      ctx_.portId = kPortId;
       ASSERT_EQ(SifraGenericCreateSpinlock("sifg.sec.config", ORR_SPINLOCK_RW,
                                            SifraGenericLockRank::PortConfig, &ctx_.configLock),
                 ORR_OK);
@@ -120,22 +99,8 @@ protected:
       SwSecCleanupPortFilterMap();
       orr_LockDomainDestroy(sifraGenericLockDomain);
       sifraGenericLockDomain = ORR_INVALID_LOCK_DOMAIN;
-      orr_LogUnregister(sifraGenericLogHandle);
-      sifraGenericLogHandle = nullptr;
-      orr_HeapDestroy(sifraGenericHeapID);   // a block left behind is reported as a leak
-      sifraGenericHeapID = nullptr;
+      releasePort();
       HostTest::TearDown();
-   }
-
-   static SwSecVmi *vmiAt(orr_ListLinks *links)
-   {
-      return reinterpret_cast<SwSecVmi *>(reinterpret_cast<uint8_t *>(links) -
-                                          offsetof(SwSecVmi, listLinks));
-   }
-   static SwSecDhcpReq *reqAt(orr_ListLinks *links)
-   {
-      return reinterpret_cast<SwSecDhcpReq *>(reinterpret_cast<uint8_t *>(links) -
-                                              offsetof(SwSecDhcpReq, links));
    }
 
    // A filled heap record, as a learner makes it.
@@ -284,16 +249,7 @@ protected:
       return status;
    }
 
-   int64_t uptime()
-   {
-      orr_TimeVal now{};
-      orr_GetUptime(&now);
-      return now.sec;
-   }
-
    SifraGenericFastPathAgent agent_{};
-   SifraGenericFilter filter_{};
-   SwSecContext ctx_{};
    uint64_t baseBlocks_ = 0;
 };
 

@@ -1,6 +1,7 @@
 // The subcommands of the swsec tool.
 #pragma once
 
+#include <cstdint>
 #include <map>
 #include <string>
 #include <vector>
@@ -25,5 +26,21 @@ struct InfoOptions {
 
 void addInfoOptions(CLI::App &command, InfoOptions &options);
 int runInfo(const InfoOptions &options);
+
+struct ReplayCommandOptions {
+   std::string capture;
+   std::string vmMac;
+   std::string config;
+   double untilSeconds = 0;
+   uint32_t batch = 32;
+   bool json = false;
+   bool verbose = false;
+   std::string writePassed;
+   std::string writeDropped;
+   std::string modulePath;
+};
+
+void addReplayOptions(CLI::App &command, ReplayCommandOptions &options);
+int runReplay(const ReplayCommandOptions &options);
 
 }  // namespace swsec::tools

@@ -16,6 +16,11 @@ int main(int argc, char **argv)
       app.add_subcommand("info", "load the module, show what it registered, unload it");
    swsec::tools::addInfoOptions(*infoCommand, info);
 
+   swsec::tools::ReplayCommandOptions replay;
+   CLI::App *replayCommand =
+      app.add_subcommand("replay", "run every frame of a capture through one switch-security port");
+   swsec::tools::addReplayOptions(*replayCommand, replay);
+
    try {
       app.parse(argc, argv);
    } catch (const CLI::ParseError &e) {
@@ -25,6 +30,9 @@ int main(int argc, char **argv)
    try {
       if (infoCommand->parsed()) {
          return swsec::tools::runInfo(info);
+      }
+      if (replayCommand->parsed()) {
+         return swsec::tools::runReplay(replay);
       }
    } catch (const std::exception &e) {
       std::fprintf(stderr, "swsec: %s\n", e.what());

@@ -1,0 +1,212 @@
+// Every committed capture replayed under the two port settings of the
+// manifest (learning: a new port's defaults; enforcing: examples/enforcing.json),
+// checked against the expectations an independent model computed from the
+// frames: which frames are dropped, the events in order, the final
+// database and the drop counters.
+#include "replay_support.h"
+
+#include "replay_engine.h"
+
+#include <gtest/gtest.h>
+#include <nlohmann/json.hpp>
+
+#include <fstream>
+#include <iostream>
+#include <set>
+#include <tuple>
+
+namespace swsec::testing {
+namespace {
+
+using nlohmann::json;
+
+const json &manifest()
+{
+   static const json doc = [] {
+      std::ifstream in(sourceDir() / "tests/data/manifest.json");
+      return json::parse(in);
+   }();
+   return doc;
+}
+
+struct Case {
+   std::string capture;
+   std::string setting;
+};
+
+std::vector<Case> allCases()
+{
+   std::vector<Case> cases;
+   for (const auto &entry : manifest()) {
+      for (const auto &config : entry["expected"]["configs"]) {
+         cases.push_back({entry["file"], config["name"]});
+      }
+   }
+   return cases;
+}
+
+const json &entryFor(const std::string &capture)
+{
+   for (const auto &entry : manifest()) {
+      if (entry["file"] == capture) {
+         return entry;
+      }
+   }
+   throw std::out_of_range(capture);
+}
+
+const json &settingFor(const json &entry, const std::string &setting)
+{
+   for (const auto &config : entry["expected"]["configs"]) {
+      if (config["name"] == setting) {
+         return config;
+      }
+   }
+   throw std::out_of_range(setting);
+}
+
+bool authoritativeMethod(const std::string &method)
+{
+   return method == "DHCP Snooping" || method == "Static";
+}
+
+using Event = std::tuple<uint64_t, std::string, uint16_t, std::string, std::string, bool>;
+using Binding = std::tuple<uint16_t, std::string, std::string, std::string, std::string>;
+
+class ManifestReplay : public ::testing::TestWithParam<Case> {
+protected:
+   // The capture as pcapng with the manifest's direction of every frame, so
+   // that a frame the VM sends with a foreign source MAC is still from it.
+   replay::ReplayResult replayCase(uint32_t batch)
+   {
+      const Case &c = GetParam();
+      const json &entry = entryFor(c.capture);
+      auto frames = readCapture(sourceDir() / "tests/data" / c.capture);
+      EXPECT_EQ(frames.size(), entry["frames"].size());
+      for (size_t i = 0; i < frames.size() && i < entry["frames"].size(); ++i) {
+         frames[i].direction = entry["frames"][i]["fromVm"].get<bool>() ? replay::kDirFromVm : replay::kDirToVm;
+      }
+      const auto capture = dir_.path() / "directed.pcapng";
+      writePcapng(capture, frames);
+
+      replay::ReplayOptions options;
+      options.capturePath = capture.string();
+      options.batch = batch;
+      if (c.setting == "enforcing") {
+         options.config = replay::loadConfigFile((sourceDir() / "examples/enforcing.json").string());
+      }
+      return replay::runReplay(options);
+   }
+
+   TempDir dir_;
+};
+
+TEST(ManifestSettings, the_shipped_configurations_are_the_manifests_settings)
+{
+   const json &entry = manifest().at(0);
+   for (const char *name : {"learning", "enforcing"}) {
+      const json &expected = settingFor(entry, name);
+      const auto config = replay::loadConfigFile((sourceDir() / "examples" / (std::string(name) + ".json")).string());
+      EXPECT_EQ(config.features, expected["featuresEnabled"].get<uint32_t>()) << name;
+      EXPECT_EQ(config.trusted, expected["trusted"].get<int>() != 0) << name;
+      EXPECT_EQ(config.portDbSize, expected["portDbSize"].get<uint32_t>()) << name;
+      EXPECT_EQ(config.arpRateLimit, expected["arpRateLimit"].get<uint32_t>()) << name;
+      EXPECT_EQ(config.errRateLimit, expected["errRateLimit"].get<uint32_t>()) << name;
+      EXPECT_EQ(config.errRateLimitPeriod, expected["errRateLimitPeriod"].get<uint32_t>()) << name;
+   }
+   // Learning is what a new port starts with, so replays without --config match it too.
+   EXPECT_EQ(replay::configRecord(replay::PortSecurityConfig{}),
+             replay::configRecord(replay::loadConfigFile((sourceDir() / "examples/learning.json").string())));
+}
+
+TEST_P(ManifestReplay, verdicts_events_database_and_counters_match_the_manifest)
+{
+   const Case &c = GetParam();
+   const json &expected = settingFor(entryFor(c.capture), c.setting);
+   const replay::ReplayResult result = replayCase(1);
+   EXPECT_TRUE(result.violations.empty()) << ::testing::PrintToString(result.violations);
+
+   std::vector<uint64_t> dropped;
+   for (const auto &frame : result.frames) {
+      if (!frame.passed) {
+         dropped.push_back(frame.index);
+      }
+   }
+   std::vector<uint64_t> expectedDropped;
+   for (const auto &d : expected["dropped"]) {
+      expectedDropped.push_back(d["index"]);
+   }
+   EXPECT_EQ(dropped, expectedDropped);
+
+   // With one frame a list, each event is seen right after the frame that made it.
+   std::vector<Event> events;
+   for (const auto &n : result.notifications) {
+      events.emplace_back(n.afterFrame, n.name, n.vlan, n.mac, n.ip, n.authoritative);
+   }
+   std::vector<Event> expectedEvents;
+   for (const auto &e : expected["events"]) {
+      expectedEvents.emplace_back(e["index"], e["event"], e["vlan"], e["mac"], e["ip"],
+                                  authoritativeMethod(e["method"]));
+   }
+   EXPECT_EQ(events, expectedEvents);
+
+   std::multiset<Binding> bindings;
+   for (const auto &b : result.portDb) {
+      bindings.emplace(b.vlan, b.mac, b.ip, b.method, b.method == "DHCP Snooping" ? b.leaseTime : "");
+   }
+   std::multiset<Binding> expectedBindings;
+   for (const auto &b : expected["bindings"]) {
+      const std::string method = b["method"];
+      expectedBindings.emplace(b["vlan"], b["mac"], b["ip"], method,
+                               method == "DHCP Snooping" ? std::to_string(b["leaseSeconds"].get<int>()) : "");
+   }
+   EXPECT_EQ(bindings, expectedBindings);
+
+   std::map<std::string, uint64_t, std::less<>> counters;
+   for (const auto &[name, value] : result.counters) {
+      if (value != 0) {
+         counters[name] = value;
+      }
+   }
+   std::map<std::string, uint64_t, std::less<>> expectedCounters;
+   for (const auto &[name, value] : expected["counters"].items()) {
+      expectedCounters[name] = value.get<uint64_t>();
+   }
+   EXPECT_EQ(counters, expectedCounters);
+}
+
+// No capture lasts long enough for a timer to matter, so handing frames
+// over in lists must not change what the port decides.
+TEST_P(ManifestReplay, lists_of_frames_decide_as_single_frames_do)
+{
+   const replay::ReplayResult single = replayCase(1);
+   const replay::ReplayResult batched = replayCase(32);
+   ASSERT_EQ(single.frames.size(), batched.frames.size());
+   for (size_t i = 0; i < single.frames.size(); ++i) {
+      EXPECT_EQ(single.frames[i].passed, batched.frames[i].passed) << "frame " << single.frames[i].index;
+   }
+   ASSERT_EQ(single.notifications.size(), batched.notifications.size());
+   for (size_t i = 0; i < single.notifications.size(); ++i) {
+      EXPECT_EQ(single.notifications[i].name, batched.notifications[i].name);
+      EXPECT_EQ(single.notifications[i].ip, batched.notifications[i].ip);
+      // A list's events are seen after its last frame, never before the frame that made them.
+      EXPECT_GE(batched.notifications[i].afterFrame, single.notifications[i].afterFrame);
+   }
+   EXPECT_EQ(single.counters, batched.counters);
+}
+
+std::string caseName(const ::testing::TestParamInfo<Case> &info)
+{
+   std::string name = info.param.capture.substr(0, info.param.capture.find('.')) + "_" + info.param.setting;
+   for (char &ch : name) {
+      if (!std::isalnum(static_cast<unsigned char>(ch))) {
+         ch = '_';
+      }
+   }
+   return name;
+}
+
+INSTANTIATE_TEST_SUITE_P(Captures, ManifestReplay, ::testing::ValuesIn(allCases()), caseName);
+
+}  // namespace
+}  // namespace swsec::testing

@@ -1,0 +1,50 @@
+// Shared by the replay tests: where the data and the tool are, temporary
+// directories, and captures written with per-packet directions.
+#pragma once
+
+#include "replay_capture.h"
+
+#include <cstdint>
+#include <filesystem>
+#include <string>
+#include <vector>
+
+namespace swsec::testing {
+
+std::filesystem::path sourceDir();
+std::filesystem::path toolPath();
+
+// A fresh directory removed at the end of the test.
+class TempDir {
+public:
+   TempDir();
+   ~TempDir();
+   TempDir(const TempDir &) = delete;
+   TempDir &operator=(const TempDir &) = delete;
+   const std::filesystem::path &path() const { return path_; }
+   // Names of the files in it, sorted.
+   std::vector<std::string> files() const;
+
+private:
+   std::filesystem::path path_;
+};
+
+struct CapturedFrame {
+   int64_t timeNs = 0;
+   std::vector<uint8_t> bytes;
+   uint8_t direction = replay::kDirUnknown;   // written as the EPB flags
+};
+
+std::vector<CapturedFrame> readCapture(const std::filesystem::path &path);
+void writePcapng(const std::filesystem::path &path, const std::vector<CapturedFrame> &frames);
+void writeFile(const std::filesystem::path &path, const std::string &bytes);
+
+struct ToolRun {
+   int status = 0;
+   std::string out;
+   std::string err;
+};
+// Runs the swsec binary with `args` (each quoted for the shell).
+ToolRun runTool(const std::vector<std::string> &args);
+
+}  // namespace swsec::testing

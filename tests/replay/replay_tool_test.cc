@@ -1,0 +1,299 @@
+// The replay as a user meets it: directions, the clock running on, the
+// configuration file, output captures, and every kind of bad input (one
+// line on stderr naming the file, exit status 2, no output file left).
+#include "replay_support.h"
+
+#include "replay_config.h"
+#include "replay_describe.h"
+#include "replay_engine.h"
+#include "replay_error.h"
+
+#include <gtest/gtest.h>
+#include <nlohmann/json.hpp>
+
+#include <algorithm>
+#include <fstream>
+
+namespace swsec::testing {
+namespace {
+
+const std::string kVmMac = "02:00:5e:c0:00:01";
+
+std::string example()
+{
+   return (sourceDir() / "examples/example-dhcp-then-spoof.pcap").string();
+}
+
+std::string enforcing()
+{
+   return (sourceDir() / "examples/enforcing.json").string();
+}
+
+std::string sourceMac(const std::vector<uint8_t> &bytes)
+{
+   return replay::macText(bytes.data() + 6);
+}
+
+// ---------------------------------------------------------------- directions
+
+TEST(ReplayDirections, the_vm_mac_decides_unless_the_capture_records_a_direction)
+{
+   TempDir dir;
+   auto frames = readCapture(example());
+   replay::ReplayOptions options;
+   options.vmMac = replay::parseMac(kVmMac, "test");
+   options.capturePath = example();
+   auto byMac = replay::runReplay(options);
+   ASSERT_EQ(byMac.frames.size(), frames.size());
+   for (size_t i = 0; i < frames.size(); ++i) {
+      EXPECT_EQ(byMac.frames[i].direction, sourceMac(frames[i].bytes) == kVmMac ? replay::kDirFromVm : replay::kDirToVm);
+   }
+
+   // Every frame recorded as inbound: the flags win over the MAC.
+   for (auto &frame : frames) {
+      frame.direction = replay::kDirToVm;
+   }
+   writePcapng(dir.path() / "in.pcapng", frames);
+   options.capturePath = (dir.path() / "in.pcapng").string();
+   for (const auto &frame : replay::runReplay(options).frames) {
+      EXPECT_EQ(frame.direction, replay::kDirToVm) << frame.index;
+   }
+}
+
+TEST(ReplayDirections, a_capture_without_directions_needs_the_vm_mac)
+{
+   const ToolRun run = runTool({"replay", example()});
+   EXPECT_EQ(run.status, 2);
+   EXPECT_NE(run.err.find(example()), std::string::npos) << run.err;
+   EXPECT_NE(run.err.find("--vm-mac"), std::string::npos) << run.err;
+}
+
+// ---------------------------------------------------------------- the clock
+
+TEST(ReplayClock, running_on_past_the_lease_and_arp_lifetimes_ages_the_bindings_out)
+{
+   replay::ReplayOptions options;
+   options.capturePath = example();
+   options.vmMac = replay::parseMac(kVmMac, "test");
+   const auto atEnd = replay::runReplay(options);
+   ASSERT_EQ(atEnd.portDb.size(), 2u);   // the DHCP lease and the ARP-snooped 192.0.2.1
+
+   options.untilSeconds = 200;
+   const auto later = replay::runReplay(options);
+   EXPECT_TRUE(later.portDb.empty());
+   std::vector<std::string> removed;
+   for (const auto &n : later.notifications) {
+      if (n.name == "portdb.entry.removed") {
+         EXPECT_EQ(n.afterFrame, 18u);   // after the last frame, as the clock ran on
+         removed.push_back(n.ip);
+      }
+   }
+   std::sort(removed.begin(), removed.end());
+   EXPECT_EQ(removed, (std::vector<std::string>{"192.0.2.1", "192.0.2.101"}));
+}
+
+TEST(ReplayClock, the_lease_counts_down_on_capture_time)
+{
+   replay::ReplayOptions options;
+   options.capturePath = example();
+   options.vmMac = replay::parseMac(kVmMac, "test");
+   options.untilSeconds = 50;
+   const auto result = replay::runReplay(options);
+   ASSERT_FALSE(result.portDb.empty());
+   // Renewed at 9.04 s for 120 s; the clock stops at 10.54 + 50 s.
+   EXPECT_EQ(result.portDb.front().method, "DHCP Snooping");
+   EXPECT_EQ(result.portDb.front().timeRemaining, "68 sec");
+}
+
+// ---------------------------------------------------------------- configuration
+
+TEST(ReplayConfig, static_bindings_are_written_in_the_record_layout)
+{
+   const auto config = replay::parseConfig(
+      R"({"features":["dai","ip-discovery"],"trusted":false,"static":[{"vlan":258,"mac":"02:00:5e:c0:00:01","ip":"192.0.2.7"}]})",
+      "inline");
+   const auto bytes = replay::configRecord(config);
+   ASSERT_EQ(bytes.size(), 26u + 12u);
+   EXPECT_EQ(bytes[0], 1);                                  // version
+   EXPECT_EQ(bytes[1], 0x0c);                               // DAI | IP discovery
+   EXPECT_EQ(bytes[5], 0);                                  // untrusted
+   EXPECT_EQ(bytes[10], 1);                                 // one static entry
+   EXPECT_EQ((std::vector<uint8_t>(bytes.begin() + 26, bytes.end())),
+             (std::vector<uint8_t>{0x02, 0x01, 0x02, 0x00, 0x5e, 0xc0, 0x00, 0x01, 192, 0, 2, 7}));
+}
+
+TEST(ReplayConfig, a_static_binding_lets_its_owner_pass_inspection_without_dhcp)
+{
+   TempDir dir;
+   const auto path = dir.path() / "static.json";
+   writeFile(path, R"({"features":["ip-discovery","dai","ip-source-guard"],"trusted":false,)"
+                   R"("static":[{"vlan":0,"mac":"02:00:5e:c0:00:01","ip":"192.0.2.101"}]})");
+   replay::ReplayOptions options;
+   options.capturePath = example();
+   options.vmMac = replay::parseMac(kVmMac, "test");
+   options.config = replay::loadConfigFile(path.string());
+   const auto result = replay::runReplay(options);
+   // Frame 10, the VM's ARP reply from 192.0.2.101, passes on the static binding.
+   EXPECT_TRUE(result.frames.at(9).passed);
+   ASSERT_FALSE(result.portDb.empty());
+   EXPECT_EQ(result.portDb.front().method, "Static");
+}
+
+struct BadConfig {
+   const char *name;
+   const char *text;
+   const char *message;
+};
+
+class ReplayBadConfig : public ::testing::TestWithParam<BadConfig> {};
+
+TEST_P(ReplayBadConfig, is_refused_with_the_file_and_the_problem)
+{
+   TempDir dir;
+   const auto path = dir.path() / "port.json";
+   writeFile(path, GetParam().text);
+   const ToolRun run = runTool({"replay", "--vm-mac", kVmMac, "--config", path.string(), "--write-passed",
+                                (dir.path() / "passed.pcap").string(), example()});
+   EXPECT_EQ(run.status, 2);
+   EXPECT_EQ(run.out, "");
+   EXPECT_NE(run.err.find(path.string()), std::string::npos) << run.err;
+   EXPECT_NE(run.err.find(GetParam().message), std::string::npos) << run.err;
+   EXPECT_EQ(std::count(run.err.begin(), run.err.end(), '\n'), 1) << run.err;
+   EXPECT_EQ(dir.files(), (std::vector<std::string>{"port.json"}));
+}
+
+INSTANTIATE_TEST_SUITE_P(
+   Documents, ReplayBadConfig,
+   ::testing::Values(
+      BadConfig{"bad_json", R"({"features": [)", "bad JSON"},
+      BadConfig{"unknown_feature", R"({"features": ["dai", "firewall"]})", "unknown feature \"firewall\""},
+      BadConfig{"unknown_key", R"({"trustd": true})", "unknown key \"trustd\""},
+      BadConfig{"malformed_static_mac", R"({"static": [{"vlan": 0, "mac": "02:00:5e:c0:00", "ip": "10.0.0.1"}]})",
+                "malformed MAC address"},
+      BadConfig{"malformed_static_ip", R"({"static": [{"vlan": 0, "mac": "02:00:5e:c0:00:01", "ip": "10.0.0"}]})",
+                "malformed IPv4 address"},
+      BadConfig{"vlan_out_of_range", R"({"static": [{"vlan": 4096, "mac": "02:00:5e:c0:00:01", "ip": "10.0.0.1"}]})",
+                "0 to 4095"},
+      BadConfig{"negative_limit", R"({"arpRateLimit": -1})", "unsigned 32-bit"},
+      // The module's own rule: inspection on a trusted port is refused, in its words.
+      BadConfig{"refused_by_the_module", R"({"features": ["dai", "ip-discovery"], "trusted": true})",
+                "Invalid config: featuresEnabled = 0xc trusted = 1"}),
+   [](const auto &param) { return std::string(param.param.name); });
+
+// ---------------------------------------------------------------- captures and outputs
+
+struct BadCapture {
+   const char *name;
+   std::string bytes;    // the capture file's contents
+   const char *message;
+};
+
+std::string pcapHeader()
+{
+   std::string h;
+   const uint32_t words[] = {0xa1b2c3d4, 0x00040002, 0, 0, 65535, 1};
+   h.append(reinterpret_cast<const char *>(words), 8);
+   h.append(reinterpret_cast<const char *>(&words[2]), 16);
+   return h;
+}
+
+std::string pcapRecord(uint32_t caplen, uint32_t len, size_t present)
+{
+   std::string r;
+   const uint32_t words[] = {1, 0, caplen, len};
+   r.append(reinterpret_cast<const char *>(words), sizeof words);
+   r.append(present, '\x02');
+   return r;
+}
+
+class ReplayBadCapture : public ::testing::TestWithParam<BadCapture> {};
+
+TEST_P(ReplayBadCapture, is_refused_and_leaves_no_output)
+{
+   TempDir dir;
+   const auto capture = dir.path() / "in.pcap";
+   writeFile(capture, GetParam().bytes);
+   const ToolRun run = runTool({"replay", "--vm-mac", kVmMac, "--write-passed", (dir.path() / "p.pcap").string(),
+                                "--write-dropped", (dir.path() / "d.pcap").string(), capture.string()});
+   EXPECT_EQ(run.status, 2);
+   EXPECT_NE(run.err.find(capture.string()), std::string::npos) << run.err;
+   EXPECT_NE(run.err.find(GetParam().message), std::string::npos) << run.err;
+   EXPECT_EQ(std::count(run.err.begin(), run.err.end(), '\n'), 1) << run.err;
+   EXPECT_EQ(dir.files(), (std::vector<std::string>{"in.pcap"}));
+}
+
+INSTANTIATE_TEST_SUITE_P(
+   Files, ReplayBadCapture,
+   ::testing::Values(BadCapture{"not_a_capture", "hello, this is text\n", "cannot read capture"},
+                     BadCapture{"empty_file", "", "cannot read capture"},
+                     BadCapture{"cut_inside_a_record", pcapHeader() + pcapRecord(60, 60, 60) + pcapRecord(60, 60, 20),
+                                "corrupt capture after frame 1"},
+                     BadCapture{"frame_captured_short", pcapHeader() + pcapRecord(60, 60, 60) + pcapRecord(40, 60, 40),
+                                "frame 2 is truncated (40 of 60 bytes captured)"}),
+   [](const auto &param) { return std::string(param.param.name); });
+
+TEST(ReplayBadInput, a_missing_capture_a_bad_mac_and_an_unwritable_output_are_named)
+{
+   TempDir dir;
+   const std::string missing = (dir.path() / "nope.pcap").string();
+   ToolRun run = runTool({"replay", "--vm-mac", kVmMac, missing});
+   EXPECT_EQ(run.status, 2);
+   EXPECT_NE(run.err.find(missing + ": cannot read capture"), std::string::npos) << run.err;
+
+   run = runTool({"replay", "--vm-mac", "02:00:5e:c0:00:zz", example()});
+   EXPECT_EQ(run.status, 2);
+   EXPECT_NE(run.err.find("--vm-mac: malformed MAC address \"02:00:5e:c0:00:zz\""), std::string::npos) << run.err;
+
+   const std::string unwritable = (dir.path() / "no-such-dir" / "out.pcap").string();
+   run = runTool({"replay", "--vm-mac", kVmMac, "--write-dropped", unwritable, example()});
+   EXPECT_EQ(run.status, 2);
+   EXPECT_NE(run.err.find(unwritable + ": cannot write"), std::string::npos) << run.err;
+   EXPECT_TRUE(dir.files().empty());
+}
+
+TEST(ReplayOutputs, passed_and_dropped_frames_are_written_as_they_were_captured)
+{
+   TempDir dir;
+   const auto passed = dir.path() / "passed.pcap";
+   const auto dropped = dir.path() / "dropped.pcap";
+   const ToolRun run = runTool({"replay", "--json", "--vm-mac", kVmMac, "--config", enforcing(), "--write-passed",
+                                passed.string(), "--write-dropped", dropped.string(), example()});
+   ASSERT_EQ(run.status, 0) << run.err;
+   EXPECT_EQ(dir.files(), (std::vector<std::string>{"dropped.pcap", "passed.pcap"}));
+   const auto input = readCapture(example());
+   const auto doc = nlohmann::json::parse(run.out);
+   std::vector<std::vector<uint8_t>> wantPassed;
+   std::vector<std::vector<uint8_t>> wantDropped;
+   for (const auto &frame : doc["frames"]) {
+      const size_t i = frame["index"].get<size_t>() - 1;
+      (frame["verdict"] == "passed" ? wantPassed : wantDropped).push_back(input.at(i).bytes);
+   }
+   auto bytesOf = [](const std::vector<CapturedFrame> &frames) {
+      std::vector<std::vector<uint8_t>> out;
+      for (const auto &f : frames) {
+         out.push_back(f.bytes);
+      }
+      return out;
+   };
+   EXPECT_EQ(wantDropped.size(), 4u);
+   EXPECT_EQ(bytesOf(readCapture(passed)), wantPassed);
+   EXPECT_EQ(bytesOf(readCapture(dropped)), wantDropped);
+   EXPECT_EQ(readCapture(dropped).front().timeNs / 1000, input.at(13).timeNs / 1000);
+}
+
+TEST(ReplayReport, the_readable_report_shows_the_binding_the_spoofs_and_the_log)
+{
+   const ToolRun run = runTool({"replay", "-v", "--vm-mac", kVmMac, "--config", enforcing(), example()});
+   ASSERT_EQ(run.status, 0) << run.err;
+   for (const char *line : {"  from-vm          8        4\n",
+                            "dropped #16  10.344753  from-vm  02:00:5e:c0:00:01 > ff:ff:ff:ff:ff:ff ARP reply 192.0.2.1 is at 02:00:5e:c0:00:01\n",
+                            "  0     02:00:5e:c0:00:01  192.0.2.101      DHCP Snooping",
+                            "after #4     portdb.entry.added    VLAN 0    02:00:5e:c0:00:01  192.0.2.101      authoritative\n",
+                            "   DAI drop count           : 2\n",
+                            "featuresEnabled = 0x1f: Configured successfully\n"}) {
+      EXPECT_NE(run.out.find(line), std::string::npos) << line << "\n---\n" << run.out;
+   }
+}
+
+}  // namespace
+}  // namespace swsec::testing

@@ -1,0 +1,41 @@
+// A port's security configuration written as JSON, turned into the record
+// the security property takes.
+#pragma once
+
+#include <array>
+#include <cstdint>
+#include <string>
+#include <string_view>
+#include <vector>
+
+namespace swsec::replay {
+
+struct StaticBinding {
+   uint16_t vlan = 0;
+   std::array<uint8_t, 6> mac{};
+   std::array<uint8_t, 4> ip{};   // network order
+};
+
+// Defaults are those of a new port: IP discovery alone, trusted, 32 entries.
+struct PortSecurityConfig {
+   uint32_t features = 0x04;
+   bool trusted = true;
+   uint32_t portDbSize = 32;
+   uint32_t arpRateLimit = 0;
+   uint32_t errRateLimit = 0;
+   uint32_t errRateLimitPeriod = 0;
+   std::vector<StaticBinding> statics;
+};
+
+// Parses a document; `origin` names it in errors. Throws ReplayError on bad
+// JSON, unknown keys or feature names, wrong types and malformed addresses.
+PortSecurityConfig parseConfig(std::string_view text, const std::string &origin);
+PortSecurityConfig loadConfigFile(const std::string &path);
+
+// The packed record: header then one 12-byte entry per static binding.
+std::vector<uint8_t> configRecord(const PortSecurityConfig &config);
+
+// "02:00:5e:c0:00:01" (six two-digit hex groups); throws ReplayError naming `what`.
+std::array<uint8_t, 6> parseMac(std::string_view text, const std::string &what);
+
+}  // namespace swsec::replay

@@ -1,0 +1,20 @@
+// One line saying what a frame is (ARP, DHCP message type, IPv4 addresses,
+// BPDU, ...), read within the bytes given.
+#pragma once
+
+#include <cstdint>
+#include <span>
+#include <string>
+
+namespace swsec::replay {
+
+std::string describeFrame(std::span<const uint8_t> bytes);
+
+// "02:00:5e:c0:00:01" and "192.0.2.1" from raw bytes.
+std::string macText(const uint8_t *mac);
+std::string ipText(const uint8_t *ip);
+
+// The 802.1Q VLAN ID of a tagged frame, 0 for an untagged one.
+uint16_t frameVlan(std::span<const uint8_t> bytes);
+
+}  // namespace swsec::replay

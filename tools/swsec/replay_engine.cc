@@ -1,0 +1,355 @@
+// The replay run: host, port, configuration, the frame lists on the
+// capture's clock, then the port's state read back through the management
+// nodes, as an administrator would.
+#include "replay_engine.h"
+
+#include "replay_capture.h"
+#include "replay_describe.h"
+#include "replay_error.h"
+#include "replay_pcap_writer.h"
+
+#include "host/host.h"
+
+#include <chrono>
+#include <cstring>
+
+namespace swsec::replay {
+
+namespace {
+
+using namespace std::chrono_literals;
+
+constexpr const char *kAgent = "sifra-generic-tarlin-swsec";
+constexpr const char *kSecurityProperty = "sifra-generic-tarlin-swsec.security";
+constexpr const char *kPortset = "vs0";
+constexpr uint32_t kPortId = 1;
+// The port is configured this long before the first frame, so that a first
+// frame is not seen in the same instant as the configuration.
+constexpr std::chrono::microseconds kConfigLead = 500ms;
+// A list is cut when the next frame is more than this after its first one,
+// so that timers fire between frames as capture time passes.
+constexpr int64_t kListSpanNs = 1'000'000;
+constexpr size_t kPortDbMsgPayload = 40;
+constexpr const char *kCounterFields[] = {"dhcpSnoopingDropCnt", "daiDropCnt",          "ipSrcGuardDropCnt",
+                                          "txRateLimitDropCnt",  "rxRateLimitDropCnt", "txRateLimitErrEntryCnt"};
+
+std::string withoutNewline(std::string text)
+{
+   while (!text.empty() && text.back() == '\n') {
+      text.pop_back();
+   }
+   return text;
+}
+
+// One direction list being gathered, with what the outputs need of its frames.
+struct PendingList {
+   uint8_t direction = kDirUnknown;
+   int64_t firstTimeNs = 0;
+   std::vector<host::FrameSpec> specs;
+   std::vector<size_t> verdictIndex;   // into ReplayResult::frames
+   std::vector<int64_t> timesNs;
+};
+
+class Run {
+public:
+   Run(const ReplayOptions &options, ReplayResult &result) : options_(options), result_(result)
+   {
+      if (!options.writePassed.empty()) {
+         passed_.emplace(options.writePassed);
+      }
+      if (!options.writeDropped.empty()) {
+         dropped_.emplace(options.writeDropped);
+      }
+      list_.specs.reserve(options.batch);
+      list_.verdictIndex.reserve(options.batch);
+      list_.timesNs.reserve(options.batch);
+   }
+
+   // A run cut short by bad input still takes the port down and unloads
+   // the module, as the hypervisor would, before the error is reported.
+   ~Run()
+   {
+      if (!host_.loaded()) {
+         return;
+      }
+      if (portMade_) {
+         (void)host_.sifra().destroyFilterAsHypervisor(filter_);
+      }
+      (void)host_.unload();
+   }
+   Run(const Run &) = delete;
+   Run &operator=(const Run &) = delete;
+
+   void execute();
+
+private:
+   void startPort();
+   uint8_t directionOf(const CaptureFrame &frame) const;
+   void add(const CaptureFrame &frame, uint8_t direction);
+   void flush();
+   void advanceTo(std::chrono::microseconds target);
+   void collectNotifications();
+   void readPortState();
+
+   const ReplayOptions &options_;
+   ReplayResult &result_;
+   host::Host host_;
+   host::FilterId filter_ = 0;
+   bool portMade_ = false;
+   std::optional<PcapWriter> passed_;
+   std::optional<PcapWriter> dropped_;
+   PendingList list_;
+   std::chrono::microseconds clockBase_{0};   // host time of the first frame
+   int64_t firstTimeNs_ = 0;
+   uint64_t lastHandedOver_ = 0;
+};
+
+void Run::startPort()
+{
+   host::LoadOptions load;
+   load.modulePath = options_.modulePath;
+   if (host_.load(load) != 0) {
+      throw std::runtime_error("the module failed to load");
+   }
+   host_.portsets().addPortset(kPortset);
+   host_.portsets().addPort(kPortset, kPortId);
+   host::FilterConfig filterConfig;
+   filterConfig.name = "vm.eth0";
+   filterConfig.vmUuid = "replay";
+   const orr_Status status = host_.sifra().createFilter(kAgent, kPortId, filterConfig, &filter_);
+   if (status != ORR_OK) {
+      throw std::runtime_error(std::string("the port could not be made: ") + orr_StatusToString(status));
+   }
+   portMade_ = true;
+   if (options_.config) {
+      const size_t logBefore = host_.log().records().size();
+      const orr_Status written =
+         host_.sifra().writeProperty(kSecurityProperty, filter_, configRecord(*options_.config));
+      if (written != ORR_OK) {
+         // The module says why in its log; its error lines are the message.
+         const auto records = host_.log().records();
+         std::string message;
+         for (size_t i = logBefore; i < records.size(); ++i) {
+            if (records[i].severity >= 2) {
+               message += (message.empty() ? "" : "; ") + withoutNewline(records[i].text);
+            }
+         }
+         if (message.empty()) {
+            message = orr_StatusToString(written);
+         }
+         throw ConfigRefused("configuration refused: " + message);
+      }
+   }
+   host_.clock().advance(kConfigLead);
+   clockBase_ = host_.clock().now();
+}
+
+uint8_t Run::directionOf(const CaptureFrame &frame) const
+{
+   if (frame.recordedDirection != kDirUnknown) {
+      return frame.recordedDirection;
+   }
+   if (options_.vmMac) {
+      if (frame.bytes.size() >= 12 && std::memcmp(frame.bytes.data() + 6, options_.vmMac->data(), 6) == 0) {
+         return kDirFromVm;
+      }
+      return kDirToVm;
+   }
+   throw ReplayError(options_.capturePath + ": frame " + std::to_string(frame.index) +
+                     " has no recorded direction; give the VM's MAC with --vm-mac");
+}
+
+void Run::add(const CaptureFrame &frame, uint8_t direction)
+{
+   if (!list_.specs.empty() &&
+       (direction != list_.direction || frame.timeNs - list_.firstTimeNs > kListSpanNs ||
+        list_.specs.size() >= options_.batch)) {
+      flush();
+   }
+   if (list_.specs.empty()) {
+      list_.direction = direction;
+      list_.firstTimeNs = frame.timeNs;
+   }
+   host::FrameSpec &spec = list_.specs.emplace_back();
+   spec.bytes.assign(frame.bytes.begin(), frame.bytes.end());
+   spec.untag = true;
+   FrameVerdict &verdict = result_.frames.emplace_back();
+   verdict.index = frame.index;
+   verdict.time = static_cast<double>(frame.timeNs - firstTimeNs_) / 1e9;
+   verdict.direction = direction;
+   verdict.vlan = frameVlan(frame.bytes);
+   list_.verdictIndex.push_back(result_.frames.size() - 1);
+   list_.timesNs.push_back(frame.timeNs);
+}
+
+void Run::advanceTo(std::chrono::microseconds target)
+{
+   const auto now = host_.clock().now();
+   if (target > now) {
+      host_.clock().advance(target - now);
+   }
+   collectNotifications();
+}
+
+void Run::flush()
+{
+   if (list_.specs.empty()) {
+      return;
+   }
+   // Capture time that goes backwards leaves the clock where it is.
+   advanceTo(clockBase_ + std::chrono::duration_cast<std::chrono::microseconds>(
+                             std::chrono::nanoseconds(list_.firstTimeNs - firstTimeNs_)));
+   const host::PacketsResult out = host_.sifra().processPackets(filter_, list_.direction, list_.specs);
+   std::vector<bool> kept(list_.specs.size(), false);
+   for (size_t index : out.kept) {
+      if (index < kept.size()) {
+         kept[index] = true;
+      }
+   }
+   for (size_t i = 0; i < list_.specs.size(); ++i) {
+      FrameVerdict &verdict = result_.frames[list_.verdictIndex[i]];
+      verdict.passed = kept[i];
+      ++result_.totals[verdict.direction][kept[i] ? 0 : 1];
+      if (!kept[i] && options_.describeDrops) {
+         verdict.description = describeFrame(list_.specs[i].bytes);
+      }
+      std::optional<PcapWriter> &writer = kept[i] ? passed_ : dropped_;
+      if (writer) {
+         writer->write(list_.timesNs[i], list_.specs[i].bytes);
+      }
+   }
+   lastHandedOver_ = result_.frames[list_.verdictIndex.back()].index;
+   collectNotifications();
+   list_.specs.clear();
+   list_.verdictIndex.clear();
+   list_.timesNs.clear();
+}
+
+void Run::collectNotifications()
+{
+   auto posted = host_.portsets().posted();
+   if (posted.empty()) {
+      return;
+   }
+   host_.portsets().clearPosted();
+   for (const auto &message : posted) {
+      if (message.name.rfind("portdb.entry.", 0) != 0 || message.payload.size() < kPortDbMsgPayload) {
+         continue;
+      }
+      const uint8_t *payload = message.payload.data();
+      Notification &note = result_.notifications.emplace_back();
+      note.afterFrame = lastHandedOver_;
+      note.name = message.name;
+      uint16_t vlan = 0;
+      std::memcpy(&vlan, payload + 8, sizeof vlan);
+      note.vlan = vlan;
+      note.mac = macText(payload + 10);
+      note.ip = ipText(payload + 20);
+      note.authoritative = payload[36] != 0;
+   }
+}
+
+void Run::readPortState()
+{
+   const std::string port = "/security/" + std::to_string(kPortId);
+   host::NexoRecord summary;
+   if (host_.nexo().get(port + "/featureSummary", &summary) == ORR_OK) {
+      result_.featureSummary = summary.values();
+      result_.featureSummaryText = summary.text();
+      for (const char *field : kCounterFields) {
+         const auto found = result_.featureSummary->find(field);
+         if (found != result_.featureSummary->end() && found->second != "N/A") {
+            result_.counters[field] = std::stoull(found->second);
+         }
+      }
+   }
+   std::vector<int64_t> instances;
+   if (host_.nexo().list(port + "/vmi", &instances) != ORR_OK) {
+      return;
+   }
+   for (int64_t instance : instances) {
+      host::NexoRecord vmi;
+      if (host_.nexo().get(port + "/vmi/" + std::to_string(instance), &vmi) != ORR_OK) {
+         continue;
+      }
+      const auto values = vmi.values();
+      auto field = [&values](const char *name) {
+         const auto found = values.find(name);
+         return found != values.end() ? found->second : std::string();
+      };
+      PortDbEntry &entry = result_.portDb.emplace_back();
+      entry.vlan = static_cast<uint16_t>(std::stoul(field("vlanId")));
+      entry.mac = field("macAddr");
+      entry.ip = field("ipAddr");
+      entry.method = field("discoveryMethod");
+      entry.timeRemaining = field("timeRemaining");
+      entry.chaddr = field("chaddr");
+      entry.clientIdLen = field("clientIdLen");
+      entry.serverIp = field("serverIp");
+      entry.leaseTime = field("leaseTime");
+   }
+}
+
+void Run::execute()
+{
+   host_.setViolationHandler([this](const std::string &v) { result_.violations.push_back(v); });
+   CaptureReader reader(options_.capturePath);
+   startPort();
+
+   CaptureFrame frame;
+   bool first = true;
+   while (reader.next(frame)) {
+      if (first) {
+         firstTimeNs_ = frame.timeNs;
+         first = false;
+      }
+      add(frame, directionOf(frame));
+      if (options_.progress && frame.index % 4096 == 0) {
+         options_.progress(frame.index, reader.bytesRead(), reader.fileSize());
+      }
+   }
+   flush();
+   if (options_.untilSeconds > 0) {
+      const auto lastTime = result_.frames.empty() ? 0.0 : result_.frames.back().time;
+      advanceTo(clockBase_ + std::chrono::duration_cast<std::chrono::microseconds>(
+                                std::chrono::duration<double>(lastTime + options_.untilSeconds)));
+   }
+   collectNotifications();
+   readPortState();
+   for (const auto &record : host_.log().records()) {
+      result_.log.push_back({record.severity, withoutNewline(record.text)});
+   }
+
+   const host::DestroyResult destroyed = host_.sifra().destroyFilterAsHypervisor(filter_);
+   portMade_ = false;
+   if (destroyed.status != ORR_OK) {
+      result_.violations.push_back(std::string("the port could not be destroyed: ") +
+                                   orr_StatusToString(destroyed.status));
+   }
+   const orr_Status unloaded = host_.unload();
+   if (unloaded != ORR_OK) {
+      result_.violations.push_back(std::string("the module did not unload: ") + orr_StatusToString(unloaded));
+   }
+   // Outputs are renamed into place only once the whole run succeeded.
+   if (passed_) {
+      passed_->commit();
+   }
+   if (dropped_) {
+      dropped_->commit();
+   }
+}
+
+}  // namespace
+
+ReplayResult runReplay(const ReplayOptions &options)
+{
+   if (options.batch == 0) {
+      throw ReplayError("--batch must be at least 1");
+   }
+   ReplayResult result;
+   Run run(options, result);
+   run.execute();
+   return result;
+}
+
+}  // namespace swsec::replay

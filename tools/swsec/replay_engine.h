@@ -1,0 +1,94 @@
+// The replay engine: loads the module into a host, makes one VM port of the
+// built-in agent, configures it, hands it every frame of a capture in
+// direction lists on the capture's clock and gathers what the port did.
+#pragma once
+
+#include "replay_config.h"
+
+#include <array>
+#include <cstdint>
+#include <functional>
+#include <map>
+#include <optional>
+#include <stdexcept>
+#include <string>
+#include <vector>
+
+namespace swsec::replay {
+
+struct ReplayOptions {
+   std::string capturePath;
+   std::optional<std::array<uint8_t, 6>> vmMac;   // frames from it go from the VM
+   std::optional<PortSecurityConfig> config;      // none: the new port's defaults
+   double untilSeconds = 0;                       // clock runs on after the last frame
+   uint32_t batch = 32;                           // most frames in one list
+   bool describeDrops = false;                    // one-line description per dropped frame
+   std::string writePassed;                       // pcap of passed frames ("" none)
+   std::string writeDropped;                      // pcap of dropped frames ("" none)
+   std::string modulePath;                        // "" the built module
+   // Called now and then with frames done and bytes read of the file's size.
+   std::function<void(uint64_t frames, uint64_t bytesRead, uint64_t fileSize)> progress;
+};
+
+struct FrameVerdict {
+   uint64_t index = 0;
+   double time = 0;          // seconds since the first frame
+   uint8_t direction = 0;    // kDirToVm or kDirFromVm
+   bool passed = true;
+   uint16_t vlan = 0;
+   std::string description;  // dropped frames, with describeDrops
+};
+
+struct PortDbEntry {
+   uint16_t vlan = 0;
+   std::string mac;
+   std::string ip;
+   std::string method;        // "DHCP Snooping", "Static", "ARP Snooping", ...
+   std::string timeRemaining; // as the node renders it: "118 sec", "N/A"
+   std::string chaddr;
+   std::string clientIdLen;
+   std::string serverIp;
+   std::string leaseTime;
+};
+
+struct Notification {
+   uint64_t afterFrame = 0;   // the last frame handed over before it was seen (0: none yet)
+   std::string name;          // "portdb.entry.added" / "portdb.entry.removed"
+   uint16_t vlan = 0;
+   std::string mac;
+   std::string ip;
+   bool authoritative = false;
+};
+
+struct LogLine {
+   uint32_t severity = 0;     // 1 information, 2 error
+   std::string text;          // without the final newline
+};
+
+struct ReplayResult {
+   std::vector<FrameVerdict> frames;
+   // [direction][0 passed, 1 dropped], direction indexed by kDirToVm/kDirFromVm.
+   std::array<std::array<uint64_t, 2>, 3> totals{};
+   // The "featureSummary" node's fields, when the port has IP discovery.
+   std::optional<std::map<std::string, std::string, std::less<>>> featureSummary;
+   std::string featureSummaryText;
+   std::map<std::string, uint64_t, std::less<>> counters;   // drop counters the port keeps
+   std::vector<PortDbEntry> portDb;
+   std::vector<Notification> notifications;
+   std::vector<LogLine> log;
+   std::vector<std::string> violations;   // host checks (leaks at unload, ...)
+};
+
+// The security configuration was refused by the module: `what()` is the
+// module's own message.
+class ConfigRefused : public std::runtime_error {
+public:
+   using std::runtime_error::runtime_error;
+};
+
+// Throws ReplayError on bad input (before any output file is left behind),
+// ConfigRefused when the port refuses the configuration, std::runtime_error
+// when the module does not load.
+ReplayResult runReplay(const ReplayOptions &options);
+
+}  // namespace swsec::replay

@@ -1,0 +1,15 @@
+// The one error a replay reports for bad input: a line naming the file and
+// the problem.
+#pragma once
+
+#include <stdexcept>
+#include <string>
+
+namespace swsec::replay {
+
+class ReplayError : public std::runtime_error {
+public:
+   using std::runtime_error::runtime_error;
+};
+
+}  // namespace swsec::replay

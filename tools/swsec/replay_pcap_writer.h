@@ -1,0 +1,36 @@
+// A pcap file written whole or not at all: frames go to a temporary file in
+// the target's directory, renamed over the target by commit(); a writer
+// destroyed without commit removes its temporary file.
+#pragma once
+
+#include <cstdint>
+#include <span>
+#include <string>
+
+struct pcap;
+struct pcap_dumper;
+
+namespace swsec::replay {
+
+class PcapWriter {
+public:
+   // Throws ReplayError naming `path` when the temporary file cannot be made.
+   explicit PcapWriter(const std::string &path);
+   ~PcapWriter();
+   PcapWriter(const PcapWriter &) = delete;
+   PcapWriter &operator=(const PcapWriter &) = delete;
+
+   void write(int64_t timeNs, std::span<const uint8_t> bytes);
+   // Flushes, closes and renames; throws ReplayError on a write failure.
+   void commit();
+
+private:
+   void discard();
+
+   std::string path_;
+   std::string tempPath_;
+   pcap *dead_ = nullptr;
+   pcap_dumper *dumper_ = nullptr;
+};
+
+}  // namespace swsec::replay

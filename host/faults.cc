@@ -59,11 +59,51 @@ constexpr std::array kFaultPoints = {
 
 }  // namespace
 
-FaultTable::FaultTable()
+namespace {
+std::atomic<uint64_t> nextGeneration{1};
+}  // namespace
+
+FaultTable::FaultTable() : generation_(nextGeneration.fetch_add(1))
 {
    for (auto op : kFaultPoints) {
-      points_.emplace(std::string(op), Point{});
+      index_.emplace(std::string(op), points_.size());
+      points_.push_back(std::make_unique<Point>());
    }
+}
+
+size_t FaultTable::indexOf(std::string_view op) const
+{
+   auto found = index_.find(op);
+   if (found == index_.end()) {
+      throw std::invalid_argument("no fault point named '" + std::string(op) + "'");
+   }
+   return found->second;
+}
+
+FaultTable::Point &FaultTable::pointFor(std::string_view op)
+{
+   // Host operations name themselves with string literals, whose addresses
+   // are stable: a small per-thread cache keyed by the address saves the
+   // name lookup on every call. The table it points into belongs to one
+   // Host, so the cache remembers which (by generation: a later Host may
+   // live at the same address).
+   struct Slot {
+      uint64_t generation = 0;
+      const char *name = nullptr;
+      Point *point = nullptr;
+   };
+   thread_local std::array<Slot, 64> cache{};
+   Slot &slot = cache[(reinterpret_cast<uintptr_t>(op.data()) >> 3) % cache.size()];
+   if (slot.generation == generation_ && slot.name == op.data()) {
+      return *slot.point;
+   }
+   auto found = index_.find(op);
+   if (found == index_.end()) {
+      // A host operation that forgot to list itself: a host bug, not the module's.
+      fatal("fault point '" + std::string(op) + "' is not listed");
+   }
+   slot = Slot{generation_, op.data(), points_[found->second].get()};
+   return *slot.point;
 }
 
 void FaultTable::addRule(std::string_view op, orr_Status status, uint64_t nth, bool once)
@@ -71,12 +111,10 @@ void FaultTable::addRule(std::string_view op, orr_Status status, uint64_t nth, b
    if (nth == 0) {
       throw std::invalid_argument("fault rule for " + std::string(op) + ": nth counts from 1");
    }
+   Point &point = *points_[indexOf(op)];
    std::lock_guard guard(mutex_);
-   auto point = points_.find(op);
-   if (point == points_.end()) {
-      throw std::invalid_argument("no fault point named '" + std::string(op) + "'");
-   }
-   point->second.rules.push_back(Rule{status, point->second.calls + nth, once});
+   point.rules.push_back(Rule{status, point.calls.load() + nth, once});
+   armedRules_.fetch_add(1);
 }
 
 void FaultTable::failOnce(std::string_view op, orr_Status status, uint64_t nth)
@@ -92,43 +130,40 @@ void FaultTable::failFrom(std::string_view op, orr_Status status, uint64_t nth)
 void FaultTable::clear()
 {
    std::lock_guard guard(mutex_);
-   for (auto &[name, point] : points_) {
-      point.rules.clear();
+   for (auto &point : points_) {
+      armedRules_.fetch_sub(point->rules.size());
+      point->rules.clear();
    }
 }
 
 uint64_t FaultTable::calls(std::string_view op) const
 {
-   std::lock_guard guard(mutex_);
-   auto point = points_.find(op);
-   if (point == points_.end()) {
-      throw std::invalid_argument("no fault point named '" + std::string(op) + "'");
-   }
-   return point->second.calls;
+   return points_[indexOf(op)]->calls.load();
 }
 
 std::optional<orr_Status> FaultTable::hit(std::string_view op)
 {
-   std::lock_guard guard(mutex_);
-   auto point = points_.find(op);
-   if (point == points_.end()) {
-      // A host operation that forgot to list itself: a host bug, not the module's.
-      fatal("fault point '" + std::string(op) + "' is not listed");
+   Point &p = pointFor(op);
+   const uint64_t call = p.calls.fetch_add(1) + 1;
+   if (armedRules_.load(std::memory_order_acquire) == 0) {
+      return std::nullopt;
    }
-   Point &p = point->second;
-   ++p.calls;
+   std::lock_guard guard(mutex_);
    // The first rule that applies decides; a spent one-shot rule is dropped.
    for (auto rule = p.rules.begin(); rule != p.rules.end(); ++rule) {
-      if (rule->once && rule->firstCall == p.calls) {
+      if (rule->once && rule->firstCall == call) {
          orr_Status status = rule->status;
          p.rules.erase(rule);
+         armedRules_.fetch_sub(1);
          return status;
       }
-      if (!rule->once && p.calls >= rule->firstCall) {
+      if (!rule->once && call >= rule->firstCall) {
          return rule->status;
       }
    }
-   std::erase_if(p.rules, [&](const Rule &r) { return r.once && r.firstCall < p.calls; });
+   const size_t before = p.rules.size();
+   std::erase_if(p.rules, [&](const Rule &r) { return r.once && r.firstCall < call; });
+   armedRules_.fetch_sub(before - p.rules.size());
    return std::nullopt;
 }
 

@@ -5,10 +5,12 @@
 #   asan     clang++ with AddressSanitizer and UndefinedBehaviorSanitizer
 #   tsan     clang++ with ThreadSanitizer
 #   release  g++ optimised, for the tools and benchmarks
+# Further arguments name the targets to build (default: all).
 set -euo pipefail
 cd "$(dirname "$0")/.."
 
 flavour=${1:-gcc}
+shift || true
 args=(-G Ninja -DSWSEC_WERROR=ON)
 case "$flavour" in
   gcc)     args+=(-DCMAKE_CXX_COMPILER=g++ -DCMAKE_C_COMPILER=gcc -DCMAKE_BUILD_TYPE=RelWithDebInfo) ;;
@@ -23,4 +25,4 @@ esac
 
 dir="build/$flavour"
 cmake -S . -B "$dir" "${args[@]}" >/dev/null
-ninja -C "$dir" -j "$(nproc)"
+ninja -C "$dir" -j "$(nproc)" "$@"

@@ -7,6 +7,6 @@ set -euo pipefail
 cd "$(dirname "$0")/.."
 
 bash scripts/setup.sh
-bash scripts/build.sh release >/dev/null
+bash scripts/build.sh release swsec >/dev/null
 exec build/release/tools/swsec replay --vm-mac 02:00:5e:c0:00:01 --config examples/enforcing.json -v \
    "$@" examples/example-dhcp-then-spoof.pcap

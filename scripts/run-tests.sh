@@ -25,3 +25,6 @@ ASAN_OPTIONS=detect_leaks=1:abort_on_error=1 UBSAN_OPTIONS=print_stacktrace=1 ru
 # Frames are judged by several threads at once; the host's locks are real.
 bash scripts/build.sh tsan
 TSAN_OPTIONS=halt_on_error=1 run_suite tsan
+
+# Fuzz targets, a bounded time each (libFuzzer with clang, ASan and UBSan).
+bash scripts/fuzz.sh 30

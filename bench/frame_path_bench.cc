@@ -1,0 +1,322 @@
+// The module's frame path beside a minimal hand-written loop and libpcap's
+// BPF doing the equivalent stateless source check, at 1, 2, 16 and 32
+// bindings, and the module with one and two threads on one port.
+//
+// Frame lists are built by the host before the timed loop. The common path
+// (UDP/IPv4 from bound sources) passes every frame, so one list is judged
+// again and again. The mix drops frames, which leave the list: its list is
+// rebuilt before each iteration with the timer paused.
+#include "bpf_source_check.h"
+#include "frame_mix.h"
+#include "minimal_loop.h"
+#include "module_port.h"
+
+#include "host/host.h"
+
+#include <benchmark/benchmark.h>
+
+#include <cstdio>
+#include <map>
+#include <memory>
+#include <string>
+#include <utility>
+#include <vector>
+
+namespace swsec::bench {
+namespace {
+
+constexpr uint32_t kSeed = 20261122;
+constexpr uint32_t kMixFrames = 4096;
+constexpr uint32_t kThreadListFrames = 256;
+constexpr uint32_t kThreadBindings = 16;
+constexpr uint32_t kBindingCounts[] = {1, 2, 16, 32};
+
+// Everything one binding count needs, made once before any timing.
+struct Setup {
+   uint32_t bindingCount = 0;
+   std::vector<Binding> bindings;
+   std::vector<MixFrame> mix;
+   std::vector<MixFrame> common;
+   std::vector<testing::Bytes> mixBytes;
+   std::vector<testing::Bytes> commonBytes;
+   std::unique_ptr<ModulePort> port;
+   std::unique_ptr<MinimalLoop> minimal;
+   std::unique_ptr<BpfSourceCheck> bpf;
+   std::unique_ptr<host::FrameList> moduleCommonList;
+   std::unique_ptr<host::FrameList> minimalCommonList;
+   std::unique_ptr<host::FrameList> minimalMixList;
+   // Per thread, lists of kThreadListFrames common frames.
+   std::vector<std::unique_ptr<host::FrameList>> threadLists;
+};
+
+std::vector<testing::Bytes> bytesOf(const std::vector<MixFrame> &frames)
+{
+   std::vector<testing::Bytes> out;
+   for (const auto &frame : frames) {
+      out.push_back(frame.bytes);
+   }
+   return out;
+}
+
+std::unique_ptr<Setup> makeSetup(host::Host &host, uint32_t bindingCount)
+{
+   auto setup = std::make_unique<Setup>();
+   setup->bindingCount = bindingCount;
+   setup->bindings = bindingsFor(bindingCount);
+   setup->mix = makeMix(kSeed, kMixFrames, setup->bindings);
+   setup->common = onlyKind(setup->mix, FrameKind::Ipv4Bound);
+   setup->mixBytes = bytesOf(setup->mix);
+   setup->commonBytes = bytesOf(setup->common);
+   setup->port = std::make_unique<ModulePort>(host, 100 + bindingCount, setup->bindings);
+   setup->minimal = std::make_unique<MinimalLoop>(setup->bindings);
+   setup->bpf = std::make_unique<BpfSourceCheck>(setup->bindings);
+   setup->moduleCommonList = setup->port->makeList(setup->common);
+   setup->minimalCommonList = setup->port->makeList(setup->common);
+   setup->minimalMixList = setup->port->makeList(setup->mix);
+   for (uint32_t thread = 0; thread < 2; ++thread) {
+      const auto first = setup->common.begin() + thread * kThreadListFrames;
+      const std::vector<MixFrame> slice(first, first + kThreadListFrames);
+      setup->threadLists.push_back(setup->port->makeList(slice));
+   }
+   return setup;
+}
+
+void moduleCommon(benchmark::State &state, Setup *setup)
+{
+   for (auto _ : state) {
+      benchmark::DoNotOptimize(setup->port->judge(*setup->moduleCommonList));
+   }
+   if (setup->moduleCommonList->kept().size() != setup->common.size()) {
+      state.SkipWithError("the module dropped a frame of the common path");
+   }
+   state.SetItemsProcessed(static_cast<int64_t>(state.iterations() * setup->common.size()));
+}
+
+void minimalCommon(benchmark::State &state, Setup *setup)
+{
+   for (auto _ : state) {
+      benchmark::DoNotOptimize(setup->minimal->run(setup->minimalCommonList->list()));
+   }
+   state.SetItemsProcessed(static_cast<int64_t>(state.iterations() * setup->common.size()));
+}
+
+void minimalHeadersCommon(benchmark::State &state, Setup *setup)
+{
+   for (auto _ : state) {
+      benchmark::DoNotOptimize(setup->minimal->runViaHeaders(setup->minimalCommonList->list()));
+   }
+   state.SetItemsProcessed(static_cast<int64_t>(state.iterations() * setup->common.size()));
+}
+
+void bpfCommon(benchmark::State &state, Setup *setup)
+{
+   for (auto _ : state) {
+      benchmark::DoNotOptimize(setup->bpf->run(setup->commonBytes));
+   }
+   state.SetItemsProcessed(static_cast<int64_t>(state.iterations() * setup->common.size()));
+}
+
+void moduleMix(benchmark::State &state, Setup *setup)
+{
+   std::unique_ptr<host::FrameList> list;
+   size_t kept = 0;
+   for (auto _ : state) {
+      state.PauseTiming();
+      list.reset();
+      list = setup->port->makeList(setup->mix);
+      state.ResumeTiming();
+      benchmark::DoNotOptimize(setup->port->judge(*list));
+   }
+   // Past the loop the timer has stopped.
+   kept = list ? list->kept().size() : 0;
+   list.reset();
+   state.counters["drops"] = static_cast<double>(setup->mix.size() - kept);
+   state.SetItemsProcessed(static_cast<int64_t>(state.iterations() * setup->mix.size()));
+}
+
+void minimalMix(benchmark::State &state, Setup *setup)
+{
+   uint32_t drops = 0;
+   for (auto _ : state) {
+      drops = setup->minimal->run(setup->minimalMixList->list());
+      benchmark::DoNotOptimize(drops);
+   }
+   state.counters["drops"] = drops;
+   state.SetItemsProcessed(static_cast<int64_t>(state.iterations() * setup->mix.size()));
+}
+
+void bpfMix(benchmark::State &state, Setup *setup)
+{
+   uint32_t drops = 0;
+   for (auto _ : state) {
+      drops = setup->bpf->run(setup->mixBytes);
+      benchmark::DoNotOptimize(drops);
+   }
+   state.counters["drops"] = drops;
+   state.SetItemsProcessed(static_cast<int64_t>(state.iterations() * setup->mix.size()));
+}
+
+// Each thread judges its own list of common frames on the same port.
+void moduleThreads(benchmark::State &state, Setup *setup)
+{
+   host::FrameList &list = *setup->threadLists.at(static_cast<size_t>(state.thread_index()));
+   for (auto _ : state) {
+      benchmark::DoNotOptimize(setup->port->judge(list));
+   }
+   state.SetItemsProcessed(static_cast<int64_t>(state.iterations() * kThreadListFrames));
+}
+
+// The same lists through the minimal loop making the module's header calls:
+// whether two threads scale when the module's own work is taken away.
+void minimalHeadersThreads(benchmark::State &state, Setup *setup)
+{
+   host::FrameList &list = *setup->threadLists.at(static_cast<size_t>(state.thread_index()));
+   for (auto _ : state) {
+      benchmark::DoNotOptimize(setup->minimal->runViaHeaders(list.list()));
+   }
+   state.SetItemsProcessed(static_cast<int64_t>(state.iterations() * kThreadListFrames));
+}
+
+// Keeps frames per second of every run by name and thread count, for the ratios.
+class RateCollector : public benchmark::ConsoleReporter {
+public:
+   void ReportRuns(const std::vector<Run> &runs) override
+   {
+      ConsoleReporter::ReportRuns(runs);
+      for (const auto &run : runs) {
+         if (run.error_occurred) {
+            continue;
+         }
+         const auto rate = run.counters.find("items_per_second");
+         if (rate != run.counters.end()) {
+            rates_[{run.run_name.function_name, run.threads}] = rate->second.value;
+         }
+      }
+   }
+
+   // Nanoseconds a frame, or 0 when the run is missing.
+   double nsPerFrame(const std::string &name, int threads = 1) const
+   {
+      const auto found = rates_.find({name, threads});
+      return found == rates_.end() || found->second <= 0 ? 0 : 1e9 / found->second;
+   }
+   double rate(const std::string &name, int threads = 1) const
+   {
+      const auto found = rates_.find({name, threads});
+      return found == rates_.end() ? 0 : found->second;
+   }
+
+private:
+   std::map<std::pair<std::string, int>, double> rates_;
+};
+
+const char *verdict(bool met)
+{
+   return met ? "met" : "MISSED";
+}
+
+void printSummary(const RateCollector &rates, const std::vector<std::unique_ptr<Setup>> &setups,
+                  uint64_t fullPortHeapBytes)
+{
+   std::printf("\n== frame path summary (ns a frame; ratios)\n");
+   std::printf("%-9s %8s %8s %12s %8s %15s %19s %11s %11s %8s\n", "bindings", "module", "minimal",
+               "minimal-hdr", "bpf", "module/minimal", "module/minimal-hdr", "bpf/module", "mix:module", "mix:bpf");
+   for (const auto &setup : setups) {
+      const std::string n = std::to_string(setup->bindingCount);
+      const double module = rates.nsPerFrame("module/common/" + n);
+      const double minimal = rates.nsPerFrame("minimal/common/" + n);
+      const double minimalHeaders = rates.nsPerFrame("minimal-hdr/common/" + n);
+      const double bpf = rates.nsPerFrame("bpf/common/" + n);
+      std::printf("%-9s %8.1f %8.1f %12.1f %8.1f %15.2f %19.2f %11.2f %11.1f %8.1f\n", n.c_str(), module,
+                  minimal, minimalHeaders, bpf, minimal > 0 ? module / minimal : 0,
+                  minimalHeaders > 0 ? module / minimalHeaders : 0, module > 0 ? bpf / module : 0,
+                  rates.nsPerFrame("module/mix/" + n), rates.nsPerFrame("bpf/mix/" + n));
+   }
+
+   double worstMinimalRatio = 0;
+   for (const auto &setup : setups) {
+      const std::string n = std::to_string(setup->bindingCount);
+      const double minimal = rates.nsPerFrame("minimal/common/" + n);
+      if (minimal > 0) {
+         worstMinimalRatio = std::max(worstMinimalRatio, rates.nsPerFrame("module/common/" + n) / minimal);
+      }
+   }
+   const double module16 = rates.nsPerFrame("module/common/16");
+   const double bpfOverModule16 = module16 > 0 ? rates.nsPerFrame("bpf/common/16") / module16 : 0;
+   const double module1 = rates.nsPerFrame("module/common/1");
+   const double scaling = module1 > 0 ? rates.nsPerFrame("module/common/32") / module1 : 0;
+   const double one = rates.rate("module/threads256", 1);
+   const double threadGain = one > 0 ? rates.rate("module/threads256", 2) / one : 0;
+
+   std::printf("\nIPv4 common path, module / minimal loop (worst over binding counts): %.2f (target <= 3.0: %s)\n",
+               worstMinimalRatio, verdict(worstMinimalRatio > 0 && worstMinimalRatio <= 3.0));
+   std::printf("BPF / module at 16 bindings: %.2f (target >= 2.0: %s)\n", bpfOverModule16,
+               verdict(bpfOverModule16 >= 2.0));
+   std::printf("module at 32 bindings / at 1: %.2f (target <= 1.3: %s)\n", scaling,
+               verdict(scaling > 0 && scaling <= 1.3));
+   std::printf("two threads / one thread, lists of %u frames: %.2f (target >= 1.7: %s)\n", kThreadListFrames,
+               threadGain, verdict(threadGain >= 1.7));
+   const double oneHeaders = rates.rate("minimal-hdr/threads256", 1);
+   std::printf("  (the minimal loop through the same header calls: two threads / one: %.2f)\n",
+               oneHeaders > 0 ? rates.rate("minimal-hdr/threads256", 2) / oneHeaders : 0);
+   std::printf("module heap of one port with a full database (32 entries): %llu bytes\n",
+               static_cast<unsigned long long>(fullPortHeapBytes));
+}
+
+}  // namespace
+}  // namespace swsec::bench
+
+int main(int argc, char **argv)
+{
+   using namespace swsec::bench;
+   benchmark::Initialize(&argc, argv);
+
+   swsec::host::Host host;
+   if (host.load() != 0) {
+      std::fprintf(stderr, "frame path bench: the module failed to load\n");
+      return 1;
+   }
+   // Lock-rank checks and the like stay on: they are part of the host, and
+   // the module's path crosses them as any caller's would.
+   uint64_t fullPortHeapBytes = 0;
+   std::vector<std::unique_ptr<Setup>> setups;
+   for (const uint32_t count : kBindingCounts) {
+      setups.push_back(makeSetup(host, count));
+      if (count == 32) {
+         fullPortHeapBytes = setups.back()->port->heapBytes();
+      }
+   }
+
+   for (const auto &setup : setups) {
+      Setup *s = setup.get();
+      const std::string n = std::to_string(s->bindingCount);
+      benchmark::RegisterBenchmark(("module/common/" + n).c_str(), moduleCommon, s);
+      benchmark::RegisterBenchmark(("minimal/common/" + n).c_str(), minimalCommon, s);
+      benchmark::RegisterBenchmark(("minimal-hdr/common/" + n).c_str(), minimalHeadersCommon, s);
+      benchmark::RegisterBenchmark(("bpf/common/" + n).c_str(), bpfCommon, s);
+      benchmark::RegisterBenchmark(("module/mix/" + n).c_str(), moduleMix, s);
+      benchmark::RegisterBenchmark(("minimal/mix/" + n).c_str(), minimalMix, s);
+      benchmark::RegisterBenchmark(("bpf/mix/" + n).c_str(), bpfMix, s);
+   }
+   for (const auto &setup : setups) {
+      if (setup->bindingCount == kThreadBindings) {
+         benchmark::RegisterBenchmark("module/threads256", moduleThreads, setup.get())
+            ->Threads(1)
+            ->Threads(2)
+            ->UseRealTime();
+         benchmark::RegisterBenchmark("minimal-hdr/threads256", minimalHeadersThreads, setup.get())
+            ->Threads(1)
+            ->Threads(2)
+            ->UseRealTime();
+      }
+   }
+
+   RateCollector reporter;
+   benchmark::RunSpecifiedBenchmarks(&reporter);
+   printSummary(reporter, setups, fullPortHeapBytes);
+   benchmark::Shutdown();
+
+   setups.clear();
+   host.log().clear();
+   return host.unload() == ORR_OK ? 0 : 1;
+}

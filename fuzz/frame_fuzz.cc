@@ -1,0 +1,45 @@
+// Whole frames through a port of the loaded module: the enforcing or the
+// learning port, either direction, the frame in scatter-gather elements and
+// repeated in one list, the virtual clock moved on before it.
+//
+// Input: [flags] [clock step] [split lengths...] [frame]
+//   flags bit 0: direction (0 from the VM, 1 to it)
+//         bit 1: port (0 enforcing, 1 learning)
+//         bits 2-3: split count
+//         bit 4: VLAN ID metadata 100 instead of 0
+//         bits 5-6: copies of the frame in the list, less one
+#include "fuzz_input.h"
+#include "loaded_module.h"
+
+#include <chrono>
+#include <cstdint>
+#include <vector>
+
+extern "C" int LLVMFuzzerInitialize(int *, char ***)
+{
+   (void)swsec::fuzz::loadedModule();
+   return 0;
+}
+
+extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size)
+{
+   swsec::fuzz::LoadedModule &module = swsec::fuzz::loadedModule();
+   swsec::fuzz::FuzzInput in(data, size);
+   const uint8_t flags = in.byte();
+   const uint8_t clockStep = in.byte();
+   const std::vector<uint8_t> rawSplits = in.bytes((flags >> 2) & 3u);
+
+   swsec::host::FrameSpec spec;
+   spec.bytes = in.rest();
+   spec.split = swsec::fuzz::clampSplits(rawSplits, spec.bytes.size());
+   spec.vlanId = (flags & 0x10u) != 0 ? 100 : 0;
+   const std::vector<swsec::host::FrameSpec> frames(1u + ((flags >> 5) & 3u), spec);
+
+   // Rate limits, pending requests and leases depend on time: up to 25.5 s a step.
+   module.host.clock().advance(std::chrono::milliseconds(100 * clockStep));
+   const uint32_t direction = (flags & 1u) != 0 ? ORR_SIFRA_DIR_RX : ORR_SIFRA_DIR_TX;
+   const swsec::host::FilterId port = (flags & 2u) != 0 ? module.learning : module.enforcing;
+   (void)module.host.sifra().processPackets(port, direction, frames);
+   module.forgetRecords();
+   return 0;
+}

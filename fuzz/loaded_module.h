@@ -1,0 +1,30 @@
+// The module loaded in a host for the process, with one port configured to
+// enforce and one learning, as the frame and control-input targets use it.
+#pragma once
+
+#include "host/host.h"
+
+#include <cstdint>
+#include <string_view>
+
+namespace swsec::fuzz {
+
+inline constexpr std::string_view kAgent = "sifra-generic-tarlin-swsec";
+inline constexpr std::string_view kSecurityProperty = "sifra-generic-tarlin-swsec.security";
+inline constexpr std::string_view kAgentProperty = "com.tarlin.common.switch-security";
+
+struct LoadedModule {
+   host::Host host;
+   host::FilterId enforcing = 0;
+   host::FilterId learning = 0;
+
+   // Per input: forgets what the host recorded, so that memory stays flat
+   // over millions of inputs.
+   void forgetRecords();
+};
+
+// Made on first use and kept until exit: unloading would only repeat what
+// the test suite checks, and a fresh load per input is too slow to fuzz.
+LoadedModule &loadedModule();
+
+}  // namespace swsec::fuzz

@@ -92,7 +92,7 @@ FaultTable::Point &FaultTable::pointFor(std::string_view op)
       const char *name = nullptr;
       Point *point = nullptr;
    };
-   thread_local std::array<Slot, 64> cache{};
+   thread_local __attribute__((tls_model("initial-exec"))) std::array<Slot, 64> cache{};
    Slot &slot = cache[(reinterpret_cast<uintptr_t>(op.data()) >> 3) % cache.size()];
    if (slot.generation == generation_ && slot.name == op.data()) {
       return *slot.point;
@@ -113,7 +113,7 @@ void FaultTable::addRule(std::string_view op, orr_Status status, uint64_t nth, b
    }
    Point &point = *points_[indexOf(op)];
    std::lock_guard guard(mutex_);
-   point.rules.push_back(Rule{status, point.calls.load() + nth, once});
+   point.rules.push_back(Rule{status, static_cast<uint64_t>(point.calls.value()) + nth, once});
    armedRules_.fetch_add(1);
 }
 
@@ -138,17 +138,20 @@ void FaultTable::clear()
 
 uint64_t FaultTable::calls(std::string_view op) const
 {
-   return points_[indexOf(op)]->calls.load();
+   return static_cast<uint64_t>(points_[indexOf(op)]->calls.value());
 }
 
 std::optional<orr_Status> FaultTable::hit(std::string_view op)
 {
    Point &p = pointFor(op);
-   const uint64_t call = p.calls.fetch_add(1) + 1;
+   p.calls.add(1);
    if (armedRules_.load(std::memory_order_acquire) == 0) {
       return std::nullopt;
    }
+   // With a rule armed the count must be exact: the call's number is taken
+   // under the lock, which every counted call then passes through.
    std::lock_guard guard(mutex_);
+   const auto call = static_cast<uint64_t>(p.calls.value());
    // The first rule that applies decides; a spent one-shot rule is dropped.
    for (auto rule = p.rules.begin(); rule != p.rules.end(); ++rule) {
       if (rule->once && rule->firstCall == call) {

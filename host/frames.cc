@@ -90,7 +90,7 @@ public:
          if (!frame.mappings.empty()) {
             problems.push_back(which + " returned to the host with " + std::to_string(frame.mappings.size()) +
                                " header mapping(s) outstanding");
-            store_.outstandingMappings_ -= frame.mappings.size();
+            store_.outstandingMappings_.add(-static_cast<int64_t>(frame.mappings.size()));
          }
       }
       for (auto &frame : frames_) {
@@ -255,7 +255,7 @@ std::unique_ptr<FrameList> FrameStore::makeList(const std::vector<FrameSpec> &fr
 
 uint64_t FrameStore::outstandingMappings() const
 {
-   return outstandingMappings_.load();
+   return static_cast<uint64_t>(outstandingMappings_.value());
 }
 
 uint64_t FrameStore::releases() const
@@ -330,7 +330,7 @@ void FrameStore::release(orr_Pkt *pkt)
       outstanding = frame->mappings.size();
       frame->mappings.clear();
    }
-   outstandingMappings_ -= outstanding;
+   outstandingMappings_.add(-static_cast<int64_t>(outstanding));
    frame->freeData(*this);
    frame->released = true;
    frame->list->countRelease();
@@ -433,7 +433,7 @@ orr_Status FrameStore::headerDataGet(orr_Pkt *pkt, orr_PktHeaderEntry *entry, ui
       std::lock_guard guard(frame.mappingsMutex);
       frame.mappings.push_back(std::move(mapping));
    }
-   ++outstandingMappings_;
+   outstandingMappings_.add(1);
    return ORR_OK;
 }
 
@@ -449,7 +449,7 @@ void FrameStore::headerDataRelease(orr_Pkt *pkt, orr_PktHeaderEntry *entry, uint
             " of frame " + pointerText(pkt));
    }
    frame.mappings.erase(std::next(found).base());
-   --outstandingMappings_;
+   outstandingMappings_.add(-1);
 }
 
 }  // namespace swsec::host

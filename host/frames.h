@@ -13,6 +13,8 @@
 // counters are shared and locked.
 #pragma once
 
+#include "host/sharded_counter.h"
+
 #include "host/faults.h"
 #include "host/header_lookup.h"
 #include "host/host.h"
@@ -66,7 +68,7 @@ private:
    Violations &violations_;
    FaultTable &faults_;
 
-   std::atomic<uint64_t> outstandingMappings_{0};
+   ShardedCounter outstandingMappings_;
    std::atomic<uint64_t> releases_{0};
    std::atomic<orr_MA> nextBase_{0x10000000000ull};
 

@@ -7,10 +7,20 @@ cd "$(dirname "$0")/.."
 
 bash scripts/setup.sh
 
+passed=0
+failed=0
 run_suite() {
-  local flavour=$1
+  local flavour=$1 log
   echo "== tests ($flavour)"
-  ctest --test-dir "build/$flavour" -j "$(nproc)" --output-on-failure --timeout 600
+  log=$(mktemp)
+  # set -e stops the run on a failure; the totals are for the closing line.
+  ctest --test-dir "build/$flavour" -j "$(nproc)" --output-on-failure --timeout 600 | tee "$log"
+  local total failures
+  total=$(sed -n 's/.*tests failed out of \([0-9]*\).*/\1/p' "$log" | tail -n 1)
+  failures=$(sed -n 's/.* \([0-9]*\) tests failed out of.*/\1/p' "$log" | tail -n 1)
+  rm -f "$log"
+  passed=$((passed + ${total:-0} - ${failures:-0}))
+  failed=$((failed + ${failures:-0}))
 }
 
 bash scripts/build.sh gcc
@@ -28,3 +38,5 @@ TSAN_OPTIONS=halt_on_error=1 run_suite tsan
 
 # Fuzz targets, a bounded time each (libFuzzer with clang, ASan and UBSan).
 bash scripts/fuzz.sh 30
+
+echo "tests: $passed passed, $failed failed"

@@ -64,11 +64,11 @@ ModulePort::~ModulePort()
 
 std::unique_ptr<host::FrameList> ModulePort::makeList(const std::vector<MixFrame> &frames) const
 {
-   std::vector<host::FrameSpec> specs(frames.size());
+   std::vector<host::FrameSpec> frameSpecs(frames.size());
    for (size_t i = 0; i < frames.size(); ++i) {
-      specs[i].bytes = frames[i].bytes;
+      frameSpecs[i].bytes = frames[i].bytes;
    }
-   return host_.frames().makeList(specs, minMappedLen_);
+   return host_.frames().makeList(frameSpecs, minMappedLen_);
 }
 
 }  // namespace swsec::bench

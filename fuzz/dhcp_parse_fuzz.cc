@@ -97,13 +97,13 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size)
    bytes[14] = 0x45;
    bytes[23] = 17;
 
-   swsec::host::FrameSpec spec;
-   spec.bytes = bytes;
-   spec.split = swsec::fuzz::clampSplits(rawSplits, bytes.size());
+   swsec::host::FrameSpec frameSpec;
+   frameSpec.bytes = bytes;
+   frameSpec.split = swsec::fuzz::clampSplits(rawSplits, bytes.size());
    // The loop maps at least the located headers; beyond that the input decides.
-   spec.mappedLen = static_cast<uint32_t>(
+   frameSpec.mappedLen = static_cast<uint32_t>(
       std::clamp<size_t>(mappedWanted, kUdpPayloadOffset, bytes.size()));
-   auto list = p.host.frames().makeList({spec});
+   auto list = p.host.frames().makeList({frameSpec});
    orr_Pkt *pkt = list->frame(0);
 
    orr_PktHeaderEntry eth{0, 14, 0, 14};

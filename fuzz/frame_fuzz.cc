@@ -29,11 +29,11 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size)
    const uint8_t clockStep = in.byte();
    const std::vector<uint8_t> rawSplits = in.bytes((flags >> 2) & 3u);
 
-   swsec::host::FrameSpec spec;
-   spec.bytes = in.rest();
-   spec.split = swsec::fuzz::clampSplits(rawSplits, spec.bytes.size());
-   spec.vlanId = (flags & 0x10u) != 0 ? 100 : 0;
-   const std::vector<swsec::host::FrameSpec> frames(1u + ((flags >> 5) & 3u), spec);
+   swsec::host::FrameSpec frameSpec;
+   frameSpec.bytes = in.rest();
+   frameSpec.split = swsec::fuzz::clampSplits(rawSplits, frameSpec.bytes.size());
+   frameSpec.vlanId = (flags & 0x10u) != 0 ? 100 : 0;
+   const std::vector<swsec::host::FrameSpec> frames(1u + ((flags >> 5) & 3u), frameSpec);
 
    // Rate limits, pending requests and leases depend on time: up to 25.5 s a step.
    module.host.clock().advance(std::chrono::milliseconds(100 * clockStep));

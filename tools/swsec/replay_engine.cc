@@ -45,7 +45,7 @@ std::string withoutNewline(std::string text)
 struct PendingList {
    uint8_t direction = kDirUnknown;
    int64_t firstTimeNs = 0;
-   std::vector<host::FrameSpec> specs;
+   std::vector<host::FrameSpec> frameSpecs;
    std::vector<size_t> verdictIndex;   // into ReplayResult::frames
    std::vector<int64_t> timesNs;
 };
@@ -60,7 +60,7 @@ public:
       if (!options.writeDropped.empty()) {
          dropped_.emplace(options.writeDropped);
       }
-      list_.specs.reserve(options.batch);
+      list_.frameSpecs.reserve(options.batch);
       list_.verdictIndex.reserve(options.batch);
       list_.timesNs.reserve(options.batch);
    }
@@ -161,18 +161,18 @@ uint8_t Run::directionOf(const CaptureFrame &frame) const
 
 void Run::add(const CaptureFrame &frame, uint8_t direction)
 {
-   if (!list_.specs.empty() &&
+   if (!list_.frameSpecs.empty() &&
        (direction != list_.direction || frame.timeNs - list_.firstTimeNs > kListSpanNs ||
-        list_.specs.size() >= options_.batch)) {
+        list_.frameSpecs.size() >= options_.batch)) {
       flush();
    }
-   if (list_.specs.empty()) {
+   if (list_.frameSpecs.empty()) {
       list_.direction = direction;
       list_.firstTimeNs = frame.timeNs;
    }
-   host::FrameSpec &spec = list_.specs.emplace_back();
-   spec.bytes.assign(frame.bytes.begin(), frame.bytes.end());
-   spec.untag = true;
+   host::FrameSpec &frameSpec = list_.frameSpecs.emplace_back();
+   frameSpec.bytes.assign(frame.bytes.begin(), frame.bytes.end());
+   frameSpec.untag = true;
    FrameVerdict &verdict = result_.frames.emplace_back();
    verdict.index = frame.index;
    verdict.time = static_cast<double>(frame.timeNs - firstTimeNs_) / 1e9;
@@ -193,34 +193,34 @@ void Run::advanceTo(std::chrono::microseconds target)
 
 void Run::flush()
 {
-   if (list_.specs.empty()) {
+   if (list_.frameSpecs.empty()) {
       return;
    }
    // Capture time that goes backwards leaves the clock where it is.
    advanceTo(clockBase_ + std::chrono::duration_cast<std::chrono::microseconds>(
                              std::chrono::nanoseconds(list_.firstTimeNs - firstTimeNs_)));
-   const host::PacketsResult out = host_.sifra().processPackets(filter_, list_.direction, list_.specs);
-   std::vector<bool> kept(list_.specs.size(), false);
+   const host::PacketsResult out = host_.sifra().processPackets(filter_, list_.direction, list_.frameSpecs);
+   std::vector<bool> kept(list_.frameSpecs.size(), false);
    for (size_t index : out.kept) {
       if (index < kept.size()) {
          kept[index] = true;
       }
    }
-   for (size_t i = 0; i < list_.specs.size(); ++i) {
+   for (size_t i = 0; i < list_.frameSpecs.size(); ++i) {
       FrameVerdict &verdict = result_.frames[list_.verdictIndex[i]];
       verdict.passed = kept[i];
       ++result_.totals[verdict.direction][kept[i] ? 0 : 1];
       if (!kept[i] && options_.describeDrops) {
-         verdict.description = describeFrame(list_.specs[i].bytes);
+         verdict.description = describeFrame(list_.frameSpecs[i].bytes);
       }
       std::optional<PcapWriter> &writer = kept[i] ? passed_ : dropped_;
       if (writer) {
-         writer->write(list_.timesNs[i], list_.specs[i].bytes);
+         writer->write(list_.timesNs[i], list_.frameSpecs[i].bytes);
       }
    }
    lastHandedOver_ = result_.frames[list_.verdictIndex.back()].index;
    collectNotifications();
-   list_.specs.clear();
+   list_.frameSpecs.clear();
    list_.verdictIndex.clear();
    list_.timesNs.clear();
 }

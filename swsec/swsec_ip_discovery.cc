@@ -16,6 +16,7 @@
 #include "swsec/swsec_dhcp_parse.h"
 #include "swsec/swsec_notify.h"
 #include "swsec/swsec_port_db.h"
+#include "swsec/swsec_port_db_links.h"
 
 #include <cstddef>
 #include <cstdint>
@@ -207,8 +208,7 @@ orr_ListLinks *BucketOf(SwSecContext *ctx, const SwSecVmi *vmi)
    key.vlanId = vmi->vlanId;
    orr_Memcpy(key.macAddr, vmi->macAddr, MAC_LEN);
    key.ipAddr = vmi->ipAddr;
-   const uint32_t hash = HashFunc_HashBytes(&key, sizeof(key));
-   return &ctx->portDbHash->buckets[hash & ctx->portDbHash->bucketMask];
+   return SwSecVmiBucket(ctx->portDbHash, &key);
 }
 
 void LogAddressChange(SwSecContext *ctx, const SwSecVmi *vmi, uint32_t newIp)

@@ -253,6 +253,17 @@ std::unique_ptr<FrameList> FrameStore::makeList(const std::vector<FrameSpec> &fr
    return list;
 }
 
+std::unique_ptr<FrameList> FrameStore::makeList(std::span<const FrameView> frames, uint32_t minMappedLen)
+{
+   std::vector<FrameSpec> frameSpecs(frames.size());
+   for (size_t index = 0; index < frames.size(); ++index) {
+      frameSpecs[index].bytes.assign(frames[index].bytes.begin(), frames[index].bytes.end());
+      frameSpecs[index].vlanId = frames[index].vlanId;
+      frameSpecs[index].untag = frames[index].untag;
+   }
+   return makeList(frameSpecs, minMappedLen);
+}
+
 uint64_t FrameStore::outstandingMappings() const
 {
    return static_cast<uint64_t>(outstandingMappings_.value());

@@ -54,6 +54,7 @@ public:
 
    // Frames
    std::unique_ptr<FrameList> makeList(const std::vector<FrameSpec> &frames, uint32_t minMappedLen) override;
+   std::unique_ptr<FrameList> makeList(std::span<const FrameView> frames, uint32_t minMappedLen) override;
    uint64_t outstandingMappings() const override;
    uint64_t releases() const override;
 

@@ -19,6 +19,7 @@
 #include <map>
 #include <memory>
 #include <optional>
+#include <span>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -167,6 +168,16 @@ struct FrameSpec {
    std::optional<uint32_t> mappedLen;
 };
 
+// A frame handed over by reference, for callers that build many lists
+// (the replay tool, the benchmark): one scatter-gather element, the default
+// mapped length. The host copies the bytes during makeList; the caller's
+// buffer may change afterwards.
+struct FrameView {
+   std::span<const uint8_t> bytes;
+   uint16_t vlanId = 0;
+   bool untag = false;
+};
+
 // Frames the host made and handed out as one list (orr_PktList). Destroying
 // it returns the list to the host: every frame still in it is freed; a
 // frame with header mappings outstanding, or taken out of the list and
@@ -189,6 +200,7 @@ public:
    // Builds the frames as a list; `minMappedLen` raises the default mapped
    // length as a filter's minimum would.
    virtual std::unique_ptr<FrameList> makeList(const std::vector<FrameSpec> &frames, uint32_t minMappedLen = 0) = 0;
+   virtual std::unique_ptr<FrameList> makeList(std::span<const FrameView> frames, uint32_t minMappedLen = 0) = 0;
    // Header mappings (orr_PktHeaderDataGet) not yet given back, over all frames.
    virtual uint64_t outstandingMappings() const = 0;
    // Frames released with orr_PktRelease since the host was made.
@@ -281,6 +293,7 @@ public:
    // minimum mapped length for that direction applies. Thread-safe: several
    // threads may hand lists to the same filter at once.
    virtual PacketsResult processPackets(FilterId id, uint32_t direction, const std::vector<FrameSpec> &frames) = 0;
+   virtual PacketsResult processPackets(FilterId id, uint32_t direction, std::span<const FrameView> frames) = 0;
 
    // ---- per-filter properties, as the management plane uses them
 

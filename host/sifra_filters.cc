@@ -252,7 +252,8 @@ void SifraRegistry::clearIoctlReplies()
    replies_.clear();
 }
 
-PacketsResult SifraRegistry::processPackets(FilterId id, uint32_t direction, const std::vector<FrameSpec> &frames)
+template <typename FrameInputs>
+PacketsResult SifraRegistry::judgeList(FilterId id, uint32_t direction, const FrameInputs &frames)
 {
    auto call = callOf(id, direction);
    if (!call) {
@@ -267,6 +268,16 @@ PacketsResult SifraRegistry::processPackets(FilterId id, uint32_t direction, con
    list.reset();
    afterModuleCall();
    return result;
+}
+
+PacketsResult SifraRegistry::processPackets(FilterId id, uint32_t direction, const std::vector<FrameSpec> &frames)
+{
+   return judgeList(id, direction, frames);
+}
+
+PacketsResult SifraRegistry::processPackets(FilterId id, uint32_t direction, std::span<const FrameView> frames)
+{
+   return judgeList(id, direction, frames);
 }
 
 // Platform operations on a filter handle. An unknown handle would be a

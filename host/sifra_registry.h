@@ -61,6 +61,7 @@ public:
    std::vector<IoctlReply> ioctlReplies() const override;
    void clearIoctlReplies() override;
    PacketsResult processPackets(FilterId id, uint32_t direction, const std::vector<FrameSpec> &frames) override;
+   PacketsResult processPackets(FilterId id, uint32_t direction, std::span<const FrameView> frames) override;
    orr_Status writeProperty(std::string_view property, std::optional<FilterId> filter,
                             const std::vector<uint8_t> &bytes) override;
    orr_Status readProperty(std::string_view property, std::optional<FilterId> filter,
@@ -92,6 +93,9 @@ private:
    // Destroys every filter of a fast path being withdrawn.
    void destroyFiltersOf(const FastPath *fastPath);
    void afterModuleCall();
+   // Builds the list, hands it to the filter and collects what stayed.
+   template <typename FrameInputs>
+   PacketsResult judgeList(FilterId id, uint32_t direction, const FrameInputs &frames);
 
    Violations &violations_;
    FaultTable &faults_;

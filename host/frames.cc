@@ -2,14 +2,13 @@
 
 #include "host/state.h"
 
+#include <sanitizer/asan_interface.h>
+
 #include <algorithm>
 #include <cstring>
 #include <mutex>
 #include <stdexcept>
-
-// The records behind the platform's frame types.
-struct orr_Pkt {};
-struct orr_PktList {};
+#include <string>
 
 // Iterator storage, the caller's (orr_PktListIterSizeOf bytes).
 struct orr_PktListIter {
@@ -23,82 +22,117 @@ namespace swsec::host {
 
 namespace {
 
-constexpr uint64_t kFrameMagic = 0x7266'7473'6f68'6673ull;   // a live frame
-constexpr uint64_t kIterMagic = 0x7265'7469'7473'6f68ull;    // a started iterator
+constexpr uint64_t kFrameMagic = 0x7266'7473'6f68'6673ull;      // a live frame
+constexpr uint64_t kReleasedMagic = 0x6473'6172'6665'6c72ull;   // released, its list not yet given back
+constexpr uint64_t kIterMagic = 0x7265'7469'7473'6f68ull;       // a started iterator
 constexpr uint16_t kEtherVlan = 0x8100;
+// Poisoned bytes around every buffer of a list's arena.
+constexpr size_t kRedZone = 32;
+// Each element owns a 4 GiB slot of its list's machine address range.
+constexpr unsigned kElementSlotShift = 32;
+// Header mappings a frame tracks without allocating; the frame loop holds
+// at most three at once.
+constexpr size_t kInlineMappings = 4;
+
+constexpr size_t alignedUp(size_t size)
+{
+   return (size + 7) & ~size_t{7};
+}
 
 }  // namespace
 
 struct FrameStore::Frame : orr_Pkt {
+   // A plain record, moved around without cost; a copy the host had to
+   // make is freed when the mapping is given back or the frame goes.
    struct Mapping {
       const orr_PktHeaderEntry *entry = nullptr;
       uint8_t *data = nullptr;
-      std::unique_ptr<uint8_t[]> copy;   // when the header had to be copied
+      uint8_t *copy = nullptr;   // when the header had to be copied
    };
 
    uint64_t magic = kFrameMagic;
    List *list = nullptr;
-   std::vector<uint8_t> bytes;
-   std::vector<std::unique_ptr<uint8_t[]>> elementData;
-   std::vector<orr_SgElem> elements;
-   orr_SgArray sgArray{};
-   std::unique_ptr<uint8_t[]> mapped;
+   size_t index = 0;              // in the caller's input
+   uint32_t length = 0;
    uint32_t mappedLen = 0;
+   uint8_t *mapped = nullptr;     // the mapped part, its own buffer in the arena
+   uint32_t firstElement = 0;     // in the list's element tables
    uint16_t vlanId = 0;
+   uint8_t present = 0;           // bit per layer with a header entry
+   orr_SgArray sgArray{};
    std::array<orr_PktHeaderEntry, 3> entries{};
-   std::array<bool, 3> present{};
 
-   std::mutex mappingsMutex;
-   std::vector<Mapping> mappings;
+   // Mappings in the order they were made: the first kInlineMappings here,
+   // the rest in `moreMappings`. The count is read by outstandingMappings()
+   // from other threads.
+   std::atomic<uint32_t> mappingCount{0};
+   std::array<Mapping, kInlineMappings> mappings;
+   std::vector<Mapping> moreMappings;
 
    Frame *prev = nullptr;
    Frame *next = nullptr;
    bool inList = false;
-   bool released = false;
 
-   // Gives the element buffers and the mapped buffer back; the record
-   // stays so that a second release or a use after release is caught.
-   void freeData(FrameStore &store)
+   Frame() = default;
+   Frame(const Frame &) = delete;
+   Frame &operator=(const Frame &) = delete;
+   ~Frame() { dropMappings(); }
+
+   Mapping &mappingAt(size_t position)
    {
-      for (const orr_SgElem &element : elements) {
-         store.removeElement(element.addr);
+      return position < kInlineMappings ? mappings[position] : moreMappings[position - kInlineMappings];
+   }
+
+   void dropMappings()
+   {
+      const uint32_t count = mappingCount.load(std::memory_order_relaxed);
+      for (uint32_t position = 0; position < count; ++position) {
+         delete[] mappingAt(position).copy;
       }
-      elementData.clear();
-      mapped.reset();
-      bytes.clear();
-      bytes.shrink_to_fit();
+      moreMappings.clear();
+      mappingCount.store(0, std::memory_order_relaxed);
    }
 };
 
 class FrameStore::List final : public orr_PktList, public FrameList {
 public:
-   explicit List(FrameStore &store) : store_(store) {}
+   struct Element {
+      uint8_t *data = nullptr;
+      uint32_t length = 0;
+      uint32_t frame = 0;   // index of the frame it belongs to
+   };
+
+   List(FrameStore &store, size_t frameCount, size_t elementCount, size_t arenaSize)
+      : store_(store), frameCount_(frameCount), frames_(std::make_unique<Frame[]>(frameCount)),
+        sgElems_(elementCount), elements_(elementCount), arenaSize_(arenaSize),
+        arena_(std::make_unique_for_overwrite<uint8_t[]>(arenaSize))
+   {
+      // Everything is out of bounds until a buffer is laid out over it.
+      ASAN_POISON_MEMORY_REGION(arena_.get(), arenaSize_);
+   }
 
    ~List() override
    {
       std::vector<std::string> problems;
-      for (size_t index = 0; index < frames_.size(); ++index) {
-         Frame &frame = *frames_[index];
-         if (frame.released) {
+      for (size_t index = 0; index < frameCount_; ++index) {
+         Frame &frame = frames_[index];
+         if (frame.magic == kReleasedMagic) {
             continue;
          }
          const std::string which = "frame " + std::to_string(index);
          if (!frame.inList) {
             problems.push_back(which + " was taken out of its list and never released");
          }
-         std::lock_guard guard(frame.mappingsMutex);
-         if (!frame.mappings.empty()) {
-            problems.push_back(which + " returned to the host with " + std::to_string(frame.mappings.size()) +
+         if (const uint32_t outstanding = frame.mappingCount.load(std::memory_order_relaxed); outstanding != 0) {
+            problems.push_back(which + " returned to the host with " + std::to_string(outstanding) +
                                " header mapping(s) outstanding");
-            store_.outstandingMappings_.add(-static_cast<int64_t>(frame.mappings.size()));
          }
       }
-      for (auto &frame : frames_) {
-         if (!frame->released) {
-            frame->freeData(store_);
-         }
-         frame->magic = ~kFrameMagic;
+      store_.forget(*this);
+      for (size_t index = 0; index < frameCount_; ++index) {
+         frames_[index].magic = ~kFrameMagic;
       }
+      ASAN_UNPOISON_MEMORY_REGION(arena_.get(), arenaSize_);
       store_.violations_.reportAll(std::move(problems));
    }
 
@@ -106,35 +140,43 @@ public:
 
    orr_Pkt *frame(size_t index) override
    {
-      if (index >= frames_.size() || frames_[index]->released) {
+      if (index >= frameCount_ || frames_[index].magic != kFrameMagic) {
          return nullptr;
       }
-      return frames_[index].get();
+      return &frames_[index];
    }
 
    std::vector<size_t> kept() const override
    {
       std::vector<size_t> indices;
       for (const Frame *frame = head_; frame != nullptr; frame = frame->next) {
-         indices.push_back(indexOf(frame));
+         indices.push_back(frame->index);
       }
       return indices;
    }
 
    size_t released() const override { return releasedCount_; }
 
-   void append(std::unique_ptr<Frame> frame)
+   // Places `length` bytes in the arena at `offset` (advanced past the
+   // buffer and its red zone) and opens them to reads and writes.
+   uint8_t *place(size_t &offset, const uint8_t *bytes, size_t length)
    {
-      frame->list = this;
-      frame->inList = true;
-      frame->prev = tail_;
-      if (tail_ != nullptr) {
-         tail_->next = frame.get();
-      } else {
-         head_ = frame.get();
+      uint8_t *buffer = arena_.get() + offset;
+      ASAN_UNPOISON_MEMORY_REGION(buffer, length);
+      if (length != 0) {
+         std::memcpy(buffer, bytes, length);
       }
-      tail_ = frame.get();
-      frames_.push_back(std::move(frame));
+      offset += alignedUp(length) + kRedZone;
+      return buffer;
+   }
+
+   void append(Frame &frame)
+   {
+      frame.list = this;
+      frame.inList = true;
+      frame.prev = tail_;
+      (tail_ != nullptr ? tail_->next : head_) = &frame;
+      tail_ = &frame;
    }
 
    void unlink(Frame &frame)
@@ -146,162 +188,264 @@ public:
       frame.inList = false;
    }
 
-   Frame *head() const { return head_; }
-   void countRelease() { ++releasedCount_; }
-
-private:
-   size_t indexOf(const Frame *frame) const
+   // Closes a released frame's buffers: a later read through a kept
+   // pointer is a use after free.
+   void poisonBuffers(const Frame &frame)
    {
-      for (size_t index = 0; index < frames_.size(); ++index) {
-         if (frames_[index].get() == frame) {
-            return index;
-         }
+      for (uint32_t element = 0; element < frame.sgArray.numElems; ++element) {
+         ASAN_POISON_MEMORY_REGION(elements_[frame.firstElement + element].data,
+                                   elements_[frame.firstElement + element].length);
       }
-      return frames_.size();
+      ASAN_POISON_MEMORY_REGION(frame.mapped, frame.mappedLen);
    }
 
+   // Copies frame bytes out of its elements; false past the frame's end.
+   bool copyOut(const Frame &frame, uint32_t offset, uint32_t length, uint8_t *dst) const
+   {
+      if (offset > frame.length || length > frame.length - offset) {
+         return false;
+      }
+      uint32_t begin = 0;
+      for (uint32_t element = 0; element < frame.sgArray.numElems && length != 0; ++element) {
+         const Element &part = elements_[frame.firstElement + element];
+         const uint32_t end = begin + part.length;
+         if (offset < end) {
+            const uint32_t take = std::min(length, end - offset);
+            std::memcpy(dst, part.data + (offset - begin), take);
+            dst += take;
+            offset += take;
+            length -= take;
+         }
+         begin = end;
+      }
+      return true;
+   }
+
+   Frame *head() const { return head_; }
+   Frame &frameAt(size_t index) { return frames_[index]; }
+   orr_SgElem &sgElem(size_t index) { return sgElems_[index]; }
+   Element &element(size_t index) { return elements_[index]; }
+   const Element &element(size_t index) const { return elements_[index]; }
+   size_t elementCount() const { return elements_.size(); }
+   const Frame &frameOf(const Element &element) const { return frames_[element.frame]; }
+   size_t frameCount() const { return frameCount_; }
+   void countRelease() { ++releasedCount_; }
+
+   orr_MA base = 0;
+
+private:
    FrameStore &store_;
-   std::vector<std::unique_ptr<Frame>> frames_;
+   size_t frameCount_;
+   std::unique_ptr<Frame[]> frames_;
+   std::vector<orr_SgElem> sgElems_;
+   std::vector<Element> elements_;
+   size_t arenaSize_;
+   std::unique_ptr<uint8_t[]> arena_;
    Frame *head_ = nullptr;
    Frame *tail_ = nullptr;
    size_t releasedCount_ = 0;
 };
 
-FrameStore::FrameStore(Violations &violations, FaultTable &faults) : violations_(violations), faults_(faults) {}
+namespace {
 
-FrameStore::~FrameStore() = default;
-
-FrameStore::Frame &FrameStore::checked(const orr_Pkt *pkt, const char *op)
+// The frame operations' check: a live frame of some list, else an abort
+// that says what the pointer was.
+[[noreturn]] void notLive(const orr_Pkt *pkt, const char *op)
 {
    if (pkt == nullptr) {
       fatal(std::string(op) + ": null frame");
    }
-   auto *frame = static_cast<Frame *>(const_cast<orr_Pkt *>(pkt));
-   if (frame->magic != kFrameMagic) {
-      fatal(std::string(op) + ": " + pointerText(pkt) + " is not a frame the host handed out");
-   }
-   if (frame->released) {
+   if (static_cast<const FrameStore::Frame *>(pkt)->magic == kReleasedMagic) {
       fatal(std::string(op) + ": frame " + pointerText(pkt) + " used after orr_PktRelease");
+   }
+   fatal(std::string(op) + ": " + pointerText(pkt) + " is not a frame the host handed out");
+}
+
+inline FrameStore::Frame &checked(const orr_Pkt *pkt, const char *op)
+{
+   auto *frame = static_cast<FrameStore::Frame *>(const_cast<orr_Pkt *>(pkt));
+   if (pkt == nullptr || frame->magic != kFrameMagic) [[unlikely]] {
+      notLive(pkt, op);
    }
    return *frame;
 }
 
+}  // namespace
+
+FrameStore::FrameStore(Violations &violations, FaultTable &faults) : violations_(violations), faults_(faults) {}
+
+FrameStore::~FrameStore() = default;
+
 std::unique_ptr<FrameList> FrameStore::makeList(const std::vector<FrameSpec> &frameSpecs, uint32_t minMappedLen)
 {
-   auto list = std::make_unique<List>(*this);
-   for (const FrameSpec &frameSpec : frameSpecs) {
-      auto frame = std::make_unique<Frame>();
-      frame->bytes = frameSpec.bytes;
-      frame->vlanId = frameSpec.vlanId;
-      auto &bytes = frame->bytes;
-      if (frameSpec.untag && bytes.size() >= 18 && ((bytes[12] << 8) | bytes[13]) == kEtherVlan) {
-         frame->vlanId = static_cast<uint16_t>(((bytes[14] << 8) | bytes[15]) & 0x0fff);
-         bytes.erase(bytes.begin() + 12, bytes.begin() + 16);
+   std::vector<FrameInput> inputs(frameSpecs.size());
+   for (size_t index = 0; index < frameSpecs.size(); ++index) {
+      const FrameSpec &spec = frameSpecs[index];
+      inputs[index] = FrameInput{spec.bytes, spec.vlanId, spec.untag, spec.split, spec.mappedLen};
+   }
+   return build(inputs, minMappedLen);
+}
+
+std::unique_ptr<FrameList> FrameStore::makeList(std::span<const FrameView> frames, uint32_t minMappedLen)
+{
+   std::vector<FrameInput> inputs(frames.size());
+   for (size_t index = 0; index < frames.size(); ++index) {
+      inputs[index] = FrameInput{frames[index].bytes, frames[index].vlanId, frames[index].untag, {}, {}};
+   }
+   return build(inputs, minMappedLen);
+}
+
+std::unique_ptr<FrameList> FrameStore::build(std::span<const FrameInput> inputs, uint32_t minMappedLen)
+{
+   // A frame as the filter sees it: untagged where asked, cut into elements.
+   struct Shape {
+      std::span<const uint8_t> bytes;   // the caller's, or `untagged`
+      uint16_t vlanId = 0;
+      size_t splitCount = 0;            // elements from the caller's split
+      uint32_t rest = 0;                // bytes left after them
+      bool restElement = false;
+      uint32_t mappedLen = 0;
+   };
+   std::vector<Shape> shapes(inputs.size());
+   std::vector<std::vector<uint8_t>> untagged;
+   size_t elementCount = 0;
+   size_t arenaSize = kRedZone;
+   for (size_t index = 0; index < inputs.size(); ++index) {
+      const FrameInput &input = inputs[index];
+      Shape &shape = shapes[index];
+      shape.bytes = input.bytes;
+      shape.vlanId = input.vlanId;
+      const auto &bytes = input.bytes;
+      if (input.untag && bytes.size() >= 18 && ((bytes[12] << 8) | bytes[13]) == kEtherVlan) {
+         shape.vlanId = static_cast<uint16_t>(((bytes[14] << 8) | bytes[15]) & 0x0fff);
+         auto &copy = untagged.emplace_back(bytes.begin(), bytes.begin() + 12);
+         copy.insert(copy.end(), bytes.begin() + 16, bytes.end());
+         shape.bytes = copy;
       }
-      if (bytes.size() > UINT32_MAX) {
+      if (shape.bytes.size() > UINT32_MAX) {
          throw std::invalid_argument("frame too long");
       }
-      const auto length = static_cast<uint32_t>(bytes.size());
-
-      std::vector<uint32_t> split = frameSpec.split;
+      const auto length = static_cast<uint32_t>(shape.bytes.size());
       uint64_t total = 0;
-      for (uint32_t part : split) {
+      for (uint32_t part : input.split) {
          total += part;
       }
       if (total > length) {
          throw std::invalid_argument("split of " + std::to_string(total) + " bytes for a frame of " +
                                      std::to_string(length));
       }
-      if (split.empty() || total < length) {
-         split.push_back(length - static_cast<uint32_t>(total));
-      }
-      if (split.size() > UINT16_MAX) {
+      shape.splitCount = input.split.size();
+      shape.rest = length - static_cast<uint32_t>(total);
+      shape.restElement = input.split.empty() || shape.rest != 0;
+      const size_t elements = shape.splitCount + (shape.restElement ? 1 : 0);
+      if (elements > UINT16_MAX) {
          throw std::invalid_argument("too many scatter-gather elements");
       }
-      uint32_t offset = 0;
-      for (uint32_t part : split) {
-         auto data = std::make_unique<uint8_t[]>(part);
-         std::copy_n(bytes.data() + offset, part, data.get());
-         const orr_MA base = nextBase_.fetch_add(1ull << 32);
-         addElement(base, data.get(), part);
-         frame->elements.push_back(orr_SgElem{base, part, 0});
-         frame->elementData.push_back(std::move(data));
-         offset += part;
-      }
-      frame->sgArray.numElems = static_cast<uint16_t>(split.size());
-
-      if (frameSpec.mappedLen) {
-         if (*frameSpec.mappedLen > length) {
+      if (input.mappedLen) {
+         if (*input.mappedLen > length) {
             throw std::invalid_argument("mapped length beyond the frame");
          }
-         frame->mappedLen = *frameSpec.mappedLen;
+         shape.mappedLen = *input.mappedLen;
       } else {
-         frame->mappedLen = std::min(std::max(split.front(), minMappedLen), length);
+         const uint32_t first = shape.splitCount != 0 ? input.split.front() : shape.rest;
+         shape.mappedLen = std::min(std::max(first, minMappedLen), length);
       }
-      frame->mapped = std::make_unique<uint8_t[]>(frame->mappedLen);
-      std::copy_n(bytes.data(), frame->mappedLen, frame->mapped.get());
+      elementCount += elements;
+      arenaSize += alignedUp(length) + elements * kRedZone + alignedUp(shape.mappedLen) + kRedZone;
+   }
 
-      const FrameHeaders headers = findHeaders(bytes);
+   auto list = std::make_unique<List>(*this, inputs.size(), elementCount, arenaSize);
+   size_t offset = kRedZone;
+   size_t element = 0;
+   for (size_t index = 0; index < inputs.size(); ++index) {
+      const Shape &shape = shapes[index];
+      Frame &frame = list->frameAt(index);
+      frame.index = index;
+      frame.length = static_cast<uint32_t>(shape.bytes.size());
+      frame.vlanId = shape.vlanId;
+      frame.firstElement = static_cast<uint32_t>(element);
+      const auto addElement = [&](uint32_t from, uint32_t length) {
+         List::Element &part = list->element(element);
+         part.data = list->place(offset, shape.bytes.data() + from, length);
+         part.length = length;
+         part.frame = static_cast<uint32_t>(index);
+         list->sgElem(element) = orr_SgElem{0, length, 0};   // the address once the list has its range
+         ++element;
+      };
+      uint32_t from = 0;
+      for (size_t part = 0; part < shape.splitCount; ++part) {
+         addElement(from, inputs[index].split[part]);
+         from += inputs[index].split[part];
+      }
+      if (shape.restElement) {
+         addElement(from, shape.rest);
+      }
+      frame.sgArray.numElems = static_cast<uint16_t>(element - frame.firstElement);
+      frame.mappedLen = shape.mappedLen;
+      frame.mapped = list->place(offset, shape.bytes.data(), shape.mappedLen);
+
+      const FrameHeaders headers = findHeaders(shape.bytes);
       for (size_t layer = 0; layer < headers.entries.size(); ++layer) {
          if (headers.entries[layer]) {
-            frame->entries[layer] = *headers.entries[layer];
-            frame->present[layer] = true;
+            frame.entries[layer] = *headers.entries[layer];
+            frame.present = static_cast<uint8_t>(frame.present | (1u << layer));
          }
       }
-      list->append(std::move(frame));
+      list->append(frame);
+   }
+
+   // The list's machine address range: a slot per element (at least one,
+   // so that no two lists start at the same address).
+   list->base = nextBase_.fetch_add(std::max<size_t>(elementCount, 1) << kElementSlotShift);
+   for (size_t index = 0; index < elementCount; ++index) {
+      list->sgElem(index).addr = list->base + (static_cast<orr_MA>(index) << kElementSlotShift);
+   }
+   {
+      std::unique_lock guard(listsMutex_);
+      lists_.emplace(list->base, list.get());
    }
    return list;
 }
 
-std::unique_ptr<FrameList> FrameStore::makeList(std::span<const FrameView> frames, uint32_t minMappedLen)
+void FrameStore::forget(const List &list)
 {
-   std::vector<FrameSpec> frameSpecs(frames.size());
-   for (size_t index = 0; index < frames.size(); ++index) {
-      frameSpecs[index].bytes.assign(frames[index].bytes.begin(), frames[index].bytes.end());
-      frameSpecs[index].vlanId = frames[index].vlanId;
-      frameSpecs[index].untag = frames[index].untag;
-   }
-   return makeList(frameSpecs, minMappedLen);
+   std::unique_lock guard(listsMutex_);
+   lists_.erase(list.base);
 }
 
 uint64_t FrameStore::outstandingMappings() const
 {
-   return static_cast<uint64_t>(outstandingMappings_.value());
+   std::shared_lock guard(listsMutex_);
+   uint64_t outstanding = 0;
+   for (const auto &[base, list] : lists_) {
+      for (size_t index = 0; index < list->frameCount(); ++index) {
+         outstanding += list->frameAt(index).mappingCount.load(std::memory_order_relaxed);
+      }
+   }
+   return outstanding;
 }
 
 uint64_t FrameStore::releases() const
 {
-   return releases_.load();
+   return static_cast<uint64_t>(releases_.value());
 }
 
-void FrameStore::addElement(orr_MA base, uint8_t *data, uint32_t length)
+inline uint8_t *FrameStore::mappedPointer(orr_Pkt *pkt)
 {
-   std::unique_lock guard(elementsMutex_);
-   elements_[base] = Element{data, length};
+   return checked(pkt, "orr_PktFrameMappedPointerGet").mapped;
 }
 
-void FrameStore::removeElement(orr_MA base)
+inline uint32_t FrameStore::frameLen(const orr_Pkt *pkt)
 {
-   std::unique_lock guard(elementsMutex_);
-   elements_.erase(base);
+   return checked(pkt, "orr_PktFrameLenGet").length;
 }
 
-uint8_t *FrameStore::mappedPointer(orr_Pkt *pkt)
-{
-   return checked(pkt, "orr_PktFrameMappedPointerGet").mapped.get();
-}
-
-uint32_t FrameStore::frameLen(const orr_Pkt *pkt)
-{
-   return static_cast<uint32_t>(checked(pkt, "orr_PktFrameLenGet").bytes.size());
-}
-
-uint32_t FrameStore::mappedLen(const orr_Pkt *pkt)
+inline uint32_t FrameStore::mappedLen(const orr_Pkt *pkt)
 {
    return checked(pkt, "orr_PktFrameMappedLenGet").mappedLen;
 }
 
-uint16_t FrameStore::vlanId(const orr_Pkt *pkt)
+inline uint16_t FrameStore::vlanId(const orr_Pkt *pkt)
 {
    return checked(pkt, "orr_PktVlanIDGet").vlanId;
 }
@@ -309,17 +453,13 @@ uint16_t FrameStore::vlanId(const orr_Pkt *pkt)
 orr_Status FrameStore::copyBytesOut(const orr_Pkt *pkt, uint32_t offset, uint32_t length, void *dst)
 {
    Frame &frame = checked(pkt, "orr_PktCopyBytesOut");
-   if (auto status = faults_.hit("orr_PktCopyBytesOut")) {
+   if (auto status = faults_.hit(faultPoint("orr_PktCopyBytesOut"))) {
       return *status;
    }
-   const size_t size = frame.bytes.size();
-   if (offset > size || length > size - offset || (dst == nullptr && length != 0)) {
+   if (dst == nullptr && length != 0) {
       return ORR_BAD_PARAM;
    }
-   if (length != 0) {
-      std::memcpy(dst, frame.bytes.data() + offset, length);
-   }
-   return ORR_OK;
+   return frame.list->copyOut(frame, offset, length, static_cast<uint8_t *>(dst)) ? ORR_OK : ORR_BAD_PARAM;
 }
 
 void FrameStore::release(orr_Pkt *pkt)
@@ -328,24 +468,19 @@ void FrameStore::release(orr_Pkt *pkt)
       fatal("orr_PktRelease: null frame");
    }
    auto *frame = static_cast<Frame *>(pkt);
-   if (frame->magic == kFrameMagic && frame->released) {
+   if (frame->magic == kReleasedMagic) {
       fatal("orr_PktRelease: frame " + pointerText(pkt) + " released twice");
    }
    checked(pkt, "orr_PktRelease");
    if (frame->inList) {
       fatal("orr_PktRelease: frame " + pointerText(pkt) + " is still in a list");
    }
-   size_t outstanding = 0;
-   {
-      std::lock_guard guard(frame->mappingsMutex);
-      outstanding = frame->mappings.size();
-      frame->mappings.clear();
-   }
-   outstandingMappings_.add(-static_cast<int64_t>(outstanding));
-   frame->freeData(*this);
-   frame->released = true;
+   const uint32_t outstanding = frame->mappingCount.load(std::memory_order_relaxed);
+   frame->dropMappings();
+   frame->list->poisonBuffers(*frame);
+   frame->magic = kReleasedMagic;
    frame->list->countRelease();
-   ++releases_;
+   releases_.add(1);
    if (outstanding != 0) {
       violations_.report("orr_PktRelease: frame " + pointerText(pkt) + " released with " +
                          std::to_string(outstanding) + " header mapping(s) outstanding");
@@ -360,27 +495,35 @@ const orr_SgArray *FrameStore::sgArray(const orr_Pkt *pkt)
 const orr_SgElem *FrameStore::sgElem(const orr_Pkt *pkt, uint16_t index)
 {
    Frame &frame = checked(pkt, "orr_PktSgElemGet");
-   if (index >= frame.elements.size()) {
+   if (index >= frame.sgArray.numElems) {
       return nullptr;
    }
-   return &frame.elements[index];
+   return &frame.list->sgElem(frame.firstElement + index);
 }
 
 orr_Status FrameStore::machineToVirtual(orr_MA addr, uint32_t length, void **va)
 {
-   if (auto status = faults_.hit("orr_MA2VA")) {
+   if (auto status = faults_.hit(faultPoint("orr_MA2VA"))) {
       return *status;
    }
    if (va == nullptr) {
       return ORR_BAD_PARAM;
    }
-   std::shared_lock guard(elementsMutex_);
-   auto next = elements_.upper_bound(addr);
-   if (next == elements_.begin()) {
+   std::shared_lock guard(listsMutex_);
+   auto next = lists_.upper_bound(addr);
+   if (next == lists_.begin()) {
       return ORR_BAD_PARAM;
    }
-   const auto &[base, element] = *std::prev(next);
-   const uint64_t into = addr - base;
+   const List &list = *std::prev(next)->second;
+   const uint64_t slot = (addr - list.base) >> kElementSlotShift;
+   if (slot >= list.elementCount()) {
+      return ORR_BAD_PARAM;
+   }
+   const List::Element &element = list.element(slot);
+   if (list.frameOf(element).magic != kFrameMagic) {
+      return ORR_BAD_PARAM;   // the frame was released
+   }
+   const uint64_t into = addr - (list.base + (slot << kElementSlotShift));
    if (into > element.length || length > element.length - into) {
       return ORR_BAD_PARAM;
    }
@@ -388,79 +531,97 @@ orr_Status FrameStore::machineToVirtual(orr_MA addr, uint32_t length, void **va)
    return ORR_OK;
 }
 
-orr_Status FrameStore::headerFind(orr_Pkt *pkt, orr_PktLayer layer, uint32_t classMask, uint32_t instance,
+inline orr_Status FrameStore::headerFind(orr_Pkt *pkt, orr_PktLayer layer, uint32_t classMask, uint32_t instance,
                                   orr_PktHeaderEntry **entry)
 {
    Frame &frame = checked(pkt, "orr_PktHeaderFind");
-   if (auto status = faults_.hit("orr_PktHeaderFind")) {
+   if (auto status = faults_.hit(faultPoint("orr_PktHeaderFind"))) [[unlikely]] {
       return *status;
    }
    if (entry == nullptr || layer > ORR_PKT_LAYER_4) {
       return ORR_BAD_PARAM;
    }
-   // A frame has at most one header per layer: only instance 1 exists.
-   if (instance != 1 || !frame.present[layer] || (classMask & headerClassOf(layer)) == 0) {
+   // A frame has at most one header per layer: only instance 1 exists. The
+   // class bits of layers 2, 3 and 4 are consecutive.
+   if (instance != 1 || (frame.present & (1u << layer)) == 0 || (classMask & (ORR_PKT_HEADER_CLASS_L2 << layer)) == 0) {
       return ORR_NOT_FOUND;
    }
    *entry = &frame.entries[layer];
    return ORR_OK;
 }
 
-orr_Status FrameStore::headerDataGet(orr_Pkt *pkt, orr_PktHeaderEntry *entry, uint8_t **data)
+inline orr_Status FrameStore::headerDataGet(orr_Pkt *pkt, orr_PktHeaderEntry *entry, uint8_t **data)
 {
    Frame &frame = checked(pkt, "orr_PktHeaderDataGet");
-   if (auto status = faults_.hit("orr_PktHeaderDataGet")) {
+   if (auto status = faults_.hit(faultPoint("orr_PktHeaderDataGet"))) [[unlikely]] {
       return *status;
    }
-   const auto layer = static_cast<size_t>(entry - frame.entries.data());
-   if (data == nullptr || entry == nullptr || entry < frame.entries.data() || layer >= frame.entries.size() ||
-       !frame.present[layer]) {
+   // Compared as addresses: an entry from elsewhere is not one of the frame's.
+   const auto address = reinterpret_cast<uintptr_t>(entry);
+   const auto first = reinterpret_cast<uintptr_t>(frame.entries.data());
+   const size_t layer = (address - first) / sizeof(orr_PktHeaderEntry);
+   if (data == nullptr || entry == nullptr || address < first || layer >= frame.entries.size() ||
+       address != first + layer * sizeof(orr_PktHeaderEntry) || (frame.present & (1u << layer)) == 0) {
       return ORR_BAD_PARAM;
    }
    const uint32_t offset = entry->offset;
    const uint32_t length = entry->length;
    Frame::Mapping mapping{entry, nullptr, nullptr};
-   if (offset + length <= frame.mappedLen) {
-      mapping.data = frame.mapped.get() + offset;
+   if (offset + length <= frame.mappedLen) [[likely]] {
+      mapping.data = frame.mapped + offset;
    } else {
       uint32_t begin = 0;
-      for (size_t index = 0; index < frame.elements.size(); ++index) {
-         const uint32_t size = frame.elements[index].length;
-         if (offset >= begin && offset + length <= begin + size && size != 0) {
-            mapping.data = frame.elementData[index].get() + (offset - begin);
+      for (uint32_t index = 0; index < frame.sgArray.numElems; ++index) {
+         const List::Element &part = frame.list->element(frame.firstElement + index);
+         if (offset >= begin && offset + length <= begin + part.length && part.length != 0) {
+            mapping.data = part.data + (offset - begin);
             break;
          }
-         begin += size;
+         begin += part.length;
       }
    }
    if (mapping.data == nullptr) {
       // Spread over elements: the host maps a copy of its own.
-      mapping.copy = std::make_unique<uint8_t[]>(length);
-      std::copy_n(frame.bytes.data() + offset, length, mapping.copy.get());
-      mapping.data = mapping.copy.get();
+      mapping.copy = new uint8_t[length];
+      (void)frame.list->copyOut(frame, offset, length, mapping.copy);
+      mapping.data = mapping.copy;
    }
    *data = mapping.data;
-   {
-      std::lock_guard guard(frame.mappingsMutex);
-      frame.mappings.push_back(std::move(mapping));
+   const uint32_t count = frame.mappingCount.load(std::memory_order_relaxed);
+   if (count < kInlineMappings) {
+      frame.mappings[count] = mapping;
+   } else {
+      frame.moreMappings.push_back(mapping);
    }
-   outstandingMappings_.add(1);
+   frame.mappingCount.store(count + 1, std::memory_order_relaxed);
    return ORR_OK;
 }
 
-void FrameStore::headerDataRelease(orr_Pkt *pkt, orr_PktHeaderEntry *entry, uint8_t *data)
+inline void FrameStore::headerDataRelease(orr_Pkt *pkt, orr_PktHeaderEntry *entry, uint8_t *data)
 {
    Frame &frame = checked(pkt, "orr_PktHeaderDataRelease");
-   std::lock_guard guard(frame.mappingsMutex);
-   auto found = std::find_if(frame.mappings.rbegin(), frame.mappings.rend(), [&](const Frame::Mapping &mapping) {
-      return mapping.entry == entry && mapping.data == data;
-   });
-   if (found == frame.mappings.rend()) {
+   const uint32_t count = frame.mappingCount.load(std::memory_order_relaxed);
+   // Mappings are mostly given back newest first: search from the end.
+   uint32_t found = count;
+   while (found != 0) {
+      const Frame::Mapping &mapping = frame.mappingAt(found - 1);
+      if (mapping.entry == entry && mapping.data == data) {
+         break;
+      }
+      --found;
+   }
+   if (found == 0) {
       fatal("orr_PktHeaderDataRelease: " + pointerText(data) + " is not a mapping of header " + pointerText(entry) +
             " of frame " + pointerText(pkt));
    }
-   frame.mappings.erase(std::next(found).base());
-   outstandingMappings_.add(-1);
+   delete[] frame.mappingAt(found - 1).copy;
+   for (uint32_t position = found; position < count; ++position) {
+      frame.mappingAt(position - 1) = frame.mappingAt(position);
+   }
+   if (count > kInlineMappings) {
+      frame.moreMappings.pop_back();
+   }
+   frame.mappingCount.store(count - 1, std::memory_order_relaxed);
 }
 
 }  // namespace swsec::host
@@ -470,24 +631,102 @@ using swsec::host::fatal;
 using swsec::host::pointerText;
 using swsec::host::detail::requireState;
 
-ORR_API uint8_t *orr_PktFrameMappedPointerGet(orr_Pkt *pkt)
+// The frame path's operations come in two parts. The quick part handles
+// the common case (a live frame of a live host, a header in the mapped part,
+// no fault rule armed, the thread's own counter shard) with no call and no
+// saved register; anything else goes, as a tail call, to the full operation,
+// which checks, counts and reports everything from the start.
+namespace {
+
+using swsec::host::detail::currentState;
+using Frame = FrameStore::Frame;
+
+constexpr uint64_t kLiveFrame = swsec::host::kFrameMagic;
+
+// The frame, when the host is alive and the pointer a live frame.
+inline Frame *liveFrame(const orr_Pkt *pkt)
+{
+   auto *frame = static_cast<Frame *>(const_cast<orr_Pkt *>(pkt));
+   if (currentState.load(std::memory_order_acquire) == nullptr || pkt == nullptr || frame->magic != kLiveFrame)
+      [[unlikely]] {
+      return nullptr;
+   }
+   return frame;
+}
+
+inline swsec::host::FaultTable &faultTable()
+{
+   return currentState.load(std::memory_order_relaxed)->faults;
+}
+
+[[gnu::noinline]] uint8_t *mappedPointerFull(orr_Pkt *pkt)
 {
    return requireState("orr_PktFrameMappedPointerGet").frames.mappedPointer(pkt);
 }
 
-ORR_API uint32_t orr_PktFrameLenGet(const orr_Pkt *pkt)
+[[gnu::noinline]] uint32_t frameLenFull(const orr_Pkt *pkt)
 {
    return requireState("orr_PktFrameLenGet").frames.frameLen(pkt);
 }
 
-ORR_API uint32_t orr_PktFrameMappedLenGet(const orr_Pkt *pkt)
+[[gnu::noinline]] uint32_t mappedLenFull(const orr_Pkt *pkt)
 {
    return requireState("orr_PktFrameMappedLenGet").frames.mappedLen(pkt);
 }
 
-ORR_API uint16_t orr_PktVlanIDGet(const orr_Pkt *pkt)
+[[gnu::noinline]] uint16_t vlanIdFull(const orr_Pkt *pkt)
 {
    return requireState("orr_PktVlanIDGet").frames.vlanId(pkt);
+}
+
+[[gnu::noinline]] orr_Status headerFindFull(orr_Pkt *pkt, orr_PktLayer layer, uint32_t classMask, uint32_t instance,
+                                            orr_PktHeaderEntry **entry)
+{
+   return requireState("orr_PktHeaderFind").frames.headerFind(pkt, layer, classMask, instance, entry);
+}
+
+[[gnu::noinline]] orr_Status headerDataGetFull(orr_Pkt *pkt, orr_PktHeaderEntry *entry, uint8_t **data)
+{
+   return requireState("orr_PktHeaderDataGet").frames.headerDataGet(pkt, entry, data);
+}
+
+[[gnu::noinline]] void headerDataReleaseFull(orr_Pkt *pkt, orr_PktHeaderEntry *entry, uint8_t *data)
+{
+   requireState("orr_PktHeaderDataRelease").frames.headerDataRelease(pkt, entry, data);
+}
+
+}  // namespace
+
+ORR_API uint8_t *orr_PktFrameMappedPointerGet(orr_Pkt *pkt)
+{
+   if (const Frame *frame = liveFrame(pkt)) [[likely]] {
+      return frame->mapped;
+   }
+   return mappedPointerFull(pkt);
+}
+
+ORR_API uint32_t orr_PktFrameLenGet(const orr_Pkt *pkt)
+{
+   if (const Frame *frame = liveFrame(pkt)) [[likely]] {
+      return frame->length;
+   }
+   return frameLenFull(pkt);
+}
+
+ORR_API uint32_t orr_PktFrameMappedLenGet(const orr_Pkt *pkt)
+{
+   if (const Frame *frame = liveFrame(pkt)) [[likely]] {
+      return frame->mappedLen;
+   }
+   return mappedLenFull(pkt);
+}
+
+ORR_API uint16_t orr_PktVlanIDGet(const orr_Pkt *pkt)
+{
+   if (const Frame *frame = liveFrame(pkt)) [[likely]] {
+      return frame->vlanId;
+   }
+   return vlanIdFull(pkt);
 }
 
 ORR_API orr_Status orr_PktCopyBytesOut(const orr_Pkt *pkt, uint32_t offset, uint32_t length, void *dst)
@@ -518,17 +757,56 @@ ORR_API orr_Status orr_MA2VA(orr_MA addr, uint32_t length, void **va)
 ORR_API orr_Status orr_PktHeaderFind(orr_Pkt *pkt, orr_PktLayer layer, uint32_t classMask, uint32_t instance,
                                      orr_PktHeaderEntry **entry, uint32_t /*flags*/)
 {
-   return requireState("orr_PktHeaderFind").frames.headerFind(pkt, layer, classMask, instance, entry);
+   Frame *frame = liveFrame(pkt);
+   if (frame != nullptr && entry != nullptr && layer <= ORR_PKT_LAYER_4 &&
+       faultTable().countQuietly(swsec::host::faultPoint("orr_PktHeaderFind"))) [[likely]] {
+      if (instance != 1 || (frame->present & (1u << layer)) == 0 ||
+          (classMask & (ORR_PKT_HEADER_CLASS_L2 << layer)) == 0) {
+         return ORR_NOT_FOUND;
+      }
+      *entry = &frame->entries[layer];
+      return ORR_OK;
+   }
+   return headerFindFull(pkt, layer, classMask, instance, entry);
 }
 
 ORR_API orr_Status orr_PktHeaderDataGet(orr_Pkt *pkt, orr_PktHeaderEntry *entry, uint8_t **data)
 {
-   return requireState("orr_PktHeaderDataGet").frames.headerDataGet(pkt, entry, data);
+   Frame *frame = liveFrame(pkt);
+   if (frame != nullptr && data != nullptr) [[likely]] {
+      // Compared as addresses: an entry from elsewhere is not one of the frame's.
+      const auto offset = reinterpret_cast<uintptr_t>(entry) - reinterpret_cast<uintptr_t>(frame->entries.data());
+      const size_t layer = offset / sizeof(orr_PktHeaderEntry);
+      const uint32_t count = frame->mappingCount.load(std::memory_order_relaxed);
+      if (offset % sizeof(orr_PktHeaderEntry) == 0 && layer < frame->entries.size() &&
+          (frame->present & (1u << layer)) != 0 &&
+          uint32_t{entry->offset} + entry->length <= frame->mappedLen && count < swsec::host::kInlineMappings &&
+          faultTable().countQuietly(swsec::host::faultPoint("orr_PktHeaderDataGet"))) [[likely]] {
+         uint8_t *mapped = frame->mapped + entry->offset;
+         frame->mappings[count] = Frame::Mapping{entry, mapped, nullptr};
+         frame->mappingCount.store(count + 1, std::memory_order_relaxed);
+         *data = mapped;
+         return ORR_OK;
+      }
+   }
+   return headerDataGetFull(pkt, entry, data);
 }
 
 ORR_API void orr_PktHeaderDataRelease(orr_Pkt *pkt, orr_PktHeaderEntry *entry, uint8_t *data, uint32_t /*flags*/)
 {
-   requireState("orr_PktHeaderDataRelease").frames.headerDataRelease(pkt, entry, data);
+   Frame *frame = liveFrame(pkt);
+   if (frame != nullptr) [[likely]] {
+      const uint32_t count = frame->mappingCount.load(std::memory_order_relaxed);
+      // Given back newest first, as the frame loop does, with no copy to free.
+      if (count != 0 && count <= swsec::host::kInlineMappings) {
+         const Frame::Mapping &last = frame->mappings[count - 1];
+         if (last.entry == entry && last.data == data && last.copy == nullptr) [[likely]] {
+            frame->mappingCount.store(count - 1, std::memory_order_relaxed);
+            return;
+         }
+      }
+   }
+   headerDataReleaseFull(pkt, entry, data);
 }
 
 // The iterator: the list and the frame it stands on.

@@ -1,31 +1,39 @@
 // Frames and frame lists: what the host hands a filter, and the platform's
 // frame operations on them.
 //
-// A frame's bytes live in scatter-gather elements, each its own exact-size
-// allocation, plus a separate exact-size buffer for the mapped part, so
-// that AddressSanitizer catches a read past either. Machine addresses are
-// not virtual addresses: each element gets a base of its own in a made-up
-// machine address space, and orr_MA2VA maps a range only when it lies in
-// one live element.
+// A list keeps its frames in one array and their bytes in one arena: each
+// scatter-gather element and each frame's mapped part is its own buffer in
+// the arena, fenced by poisoned red zones, so that AddressSanitizer catches
+// a read past (or before) any of them as it would past an exact-size
+// allocation. A released frame's buffers are poisoned whole. Machine
+// addresses are not virtual addresses: a list takes a range of a made-up
+// machine address space, each element a 4 GiB slot of it, and orr_MA2VA
+// maps a range only when it lies in one element of a live frame.
 //
 // A list is handled by one thread at a time; different lists may be
-// handled by different threads at once. The machine address map and the
-// counters are shared and locked.
+// handled by different threads at once. The frame path (lookups, header
+// mappings, the iterator) touches only the list's own records and the
+// per-thread shards of the host's counters; the list registry is locked
+// only when a list is made or given back.
 #pragma once
-
-#include "host/sharded_counter.h"
 
 #include "host/faults.h"
 #include "host/header_lookup.h"
 #include "host/host.h"
+#include "host/sharded_counter.h"
 #include "host/violations.h"
 
 #include <atomic>
 #include <map>
 #include <memory>
+#include <optional>
 #include <shared_mutex>
-#include <string>
+#include <span>
 #include <vector>
+
+// The records behind the platform's frame types.
+struct orr_Pkt {};
+struct orr_PktList {};
 
 namespace swsec::host {
 
@@ -58,27 +66,29 @@ public:
    uint64_t outstandingMappings() const override;
    uint64_t releases() const override;
 
-   // Used by lists and frames.
-   void addElement(orr_MA base, uint8_t *data, uint32_t length);
-   void removeElement(orr_MA base);
-   Violations &violations() { return violations_; }
-
 private:
-   Frame &checked(const orr_Pkt *pkt, const char *op);
+   friend class List;
+
+   // What one frame is made of, whichever way the caller described it.
+   struct FrameInput {
+      std::span<const uint8_t> bytes;
+      uint16_t vlanId = 0;
+      bool untag = false;
+      std::span<const uint32_t> split;
+      std::optional<uint32_t> mappedLen;
+   };
+   std::unique_ptr<FrameList> build(std::span<const FrameInput> inputs, uint32_t minMappedLen);
+   void forget(const List &list);
 
    Violations &violations_;
    FaultTable &faults_;
 
-   ShardedCounter outstandingMappings_;
-   std::atomic<uint64_t> releases_{0};
+   ShardedCounter releases_;
    std::atomic<orr_MA> nextBase_{0x10000000000ull};
 
-   struct Element {
-      uint8_t *data = nullptr;
-      uint32_t length = 0;
-   };
-   mutable std::shared_mutex elementsMutex_;
-   std::map<orr_MA, Element> elements_;   // by base machine address
+   // Live lists by the first machine address of their range.
+   mutable std::shared_mutex listsMutex_;
+   std::map<orr_MA, List *> lists_;
 };
 
 }  // namespace swsec::host

@@ -13,7 +13,7 @@ HashTables::HashTables(Violations &violations, FaultTable &faults, HeapRegistry 
 
 Hash_Table *HashTables::allocate(orr_HeapID heap, uint32_t numBuckets)
 {
-   if (faults_.hit("Hash_Alloc")) {
+   if (faults_.hit(faultPoint("Hash_Alloc"))) {
       return nullptr;
    }
    if (!std::has_single_bit(numBuckets)) {

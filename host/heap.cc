@@ -82,7 +82,7 @@ HeapSite &HeapRegistry::siteFor(const void *callSite)
 
 orr_Status HeapRegistry::create(const orr_HeapProps *props, orr_HeapID *heap)
 {
-   if (auto status = faults_.hit("orr_HeapCreate")) {
+   if (auto status = faults_.hit(faultPoint("orr_HeapCreate"))) {
       return *status;
    }
    if (props == nullptr || heap == nullptr) {
@@ -191,7 +191,7 @@ void HeapRegistry::releaseLocked(Record &heap, std::unordered_map<void *, Block>
 
 void *HeapRegistry::allocate(orr_HeapID heap, uint32_t size, const void *callSite)
 {
-   if (faults_.hit("orr_HeapAllocWithRA")) {
+   if (faults_.hit(faultPoint("orr_HeapAllocWithRA"))) {
       return nullptr;
    }
    std::string problem;

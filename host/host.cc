@@ -15,15 +15,13 @@ std::atomic<Host *> currentHost{nullptr};
 
 }  // namespace
 
-Host::State &detail::requireState(const char *operation)
+std::atomic<Host::State *> detail::currentState{nullptr};
+
+void detail::noHost(const char *operation)
 {
-   Host *host = currentHost.load(std::memory_order_acquire);
-   if (host == nullptr) {
-      std::fprintf(stderr, "swsec host: %s called with no Host alive\n", operation);
-      std::fflush(stderr);
-      std::abort();
-   }
-   return host->state();
+   std::fprintf(stderr, "swsec host: %s called with no Host alive\n", operation);
+   std::fflush(stderr);
+   std::abort();
 }
 
 Host::Host() : state_(std::make_unique<State>())
@@ -32,6 +30,7 @@ Host::Host() : state_(std::make_unique<State>())
    if (!currentHost.compare_exchange_strong(expected, this, std::memory_order_acq_rel)) {
       throw std::logic_error("only one Host may exist at a time");
    }
+   detail::currentState.store(state_.get(), std::memory_order_release);
 }
 
 Host::~Host()
@@ -45,6 +44,7 @@ Host::~Host()
    }
    // The timer thread may still be about to call into the host.
    state_->timers.stop();
+   detail::currentState.store(nullptr, std::memory_order_release);
    currentHost.store(nullptr, std::memory_order_release);
 }
 

@@ -280,7 +280,7 @@ orr_ExportedFn Loader::resolveExport(std::string_view nameSpace, std::string_vie
 
 orr_Status Loader::registerModule(orr_ModuleID *moduleID, uint32_t revision)
 {
-   if (auto status = state_.faults.hit("orr_ModuleRegister")) {
+   if (auto status = state_.faults.hit(faultPoint("orr_ModuleRegister"))) {
       return *status;
    }
    if (moduleID == nullptr) {
@@ -306,7 +306,7 @@ orr_Status Loader::registerModule(orr_ModuleID *moduleID, uint32_t revision)
 
 orr_Status Loader::unregisterModule(orr_ModuleID moduleID)
 {
-   if (auto status = state_.faults.hit("orr_ModuleUnregister")) {
+   if (auto status = state_.faults.hit(faultPoint("orr_ModuleUnregister"))) {
       return *status;
    }
    std::lock_guard guard(mutex_);
@@ -319,7 +319,7 @@ orr_Status Loader::unregisterModule(orr_ModuleID moduleID)
 
 orr_Status Loader::moduleName(orr_ModuleID moduleID, char *buffer, uint32_t size)
 {
-   if (auto status = state_.faults.hit("orr_ModuleGetName")) {
+   if (auto status = state_.faults.hit(faultPoint("orr_ModuleGetName"))) {
       return *status;
    }
    if (buffer == nullptr || size == 0) {
@@ -338,7 +338,7 @@ orr_Status Loader::moduleName(orr_ModuleID moduleID, char *buffer, uint32_t size
 
 orr_Status Loader::setHeap(orr_ModuleID moduleID, orr_HeapID heap)
 {
-   if (auto status = state_.faults.hit("orr_ModuleSetHeapID")) {
+   if (auto status = state_.faults.hit(faultPoint("orr_ModuleSetHeapID"))) {
       return *status;
    }
    {
@@ -356,7 +356,7 @@ orr_Status Loader::setHeap(orr_ModuleID moduleID, orr_HeapID heap)
 
 orr_Status Loader::incUseCount(orr_ModuleID moduleID)
 {
-   if (auto status = state_.faults.hit("orr_ModuleIncUseCount")) {
+   if (auto status = state_.faults.hit(faultPoint("orr_ModuleIncUseCount"))) {
       return *status;
    }
    std::lock_guard guard(mutex_);

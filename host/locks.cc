@@ -124,7 +124,7 @@ LockRegistry::Spinlock *LockRegistry::findLock(orr_Spinlock lock) const
 orr_Status LockRegistry::createDomain(orr_ModuleID module, orr_HeapID heap, const orr_Name *name,
                                       orr_LockDomainID *domain)
 {
-   if (auto status = faults_.hit("orr_LockDomainCreate")) {
+   if (auto status = faults_.hit(faultPoint("orr_LockDomainCreate"))) {
       return *status;
    }
    if (name == nullptr || domain == nullptr) {
@@ -174,7 +174,7 @@ bool LockRegistry::domainExists(orr_LockDomainID domain) const
 
 orr_Status LockRegistry::createSpinlock(const orr_SpinlockProps *props, orr_Spinlock *lock)
 {
-   if (auto status = faults_.hit("orr_SpinlockCreate")) {
+   if (auto status = faults_.hit(faultPoint("orr_SpinlockCreate"))) {
       return *status;
    }
    if (props == nullptr || lock == nullptr ||

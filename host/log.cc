@@ -56,7 +56,7 @@ LogBook::Component *LogBook::find(orr_LogHandle log) const
 
 orr_Status LogBook::registerComponent(const orr_LogProps *props, orr_LogHandle *log)
 {
-   if (auto status = faults_.hit("orr_LogRegister")) {
+   if (auto status = faults_.hit(faultPoint("orr_LogRegister"))) {
       return *status;
    }
    if (props == nullptr || log == nullptr || props->extra != nullptr) {

@@ -361,6 +361,7 @@ NexoRecord NexoRegistry::render(const Nexo_RecordDef &def, const uint8_t *bytes)
 // ---------------------------------------------------------------- platform
 
 using swsec::host::detail::requireState;
+using swsec::host::faultPoint;
 
 namespace {
 
@@ -414,7 +415,7 @@ ORR_API orr_Status Nexo_ParamListGetUInt32(const Nexo_ParamList *list, uint32_t 
 
 ORR_API orr_Status Nexo_ParamListGetString(const Nexo_ParamList *list, uint32_t index, const char **text)
 {
-   if (auto status = requireState("Nexo_ParamListGetString").nexo.hit("Nexo_ParamListGetString")) {
+   if (auto status = requireState("Nexo_ParamListGetString").nexo.hit(faultPoint("Nexo_ParamListGetString"))) {
       return *status;
    }
    const Nexo_ParamList::Entry *entry = entryAt(list, index);
@@ -430,7 +431,7 @@ ORR_API orr_Status Nexo_ParamListGetString(const Nexo_ParamList *list, uint32_t 
 
 ORR_API orr_Status Nexo_ParamListUsedCount(const Nexo_ParamList *list, uint32_t *count)
 {
-   if (auto status = requireState("Nexo_ParamListUsedCount").nexo.hit("Nexo_ParamListUsedCount")) {
+   if (auto status = requireState("Nexo_ParamListUsedCount").nexo.hit(faultPoint("Nexo_ParamListUsedCount"))) {
       return *status;
    }
    if (list == nullptr || count == nullptr) {
@@ -442,7 +443,7 @@ ORR_API orr_Status Nexo_ParamListUsedCount(const Nexo_ParamList *list, uint32_t 
 
 ORR_API orr_Status Nexo_ParamListAddInt(Nexo_ParamList *list, int64_t value)
 {
-   if (auto status = requireState("Nexo_ParamListAddInt").nexo.hit("Nexo_ParamListAddInt")) {
+   if (auto status = requireState("Nexo_ParamListAddInt").nexo.hit(faultPoint("Nexo_ParamListAddInt"))) {
       return *status;
    }
    if (list == nullptr) {
@@ -457,7 +458,7 @@ ORR_API orr_Status Nexo_ParamListAddInt(Nexo_ParamList *list, int64_t value)
 
 ORR_API orr_Status Nexo_NULL_Get(const Nexo_NodeDef *, const Nexo_ParamList *, void *)
 {
-   if (auto status = requireState("Nexo_NULL_Get").nexo.hit("Nexo_NULL_Get")) {
+   if (auto status = requireState("Nexo_NULL_Get").nexo.hit(faultPoint("Nexo_NULL_Get"))) {
       return *status;
    }
    return ORR_OK;
@@ -465,7 +466,7 @@ ORR_API orr_Status Nexo_NULL_Get(const Nexo_NodeDef *, const Nexo_ParamList *, v
 
 ORR_API orr_Status Nexo_NULL_Set(const Nexo_NodeDef *, const Nexo_ParamList *, const Nexo_ParamList *)
 {
-   if (auto status = requireState("Nexo_NULL_Set").nexo.hit("Nexo_NULL_Set")) {
+   if (auto status = requireState("Nexo_NULL_Set").nexo.hit(faultPoint("Nexo_NULL_Set"))) {
       return *status;
    }
    return ORR_OK;

@@ -38,6 +38,7 @@ public:
    void remove();
 
    // Platform operations.
+   std::optional<orr_Status> hit(size_t point) { return faults_.hit(point); }
    std::optional<orr_Status> hit(std::string_view op) { return faults_.hit(op); }
 
    // Nexo

@@ -6,7 +6,7 @@
 
 ORR_API orr_Status Net_StrToMac(const char *text, uint8_t *mac)
 {
-   if (auto status = swsec::host::detail::requireState("Net_StrToMac").faults.hit("Net_StrToMac")) {
+   if (auto status = swsec::host::detail::requireState("Net_StrToMac").faults.hit(swsec::host::faultPoint("Net_StrToMac"))) {
       return *status;
    }
    if (text == nullptr || mac == nullptr) {

@@ -26,7 +26,7 @@ PlexRegistry::~PlexRegistry() = default;
 orr_Status PlexRegistry::registerClientPort(orr_PlexClientPortHandle *handle, uint32_t flags, const char *name,
                                             const orr_PlexClientPortOps *ops)
 {
-   if (auto status = faults_.hit("orr_PlexClientPortRegister")) {
+   if (auto status = faults_.hit(faultPoint("orr_PlexClientPortRegister"))) {
       return *status;
    }
    // No flag is defined: anything else is a caller that expects a behaviour
@@ -52,7 +52,7 @@ orr_Status PlexRegistry::registerClientPort(orr_PlexClientPortHandle *handle, ui
 
 orr_Status PlexRegistry::unregisterClientPort(orr_PlexClientPortHandle handle)
 {
-   if (auto status = faults_.hit("orr_PlexClientPortUnregister")) {
+   if (auto status = faults_.hit(faultPoint("orr_PlexClientPortUnregister"))) {
       return *status;
    }
    if (handle == nullptr) {

@@ -15,7 +15,7 @@ orr_Status PortsetListeners::registerListener(orr_Portset *portset, uint32_t por
                                               orr_PortsetMessageCB callback, void *priv,
                                               orr_PortsetMessageCBHandle *handle)
 {
-   if (auto status = faults_.hit("orr_PortsetRegisterMessageCB")) {
+   if (auto status = faults_.hit(faultPoint("orr_PortsetRegisterMessageCB"))) {
       return *status;
    }
    if (callback == nullptr || handle == nullptr) {

@@ -125,7 +125,7 @@ orr_Portset *PortsetService::portsetOfPort(uint32_t portID) const
 
 orr_Status PortsetService::acquireByPortID(uint32_t portID, uint32_t flags, orr_PortsetHandle *handle)
 {
-   if (auto status = faults_.hit("orr_PortsetAcquireByPortID")) {
+   if (auto status = faults_.hit(faultPoint("orr_PortsetAcquireByPortID"))) {
       return *status;
    }
    if (handle == nullptr || flags != ORR_PORTSET_ACQUIRE_SHARED) {
@@ -211,7 +211,7 @@ void PortsetService::unlockExclusive(orr_Portset *portset)
 orr_Status PortsetService::post(orr_Portset *portset, uint32_t portID, uint64_t msgClass,
                                 const orr_PortsetMessageHeader *message)
 {
-   if (auto status = faults_.hit("orr_PortsetPostMessage")) {
+   if (auto status = faults_.hit(faultPoint("orr_PortsetPostMessage"))) {
       return *status;
    }
    Record *record = checked(portset, "orr_PortsetPostMessage");

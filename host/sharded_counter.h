@@ -1,5 +1,7 @@
 // A counter that threads raise and lower at once without sharing a cache
-// line: each thread works on its own shard, and the value is the sum.
+// line or a locked instruction: a thread owns a shard while it lives and
+// adds to it with a plain load and store; the value is the sum. Threads
+// beyond the number of shards share the last one, with atomic adds.
 #pragma once
 
 #include <array>
@@ -9,19 +11,53 @@
 
 namespace swsec::host {
 
-// The calling thread's shard number. The host is loaded with the program,
-// so the initial-exec model is open to it: no TLS lookup call.
-size_t shardOfThisThread();
+inline constexpr size_t kCounterShards = 16;
+// The shard that threads without one of their own share.
+inline constexpr size_t kSharedShard = kCounterShards - 1;
+
+namespace detail {
+
+// The calling thread's shard plus one, 0 until it takes one. The host is
+// loaded with the program, so the initial-exec model is open to it: no TLS
+// lookup call.
+extern thread_local constinit __attribute__((tls_model("initial-exec"))) size_t threadShard;
+size_t takeShard();
+
+}  // namespace detail
+
+inline size_t shardOfThisThread()
+{
+   const size_t shard = detail::threadShard;
+   return shard != 0 ? shard - 1 : detail::takeShard();
+}
 
 class ShardedCounter {
 public:
-   static constexpr size_t kShards = 16;
-
    void add(int64_t delta)
    {
-      shards_[shardOfThisThread() % kShards].value.fetch_add(delta, std::memory_order_relaxed);
+      const size_t shard = shardOfThisThread();
+      std::atomic<int64_t> &value = shards_[shard].value;
+      if (shard != kSharedShard) [[likely]] {
+         // Only this thread writes this shard.
+         value.store(value.load(std::memory_order_relaxed) + delta, std::memory_order_relaxed);
+      } else {
+         value.fetch_add(delta, std::memory_order_relaxed);
+      }
    }
-   // Exact once the threads that changed it have stopped (tests read it then).
+   // Adds when the calling thread owns a shard already; false, with
+   // nothing added, when it must go through add().
+   bool tryAddToOwnShard(int64_t delta)
+   {
+      const size_t shard = detail::threadShard;
+      if (shard == 0 || shard - 1 == kSharedShard) [[unlikely]] {
+         return false;
+      }
+      std::atomic<int64_t> &value = shards_[shard - 1].value;
+      value.store(value.load(std::memory_order_relaxed) + delta, std::memory_order_relaxed);
+      return true;
+   }
+   // Exact once the threads that changed it have stopped or synchronised
+   // with the reader (tests read it then).
    int64_t value() const
    {
       int64_t sum = 0;
@@ -35,7 +71,7 @@ private:
    struct alignas(64) Shard {
       std::atomic<int64_t> value{0};
    };
-   std::array<Shard, kShards> shards_;
+   std::array<Shard, kCounterShards> shards_;
 };
 
 }  // namespace swsec::host

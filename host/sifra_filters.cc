@@ -298,7 +298,7 @@ SifraRegistry::Filter *SifraRegistry::lockedFilter(std::unique_lock<std::mutex> 
 
 orr_Status SifraRegistry::getName(orr_SifraFilterHandle handle, char *buffer, uint32_t size)
 {
-   if (auto status = faults_.hit("orr_SifraGetName")) {
+   if (auto status = faults_.hit(faultPoint("orr_SifraGetName"))) {
       return *status;
    }
    std::unique_lock<std::mutex> guard;
@@ -311,7 +311,7 @@ orr_Status SifraRegistry::getName(orr_SifraFilterHandle handle, char *buffer, ui
 
 orr_Status SifraRegistry::getFailurePolicy(orr_SifraFilterHandle handle, uint32_t *policy)
 {
-   if (auto status = faults_.hit("orr_SifraGetFailurePolicy")) {
+   if (auto status = faults_.hit(faultPoint("orr_SifraGetFailurePolicy"))) {
       return *status;
    }
    std::unique_lock<std::mutex> guard;
@@ -328,7 +328,7 @@ orr_Status SifraRegistry::getFailurePolicy(orr_SifraFilterHandle handle, uint32_
 
 orr_Status SifraRegistry::getEndPointType(orr_SifraFilterHandle handle, uint32_t *type)
 {
-   if (auto status = faults_.hit("orr_SifraGetEndPointType")) {
+   if (auto status = faults_.hit(faultPoint("orr_SifraGetEndPointType"))) {
       return *status;
    }
    std::unique_lock<std::mutex> guard;
@@ -345,7 +345,7 @@ orr_Status SifraRegistry::getEndPointType(orr_SifraFilterHandle handle, uint32_t
 
 orr_Status SifraRegistry::getVMUUID(orr_SifraFilterHandle handle, char *buffer, uint32_t size)
 {
-   if (auto status = faults_.hit("orr_SifraGetVMUUID")) {
+   if (auto status = faults_.hit(faultPoint("orr_SifraGetVMUUID"))) {
       return *status;
    }
    std::unique_lock<std::mutex> guard;
@@ -364,7 +364,7 @@ orr_Status SifraRegistry::getVMUUID(orr_SifraFilterHandle handle, char *buffer, 
 
 orr_Status SifraRegistry::getVnicIndex(orr_SifraFilterHandle handle, int32_t *index)
 {
-   if (auto status = faults_.hit("orr_SifraGetVnicIndex")) {
+   if (auto status = faults_.hit(faultPoint("orr_SifraGetVnicIndex"))) {
       return *status;
    }
    std::unique_lock<std::mutex> guard;
@@ -381,7 +381,7 @@ orr_Status SifraRegistry::getVnicIndex(orr_SifraFilterHandle handle, int32_t *in
 
 orr_Status SifraRegistry::getPortID(orr_SifraFilterHandle handle, uint32_t *portID)
 {
-   if (auto status = faults_.hit("orr_SifraGetPortID")) {
+   if (auto status = faults_.hit(faultPoint("orr_SifraGetPortID"))) {
       return *status;
    }
    std::unique_lock<std::mutex> guard;
@@ -398,7 +398,7 @@ orr_Status SifraRegistry::getPortID(orr_SifraFilterHandle handle, uint32_t *port
 
 orr_Status SifraRegistry::setMinPktMappedLen(orr_SifraFilterHandle handle, uint32_t length, uint32_t directions)
 {
-   if (auto status = faults_.hit("orr_SifraSetMinPktMappedLen")) {
+   if (auto status = faults_.hit(faultPoint("orr_SifraSetMinPktMappedLen"))) {
       return *status;
    }
    std::unique_lock<std::mutex> guard;
@@ -421,7 +421,7 @@ orr_Status SifraRegistry::setMinPktMappedLen(orr_SifraFilterHandle handle, uint3
 orr_Status SifraRegistry::sendFilterIoctlReply(orr_SifraFilterHandle handle, uint32_t requestId, const void *data,
                                                uint64_t length)
 {
-   if (auto status = faults_.hit("orr_SifraSendFilterIoctlReply")) {
+   if (auto status = faults_.hit(faultPoint("orr_SifraSendFilterIoctlReply"))) {
       return *status;
    }
    std::unique_lock<std::mutex> guard;

@@ -44,7 +44,7 @@ orr_Status SifraRegistry::registerFastPath(const char *name, uint32_t revision, 
                                            orr_ModuleID module, const orr_SifraFastPathOps *ops,
                                            orr_SifraAgentHandle agent, orr_SifraFastPath *fastPath)
 {
-   if (auto status = faults_.hit("orr_SifraRegisterFastPath")) {
+   if (auto status = faults_.hit(faultPoint("orr_SifraRegisterFastPath"))) {
       return *status;
    }
    if (name == nullptr || name[0] == '\0' || ops == nullptr || fastPath == nullptr) {
@@ -92,7 +92,7 @@ void SifraRegistry::unregisterFastPath(orr_SifraFastPath fastPath)
 orr_Status SifraRegistry::registerProperty(orr_SifraPropertyHandle *handle, const char *name,
                                            const orr_SifraPropertyOps *ops)
 {
-   if (auto status = faults_.hit("orr_SifraPropertyRegister")) {
+   if (auto status = faults_.hit(faultPoint("orr_SifraPropertyRegister"))) {
       return *status;
    }
    if (handle == nullptr || name == nullptr || name[0] == '\0' || ops == nullptr) {

@@ -18,6 +18,8 @@
 #include "host/timers.h"
 #include "host/violations.h"
 
+#include <atomic>
+
 namespace swsec::host {
 
 // Members are destroyed in reverse order: the loader first, the heaps last,
@@ -42,9 +44,20 @@ struct Host::State {
 
 namespace detail {
 
-// The current host's state. A platform function called with no Host alive
-// has nothing to act on: it prints which one it was and aborts.
-Host::State &requireState(const char *operation);
+// The current host's state, set while a Host is alive. A platform function
+// called with no Host alive has nothing to act on: it prints which one it
+// was and aborts.
+extern std::atomic<Host::State *> currentState;
+[[noreturn]] void noHost(const char *operation);
+
+inline Host::State &requireState(const char *operation)
+{
+   Host::State *state = currentState.load(std::memory_order_acquire);
+   if (state == nullptr) [[unlikely]] {
+      noHost(operation);
+   }
+   return *state;
+}
 
 }  // namespace detail
 

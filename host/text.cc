@@ -90,7 +90,7 @@ ORR_API int orr_Sprintf(char *buffer, size_t size, const char *format, ...)
 ORR_API orr_Status orr_StringFormat(char *buffer, size_t size, uint32_t flags, const char *format, ...)
 {
    auto &state = swsec::host::detail::requireState("orr_StringFormat");
-   if (auto status = state.faults.hit("orr_StringFormat")) {
+   if (auto status = state.faults.hit(swsec::host::faultPoint("orr_StringFormat"))) {
       return *status;
    }
    if (buffer == nullptr || size == 0 || flags != 0 || format == nullptr) {

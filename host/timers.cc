@@ -52,7 +52,7 @@ std::string TimerService::describe(const Timer &timer)
 
 orr_Status TimerService::createQueue(const orr_TimerQueueProps *props, orr_TimerQueue *queue)
 {
-   if (auto status = faults_.hit("orr_TimerQueueCreate")) {
+   if (auto status = faults_.hit(faultPoint("orr_TimerQueueCreate"))) {
       return *status;
    }
    if (props == nullptr || queue == nullptr || props->flags != 0) {
@@ -132,7 +132,7 @@ orr_Status TimerService::insert(Timer timer, orr_Timer *handle)
 orr_Status TimerService::schedule(orr_TimerQueue queue, orr_TimerCallback callback, void *data, int64_t timeoutUs,
                                   int64_t periodUs, orr_LockDomainID domain, uint32_t lockRank, orr_Timer *timer)
 {
-   if (auto status = faults_.hit("orr_TimerSchedule")) {
+   if (auto status = faults_.hit(faultPoint("orr_TimerSchedule"))) {
       return *status;
    }
    if (callback == nullptr || timer == nullptr || timeoutUs < 0 ||
@@ -162,7 +162,7 @@ orr_Status TimerService::schedule(orr_TimerQueue queue, orr_TimerCallback callba
 orr_Status TimerService::add(orr_TimerCallback callback, void *data, int64_t timeoutUs, bool periodic,
                              orr_Timer *timer)
 {
-   if (auto status = faults_.hit("orr_TimerAdd")) {
+   if (auto status = faults_.hit(faultPoint("orr_TimerAdd"))) {
       return *status;
    }
    // A periodic timer of period 0 would fire forever without time moving.

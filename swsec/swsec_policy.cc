@@ -27,11 +27,6 @@ constexpr uint32_t kIpv4SrcOffset = 12;
 constexpr uint32_t kUdpSrcPortOffset = 0;
 constexpr uint32_t kUdpDstPortOffset = 2;
 
-bool SameMac(const uint8_t *a, const uint8_t *b)
-{
-   return __builtin_memcmp(a, b, 6) == 0;
-}
-
 /*
  * Counts an ARP rate limiting event in `direction`; true when the frame is
  * over its limit (and then counted as a drop).
@@ -132,7 +127,7 @@ orr_Status SwSecProcessPkt(SwSecContext *ctx, orr_Pkt *pkt, SwSecPktInfo *info,
    }
 
 bpdu_filter:
-   if ((features & SwSecFeatureBpduFilter) != 0 && (SameMac(eth, kStpMac) || SameMac(eth, kPvstMac))) {
+   if ((features & SwSecFeatureBpduFilter) != 0 && (SwSecSameMac(eth, kStpMac) || SwSecSameMac(eth, kPvstMac))) {
       *verdict = SwSecVerdictDrop;
       return ORR_OK;
    }

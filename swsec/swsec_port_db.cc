@@ -6,6 +6,7 @@
  * single VMI is found by comparing the list's first entry.
  */
 #include "swsec/swsec_port_db.h"
+#include "swsec/swsec_wire.h"
 
 #include "framework/sifra_generic.h"
 #include "framework/sifra_generic_filter.h"
@@ -25,8 +26,7 @@ int64_t SifraGenericGetExpirySec(uint32_t seconds)
 static bool SwSecVmiHasKey(const SwSecVmi *vmi, uint16_t vlanId, const uint8_t *mac,
                            uint32_t ipAddr)
 {
-   return vmi->vlanId == vlanId && orr_Memcmp(vmi->macAddr, mac, sizeof(vmi->macAddr)) == 0 &&
-          vmi->ipAddr == ipAddr;
+   return vmi->vlanId == vlanId && SwSecSameMac(vmi->macAddr, mac) && vmi->ipAddr == ipAddr;
 }
 
 static SwSecVmiKey SwSecVmiKeyOf(const SwSecVmi *vmi)
@@ -50,7 +50,7 @@ SwSecVmi *SwSecFindVmi(SwSecContext *ctx, uint16_t vlanId, const uint8_t *mac, u
 
    SwSecVmiKey key{};
    key.vlanId = vlanId;
-   orr_Memcpy(key.macAddr, mac, sizeof(key.macAddr));
+   __builtin_memcpy(key.macAddr, mac, sizeof(key.macAddr));
    key.ipAddr = ipAddr;
    orr_ListLinks *bucket = SwSecVmiBucket(ctx->portDbHash, &key);
    for (orr_ListLinks *links = bucket->next; links != bucket; links = links->next) {

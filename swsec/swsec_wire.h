@@ -35,3 +35,13 @@ static inline void SwSecStoreHost32(uint8_t *bytes, uint32_t value)
 {
    __builtin_memcpy(bytes, &value, sizeof(value));
 }
+
+/* Two MAC addresses compared as a u32 and a u16: no call on the frame path. */
+static inline bool SwSecSameMac(const uint8_t *a, const uint8_t *b)
+{
+   uint16_t aTail;
+   uint16_t bTail;
+   __builtin_memcpy(&aTail, a + 4, sizeof(aTail));
+   __builtin_memcpy(&bTail, b + 4, sizeof(bTail));
+   return SwSecLoadRaw32(a) == SwSecLoadRaw32(b) && aTail == bTail;
+}

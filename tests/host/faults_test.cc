@@ -3,6 +3,7 @@
 #include "host_unit.h"
 
 #include <functional>
+#include <thread>
 #include <vector>
 #include <stdexcept>
 
@@ -69,6 +70,33 @@ TEST_F(FaultTest, FailFromFailsEveryCallUntilCleared)
    orr_SpinlockDestroy(locks[0]);
    orr_SpinlockDestroy(locks[3]);
    orr_LockDomainDestroy(domain);
+}
+
+// Each thread counts in a shard of its own while it lives; threads beyond
+// the shards share one, and a shard given back keeps what was counted.
+TEST_F(FaultTest, CallsFromManyThreadsAtOnceAreCountedExactly)
+{
+   constexpr int kThreads = 24;
+   constexpr int kCallsEach = 2000;
+   for (int wave = 0; wave < 2; ++wave) {
+      std::vector<std::thread> threads;
+      for (int thread = 0; thread < kThreads; ++thread) {
+         threads.emplace_back([] {
+            uint8_t mac[6];
+            for (int call = 0; call < kCallsEach; ++call) {
+               (void)Net_StrToMac("02:00:00:00:00:01", mac);
+            }
+         });
+      }
+      for (auto &thread : threads) {
+         thread.join();
+      }
+   }
+   EXPECT_EQ(host.faults().calls("Net_StrToMac"), 2u * kThreads * kCallsEach);
+   host.faults().failOnce("Net_StrToMac", ORR_FAILURE, 2);
+   uint8_t mac[6];
+   EXPECT_EQ(Net_StrToMac("02:00:00:00:00:01", mac), ORR_OK);
+   EXPECT_EQ(Net_StrToMac("02:00:00:00:00:01", mac), ORR_FAILURE) << "rules count on from the exact total";
 }
 
 TEST_F(FaultTest, RulesForUnknownOperationsAreRefused)

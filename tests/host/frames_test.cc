@@ -130,6 +130,25 @@ TEST_F(FramesTest, UntaggingMovesTheVlanIdIntoTheMetadata)
    EXPECT_EQ(orr_PktFrameLenGet(pkt), tagged.size());
 }
 
+TEST_F(FramesTest, ViewsAreCopiedUntaggedAndMappedWhole)
+{
+   Bytes tagged = sampleUdp(uint16_t{42});
+   const Bytes plain = sampleUdp();
+   const host::FrameView views[] = {{.bytes = tagged, .untag = true}, {.bytes = plain, .vlanId = 5}};
+   list = host.frames().makeList(std::span<const host::FrameView>(views), 66);
+   std::fill(tagged.begin(), tagged.end(), uint8_t{0});   // the host kept its own copy
+   orr_Pkt *first = list->frame(0);
+   orr_Pkt *second = list->frame(1);
+   EXPECT_EQ(orr_PktVlanIDGet(first), 42);
+   EXPECT_EQ(orr_PktVlanIDGet(second), 5);
+   for (orr_Pkt *pkt : {first, second}) {
+      ASSERT_EQ(orr_PktFrameLenGet(pkt), plain.size());
+      EXPECT_EQ(orr_PktFrameMappedLenGet(pkt), plain.size()) << "one element, mapped whole";
+      EXPECT_EQ(0, std::memcmp(orr_PktFrameMappedPointerGet(pkt), plain.data(), plain.size()));
+   }
+   EXPECT_THAT(list->kept(), ElementsAre(0u, 1u));
+}
+
 // ---- copy-out and machine addresses
 
 TEST_F(FramesTest, CopyBytesOutIsBoundedByTheFrame)
@@ -271,6 +290,34 @@ TEST_F(FramesTest, HeaderDataComesFromMappedPartElementOrCopy)
    EXPECT_EQ(host.frames().outstandingMappings(), 0u);
 }
 
+TEST_F(FramesTest, MappingsMayBeGivenBackInAnyOrder)
+{
+   orr_Pkt *pkt = single({.bytes = sampleUdp()});
+   orr_PktHeaderEntry *entries[3] = {};
+   uint8_t *data[3] = {};
+   const uint32_t classes[] = {ORR_PKT_HEADER_CLASS_L2, ORR_PKT_HEADER_CLASS_L3, ORR_PKT_HEADER_CLASS_L4};
+   for (uint32_t layer = 0; layer < 3; ++layer) {
+      ASSERT_EQ(orr_PktHeaderFind(pkt, static_cast<orr_PktLayer>(layer), classes[layer], 1, &entries[layer], 0),
+                ORR_OK);
+      ASSERT_EQ(orr_PktHeaderDataGet(pkt, entries[layer], &data[layer]), ORR_OK);
+   }
+   // Two more of layer 2: beyond what a frame tracks without allocating.
+   uint8_t *extra[2] = {};
+   for (auto &mapping : extra) {
+      ASSERT_EQ(orr_PktHeaderDataGet(pkt, entries[0], &mapping), ORR_OK);
+   }
+   EXPECT_EQ(host.frames().outstandingMappings(), 5u);
+   orr_PktHeaderDataRelease(pkt, entries[0], data[0], 0);   // the oldest first
+   orr_PktHeaderDataRelease(pkt, entries[2], data[2], 0);
+   orr_PktHeaderDataRelease(pkt, entries[0], extra[1], 0);
+   EXPECT_EQ(host.frames().outstandingMappings(), 2u);
+   orr_PktHeaderDataRelease(pkt, entries[1], data[1], 0);
+   orr_PktHeaderDataRelease(pkt, entries[0], extra[0], 0);
+   EXPECT_EQ(host.frames().outstandingMappings(), 0u);
+   orr_PktHeaderEntry foreign = *entries[0];
+   EXPECT_EQ(orr_PktHeaderDataGet(pkt, &foreign, &data[0]), ORR_BAD_PARAM) << "not one of the frame's entries";
+}
+
 // ---- lists, removal and release
 
 TEST_F(FramesTest, IteratorRemovalAndReleaseAccounting)
@@ -341,6 +388,47 @@ TEST_F(FramesDeathTest, MisusedFramesAbortWithAMessage)
    EXPECT_DEATH(releaseTwice(*host.frames().makeList({{.bytes = Bytes(60, 0)}})), "released twice");
    EXPECT_DEATH(releaseUnknownMapping(single({.bytes = sampleUdp()})), "is not a mapping of header");
 }
+
+#if defined(__SANITIZE_ADDRESS__)
+#define SWSEC_TEST_ASAN 1
+#elif defined(__has_feature)
+#if __has_feature(address_sanitizer)
+#define SWSEC_TEST_ASAN 1
+#endif
+#endif
+
+#ifdef SWSEC_TEST_ASAN
+uint8_t readAt(const uint8_t *base, std::ptrdiff_t offset)
+{
+   return *static_cast<const volatile uint8_t *>(base + offset);
+}
+
+void readReleasedFrame(host::FrameList &frames)
+{
+   orr_Pkt *pkt = takeOut(frames);
+   const uint8_t *mapped = orr_PktFrameMappedPointerGet(pkt);
+   orr_PktRelease(pkt);
+   (void)readAt(mapped, 0);
+}
+
+// The frames of a list share one arena; each buffer in it is fenced as
+// tightly as an allocation of its own.
+TEST_F(FramesDeathTest, ReadsOutsideAFramesBuffersAreCaught)
+{
+   GTEST_FLAG_SET(death_test_style, "threadsafe");
+   orr_Pkt *pkt = single({.bytes = sampleUdp(), .split = {14, 17}});
+   const uint8_t *mapped = orr_PktFrameMappedPointerGet(pkt);
+   void *element = nullptr;
+   ASSERT_EQ(orr_MA2VA(orr_PktSgElemGet(pkt, 1)->addr, 17, &element), ORR_OK);
+   const auto *second = static_cast<const uint8_t *>(element);
+   (void)readAt(mapped, 13);
+   (void)readAt(second, 16);
+   EXPECT_DEATH(readAt(mapped, 14), "container-overflow|use-after-poison|heap-buffer-overflow");
+   EXPECT_DEATH(readAt(second, 17), "container-overflow|use-after-poison|heap-buffer-overflow");
+   EXPECT_DEATH(readAt(second, -1), "container-overflow|use-after-poison|heap-buffer-overflow");
+   EXPECT_DEATH(readReleasedFrame(*host.frames().makeList({{.bytes = sampleUdp()}})), "use-after-poison");
+}
+#endif
 
 }  // namespace
 }  // namespace swsec::testing

@@ -1,6 +1,6 @@
 #include "module_port.h"
 
-#include "security_config.h"
+#include "support/security_config.h"
 
 #include <cstring>
 #include <stdexcept>
@@ -30,18 +30,18 @@ ModulePort::ModulePort(host::Host &host, uint32_t portId, const std::vector<Bind
    }
    // Every feature on an untrusted port; no rate limits, so that repeated
    // runs over the same frames judge them the same way.
-   fuzz::PortConfig config = fuzz::enforcingConfig();
+   testing::PortConfig config = testing::enforcingConfig();
    config.arpRateLimit = 0;
    config.errRateLimit = 0;
    config.errRateLimitPeriod = 0;
    config.portDbSize = 32;
    for (const auto &binding : bindings) {
-      fuzz::StaticBinding entry;
+      testing::StaticBinding entry;
       entry.mac = binding.mac.bytes;
       entry.ip = binding.ip.bytes;
       config.statics.push_back(entry);
    }
-   if (host.sifra().writeProperty(kSecurityProperty, id_, fuzz::configBytes(config)) != ORR_OK) {
+   if (host.sifra().writeProperty(kSecurityProperty, id_, testing::configBytes(config)) != ORR_OK) {
       (void)host.sifra().destroyFilterAsHypervisor(id_);
       throw std::runtime_error("security property write refused");
    }

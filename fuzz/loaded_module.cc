@@ -1,6 +1,6 @@
 #include "loaded_module.h"
 
-#include "security_config.h"
+#include "tests/support/security_config.h"
 
 #include <cstdio>
 #include <cstdlib>
@@ -17,7 +17,7 @@ constexpr uint32_t kLearningPort = 8;
    std::abort();
 }
 
-host::FilterId createPort(host::Host &host, uint32_t portId, const PortConfig &config)
+host::FilterId createPort(host::Host &host, uint32_t portId, const testing::PortConfig &config)
 {
    host::FilterConfig filterConfig;
    filterConfig.name = "vm-" + std::to_string(portId) + ".eth0";
@@ -25,7 +25,7 @@ host::FilterId createPort(host::Host &host, uint32_t portId, const PortConfig &c
    if (host.sifra().createFilter(kAgent, portId, filterConfig, &id) != ORR_OK) {
       fail("createFilter");
    }
-   if (host.sifra().writeProperty(kSecurityProperty, id, configBytes(config)) != ORR_OK) {
+   if (host.sifra().writeProperty(kSecurityProperty, id, testing::configBytes(config)) != ORR_OK) {
       fail("security property write");
    }
    return id;
@@ -41,9 +41,9 @@ LoadedModule *make()
    module->host.portsets().addPort("vs0", kEnforcingPort);
    module->host.portsets().addPort("vs0", kLearningPort);
    // The VM of the test captures, bound statically so that source checks pass for it.
-   const StaticBinding vm{.vlanId = 0, .mac = {0x02, 0x00, 0x5e, 0xc0, 0x00, 0x01}, .ip = {192, 0, 2, 101}};
-   module->enforcing = createPort(module->host, kEnforcingPort, enforcingConfig({vm}));
-   module->learning = createPort(module->host, kLearningPort, learningConfig());
+   const testing::StaticBinding vm{.vlanId = 0, .mac = {0x02, 0x00, 0x5e, 0xc0, 0x00, 0x01}, .ip = {192, 0, 2, 101}};
+   module->enforcing = createPort(module->host, kEnforcingPort, testing::enforcingConfig({vm}));
+   module->learning = createPort(module->host, kLearningPort, testing::learningConfig());
    module->forgetRecords();
    return module;
 }

@@ -5,9 +5,14 @@
 
 #include "host/state.h"
 
+#include <gmock/gmock.h>
+
 #include <cstring>
 #include <string>
 #include <vector>
+
+using ::testing::ElementsAre;
+using ::testing::HasSubstr;
 
 namespace swsec::testing {
 namespace {
@@ -190,9 +195,7 @@ TEST_F(NexoHostTest, a_text_field_without_its_terminator_is_a_violation)
    host::NexoRecord record;
    ASSERT_EQ(host.nexo().get("/broken", &record), ORR_OK);
    EXPECT_EQ(record.value("text"), "xxxxxxxx");
-   const auto violations = takeViolations();
-   ASSERT_EQ(violations.size(), 1u);
-   EXPECT_NE(violations[0].find("'text' is not terminated"), std::string::npos);
+   EXPECT_THAT(takeViolations(), ElementsAre(HasSubstr("'text' is not terminated")));
 }
 
 TEST_F(NexoHostTest, a_filled_list_refuses_the_next_entry)

@@ -156,9 +156,7 @@ TEST_F(PortsetsTest, PostingNeedsTheLockAndCanFail)
 {
    const Message message("m", "x");
    EXPECT_EQ(orr_PortsetPostMessage(vswitch, 10, kClass, &message.header), ORR_FAILURE);
-   auto violations = takeViolations();
-   ASSERT_EQ(violations.size(), 1u);
-   EXPECT_THAT(violations[0], HasSubstr("without holding its lock"));
+   EXPECT_THAT(takeViolations(), ElementsAre(HasSubstr("without holding its lock")));
 
    orr_PortsetLockShared(vswitch);
    host.faults().failOnce("orr_PortsetPostMessage", ORR_NO_MEMORY);

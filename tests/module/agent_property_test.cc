@@ -4,7 +4,7 @@
 
 #include "framework/sifra_generic_agent.h"
 
-#include <ostream>
+#include <algorithm>
 #include <string>
 #include <thread>
 #include <vector>
@@ -42,11 +42,8 @@ protected:
 
    size_t agentLocks()
    {
-      size_t count = 0;
-      for (const auto &lock : host().locks().live()) {
-         count += lock.name == "sifg.fastpath" ? 1 : 0;
-      }
-      return count;
+      const auto locks = host().locks().live();
+      return static_cast<size_t>(std::ranges::count(locks, std::string("sifg.fastpath"), &host::LockInfo::name));
    }
 };
 
@@ -95,7 +92,7 @@ TEST_F(AgentPropertyTest, a_refused_name_stops_the_write_and_keeps_earlier_agent
    EXPECT_EQ(created(), Strings{"x"});
    EXPECT_TRUE(loggedWithPrefix(host(), "y: Failed to register agent " + statusText(ORR_LIMIT_EXCEEDED),
                                 ORR_LOG_ERROR));
-   EXPECT_EQ(countRecords(host(), "'z'"), 0u) << "z is never looked at";
+   EXPECT_EQ(host().log().count("'z'"), 0u) << "z is never looked at";
    EXPECT_EQ(host().faults().calls("orr_SifraRegisterFastPath") - before, 2u);
    EXPECT_EQ(agentLocks(), 2u) << "y's lock is destroyed again";
 }
@@ -108,11 +105,6 @@ struct TextCase {
    size_t alreadyThere;   // "already exists" messages
 };
 
-void PrintTo(const TextCase &c, std::ostream *os)
-{
-   *os << c.name;
-}
-
 class AgentTextTest : public AgentPropertyTest, public ::testing::WithParamInterface<TextCase> {};
 
 TEST_P(AgentTextTest, every_single_space_ends_a_name)
@@ -120,8 +112,8 @@ TEST_P(AgentTextTest, every_single_space_ends_a_name)
    const TextCase &c = GetParam();
    EXPECT_EQ(write(c.text), ORR_OK);
    EXPECT_EQ(created(), c.created);
-   EXPECT_EQ(countRecords(host(), "Registering new fastpath ''"), c.emptyNames);
-   EXPECT_EQ(countRecords(host(), "already exists. Not recreating"), c.alreadyThere);
+   EXPECT_EQ(host().log().count("Registering new fastpath ''"), c.emptyNames);
+   EXPECT_EQ(host().log().count("already exists. Not recreating"), c.alreadyThere);
 }
 
 INSTANTIATE_TEST_SUITE_P(
@@ -146,7 +138,7 @@ TEST_F(AgentPropertyTest, long_names_and_arguments_are_cut_to_fit_their_fields)
    // The same long name again finds the agent that was made from it.
    EXPECT_EQ(write(name150), ORR_OK);
    EXPECT_EQ(created().size(), 3u);
-   EXPECT_EQ(countRecords(host(), "already exists. Not recreating"), 1u);
+   EXPECT_EQ(host().log().count("already exists. Not recreating"), 1u);
 }
 
 TEST_F(AgentPropertyTest, no_memory_for_the_text_fails_the_write)

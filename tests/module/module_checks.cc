@@ -1,7 +1,7 @@
 #include "module_checks.h"
 
-#include <cctype>
 #include <cstdio>
+#include <regex>
 
 namespace swsec::testing {
 
@@ -10,11 +10,6 @@ std::string statusText(orr_Status status)
    char number[16];
    std::snprintf(number, sizeof(number), "%#x", static_cast<unsigned>(status));
    return std::string("(") + number + "): " + orr_StatusToString(status);
-}
-
-size_t countRecords(host::Host &host, std::string_view needle)
-{
-   return host.log().count(needle);
 }
 
 static std::string allTexts(host::Host &host)
@@ -27,41 +22,18 @@ static std::string allTexts(host::Host &host)
    return all;
 }
 
-// Length of "swsec: <function>:<line>: " at the start of `text`, or 0.
-static size_t prefixLength(const std::string &text, std::string_view function)
-{
-   auto isName = [](char c) { return std::isalnum(static_cast<unsigned char>(c)) || c == '_'; };
-   const std::string head = "swsec: ";
-   if (text.rfind(head, 0) != 0) {
-      return 0;
-   }
-   size_t at = head.size();
-   if (!function.empty()) {
-      at = text.compare(at, function.size(), function) == 0 ? at + function.size() : 0;
-   } else {
-      while (at < text.size() && isName(text[at])) {
-         at++;
-      }
-   }
-   const size_t line = at + 1;
-   if (at <= head.size() || text.size() <= line || text[at] != ':') {
-      return 0;
-   }
-   at = line;
-   while (at < text.size() && std::isdigit(static_cast<unsigned char>(text[at]))) {
-      at++;
-   }
-   return at > line && text.compare(at, 2, ": ") == 0 ? at + 2 : 0;
-}
-
 ::testing::AssertionResult loggedWithPrefix(host::Host &host, std::string_view message,
                                             uint32_t severity, std::string_view function)
 {
+   // "swsec: <function>:<line>: " starts the text; function names are plain identifiers.
+   const std::string name = function.empty() ? std::string("\\w+") : std::string(function);
+   const std::regex prefix("swsec: " + name + ":\\d+: ");
    const std::string tail = std::string(message) + "\n";
    for (const auto &record : host.log().records()) {
-      const size_t prefix = prefixLength(record.text, function);
-      if (record.hasComponent && !record.viaNoLevel && record.severity == severity && prefix != 0 &&
-          record.text.substr(prefix) == tail) {
+      std::smatch match;
+      if (record.hasComponent && !record.viaNoLevel && record.severity == severity &&
+          std::regex_search(record.text, match, prefix, std::regex_constants::match_continuous) &&
+          match.suffix().str() == tail) {
          return ::testing::AssertionSuccess();
       }
    }

@@ -13,9 +13,6 @@ namespace swsec::testing {
 // "(0xbad0007): Bad parameter", as the module prints a status.
 std::string statusText(orr_Status status);
 
-// Records whose text contains `needle`.
-size_t countRecords(host::Host &host, std::string_view needle);
-
 // A record written through the module's log component "swsec" at
 // `severity`: "swsec: <function>:<line>: <message>\n". An empty `function`
 // stands for any function name.

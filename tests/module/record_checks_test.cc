@@ -5,7 +5,6 @@
 
 #include <cstring>
 #include <functional>
-#include <ostream>
 #include <string>
 #include <vector>
 
@@ -20,11 +19,6 @@ struct BadRecordCase {
    orr_Status expected;
    std::function<orr_Status(const Ops &, void *)> call;
 };
-
-void PrintTo(const BadRecordCase &c, std::ostream *os)
-{
-   *os << c.name;
-}
 
 orr_SifraSlowPath outSlowPath;
 orr_SifraFilter outFilter;

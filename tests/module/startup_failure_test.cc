@@ -3,7 +3,6 @@
 #include "module_checks.h"
 #include "support/host_fixture.h"
 
-#include <ostream>
 #include <string>
 #include <vector>
 
@@ -23,11 +22,6 @@ struct StartupFault {
    bool withLog;          // the log existed when the step failed
    unsigned made;         // what the teardown had to withdraw
 };
-
-void PrintTo(const StartupFault &fault, std::ostream *os)
-{
-   *os << fault.name;
-}
 
 std::vector<StartupFault> startupFaults()
 {

@@ -38,9 +38,4 @@ void ModuleTest::SetUp()
    ASSERT_EQ(host().load(), 0) << "module failed to load";
 }
 
-void ModuleTest::TearDown()
-{
-   HostTest::TearDown();
-}
-
 }  // namespace swsec::testing

@@ -34,7 +34,6 @@ private:
 class ModuleTest : public HostTest {
 protected:
    void SetUp() override;
-   void TearDown() override;
 };
 
 }  // namespace swsec::testing

@@ -3,7 +3,6 @@
 
 #include <gtest/gtest.h>
 
-#include <ostream>
 #include <string>
 #include <vector>
 
@@ -28,11 +27,6 @@ struct SplitCase {
    size_t failAt;
    std::vector<std::string> handedOver;
 };
-
-void PrintTo(const SplitCase &c, std::ostream *os)
-{
-   *os << c.name;
-}
 
 class AgentNamesTest : public ::testing::TestWithParam<SplitCase> {};
 

@@ -5,7 +5,7 @@
 #include "swsec/swsec_dhcp_parse.h"
 
 #include <cstdio>
-#include <ostream>
+#include <functional>
 #include <string>
 
 namespace swsec::testing {
@@ -71,13 +71,7 @@ struct RefusalCase {
    std::string message;   // after "port-7: ", without the newline
 };
 
-void PrintTo(const RefusalCase &c, std::ostream *os)
-{
-   *os << c.name;
-}
-
-class DhcpParseRefusalTest : public DhcpParseTest,
-                             public ::testing::WithParamInterface<RefusalCase> {};
+class DhcpParseRefusalTest : public DhcpParseTest, public ::testing::WithParamInterface<RefusalCase> {};
 
 TEST_P(DhcpParseRefusalTest, malformed_messages_are_refused_with_their_message)
 {
@@ -90,116 +84,60 @@ TEST_P(DhcpParseRefusalTest, malformed_messages_are_refused_with_their_message)
    EXPECT_EQ(frame->info.pktCopy, nullptr);
 }
 
-Dhcp noEnd()
+// The request with one change.
+Dhcp requestWith(const std::function<void(Dhcp &)> &change)
 {
    Dhcp dhcp = request();
-   dhcp.end = false;
-   return dhcp;
-}
-
-Dhcp bare()
-{
-   Dhcp dhcp = request();
-   dhcp.type.reset();
-   dhcp.end = false;
-   return dhcp;
-}
-
-Dhcp withCode(uint8_t htype, uint8_t hlen)
-{
-   Dhcp dhcp = request();
-   dhcp.htype = htype;
-   dhcp.hlen = hlen;
+   change(dhcp);
    return dhcp;
 }
 
 Dhcp ackWithout51()
 {
-   Dhcp dhcp = request();
-   dhcp.op = 2;
-   dhcp.type = kDhcpAck;
-   return dhcp;
+   return requestWith([](Dhcp &d) { d.op = 2; d.type = kDhcpAck; });
 }
 
-Dhcp ackWithShortLease()
+// Options that run to the frame's end, the last one cut short: its length
+// byte says more than the frame holds, or the frame ends with its code.
+Bytes optionCutShort(Bytes tail)
 {
-   Dhcp dhcp = ackWithout51();
-   dhcp.options = {{51, {0, 0, 0x0e}}};
-   return dhcp;
-}
-
-Dhcp typeOfLengthZero()
-{
-   Dhcp dhcp = request();
-   dhcp.type.reset();
-   dhcp.options = {{53, {}}};
-   return dhcp;
-}
-
-Dhcp endWithoutType()
-{
-   Dhcp dhcp = request();
-   dhcp.type.reset();
-   return dhcp;
-}
-
-Dhcp optionCutByFrameEnd()
-{
-   Dhcp dhcp = noEnd();
-   dhcp.options = {{12, {'v', 'm'}}};
-   return dhcp;
-}
-
-// The last option's length byte says more than the frame holds.
-Bytes optionValuePastEnd()
-{
-   Bytes bytes = frameOf(noEnd());
-   bytes.push_back(12);
-   bytes.push_back(9);
-   bytes.push_back('v');
-   return withUdpLength(bytes, static_cast<uint16_t>(bytes.size() - 34));
-}
-
-// The frame ends with an option code.
-Bytes optionLenPastEnd()
-{
-   Bytes bytes = frameOf(noEnd());
-   bytes.push_back(12);
+   Bytes bytes = frameOf(requestWith([](Dhcp &d) { d.end = false; }));
+   bytes.insert(bytes.end(), tail.begin(), tail.end());
    return withUdpLength(bytes, static_cast<uint16_t>(bytes.size() - 34));
 }
 
 const std::string kNil = nullPointerText();
 const uint32_t kBareEnd = kDhcpOffset + 240;
+const Dhcp kBare = requestWith([](Dhcp &d) { d.type.reset(); d.end = false; });
 
 INSTANTIATE_TEST_SUITE_P(
    Messages, DhcpParseRefusalTest,
    ::testing::Values(
-      RefusalCase{"udp_length_247", withUdpLength(frameOf(bare()), 247), "Invalid frame len"},
-      RefusalCase{"udp_length_past_frame", withUdpLength(frameOf(request()), 300),
-                  "Invalid frame len"},
-      RefusalCase{"udp_length_248_without_options", frameOf(bare()),
-                  "Invalid options: 0 " + kNil},
-      RefusalCase{"end_option_without_type", frameOf(endWithoutType()),
+      RefusalCase{"udp_length_247", withUdpLength(frameOf(kBare), 247), "Invalid frame len"},
+      RefusalCase{"udp_length_past_frame", withUdpLength(frameOf(request()), 300), "Invalid frame len"},
+      RefusalCase{"udp_length_248_without_options", frameOf(kBare), "Invalid options: 0 " + kNil},
+      RefusalCase{"end_option_without_type", frameOf(requestWith([](Dhcp &d) { d.type.reset(); })),
                   "Invalid options: 1 " + kNil},
-      RefusalCase{"type_of_length_zero_is_no_type", frameOf(typeOfLengthZero()),
+      RefusalCase{"type_of_length_zero_is_no_type",
+                  frameOf(requestWith([](Dhcp &d) { d.type.reset(); d.options = {{53, {}}}; })),
                   "Invalid options: 1 " + kNil},
-      RefusalCase{"ack_without_lease_time", frameOf(ackWithout51()),
+      RefusalCase{"ack_without_lease_time", frameOf(ackWithout51()), "No lease time option in DHCPACK"},
+      RefusalCase{"ack_with_three_byte_lease_time",
+                  frameOf([] { Dhcp d = ackWithout51(); d.options = {{51, {0, 0, 0x0e}}}; return d; }()),
                   "No lease time option in DHCPACK"},
-      RefusalCase{"ack_with_three_byte_lease_time", frameOf(ackWithShortLease()),
-                  "No lease time option in DHCPACK"},
-      RefusalCase{"htype_ieee802", frameOf(withCode(6, 6)), "Invalid htype/hlen: [6 6]"},
-      RefusalCase{"hlen_16", frameOf(withCode(1, 16)), "Invalid htype/hlen: [1 16]"},
-      RefusalCase{"bad_cookie", frameOf([] { Dhcp d = request(); d.cookie = {1, 2, 3, 4}; return d; }()),
+      RefusalCase{"htype_ieee802", frameOf(requestWith([](Dhcp &d) { d.htype = 6; })), "Invalid htype/hlen: [6 6]"},
+      RefusalCase{"hlen_16", frameOf(requestWith([](Dhcp &d) { d.hlen = 16; })), "Invalid htype/hlen: [1 16]"},
+      RefusalCase{"bad_cookie", frameOf(requestWith([](Dhcp &d) { d.cookie = {1, 2, 3, 4}; })),
                   "Invalid cookie: " + cookieText({1, 2, 3, 4})},
-      RefusalCase{"option_value_past_frame", optionValuePastEnd(),
+      RefusalCase{"option_value_past_frame", optionCutShort({12, 9, 'v'}),
                   "Can't access DHCP option: " + std::to_string(kBareEnd + 5)},
-      RefusalCase{"option_length_past_frame", optionLenPastEnd(),
+      RefusalCase{"option_length_past_frame", optionCutShort({12}),
                   "Can't access DHCP option len: " + std::to_string(kBareEnd + 4)}),
    [](const auto &test) { return std::string(test.param.name); });
 
 TEST_F(DhcpParseTest, options_without_an_end_option_are_refused_with_the_type_found)
 {
-   auto frame = wrap(frameOf(optionCutByFrameEnd()));
+   auto frame = wrap(frameOf(requestWith([](Dhcp &d) { d.end = false; d.options = {{12, {'v', 'm'}}}; })));
    EXPECT_EQ(parse(*frame), -1);
    const auto logged = errors();
    ASSERT_EQ(logged.size(), 1u);

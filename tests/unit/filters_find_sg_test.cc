@@ -4,7 +4,6 @@
 #include "framework/sifra_generic_filter.h"
 
 #include <optional>
-#include <ostream>
 #include <string>
 #include <vector>
 
@@ -19,11 +18,6 @@ struct RangeCase {
    uint32_t end;
    std::optional<uint32_t> found;   // frame offset of the byte returned; none: null
 };
-
-void PrintTo(const RangeCase &c, std::ostream *os)
-{
-   *os << c.name;
-}
 
 class FindSGEntryTest : public HostTest, public ::testing::WithParamInterface<RangeCase> {};
 

@@ -1,8 +1,8 @@
 // A switch-security port made by hand, for unit tests of the module's
 // pieces: the module heap and log as start-up makes them, a filter record
 // with a name, and a context with an enabled, empty port database on a host
-// portset. Fixtures add what their piece needs (a lock domain, the port
-// filter map, configLock).
+// portset. Fixtures add what their piece needs (configLock in a lock
+// domain, the port filter map).
 #pragma once
 
 #include "support/host_fixture.h"
@@ -10,6 +10,7 @@
 #include "framework/sifra_generic.h"
 #include "framework/sifra_generic_filter.h"
 #include "framework/sifra_generic_list.h"
+#include "framework/sifra_generic_lock.h"
 #include "swsec/config_record.h"
 #include "swsec/swsec_context.h"
 
@@ -50,8 +51,27 @@ protected:
       ctx_.portId = kPortId;
    }
 
+   // The lock domain start-up makes, and the port's configLock in it.
+   void makeConfigLock()
+   {
+      ASSERT_EQ(orr_LockDomainCreate(orr_ModuleCurrentID, sifraGenericHeapID, &heapProps_.name,
+                                     &sifraGenericLockDomain),
+                ORR_OK);
+      ASSERT_EQ(SifraGenericCreateSpinlock("sifg.sec.config", ORR_SPINLOCK_RW, SifraGenericLockRank::PortConfig,
+                                           &ctx_.configLock),
+                ORR_OK);
+   }
+
    void releasePort()
    {
+      if (ctx_.configLock != nullptr) {
+         orr_SpinlockDestroy(ctx_.configLock);
+         ctx_.configLock = nullptr;
+      }
+      if (sifraGenericLockDomain != ORR_INVALID_LOCK_DOMAIN) {
+         orr_LockDomainDestroy(sifraGenericLockDomain);
+         sifraGenericLockDomain = ORR_INVALID_LOCK_DOMAIN;
+      }
       if (sifraGenericLogHandle != nullptr) {
          orr_LogUnregister(sifraGenericLogHandle);
          sifraGenericLogHandle = nullptr;
@@ -61,8 +81,6 @@ protected:
          sifraGenericHeapID = nullptr;
       }
    }
-
-   const orr_Name &moduleName() const { return heapProps_.name; }
 
    static SwSecVmi *vmiAt(orr_ListLinks *links)
    {

@@ -6,14 +6,6 @@
 namespace swsec::testing {
 namespace {
 
-constexpr uint32_t kOn = SwSecFeatureIpDiscovery;
-constexpr uint8_t kDhcp = SwSecDiscDhcpSnooping;
-constexpr uint8_t kStatic = SwSecDiscStatic;
-constexpr uint8_t kTofu = SwSecDiscTofu;
-constexpr uint8_t kArp = SwSecDiscApSnooping;
-
-using Entries = std::vector<std::pair<Key, uint8_t>>;
-
 class PortDbConfigTest : public PortDbTest {
 protected:
    bool mapped()
@@ -186,35 +178,26 @@ TEST_F(PortDbConfigTest, every_failing_step_leaves_the_old_configuration_in_forc
    const Entries before = entries();
    const auto next = config(kOn, 0, 8, {{1, 3, 3}, {1, 4, 4}, {1, 5, 5}});
 
-   struct Case {
-      const char *op;
-      orr_Status status;
-      const char *message;
-   };
-   const Case cases[] = {
-      {"orr_HeapAllocWithRA", ORR_NO_MEMORY, "port-7: Vmi pre alloc failed"},
-   };
-   for (const Case &c : cases) {
-      for (uint64_t nth = 1;; nth++) {
-         SCOPED_TRACE(::testing::Message() << c.op << " #" << nth);
-         notices();
-         const uint64_t blocks = host().heap().liveBlocks();
-         host().faults().failOnce(c.op, c.status, nth);
-         const uint64_t callsBefore = host().faults().calls(c.op);
-         const orr_Status status = configure(next);
-         const bool hit = host().faults().calls(c.op) - callsBefore >= nth;
-         host().faults().clear();
-         if (!hit) {
-            ASSERT_EQ(status, ORR_OK);
-            break;
-         }
-         EXPECT_EQ(status, c.status);
-         EXPECT_TRUE(logged(c.message));
-         EXPECT_EQ(entries(), before);
-         EXPECT_EQ(+ctx_.config.trusted, 1u);
-         EXPECT_TRUE(notices().empty());
-         EXPECT_EQ(host().heap().liveBlocks(), blocks);
+   // Each allocation of the new configuration in turn.
+   for (uint64_t nth = 1;; nth++) {
+      SCOPED_TRACE(::testing::Message() << "allocation #" << nth);
+      notices();
+      const uint64_t blocks = host().heap().liveBlocks();
+      const uint64_t callsBefore = host().faults().calls("orr_HeapAllocWithRA");
+      host().faults().failOnce("orr_HeapAllocWithRA", ORR_NO_MEMORY, nth);
+      const orr_Status status = configure(next);
+      const bool hit = host().faults().calls("orr_HeapAllocWithRA") - callsBefore >= nth;
+      host().faults().clear();
+      if (!hit) {
+         ASSERT_EQ(status, ORR_OK);
+         break;
       }
+      EXPECT_EQ(status, ORR_NO_MEMORY);
+      EXPECT_TRUE(logged("port-7: Vmi pre alloc failed"));
+      EXPECT_EQ(entries(), before);
+      EXPECT_EQ(+ctx_.config.trusted, 1u);
+      EXPECT_TRUE(notices().empty());
+      EXPECT_EQ(host().heap().liveBlocks(), blocks);
    }
    EXPECT_EQ(entries(), (Entries{{{1, 3, 3}, kStatic}, {{1, 4, 4}, kStatic}, {{1, 5, 5}, kStatic}}));
 }

@@ -4,7 +4,9 @@
 // database on a host portset, its configLock created.
 #pragma once
 
+#include "support/frames.h"
 #include "support/host_fixture.h"
+#include "support/security_config.h"
 #include "unit/hand_made_port.h"
 
 #include "framework/sifra_generic.h"
@@ -22,10 +24,15 @@
 #include <chrono>
 #include <cstring>
 #include <string>
-#include <tuple>
 #include <vector>
 
 namespace swsec::testing {
+
+constexpr uint32_t kOn = SwSecFeatureIpDiscovery;
+constexpr uint8_t kDhcp = SwSecDiscDhcpSnooping;
+constexpr uint8_t kStatic = SwSecDiscStatic;
+constexpr uint8_t kTofu = SwSecDiscTofu;
+constexpr uint8_t kArp = SwSecDiscApSnooping;
 
 // A VMI key in test terms: VLAN, last MAC byte, last address byte.
 struct Key {
@@ -34,24 +41,13 @@ struct Key {
    uint8_t ip = 1;
 
    std::array<uint8_t, 6> macBytes() const { return {0x02, 0, 0, 0, 0, mac}; }
-   uint32_t ipAddr() const
-   {
-      const uint8_t bytes[4] = {10, 0, 0, ip};
-      uint32_t value = 0;
-      std::memcpy(&value, bytes, sizeof(value));
-      return value;
-   }
-   SwSecVmiKey raw() const
-   {
-      SwSecVmiKey key{};
-      key.vlanId = vlan;
-      auto m = macBytes();
-      std::memcpy(key.macAddr, m.data(), 6);
-      key.ipAddr = ipAddr();
-      return key;
-   }
+   uint32_t ipAddr() const { return Ip4{{10, 0, 0, ip}}.raw(); }
+   SwSecVmiKey raw() const { return {.vlanId = vlan, .macAddr = {0x02, 0, 0, 0, 0, mac}, .ipAddr = ipAddr()}; }
    bool operator==(const Key &) const = default;
 };
+
+// Every VMI as (key, method), oldest first.
+using Entries = std::vector<std::pair<Key, uint8_t>>;
 
 // What a listener learns from one message.
 struct Notice {
@@ -62,22 +58,35 @@ struct Notice {
    bool operator==(const Notice &) const = default;
 };
 
+// A message's 40-byte payload, decoded; reserved bytes must be zero.
+inline Notice decodeNotice(const std::string &name, const uint8_t *p)
+{
+   Notice n{.name = name};
+   std::memcpy(&n.op, p, 4);
+   uint32_t count = 0;
+   std::memcpy(&count, p + 4, 4);
+   EXPECT_EQ(count, 1u);
+   std::memcpy(&n.key.vlan, p + 8, 2);
+   n.key.mac = p[15];
+   EXPECT_EQ(p[16], 1u);   // IPv4
+   n.key.ip = p[23];
+   n.authoritative = p[36];
+   for (size_t i : {17u, 18u, 19u, 24u, 25u, 26u, 27u, 28u, 29u, 30u, 31u, 32u, 33u, 34u, 35u, 37u, 38u, 39u}) {
+      EXPECT_EQ(p[i], 0u) << "payload byte " << i;
+   }
+   return n;
+}
+
 class PortDbTest : public HandMadePortTest {
 protected:
    void SetUp() override
    {
       HostTest::SetUp();
       makePort("portdb");
-      ASSERT_EQ(orr_LockDomainCreate(orr_ModuleCurrentID, sifraGenericHeapID, &moduleName(),
-                                     &sifraGenericLockDomain),
-                ORR_OK);
+      makeConfigLock();
       ASSERT_EQ(SwSecInitPortFilterMap(), ORR_OK);
       std::strcpy(agent_.name, SIFRAGENERIC_BUILTIN_AGENT_NAME);
       filter_.agent = &agent_;
-      ASSERT_EQ(SifraGenericCreateSpinlock("sifg.sec.config", ORR_SPINLOCK_RW,
-                                           SifraGenericLockRank::PortConfig, &ctx_.configLock),
-                ORR_OK);
-      baseBlocks_ = host().heap().liveBlocks();
    }
 
    void TearDown() override
@@ -95,10 +104,7 @@ protected:
       }
       SwSecPortDbDestroy(&ctx_);
       EXPECT_EQ(portFilterMapDb.numPfm, 0u);
-      orr_SpinlockDestroy(ctx_.configLock);
       SwSecCleanupPortFilterMap();
-      orr_LockDomainDestroy(sifraGenericLockDomain);
-      sifraGenericLockDomain = ORR_INVALID_LOCK_DOMAIN;
       releasePort();
       HostTest::TearDown();
    }
@@ -109,8 +115,7 @@ protected:
       auto *vmi = static_cast<SwSecVmi *>(SifraGenericAlloc(sizeof(SwSecVmi)));
       EXPECT_NE(vmi, nullptr);
       vmi->vlanId = key.vlan;
-      auto m = key.macBytes();
-      std::memcpy(vmi->macAddr, m.data(), 6);
+      std::memcpy(vmi->macAddr, key.macBytes().data(), 6);
       vmi->ipAddr = key.ipAddr();
       vmi->discoveryMethod = method;
       vmi->expiryTime = expiry;
@@ -148,18 +153,13 @@ protected:
       ctx_.numDhcpReqs++;
    }
 
-   SwSecVmi *find(Key key)
-   {
-      auto m = key.macBytes();
-      return SwSecFindVmi(&ctx_, key.vlan, m.data(), key.ipAddr());
-   }
+   SwSecVmi *find(Key key) { return SwSecFindVmi(&ctx_, key.vlan, key.macBytes().data(), key.ipAddr()); }
 
    static Key keyOf(const SwSecVmi *vmi) { return {vmi->vlanId, vmi->macAddr[5], static_cast<uint8_t>(vmi->ipAddr >> 24)}; }
 
-   // Every VMI as (key, method), oldest first.
-   std::vector<std::pair<Key, uint8_t>> entries()
+   Entries entries()
    {
-      std::vector<std::pair<Key, uint8_t>> out;
+      Entries out;
       for (orr_ListLinks *l = ctx_.portDbList.next; l != &ctx_.portDbList; l = l->next) {
          out.emplace_back(keyOf(vmiAt(l)), vmiAt(l)->discoveryMethod);
       }
@@ -183,7 +183,7 @@ protected:
       EXPECT_EQ(ctx_.portDbHash != nullptr, all >= 2);
    }
 
-   // The messages posted since the last call, decoded from their bytes.
+   // The messages posted since the last call.
    std::vector<Notice> notices()
    {
       std::vector<Notice> out;
@@ -191,26 +191,9 @@ protected:
          EXPECT_EQ(msg.msgClass, SWSEC_PORTSET_MSG_PORTDB);
          EXPECT_EQ(msg.portID, kPortId);
          EXPECT_EQ(msg.payload.size(), 40u);
-         if (msg.payload.size() != 40) {
-            continue;
+         if (msg.payload.size() == 40) {
+            out.push_back(decodeNotice(msg.name, msg.payload.data()));
          }
-         const uint8_t *p = msg.payload.data();
-         Notice n;
-         n.name = msg.name;
-         std::memcpy(&n.op, p, 4);
-         uint32_t count = 0;
-         std::memcpy(&count, p + 4, 4);
-         EXPECT_EQ(count, 1u);
-         std::memcpy(&n.key.vlan, p + 8, 2);
-         n.key.mac = p[15];
-         EXPECT_EQ(p[16], 1u);   // IPv4
-         n.key.ip = p[23];
-         n.authoritative = p[36];
-         // Reserved bytes stay zero.
-         for (size_t i : {17u, 18u, 19u, 24u, 25u, 26u, 27u, 28u, 29u, 30u, 31u, 32u, 33u, 34u, 35u, 37u, 38u, 39u}) {
-            EXPECT_EQ(p[i], 0u) << "payload byte " << i;
-         }
-         out.push_back(n);
       }
       host().portsets().clearPosted();
       return out;
@@ -223,19 +206,11 @@ protected:
    static std::vector<uint8_t> config(uint32_t features, uint8_t trusted, uint32_t portDbSize,
                                       const std::vector<Key> &statics = {})
    {
-      std::vector<uint8_t> bytes(sizeof(SwSecConfig) + 12 * statics.size());
-      SwSecConfig header{};
-      header.version = 1;
-      header.featuresEnabled = features;
-      header.trusted = trusted;
-      header.portDbSize = portDbSize;
-      header.numStatic = static_cast<uint32_t>(statics.size());
-      std::memcpy(bytes.data(), &header, sizeof(header));
-      for (size_t i = 0; i < statics.size(); i++) {
-         SwSecVmiKey key = statics[i].raw();
-         std::memcpy(bytes.data() + sizeof(SwSecConfig) + 12 * i, &key, 12);
+      PortConfig config{.features = features, .trusted = trusted, .portDbSize = portDbSize};
+      for (const Key &key : statics) {
+         config.statics.push_back({key.vlan, key.macBytes(), {10, 0, 0, key.ip}});
       }
-      return bytes;
+      return configBytes(config);
    }
 
    orr_Status configure(const std::vector<uint8_t> &bytes)
@@ -250,7 +225,6 @@ protected:
    }
 
    SifraGenericFastPathAgent agent_{};
-   uint64_t baseBlocks_ = 0;
 };
 
 }  // namespace swsec::testing

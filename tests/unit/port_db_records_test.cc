@@ -6,11 +6,6 @@
 namespace swsec::testing {
 namespace {
 
-constexpr uint8_t kDhcp = SwSecDiscDhcpSnooping;
-constexpr uint8_t kStatic = SwSecDiscStatic;
-constexpr uint8_t kTofu = SwSecDiscTofu;
-constexpr uint8_t kArp = SwSecDiscApSnooping;
-
 uint8_t authOf(uint8_t method)
 {
    return (method & SwSecDiscAuthoritativeMask) != 0 ? 1 : 0;
@@ -203,20 +198,20 @@ TEST_F(PortDbRecordsTest, ageing_keeps_an_entry_until_the_pass_after_its_expiry)
    notices();
 
    SwSecPortDbTimerCb(&ctx_);
-   EXPECT_EQ(entries(), (std::vector<std::pair<Key, uint8_t>>{
+   EXPECT_EQ(entries(), (Entries{
                            {{1, 1, 1}, kDhcp}, {{1, 2, 2}, kArp}, {{1, 4, 4}, kStatic}}));
    EXPECT_EQ(ctx_.numDhcpReqs, 1u);
    EXPECT_EQ(notices(), (std::vector<Notice>{removed({1, 3, 3}, 0)}));
 
    host().clock().advance(std::chrono::seconds(1));
    SwSecPortDbTimerCb(&ctx_);
-   EXPECT_EQ(entries(), (std::vector<std::pair<Key, uint8_t>>{{{1, 2, 2}, kArp}, {{1, 4, 4}, kStatic}}));
+   EXPECT_EQ(entries(), (Entries{{{1, 2, 2}, kArp}, {{1, 4, 4}, kStatic}}));
    EXPECT_EQ(ctx_.numDhcpReqs, 0u);
    EXPECT_TRUE(SifraGenericListIsEmpty(&ctx_.dhcpReqList));
 
    host().clock().advance(std::chrono::hours(24 * 365));
    SwSecPortDbTimerCb(&ctx_);
-   EXPECT_EQ(entries(), (std::vector<std::pair<Key, uint8_t>>{{{1, 4, 4}, kStatic}}));
+   EXPECT_EQ(entries(), (Entries{{{1, 4, 4}, kStatic}}));
    expectCountersAgree();
 }
 
@@ -231,7 +226,7 @@ TEST_F(PortDbRecordsTest, clear_all_leaves_exactly_the_static_entries)
 
    EXPECT_EQ(SwSecClearVmi(&ctx_, true, 0, nullptr), ORR_OK);
 
-   EXPECT_EQ(entries(), (std::vector<std::pair<Key, uint8_t>>{{{1, 2, 2}, kStatic}, {{1, 4, 4}, kStatic}}));
+   EXPECT_EQ(entries(), (Entries{{{1, 2, 2}, kStatic}, {{1, 4, 4}, kStatic}}));
    EXPECT_EQ(notices(), (std::vector<Notice>{removed({1, 1, 1}, 1), removed({1, 3, 3}, 0),
                                              removed({1, 5, 5}, 0)}));
    expectCountersAgree();
@@ -247,7 +242,7 @@ TEST_F(PortDbRecordsTest, clear_by_key_skips_absent_keys_and_keeps_static_ones)
 
    EXPECT_EQ(SwSecClearVmi(&ctx_, false, 3, keys), ORR_OK);
 
-   EXPECT_EQ(entries(), (std::vector<std::pair<Key, uint8_t>>{{{1, 1, 1}, kDhcp}, {{300, 0xab, 2}, kStatic}}));
+   EXPECT_EQ(entries(), (Entries{{{1, 1, 1}, kDhcp}, {{300, 0xab, 2}, kStatic}}));
    EXPECT_EQ(notices(), (std::vector<Notice>{removed({1, 3, 3}, 0)}));
    EXPECT_TRUE(logged("port-7: Trying to delete a static entry: 300 02:00:00:00:00:ab 10.0.0.2"))
       << ::testing::PrintToString(logTexts());

@@ -1,11 +1,13 @@
 // The checks of a security property access that come before the port.
 #include "support/host_fixture.h"
+#include "support/security_config.h"
 
 #include "framework/sifra_generic_filter.h"
 #include "swsec/swsec_security_property.h"
 
+#include <cstddef>
 #include <cstdio>
-#include <ostream>
+#include <cstring>
 #include <string>
 #include <vector>
 
@@ -17,10 +19,10 @@ using Bytes = std::vector<uint8_t>;
 // `length` bytes of a configuration record with `version` and `numStatic`.
 Bytes record(uint8_t version, uint32_t numStatic, size_t length)
 {
-   Bytes bytes(length, 0);
-   for (size_t i = 0; i < length && i < 14; i++) {
-      bytes[i] = i == 0 ? version : i >= 10 ? static_cast<uint8_t>(numStatic >> (8 * (i - 10))) : 0;
-   }
+   Bytes bytes = configBytes({});
+   bytes[0] = version;
+   std::memcpy(&bytes[offsetof(SwSecConfig, numStatic)], &numStatic, sizeof numStatic);
+   bytes.resize(length);
    return bytes;
 }
 
@@ -29,11 +31,6 @@ struct WriteCase {
    Bytes bytes;
    std::string message;
 };
-
-void PrintTo(const WriteCase &c, std::ostream *os)
-{
-   *os << c.name;
-}
 
 class SecurityPropertyWriteTest : public HostTest, public ::testing::WithParamInterface<WriteCase> {};
 

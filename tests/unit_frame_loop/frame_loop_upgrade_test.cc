@@ -2,12 +2,8 @@
 // judged by a test double of the per-packet policy (a link seam: this
 // program defines SwSecProcessPkt, so the module's policy is not linked).
 #include "support/frames.h"
-#include "support/host_fixture.h"
+#include "unit/hand_made_port.h"
 
-#include "framework/sifra_generic.h"
-#include "framework/sifra_generic_filter.h"
-#include "framework/sifra_generic_lock.h"
-#include "swsec/swsec_context.h"
 #include "swsec/swsec_filter.h"
 #include "swsec/swsec_pkt_info.h"
 #include "swsec/swsec_policy.h"
@@ -54,36 +50,21 @@ orr_Status SwSecProcessPkt(SwSecContext *, orr_Pkt *, SwSecPktInfo *info, uint32
 namespace swsec::testing {
 namespace {
 
-class FrameLoopTest : public HostTest {
+class FrameLoopTest : public HandMadePortTest {
 protected:
    void SetUp() override
    {
       HostTest::SetUp();
       policy = {};
-      orr_HeapProps props{};
-      orr_NameInitialize(&props.name, "frameloop");
-      props.initialSize = 4096;
-      props.maximumSize = 1u << 20;
-      ASSERT_EQ(orr_HeapCreate(&props, &sifraGenericHeapID), ORR_OK);
-      ASSERT_EQ(orr_LockDomainCreate(orr_ModuleCurrentID, sifraGenericHeapID, &props.name,
-                                     &sifraGenericLockDomain),
-                ORR_OK);
-      ASSERT_EQ(SifraGenericCreateSpinlock("sifg.sec.config", ORR_SPINLOCK_RW, SifraGenericLockRank::PortConfig,
-                                           &ctx_.configLock),
-                ORR_OK);
-      filter_.magic = SIFRAGENERIC_FILTER_MAGIC;
+      makePort("frameloop");
+      makeConfigLock();
       filter_.agentData = &ctx_;
-      ctx_.filter = &filter_;
       ctx_.config.featuresEnabled = SwSecFeatureBpduFilter;
    }
 
    void TearDown() override
    {
-      orr_SpinlockDestroy(ctx_.configLock);
-      orr_LockDomainDestroy(sifraGenericLockDomain);
-      sifraGenericLockDomain = ORR_INVALID_LOCK_DOMAIN;
-      orr_HeapDestroy(sifraGenericHeapID);
-      sifraGenericHeapID = nullptr;
+      releasePort();
       HostTest::TearDown();
    }
 
@@ -92,12 +73,8 @@ protected:
    {
       std::vector<host::FrameSpec> frameSpecs;
       for (uint8_t tag : tags) {
-         UdpFrame f;
-         f.src = Mac{{2, 0, 0, 0, 0, tag}};
-         f.dst = Mac{{2, 0, 0, 0, 0, 0xee}};
-         host::FrameSpec frameSpec;
-         frameSpec.bytes = udpFrame(f);
-         frameSpecs.push_back(frameSpec);
+         const UdpFrame frame{.src = Mac{{2, 0, 0, 0, 0, tag}}, .dst = Mac{{2, 0, 0, 0, 0, 0xee}}};
+         frameSpecs.push_back({.bytes = udpFrame(frame)});
       }
       auto list = host().frames().makeList(frameSpecs);
       EXPECT_EQ(SwSecProcessPackets(&filter_, list->list(), SwSecDirectionTx), ORR_OK);
@@ -106,8 +83,6 @@ protected:
       return list->kept();
    }
 
-   SifraGenericFilter filter_{};
-   SwSecContext ctx_{};
 };
 
 TEST_F(FrameLoopTest, a_frame_that_asks_for_the_write_lock_finishes_the_list_under_it)

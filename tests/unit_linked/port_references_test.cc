@@ -2,14 +2,12 @@
 // that a test can hold a port filter map reference the way an exported
 // query or a management handler does, for as long as it likes.
 #include "support/host_fixture.h"
+#include "support/security_config.h"
 
 #include "framework/sifra_generic_filter.h"
 #include "platform/orr_module.h"
-#include "swsec/config_record.h"
 #include "swsec/swsec_context.h"
 #include "swsec/swsec_port_filter_map.h"
-
-#include <cstring>
 
 extern "C" const orr_ModuleInfo orr_moduleInfo;
 
@@ -43,17 +41,9 @@ protected:
       HostTest::TearDown();
    }
 
-   // Writes a configuration header without static entries through the property.
    orr_Status configure(uint32_t features)
    {
-      SwSecConfig config = {};
-      config.version = SWSEC_CONFIG_VERSION;
-      config.featuresEnabled = features;
-      config.trusted = 1;
-      config.portDbSize = 32;
-      std::vector<uint8_t> bytes(sizeof(config));
-      std::memcpy(bytes.data(), &config, sizeof(config));
-      return host().sifra().writeProperty(kProperty, filter_, bytes);
+      return host().sifra().writeProperty(kProperty, filter_, configBytes({.features = features}));
    }
 
    host::FilterId filter_ = 0;

@@ -1,5 +1,7 @@
 // The bytes of a port configuration as the management plane writes them to
-// the security property: the fixed record, then the static entries.
+// the security property, and as the set-features ioctl carries them after
+// its type: the fixed record, then the static entries. Shared by the tests,
+// the fuzz targets and the benchmark.
 #pragma once
 
 #include "swsec/config_record.h"
@@ -10,7 +12,7 @@
 #include <cstring>
 #include <vector>
 
-namespace swsec::fuzz {
+namespace swsec::testing {
 
 struct StaticBinding {
    uint16_t vlanId = 0;
@@ -74,4 +76,4 @@ inline std::vector<uint8_t> configBytes(const PortConfig &config)
    return bytes;
 }
 
-}  // namespace swsec::fuzz
+}  // namespace swsec::testing

@@ -348,6 +348,9 @@ public:
    // Every message posted, in order (delivered or not).
    virtual std::vector<PostedMessage> posted() const = 0;
    virtual void clearPosted() = 0;
+   // The messages posted since the last call (or clearPosted), taken out:
+   // what a caller that follows posts as they come uses.
+   virtual std::vector<PostedMessage> takePosted() = 0;
    // Messages posted and not yet delivered (the posting threads still hold locks).
    virtual size_t pendingDeliveries() const = 0;
    // The next post on a thread holding a portset shared turns the hold

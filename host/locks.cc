@@ -10,7 +10,17 @@ struct orr_SpinlockOpaque {};
 
 namespace swsec::host {
 
+namespace {
+
+constexpr uint64_t kLiveLock = 0x6b63'6f6c'6e69'7073ull;
+constexpr uint64_t kDestroyedLock = ~kLiveLock;
+
+}  // namespace
+
 struct LockRegistry::Spinlock : orr_SpinlockOpaque {
+   // Tells a live lock from a destroyed one without the registry's lock, on
+   // every acquisition; destroyed records are kept, so the check is safe.
+   std::atomic<uint64_t> magic{kLiveLock};
    uint64_t seq = 0;
    std::string name;
    orr_SpinlockType type = ORR_SPINLOCK_PLAIN;
@@ -50,7 +60,9 @@ struct ThreadHolds {
    uint64_t generation = 0;
    std::vector<LockRegistry::Hold> holds;
 };
-thread_local ThreadHolds threadHoldsOfHost;
+// The host is loaded with the program: the initial-exec model is open to
+// it, so no TLS lookup call on every lock operation.
+thread_local __attribute__((tls_model("initial-exec"))) ThreadHolds threadHoldsOfHost;
 
 const char *modeText(LockRegistry::HoldKind kind)
 {
@@ -116,9 +128,11 @@ std::vector<LockRegistry::Hold> &LockRegistry::threadHolds()
 
 LockRegistry::Spinlock *LockRegistry::findLock(orr_Spinlock lock) const
 {
-   std::shared_lock guard(mutex_);
-   auto found = locks_.find(lock);
-   return found == locks_.end() ? nullptr : found->second.get();
+   auto *record = static_cast<Spinlock *>(lock);
+   if (lock == nullptr || record->magic.load(std::memory_order_relaxed) != kLiveLock) {
+      return nullptr;
+   }
+   return record;
 }
 
 orr_Status LockRegistry::createDomain(orr_ModuleID module, orr_HeapID heap, const orr_Name *name,
@@ -221,6 +235,8 @@ void LockRegistry::destroySpinlock(orr_Spinlock lock)
             --domain->second->liveLocks;
          }
          heaps_.detach(record.heap, &record);
+         record.magic.store(kDestroyedLock, std::memory_order_relaxed);
+         destroyedLocks_.push_back(std::move(found->second));
          locks_.erase(found);
       }
    }

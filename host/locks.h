@@ -114,6 +114,8 @@ private:
    orr_LockDomainID nextDomain_ = 0x100;
    std::map<orr_LockDomainID, std::unique_ptr<Domain>> domains_;
    std::map<const orr_SpinlockOpaque *, std::unique_ptr<Spinlock>> locks_;
+   // Destroyed locks' records, kept so that a stale handle is recognised.
+   std::vector<std::unique_ptr<Spinlock>> destroyedLocks_;
 
    std::mutex mutexTableMutex_;
    std::unordered_map<const orr_Mutex *, std::unique_ptr<MutexEntry>> mutexes_;

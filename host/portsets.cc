@@ -43,7 +43,7 @@ struct ThreadPortsets {
    std::deque<QueuedMessage> queue;
    bool delivering = false;
 };
-thread_local ThreadPortsets threadPortsetsOfHost;
+thread_local __attribute__((tls_model("initial-exec"))) ThreadPortsets threadPortsetsOfHost;
 
 // Payloads beyond this are taken for a corrupt header, not copied.
 constexpr uint64_t kMaxPayload = 1u << 20;
@@ -283,6 +283,14 @@ std::vector<PostedMessage> PortsetService::posted() const
 {
    std::lock_guard guard(mutex_);
    return posted_;
+}
+
+std::vector<PostedMessage> PortsetService::takePosted()
+{
+   std::vector<PostedMessage> taken;
+   std::lock_guard guard(mutex_);
+   taken.swap(posted_);
+   return taken;
 }
 
 void PortsetService::clearPosted()

@@ -62,6 +62,7 @@ public:
    orr_Portset *portset(std::string_view name) const override;
    uint64_t outstandingAcquisitions() const override;
    std::vector<PostedMessage> posted() const override;
+   std::vector<PostedMessage> takePosted() override;
    void clearPosted() override;
    size_t pendingDeliveries() const override;
    void upgradeHoldOnNextPost() override;

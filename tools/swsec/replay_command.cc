@@ -80,6 +80,10 @@ int runReplay(const ReplayCommandOptions &options)
       }
       run.untilSeconds = options.untilSeconds;
       run.batch = options.batch;
+      // JSON lists every frame; the verbose report only the dropped ones.
+      run.frameRecords = options.json      ? replay::FrameRecords::all
+                         : options.verbose ? replay::FrameRecords::dropped
+                                           : replay::FrameRecords::none;
       run.describeDrops = options.verbose || options.json;
       run.writePassed = options.writePassed;
       run.writeDropped = options.writeDropped;

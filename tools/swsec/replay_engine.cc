@@ -6,10 +6,13 @@
 #include "replay_capture.h"
 #include "replay_describe.h"
 #include "replay_error.h"
+#include "replay_frame_batch.h"
 #include "replay_pcap_writer.h"
 
 #include "host/host.h"
 
+#include <algorithm>
+#include <array>
 #include <chrono>
 #include <cstring>
 
@@ -30,6 +33,17 @@ constexpr std::chrono::microseconds kConfigLead = 500ms;
 // so that timers fire between frames as capture time passes.
 constexpr int64_t kListSpanNs = 1'000'000;
 constexpr size_t kPortDbMsgPayload = 40;
+// The list arena starts with room for a list of full-size untagged
+// Ethernet frames, up to 1 MiB (a list of 65536 frames grows it only if
+// its frames need it).
+constexpr size_t kTypicalFrameBytes = 1514;
+constexpr size_t kMaxInitialArenaBytes = size_t{1} << 20;
+// A pcap record of a minimum-size frame (16-byte record header, 60 bytes):
+// the file size over it bounds the frame count of ordinary captures, to
+// reserve every frame's record at once; past 4 Mi records (96 MiB) the
+// vector grows as it needs.
+constexpr uint64_t kSmallRecordBytes = 76;
+constexpr uint64_t kMaxReservedRecords = uint64_t{1} << 22;
 constexpr const char *kCounterFields[] = {"dhcpSnoopingDropCnt", "daiDropCnt",          "ipSrcGuardDropCnt",
                                           "txRateLimitDropCnt",  "rxRateLimitDropCnt", "txRateLimitErrEntryCnt"};
 
@@ -41,18 +55,11 @@ std::string withoutNewline(std::string text)
    return text;
 }
 
-// One direction list being gathered, with what the outputs need of its frames.
-struct PendingList {
-   uint8_t direction = kDirUnknown;
-   int64_t firstTimeNs = 0;
-   std::vector<host::FrameSpec> frameSpecs;
-   std::vector<size_t> verdictIndex;   // into ReplayResult::frames
-   std::vector<int64_t> timesNs;
-};
-
 class Run {
 public:
-   Run(const ReplayOptions &options, ReplayResult &result) : options_(options), result_(result)
+   Run(const ReplayOptions &options, ReplayResult &result)
+      : options_(options), result_(result),
+        list_(options.batch, std::min(size_t{options.batch} * kTypicalFrameBytes, kMaxInitialArenaBytes))
    {
       if (!options.writePassed.empty()) {
          passed_.emplace(options.writePassed);
@@ -60,9 +67,7 @@ public:
       if (!options.writeDropped.empty()) {
          dropped_.emplace(options.writeDropped);
       }
-      list_.frameSpecs.reserve(options.batch);
-      list_.verdictIndex.reserve(options.batch);
-      list_.timesNs.reserve(options.batch);
+      kept_.reserve(options.batch);
    }
 
    // A run cut short by bad input still takes the port down and unloads
@@ -87,6 +92,8 @@ private:
    uint8_t directionOf(const CaptureFrame &frame) const;
    void add(const CaptureFrame &frame, uint8_t direction);
    void flush();
+   void record(size_t frame, bool passed);
+   std::chrono::microseconds clockAt(int64_t timeNs) const;
    void advanceTo(std::chrono::microseconds target);
    void collectNotifications();
    void readPortState();
@@ -98,9 +105,12 @@ private:
    bool portMade_ = false;
    std::optional<PcapWriter> passed_;
    std::optional<PcapWriter> dropped_;
-   PendingList list_;
-   std::chrono::microseconds clockBase_{0};   // host time of the first frame
+   FrameBatch list_;
+   std::vector<uint8_t> kept_;                   // per frame of the list handed over
+   std::chrono::microseconds clockBase_{0};      // host time of the first frame
+   std::chrono::microseconds clockReached_{0};   // the host clock is at least here
    int64_t firstTimeNs_ = 0;
+   int64_t lastTimeNs_ = 0;
    uint64_t lastHandedOver_ = 0;
 };
 
@@ -142,6 +152,7 @@ void Run::startPort()
    }
    host_.clock().advance(kConfigLead);
    clockBase_ = host_.clock().now();
+   clockReached_ = clockBase_;
 }
 
 uint8_t Run::directionOf(const CaptureFrame &frame) const
@@ -161,77 +172,84 @@ uint8_t Run::directionOf(const CaptureFrame &frame) const
 
 void Run::add(const CaptureFrame &frame, uint8_t direction)
 {
-   if (!list_.frameSpecs.empty() &&
-       (direction != list_.direction || frame.timeNs - list_.firstTimeNs > kListSpanNs ||
-        list_.frameSpecs.size() >= options_.batch)) {
+   if (!list_.empty() && (direction != list_.direction() || frame.timeNs - list_.firstTimeNs() > kListSpanNs ||
+                          list_.size() >= options_.batch)) {
       flush();
    }
-   if (list_.frameSpecs.empty()) {
-      list_.direction = direction;
-      list_.firstTimeNs = frame.timeNs;
-   }
-   host::FrameSpec &frameSpec = list_.frameSpecs.emplace_back();
-   frameSpec.bytes.assign(frame.bytes.begin(), frame.bytes.end());
-   frameSpec.untag = true;
-   FrameVerdict &verdict = result_.frames.emplace_back();
-   verdict.index = frame.index;
-   verdict.time = static_cast<double>(frame.timeNs - firstTimeNs_) / 1e9;
-   verdict.direction = direction;
-   verdict.vlan = frameVlan(frame.bytes);
-   list_.verdictIndex.push_back(result_.frames.size() - 1);
-   list_.timesNs.push_back(frame.timeNs);
+   list_.add(frame.index, frame.timeNs, direction, frame.bytes);
+   lastTimeNs_ = frame.timeNs;
 }
 
+std::chrono::microseconds Run::clockAt(int64_t timeNs) const
+{
+   return clockBase_ +
+          std::chrono::duration_cast<std::chrono::microseconds>(std::chrono::nanoseconds(timeNs - firstTimeNs_));
+}
+
+// Collects the notifications posted since the last list was handed over,
+// after the timers due by `target` ran: both are seen after that list.
 void Run::advanceTo(std::chrono::microseconds target)
 {
-   const auto now = host_.clock().now();
-   if (target > now) {
-      host_.clock().advance(target - now);
+   // Lists that start within the same microsecond need no look at the clock.
+   if (target > clockReached_) {
+      const auto now = host_.clock().now();
+      if (target > now) {
+         host_.clock().advance(target - now);
+      }
+      clockReached_ = std::max(target, now);
    }
    collectNotifications();
 }
 
 void Run::flush()
 {
-   if (list_.frameSpecs.empty()) {
+   if (list_.empty()) {
       return;
    }
    // Capture time that goes backwards leaves the clock where it is.
-   advanceTo(clockBase_ + std::chrono::duration_cast<std::chrono::microseconds>(
-                             std::chrono::nanoseconds(list_.firstTimeNs - firstTimeNs_)));
-   const host::PacketsResult out = host_.sifra().processPackets(filter_, list_.direction, list_.frameSpecs);
-   std::vector<bool> kept(list_.frameSpecs.size(), false);
+   advanceTo(clockAt(list_.firstTimeNs()));
+   const host::PacketsResult out = host_.sifra().processPackets(filter_, list_.direction(), list_.views());
+   kept_.assign(list_.size(), 0);
    for (size_t index : out.kept) {
-      if (index < kept.size()) {
-         kept[index] = true;
+      if (index < kept_.size()) {
+         kept_[index] = 1;
       }
    }
-   for (size_t i = 0; i < list_.frameSpecs.size(); ++i) {
-      FrameVerdict &verdict = result_.frames[list_.verdictIndex[i]];
-      verdict.passed = kept[i];
-      ++result_.totals[verdict.direction][kept[i] ? 0 : 1];
-      if (!kept[i] && options_.describeDrops) {
-         verdict.description = describeFrame(list_.frameSpecs[i].bytes);
+   std::array<uint64_t, 2> &totals = result_.totals[list_.direction()];
+   const FrameRecords records = options_.frameRecords;
+   for (size_t i = 0; i < list_.size(); ++i) {
+      const bool passed = kept_[i] != 0;
+      ++totals[passed ? 0 : 1];
+      if (records == FrameRecords::all || (records == FrameRecords::dropped && !passed)) {
+         record(i, passed);
       }
-      std::optional<PcapWriter> &writer = kept[i] ? passed_ : dropped_;
+      std::optional<PcapWriter> &writer = passed ? passed_ : dropped_;
       if (writer) {
-         writer->write(list_.timesNs[i], list_.frameSpecs[i].bytes);
+         writer->write(list_.timeNs(i), list_.bytes(i));
       }
    }
-   lastHandedOver_ = result_.frames[list_.verdictIndex.back()].index;
-   collectNotifications();
-   list_.frameSpecs.clear();
-   list_.verdictIndex.clear();
-   list_.timesNs.clear();
+   lastHandedOver_ = list_.index(list_.size() - 1);
+   list_.clear();
+}
+
+void Run::record(size_t frame, bool passed)
+{
+   const std::span<const uint8_t> bytes = list_.bytes(frame);
+   FrameVerdict &verdict = result_.frames.emplace_back();
+   verdict.index = list_.index(frame);
+   verdict.timeNs = list_.timeNs(frame) - firstTimeNs_;
+   verdict.direction = list_.direction();
+   verdict.passed = passed;
+   verdict.vlan = frameVlan(bytes);
+   if (!passed && options_.describeDrops) {
+      verdict.description = static_cast<uint32_t>(result_.descriptions.size());
+      result_.descriptions.push_back(describeFrame(bytes));
+   }
 }
 
 void Run::collectNotifications()
 {
-   auto posted = host_.portsets().posted();
-   if (posted.empty()) {
-      return;
-   }
-   host_.portsets().clearPosted();
+   const auto posted = host_.portsets().takePosted();
    for (const auto &message : posted) {
       if (message.name.rfind("portdb.entry.", 0) != 0 || message.payload.size() < kPortDbMsgPayload) {
          continue;
@@ -294,6 +312,9 @@ void Run::execute()
 {
    host_.setViolationHandler([this](const std::string &v) { result_.violations.push_back(v); });
    CaptureReader reader(options_.capturePath);
+   if (options_.frameRecords == FrameRecords::all) {
+      result_.frames.reserve(std::min(reader.fileSize() / kSmallRecordBytes, kMaxReservedRecords));
+   }
    startPort();
 
    CaptureFrame frame;
@@ -310,7 +331,7 @@ void Run::execute()
    }
    flush();
    if (options_.untilSeconds > 0) {
-      const auto lastTime = result_.frames.empty() ? 0.0 : result_.frames.back().time;
+      const double lastTime = first ? 0.0 : static_cast<double>(lastTimeNs_ - firstTimeNs_) / 1e9;
       advanceTo(clockBase_ + std::chrono::duration_cast<std::chrono::microseconds>(
                                 std::chrono::duration<double>(lastTime + options_.untilSeconds)));
    }

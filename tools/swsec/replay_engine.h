@@ -12,9 +12,18 @@
 #include <optional>
 #include <stdexcept>
 #include <string>
+#include <string_view>
 #include <vector>
 
 namespace swsec::replay {
+
+// Which frames the result keeps a record of. Records cost memory and time
+// per frame, so a run keeps only what its outputs show.
+enum class FrameRecords : uint8_t {
+   none,      // totals only
+   dropped,   // the dropped frames (the verbose report)
+   all,       // every frame (JSON, callers that inspect verdicts)
+};
 
 struct ReplayOptions {
    std::string capturePath;
@@ -22,7 +31,8 @@ struct ReplayOptions {
    std::optional<PortSecurityConfig> config;      // none: the new port's defaults
    double untilSeconds = 0;                       // clock runs on after the last frame
    uint32_t batch = 32;                           // most frames in one list
-   bool describeDrops = false;                    // one-line description per dropped frame
+   FrameRecords frameRecords = FrameRecords::all;
+   bool describeDrops = false;                    // one-line description per recorded dropped frame
    std::string writePassed;                       // pcap of passed frames ("" none)
    std::string writeDropped;                      // pcap of dropped frames ("" none)
    std::string modulePath;                        // "" the built module
@@ -30,14 +40,21 @@ struct ReplayOptions {
    std::function<void(uint64_t frames, uint64_t bytesRead, uint64_t fileSize)> progress;
 };
 
+inline constexpr uint32_t kNoDescription = UINT32_MAX;
+
+// One frame's record: a plain struct, so that a million of them are one
+// allocation without a destructor to run.
 struct FrameVerdict {
    uint64_t index = 0;
-   double time = 0;          // seconds since the first frame
-   uint8_t direction = 0;    // kDirToVm or kDirFromVm
-   bool passed = true;
+   int64_t timeNs = 0;                    // since the first frame
+   uint32_t description = kNoDescription; // into ReplayResult::descriptions
    uint16_t vlan = 0;
-   std::string description;  // dropped frames, with describeDrops
+   uint8_t direction = 0;                 // kDirToVm or kDirFromVm
+   bool passed = true;
+
+   double seconds() const { return static_cast<double>(timeNs) / 1e9; }
 };
+static_assert(sizeof(FrameVerdict) == 24);
 
 struct PortDbEntry {
    uint16_t vlan = 0;
@@ -66,7 +83,10 @@ struct LogLine {
 };
 
 struct ReplayResult {
+   // In capture order, as options.frameRecords asks.
    std::vector<FrameVerdict> frames;
+   // Dropped frames' descriptions, with describeDrops.
+   std::vector<std::string> descriptions;
    // [direction][0 passed, 1 dropped], direction indexed by kDirToVm/kDirFromVm.
    std::array<std::array<uint64_t, 2>, 3> totals{};
    // The "featureSummary" node's fields, when the port has IP discovery.
@@ -77,6 +97,13 @@ struct ReplayResult {
    std::vector<Notification> notifications;
    std::vector<LogLine> log;
    std::vector<std::string> violations;   // host checks (leaks at unload, ...)
+
+   // The frame's description, "" when it has none.
+   std::string_view description(const FrameVerdict &frame) const
+   {
+      return frame.description < descriptions.size() ? std::string_view(descriptions[frame.description])
+                                                     : std::string_view();
+   }
 };
 
 // The security configuration was refused by the module: `what()` is the

@@ -37,12 +37,12 @@ nlohmann::json replayJson(const ReplayResult &result)
    json frames = json::array();
    for (const auto &frame : result.frames) {
       json entry = {{"index", frame.index},
-                    {"time", frame.time},
+                    {"time", frame.seconds()},
                     {"direction", directionName(frame.direction)},
                     {"vlan", frame.vlan},
                     {"verdict", frame.passed ? "passed" : "dropped"}};
-      if (!frame.description.empty()) {
-         entry["description"] = frame.description;
+      if (const std::string_view description = result.description(frame); !description.empty()) {
+         entry["description"] = description;
       }
       frames.push_back(std::move(entry));
    }
@@ -96,8 +96,8 @@ void printReplayReport(std::ostream &out, const ReplayResult &result, bool verbo
    if (verbose) {
       for (const auto &frame : result.frames) {
          if (!frame.passed) {
-            out << "  dropped #" << frame.index << "  " << seconds(frame.time) << "  "
-                << directionName(frame.direction) << "  " << frame.description << "\n";
+            out << "  dropped #" << frame.index << "  " << seconds(frame.seconds()) << "  "
+                << directionName(frame.direction) << "  " << result.description(frame) << "\n";
          }
       }
    }

@@ -1,5 +1,7 @@
 #include "minimal_loop.h"
 
+#include "swsec/swsec_vmi_hash.h"
+
 #include <cstring>
 
 namespace swsec::bench {
@@ -22,9 +24,9 @@ MinimalLoop::MinimalLoop(const std::vector<Binding> &bindings)
       Entry &entry = entries_[i];
       entry.key = Key{};
       entry.key.vlanId = 0;
-      std::memcpy(entry.key.mac, bindings[i].mac.bytes.data(), 6);
-      std::memcpy(&entry.key.ip, bindings[i].ip.bytes.data(), 4);
-      const uint32_t bucket = HashFunc_HashBytes(&entry.key, sizeof entry.key) & (kBuckets - 1);
+      std::memcpy(entry.key.macAddr, bindings[i].mac.bytes.data(), 6);
+      std::memcpy(&entry.key.ipAddr, bindings[i].ip.bytes.data(), 4);
+      const uint32_t bucket = SwSecVmiKeyHash(&entry.key) & (kBuckets - 1);
       entry.next = buckets_[bucket];
       buckets_[bucket] = &entry;
    }
@@ -32,7 +34,7 @@ MinimalLoop::MinimalLoop(const std::vector<Binding> &bindings)
 
 const MinimalLoop::Entry *MinimalLoop::find(const Key &key) const
 {
-   const uint32_t bucket = HashFunc_HashBytes(&key, sizeof key) & (kBuckets - 1);
+   const uint32_t bucket = SwSecVmiKeyHash(&key) & (kBuckets - 1);
    for (const Entry *entry = buckets_[bucket]; entry != nullptr; entry = entry->next) {
       if (std::memcmp(&entry->key, &key, sizeof key) == 0) {
          return entry;
@@ -66,8 +68,8 @@ uint32_t MinimalLoop::run(orr_PktList *list) const
       }
       Key key{};
       key.vlanId = orr_PktVlanIDGet(pkt);
-      std::memcpy(key.mac, frame + 6, 6);
-      std::memcpy(&key.ip, frame + kIpv4SrcOffset, 4);
+      std::memcpy(key.macAddr, frame + 6, 6);
+      std::memcpy(&key.ipAddr, frame + kIpv4SrcOffset, 4);
       if (find(key) == nullptr) {
          ++drops;
       }
@@ -105,8 +107,8 @@ uint32_t MinimalLoop::runViaHeaders(orr_PktList *list) const
          if (!toServer) {
             Key key{};
             key.vlanId = orr_PktVlanIDGet(pkt);
-            std::memcpy(key.mac, ethHdr + 6, 6);
-            std::memcpy(&key.ip, ipHdr + 12, 4);
+            std::memcpy(key.macAddr, ethHdr + 6, 6);
+            std::memcpy(&key.ipAddr, ipHdr + 12, 4);
             if (find(key) == nullptr) {
                ++drops;
             }

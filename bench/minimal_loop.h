@@ -9,6 +9,7 @@
 #include "frame_mix.h"
 
 #include "platform/platform.h"
+#include "swsec/swsec_vmi.h"
 
 #include <array>
 #include <cstdint>
@@ -31,12 +32,8 @@ public:
    uint32_t runViaHeaders(orr_PktList *list) const;
 
 private:
-   struct Key {
-      uint16_t vlanId;
-      uint8_t mac[6];
-      uint32_t ip;   // network order
-   };
-   static_assert(sizeof(Key) == 12);
+   // The module's key and its bucket hash: the same lookup.
+   using Key = SwSecVmiKey;
 
    struct Entry {
       Key key;

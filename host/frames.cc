@@ -30,9 +30,9 @@ constexpr uint16_t kEtherVlan = 0x8100;
 constexpr size_t kRedZone = 32;
 // Each element owns a 4 GiB slot of its list's machine address range.
 constexpr unsigned kElementSlotShift = 32;
-// Header mappings a frame tracks without allocating; the frame loop holds
-// at most three at once.
-constexpr size_t kInlineMappings = 4;
+// Mappings of headers in the mapped part a frame keeps in its first cache
+// line (two bits each); the frame loop holds at most three at once.
+constexpr uint32_t kQuickMappings = 8;
 
 constexpr size_t alignedUp(size_t size)
 {
@@ -41,58 +41,76 @@ constexpr size_t alignedUp(size_t size)
 
 }  // namespace
 
-struct FrameStore::Frame : orr_Pkt {
-   // A plain record, moved around without cost; a copy the host had to
-   // make is freed when the mapping is given back or the frame goes.
+struct alignas(64) FrameStore::Frame : orr_Pkt {
+   // A mapping the quick stack does not hold (one in an element or a copy,
+   // or past the stack's depth); a copy is freed when the mapping is given
+   // back or the frame goes.
    struct Mapping {
       const orr_PktHeaderEntry *entry = nullptr;
       uint8_t *data = nullptr;
-      uint8_t *copy = nullptr;   // when the header had to be copied
+      uint8_t *copy = nullptr;
    };
 
+   // The first cache line holds everything the frame path reads and
+   // writes, so that a long list costs one line a frame besides its bytes.
    uint64_t magic = kFrameMagic;
-   List *list = nullptr;
-   size_t index = 0;              // in the caller's input
+   uint8_t *mapped = nullptr;     // the mapped part, its own buffer in the arena
+   Frame *next = nullptr;
    uint32_t length = 0;
    uint32_t mappedLen = 0;
-   uint8_t *mapped = nullptr;     // the mapped part, its own buffer in the arena
-   uint32_t firstElement = 0;     // in the list's element tables
    uint16_t vlanId = 0;
    uint8_t present = 0;           // bit per layer with a header entry
-   orr_SgArray sgArray{};
+   // Mappings of headers in the mapped part (their data is mapped + the
+   // entry's offset): a stack of layers, two bits each, oldest lowest. The
+   // count is read by outstandingMappings() from other threads.
+   std::atomic<uint8_t> quickCount{0};
+   uint16_t quickLayers = 0;
    std::array<orr_PktHeaderEntry, 3> entries{};
 
-   // Mappings in the order they were made: the first kInlineMappings here,
-   // the rest in `moreMappings`. The count is read by outstandingMappings()
-   // from other threads.
-   std::atomic<uint32_t> mappingCount{0};
-   std::array<Mapping, kInlineMappings> mappings;
-   std::vector<Mapping> moreMappings;
-
+   // The rest: list bookkeeping and the other mappings.
+   List *list = nullptr;
    Frame *prev = nullptr;
-   Frame *next = nullptr;
+   size_t index = 0;              // in the caller's input
+   uint32_t firstElement = 0;     // in the list's element tables
+   orr_SgArray sgArray{};
    bool inList = false;
+   std::atomic<uint32_t> otherCount{0};
+   std::vector<Mapping> others;
 
    Frame() = default;
    Frame(const Frame &) = delete;
    Frame &operator=(const Frame &) = delete;
    ~Frame() { dropMappings(); }
 
-   Mapping &mappingAt(size_t position)
+   uint32_t outstanding() const
    {
-      return position < kInlineMappings ? mappings[position] : moreMappings[position - kInlineMappings];
+      return quickCount.load(std::memory_order_relaxed) + otherCount.load(std::memory_order_relaxed);
+   }
+
+   uint8_t *quickData(uint32_t layer) const { return mapped + entries[layer].offset; }
+
+   // Removes the quick mapping at `position` (0: the oldest).
+   void dropQuick(uint32_t position)
+   {
+      const uint32_t count = quickCount.load(std::memory_order_relaxed);
+      const uint32_t low = quickLayers & ((1u << (2 * position)) - 1);
+      const uint32_t high = static_cast<uint32_t>(quickLayers) >> (2 * position + 2);
+      quickLayers = static_cast<uint16_t>(low | (high << (2 * position)));
+      quickCount.store(static_cast<uint8_t>(count - 1), std::memory_order_relaxed);
    }
 
    void dropMappings()
    {
-      const uint32_t count = mappingCount.load(std::memory_order_relaxed);
-      for (uint32_t position = 0; position < count; ++position) {
-         delete[] mappingAt(position).copy;
+      for (const Mapping &mapping : others) {
+         delete[] mapping.copy;
       }
-      moreMappings.clear();
-      mappingCount.store(0, std::memory_order_relaxed);
+      others.clear();
+      otherCount.store(0, std::memory_order_relaxed);
+      quickCount.store(0, std::memory_order_relaxed);
+      quickLayers = 0;
    }
 };
+static_assert(sizeof(orr_PktHeaderEntry) == 8 && alignof(FrameStore::Frame) == 64);
 
 class FrameStore::List final : public orr_PktList, public FrameList {
 public:
@@ -123,7 +141,7 @@ public:
          if (!frame.inList) {
             problems.push_back(which + " was taken out of its list and never released");
          }
-         if (const uint32_t outstanding = frame.mappingCount.load(std::memory_order_relaxed); outstanding != 0) {
+         if (const uint32_t outstanding = frame.outstanding(); outstanding != 0) {
             problems.push_back(which + " returned to the host with " + std::to_string(outstanding) +
                                " header mapping(s) outstanding");
          }
@@ -419,7 +437,7 @@ uint64_t FrameStore::outstandingMappings() const
    uint64_t outstanding = 0;
    for (const auto &[base, list] : lists_) {
       for (size_t index = 0; index < list->frameCount(); ++index) {
-         outstanding += list->frameAt(index).mappingCount.load(std::memory_order_relaxed);
+         outstanding += list->frameAt(index).outstanding();
       }
    }
    return outstanding;
@@ -475,7 +493,7 @@ void FrameStore::release(orr_Pkt *pkt)
    if (frame->inList) {
       fatal("orr_PktRelease: frame " + pointerText(pkt) + " is still in a list");
    }
-   const uint32_t outstanding = frame->mappingCount.load(std::memory_order_relaxed);
+   const uint32_t outstanding = frame->outstanding();
    frame->dropMappings();
    frame->list->poisonBuffers(*frame);
    frame->magic = kReleasedMagic;
@@ -566,8 +584,15 @@ inline orr_Status FrameStore::headerDataGet(orr_Pkt *pkt, orr_PktHeaderEntry *en
    }
    const uint32_t offset = entry->offset;
    const uint32_t length = entry->length;
+   const uint32_t quick = frame.quickCount.load(std::memory_order_relaxed);
+   if (offset + length <= frame.mappedLen && quick < kQuickMappings) {
+      frame.quickLayers = static_cast<uint16_t>(frame.quickLayers | (layer << (2 * quick)));
+      frame.quickCount.store(static_cast<uint8_t>(quick + 1), std::memory_order_relaxed);
+      *data = frame.quickData(static_cast<uint32_t>(layer));
+      return ORR_OK;
+   }
    Frame::Mapping mapping{entry, nullptr, nullptr};
-   if (offset + length <= frame.mappedLen) [[likely]] {
+   if (offset + length <= frame.mappedLen) {
       mapping.data = frame.mapped + offset;
    } else {
       uint32_t begin = 0;
@@ -587,41 +612,32 @@ inline orr_Status FrameStore::headerDataGet(orr_Pkt *pkt, orr_PktHeaderEntry *en
       mapping.data = mapping.copy;
    }
    *data = mapping.data;
-   const uint32_t count = frame.mappingCount.load(std::memory_order_relaxed);
-   if (count < kInlineMappings) {
-      frame.mappings[count] = mapping;
-   } else {
-      frame.moreMappings.push_back(mapping);
-   }
-   frame.mappingCount.store(count + 1, std::memory_order_relaxed);
+   frame.others.push_back(mapping);
+   frame.otherCount.store(static_cast<uint32_t>(frame.others.size()), std::memory_order_relaxed);
    return ORR_OK;
 }
 
 inline void FrameStore::headerDataRelease(orr_Pkt *pkt, orr_PktHeaderEntry *entry, uint8_t *data)
 {
    Frame &frame = checked(pkt, "orr_PktHeaderDataRelease");
-   const uint32_t count = frame.mappingCount.load(std::memory_order_relaxed);
-   // Mappings are mostly given back newest first: search from the end.
-   uint32_t found = count;
-   while (found != 0) {
-      const Frame::Mapping &mapping = frame.mappingAt(found - 1);
-      if (mapping.entry == entry && mapping.data == data) {
-         break;
+   // Mappings are mostly given back newest first: search from the top.
+   for (uint32_t position = frame.quickCount.load(std::memory_order_relaxed); position-- > 0;) {
+      const uint32_t layer = (frame.quickLayers >> (2 * position)) & 3u;
+      if (entry == &frame.entries[layer] && data == frame.quickData(layer)) {
+         frame.dropQuick(position);
+         return;
       }
-      --found;
    }
-   if (found == 0) {
-      fatal("orr_PktHeaderDataRelease: " + pointerText(data) + " is not a mapping of header " + pointerText(entry) +
-            " of frame " + pointerText(pkt));
+   for (auto mapping = frame.others.rbegin(); mapping != frame.others.rend(); ++mapping) {
+      if (mapping->entry == entry && mapping->data == data) {
+         delete[] mapping->copy;
+         frame.others.erase(std::next(mapping).base());
+         frame.otherCount.store(static_cast<uint32_t>(frame.others.size()), std::memory_order_relaxed);
+         return;
+      }
    }
-   delete[] frame.mappingAt(found - 1).copy;
-   for (uint32_t position = found; position < count; ++position) {
-      frame.mappingAt(position - 1) = frame.mappingAt(position);
-   }
-   if (count > kInlineMappings) {
-      frame.moreMappings.pop_back();
-   }
-   frame.mappingCount.store(count - 1, std::memory_order_relaxed);
+   fatal("orr_PktHeaderDataRelease: " + pointerText(data) + " is not a mapping of header " + pointerText(entry) +
+         " of frame " + pointerText(pkt));
 }
 
 }  // namespace swsec::host
@@ -643,17 +659,18 @@ using Frame = FrameStore::Frame;
 
 constexpr uint64_t kLiveFrame = swsec::host::kFrameMagic;
 
-// The frame, when the host is alive and the pointer a live frame.
+// The frame, when the pointer is a live frame. A live frame belongs to a
+// list of a live host, so the host need not be checked on this path.
 inline Frame *liveFrame(const orr_Pkt *pkt)
 {
    auto *frame = static_cast<Frame *>(const_cast<orr_Pkt *>(pkt));
-   if (currentState.load(std::memory_order_acquire) == nullptr || pkt == nullptr || frame->magic != kLiveFrame)
-      [[unlikely]] {
+   if (pkt == nullptr || frame->magic != kLiveFrame) [[unlikely]] {
       return nullptr;
    }
    return frame;
 }
 
+// The host of a live frame.
 inline swsec::host::FaultTable &faultTable()
 {
    return currentState.load(std::memory_order_relaxed)->faults;
@@ -777,15 +794,14 @@ ORR_API orr_Status orr_PktHeaderDataGet(orr_Pkt *pkt, orr_PktHeaderEntry *entry,
       // Compared as addresses: an entry from elsewhere is not one of the frame's.
       const auto offset = reinterpret_cast<uintptr_t>(entry) - reinterpret_cast<uintptr_t>(frame->entries.data());
       const size_t layer = offset / sizeof(orr_PktHeaderEntry);
-      const uint32_t count = frame->mappingCount.load(std::memory_order_relaxed);
+      const uint32_t count = frame->quickCount.load(std::memory_order_relaxed);
       if (offset % sizeof(orr_PktHeaderEntry) == 0 && layer < frame->entries.size() &&
           (frame->present & (1u << layer)) != 0 &&
-          uint32_t{entry->offset} + entry->length <= frame->mappedLen && count < swsec::host::kInlineMappings &&
+          uint32_t{entry->offset} + entry->length <= frame->mappedLen && count < swsec::host::kQuickMappings &&
           faultTable().countQuietly(swsec::host::faultPoint("orr_PktHeaderDataGet"))) [[likely]] {
-         uint8_t *mapped = frame->mapped + entry->offset;
-         frame->mappings[count] = Frame::Mapping{entry, mapped, nullptr};
-         frame->mappingCount.store(count + 1, std::memory_order_relaxed);
-         *data = mapped;
+         frame->quickLayers = static_cast<uint16_t>(frame->quickLayers | (layer << (2 * count)));
+         frame->quickCount.store(static_cast<uint8_t>(count + 1), std::memory_order_relaxed);
+         *data = frame->mapped + entry->offset;
          return ORR_OK;
       }
    }
@@ -796,12 +812,13 @@ ORR_API void orr_PktHeaderDataRelease(orr_Pkt *pkt, orr_PktHeaderEntry *entry, u
 {
    Frame *frame = liveFrame(pkt);
    if (frame != nullptr) [[likely]] {
-      const uint32_t count = frame->mappingCount.load(std::memory_order_relaxed);
-      // Given back newest first, as the frame loop does, with no copy to free.
-      if (count != 0 && count <= swsec::host::kInlineMappings) {
-         const Frame::Mapping &last = frame->mappings[count - 1];
-         if (last.entry == entry && last.data == data && last.copy == nullptr) [[likely]] {
-            frame->mappingCount.store(count - 1, std::memory_order_relaxed);
+      const uint32_t count = frame->quickCount.load(std::memory_order_relaxed);
+      // The newest quick mapping given back first, as the frame loop does.
+      if (count != 0) {
+         const uint32_t layer = (frame->quickLayers >> (2 * (count - 1))) & 3u;
+         if (entry == &frame->entries[layer] && data == frame->quickData(layer)) [[likely]] {
+            frame->quickLayers = static_cast<uint16_t>(frame->quickLayers & ((1u << (2 * (count - 1))) - 1));
+            frame->quickCount.store(static_cast<uint8_t>(count - 1), std::memory_order_relaxed);
             return;
          }
       }

@@ -109,7 +109,15 @@ ORR_API uint32_t HashFunc_HashBytes(const void *bytes, uint32_t length)
       hash ^= hash >> 32;
    }
    uint64_t tail = 0;
-   for (uint32_t shift = 0; at < length; ++at, shift += 8) {
+   uint32_t shift = 0;
+   if (length - at >= 4) {
+      uint32_t word;
+      std::memcpy(&word, data + at, sizeof word);
+      tail = word;
+      at += 4;
+      shift = 32;
+   }
+   for (; at < length; ++at, shift += 8) {
       tail |= uint64_t{data[at]} << shift;
    }
    hash = (hash ^ tail) * kLast;

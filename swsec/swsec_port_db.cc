@@ -23,10 +23,16 @@ int64_t SifraGenericGetExpirySec(uint32_t seconds)
    return now.sec + static_cast<int64_t>(seconds);
 }
 
+/*
+ * All three parts compared without early exits: a bucket walk then has one
+ * branch an entry, where the frame path's lookups of random sources would
+ * otherwise mispredict one of three.
+ */
 static bool SwSecVmiHasKey(const SwSecVmi *vmi, uint16_t vlanId, const uint8_t *mac,
                            uint32_t ipAddr)
 {
-   return vmi->vlanId == vlanId && SwSecSameMac(vmi->macAddr, mac) && vmi->ipAddr == ipAddr;
+   return (static_cast<unsigned>(vmi->vlanId == vlanId) & static_cast<unsigned>(SwSecSameMac(vmi->macAddr, mac)) &
+           static_cast<unsigned>(vmi->ipAddr == ipAddr)) != 0;
 }
 
 static SwSecVmiKey SwSecVmiKeyOf(const SwSecVmi *vmi)

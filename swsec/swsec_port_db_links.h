@@ -5,6 +5,7 @@
 #pragma once
 
 #include "swsec/swsec_vmi.h"
+#include "swsec/swsec_vmi_hash.h"
 
 #include <cstddef>
 #include <cstdint>
@@ -27,9 +28,8 @@ static inline SwSecDhcpReq *SwSecDhcpReqFromLinks(orr_ListLinks *links)
                                            offsetof(SwSecDhcpReq, links));
 }
 
-/* The bucket head of `key`: a byte hash over its 12 bytes, masked. */
+/* The bucket head of `key`: its hash, masked. */
 static inline orr_ListLinks *SwSecVmiBucket(const Hash_Table *table, const SwSecVmiKey *key)
 {
-   uint32_t hash = HashFunc_HashBytes(key, sizeof(*key));
-   return &table->buckets[hash & table->bucketMask];
+   return &table->buckets[SwSecVmiKeyHash(key) & table->bucketMask];
 }

@@ -43,5 +43,5 @@ static inline bool SwSecSameMac(const uint8_t *a, const uint8_t *b)
    uint16_t bTail;
    __builtin_memcpy(&aTail, a + 4, sizeof(aTail));
    __builtin_memcpy(&bTail, b + 4, sizeof(bTail));
-   return SwSecLoadRaw32(a) == SwSecLoadRaw32(b) && aTail == bTail;
+   return ((SwSecLoadRaw32(a) ^ SwSecLoadRaw32(b)) | static_cast<uint32_t>(aTail ^ bTail)) == 0;
 }

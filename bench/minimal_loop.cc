@@ -2,6 +2,7 @@
 
 #include "swsec/swsec_vmi_hash.h"
 
+#include <algorithm>
 #include <cstring>
 
 namespace swsec::bench {
@@ -51,7 +52,8 @@ uint32_t MinimalLoop::run(orr_PktList *list) const
    for (orr_PktListIterStart(list, iter); !orr_PktListIterIsAtEnd(iter); orr_PktListIterMove(iter)) {
       orr_Pkt *pkt = orr_PktListIterGetPkt(iter);
       const uint8_t *frame = static_cast<const uint8_t *>(orr_PktFrameMappedPointerGet(pkt));
-      const uint32_t mapped = orr_PktFrameMappedLenGet(pkt);
+      // Bounded as the module bounds its reads: by the mapped part and the frame.
+      const uint32_t mapped = std::min(orr_PktFrameMappedLenGet(pkt), orr_PktFrameLenGet(pkt));
       if (mapped < kEthHeaderLen + 20 + 4) {
          continue;
       }

@@ -79,7 +79,7 @@ void SwSecParseFrame(orr_Pkt *pkt, SwSecPktInfo *info)
 }
 
 /* Gives back the header mappings, innermost first, and a parser's copy. */
-void SwSecReleaseFrame(orr_Pkt *pkt, SwSecPktInfo *info)
+[[gnu::always_inline]] inline void SwSecReleaseFrame(orr_Pkt *pkt, SwSecPktInfo *info)
 {
    if ((info->flags & (SWSEC_PKT_L4 | SWSEC_PKT_UDP)) != 0) {
       orr_PktHeaderDataRelease(pkt, info->l4Entry, info->udpHdr, 0);

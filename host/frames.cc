@@ -5,7 +5,9 @@
 #include <sanitizer/asan_interface.h>
 
 #include <algorithm>
+#include <cstdlib>
 #include <cstring>
+#include <new>
 #include <mutex>
 #include <stdexcept>
 #include <string>
@@ -120,13 +122,32 @@ public:
       uint32_t frame = 0;   // index of the frame it belongs to
    };
 
+   // One allocation holds the frames (cache-line aligned), the element
+   // tables and the arena: a list costs the host one malloc and one free.
    List(FrameStore &store, size_t frameCount, size_t elementCount, size_t arenaSize)
-      : store_(store), frameCount_(frameCount), frames_(std::make_unique<Frame[]>(frameCount)),
-        sgElems_(elementCount), elements_(elementCount), arenaSize_(arenaSize),
-        arena_(std::make_unique_for_overwrite<uint8_t[]>(arenaSize))
+      : store_(store), frameCount_(frameCount), elementCount_(elementCount), arenaSize_(arenaSize)
    {
+      const size_t frameBytes = frameCount * sizeof(Frame);
+      const size_t tableBytes = elementCount * (sizeof(orr_SgElem) + sizeof(Element));
+      storage_.reset(static_cast<uint8_t *>(std::malloc(alignof(Frame) + frameBytes + tableBytes + arenaSize)));
+      if (!storage_) {
+         throw std::bad_alloc();
+      }
+      const auto start = reinterpret_cast<uintptr_t>(storage_.get());
+      auto *at = storage_.get() + ((alignof(Frame) - start % alignof(Frame)) % alignof(Frame));
+      frames_ = reinterpret_cast<Frame *>(at);
+      for (size_t index = 0; index < frameCount; ++index) {
+         new (frames_ + index) Frame();
+      }
+      sgElems_ = reinterpret_cast<orr_SgElem *>(at + frameBytes);
+      elements_ = reinterpret_cast<Element *>(at + frameBytes + elementCount * sizeof(orr_SgElem));
+      for (size_t index = 0; index < elementCount; ++index) {
+         new (sgElems_ + index) orr_SgElem{};
+         new (elements_ + index) Element{};
+      }
+      arena_ = at + frameBytes + tableBytes;
       // Everything is out of bounds until a buffer is laid out over it.
-      ASAN_POISON_MEMORY_REGION(arena_.get(), arenaSize_);
+      ASAN_POISON_MEMORY_REGION(arena_, arenaSize_);
    }
 
    ~List() override
@@ -149,8 +170,9 @@ public:
       store_.forget(*this);
       for (size_t index = 0; index < frameCount_; ++index) {
          frames_[index].magic = ~kFrameMagic;
+         frames_[index].~Frame();
       }
-      ASAN_UNPOISON_MEMORY_REGION(arena_.get(), arenaSize_);
+      ASAN_UNPOISON_MEMORY_REGION(arena_, arenaSize_);
       store_.violations_.reportAll(std::move(problems));
    }
 
@@ -179,7 +201,7 @@ public:
    // buffer and its red zone) and opens them to reads and writes.
    uint8_t *place(size_t &offset, const uint8_t *bytes, size_t length)
    {
-      uint8_t *buffer = arena_.get() + offset;
+      uint8_t *buffer = arena_ + offset;
       ASAN_UNPOISON_MEMORY_REGION(buffer, length);
       if (length != 0) {
          std::memcpy(buffer, bytes, length);
@@ -244,7 +266,7 @@ public:
    orr_SgElem &sgElem(size_t index) { return sgElems_[index]; }
    Element &element(size_t index) { return elements_[index]; }
    const Element &element(size_t index) const { return elements_[index]; }
-   size_t elementCount() const { return elements_.size(); }
+   size_t elementCount() const { return elementCount_; }
    const Frame &frameOf(const Element &element) const { return frames_[element.frame]; }
    size_t frameCount() const { return frameCount_; }
    void countRelease() { ++releasedCount_; }
@@ -254,11 +276,16 @@ public:
 private:
    FrameStore &store_;
    size_t frameCount_;
-   std::unique_ptr<Frame[]> frames_;
-   std::vector<orr_SgElem> sgElems_;
-   std::vector<Element> elements_;
+   struct Free {
+      void operator()(uint8_t *storage) const { std::free(storage); }
+   };
+   size_t elementCount_;
+   std::unique_ptr<uint8_t, Free> storage_;
+   Frame *frames_ = nullptr;
+   orr_SgElem *sgElems_ = nullptr;
+   Element *elements_ = nullptr;
    size_t arenaSize_;
-   std::unique_ptr<uint8_t[]> arena_;
+   uint8_t *arena_ = nullptr;
    Frame *head_ = nullptr;
    Frame *tail_ = nullptr;
    size_t releasedCount_ = 0;

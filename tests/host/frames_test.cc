@@ -301,19 +301,24 @@ TEST_F(FramesTest, MappingsMayBeGivenBackInAnyOrder)
                 ORR_OK);
       ASSERT_EQ(orr_PktHeaderDataGet(pkt, entries[layer], &data[layer]), ORR_OK);
    }
-   // Two more of layer 2: beyond what a frame tracks without allocating.
-   uint8_t *extra[2] = {};
+   // Seven more of layer 2: past what a frame keeps in its own record.
+   uint8_t *extra[7] = {};
    for (auto &mapping : extra) {
       ASSERT_EQ(orr_PktHeaderDataGet(pkt, entries[0], &mapping), ORR_OK);
+      EXPECT_EQ(mapping, data[0]);
    }
-   EXPECT_EQ(host.frames().outstandingMappings(), 5u);
-   orr_PktHeaderDataRelease(pkt, entries[0], data[0], 0);   // the oldest first
+   EXPECT_EQ(host.frames().outstandingMappings(), 10u);
+   orr_PktHeaderDataRelease(pkt, entries[1], data[1], 0);   // from the middle
+   orr_PktHeaderDataRelease(pkt, entries[0], data[0], 0);   // the oldest
    orr_PktHeaderDataRelease(pkt, entries[2], data[2], 0);
-   orr_PktHeaderDataRelease(pkt, entries[0], extra[1], 0);
-   EXPECT_EQ(host.frames().outstandingMappings(), 2u);
-   orr_PktHeaderDataRelease(pkt, entries[1], data[1], 0);
-   orr_PktHeaderDataRelease(pkt, entries[0], extra[0], 0);
+   EXPECT_EQ(host.frames().outstandingMappings(), 7u);
+   for (auto *mapping : extra) {
+      orr_PktHeaderDataRelease(pkt, entries[0], mapping, 0);
+   }
    EXPECT_EQ(host.frames().outstandingMappings(), 0u);
+   GTEST_FLAG_SET(death_test_style, "threadsafe");
+   EXPECT_DEATH(orr_PktHeaderDataRelease(pkt, entries[0], data[0], 0), "is not a mapping of header")
+      << "every mapping was given back";
    orr_PktHeaderEntry foreign = *entries[0];
    EXPECT_EQ(orr_PktHeaderDataGet(pkt, &foreign, &data[0]), ORR_BAD_PARAM) << "not one of the frame's entries";
 }

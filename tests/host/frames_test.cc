@@ -261,6 +261,17 @@ TEST_F(FramesTest, HeaderFindHonoursClassInstanceAndFaults)
    EXPECT_EQ(orr_PktHeaderFind(pkt, ORR_PKT_LAYER_3, ORR_PKT_HEADER_CLASS_L3, 1, &entry, 0), ORR_OK);
 }
 
+// Finds and maps the layer 2, 3 and 4 headers of a UDP frame.
+void mapLayers(orr_Pkt *pkt, orr_PktHeaderEntry *(&entries)[3], uint8_t *(&data)[3])
+{
+   const uint32_t classes[] = {ORR_PKT_HEADER_CLASS_L2, ORR_PKT_HEADER_CLASS_L3, ORR_PKT_HEADER_CLASS_L4};
+   for (uint32_t layer = 0; layer < 3; ++layer) {
+      ASSERT_EQ(orr_PktHeaderFind(pkt, static_cast<orr_PktLayer>(layer), classes[layer], 1, &entries[layer], 0),
+                ORR_OK);
+      ASSERT_EQ(orr_PktHeaderDataGet(pkt, entries[layer], &data[layer]), ORR_OK);
+   }
+}
+
 TEST_F(FramesTest, HeaderDataComesFromMappedPartElementOrCopy)
 {
    const Bytes bytes = sampleUdp();
@@ -269,11 +280,8 @@ TEST_F(FramesTest, HeaderDataComesFromMappedPartElementOrCopy)
    orr_Pkt *pkt = single({.bytes = bytes, .split = {14, 30}});
    orr_PktHeaderEntry *entries[3] = {};
    uint8_t *data[3] = {};
-   const uint32_t classes[] = {ORR_PKT_HEADER_CLASS_L2, ORR_PKT_HEADER_CLASS_L3, ORR_PKT_HEADER_CLASS_L4};
+   ASSERT_NO_FATAL_FAILURE(mapLayers(pkt, entries, data));
    for (uint32_t layer = 0; layer < 3; ++layer) {
-      ASSERT_EQ(orr_PktHeaderFind(pkt, static_cast<orr_PktLayer>(layer), classes[layer], 1, &entries[layer], 0),
-                ORR_OK);
-      ASSERT_EQ(orr_PktHeaderDataGet(pkt, entries[layer], &data[layer]), ORR_OK);
       EXPECT_EQ(0, std::memcmp(data[layer], bytes.data() + entries[layer]->offset, entries[layer]->length));
    }
    EXPECT_EQ(data[0], orr_PktFrameMappedPointerGet(pkt));
@@ -295,12 +303,7 @@ TEST_F(FramesTest, MappingsMayBeGivenBackInAnyOrder)
    orr_Pkt *pkt = single({.bytes = sampleUdp()});
    orr_PktHeaderEntry *entries[3] = {};
    uint8_t *data[3] = {};
-   const uint32_t classes[] = {ORR_PKT_HEADER_CLASS_L2, ORR_PKT_HEADER_CLASS_L3, ORR_PKT_HEADER_CLASS_L4};
-   for (uint32_t layer = 0; layer < 3; ++layer) {
-      ASSERT_EQ(orr_PktHeaderFind(pkt, static_cast<orr_PktLayer>(layer), classes[layer], 1, &entries[layer], 0),
-                ORR_OK);
-      ASSERT_EQ(orr_PktHeaderDataGet(pkt, entries[layer], &data[layer]), ORR_OK);
-   }
+   ASSERT_NO_FATAL_FAILURE(mapLayers(pkt, entries, data));
    // Seven more of layer 2: past what a frame keeps in its own record.
    uint8_t *extra[7] = {};
    for (auto &mapping : extra) {

@@ -325,8 +325,8 @@ std::unique_ptr<FrameList> FrameStore::makeList(const std::vector<FrameSpec> &fr
 {
    std::vector<FrameInput> inputs(frameSpecs.size());
    for (size_t index = 0; index < frameSpecs.size(); ++index) {
-      const FrameSpec &spec = frameSpecs[index];
-      inputs[index] = FrameInput{spec.bytes, spec.vlanId, spec.untag, spec.split, spec.mappedLen};
+      const FrameSpec &frameSpec = frameSpecs[index];
+      inputs[index] = FrameInput{frameSpec.bytes, frameSpec.vlanId, frameSpec.untag, frameSpec.split, frameSpec.mappedLen};
    }
    return build(inputs, minMappedLen);
 }

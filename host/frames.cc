@@ -326,7 +326,8 @@ std::unique_ptr<FrameList> FrameStore::makeList(const std::vector<FrameSpec> &fr
    std::vector<FrameInput> inputs(frameSpecs.size());
    for (size_t index = 0; index < frameSpecs.size(); ++index) {
       const FrameSpec &frameSpec = frameSpecs[index];
-      inputs[index] = FrameInput{frameSpec.bytes, frameSpec.vlanId, frameSpec.untag, frameSpec.split, frameSpec.mappedLen};
+      inputs[index] =
+         FrameInput{frameSpec.bytes, frameSpec.vlanId, frameSpec.untag, frameSpec.split, frameSpec.mappedLen};
    }
    return build(inputs, minMappedLen);
 }
@@ -586,9 +587,8 @@ inline orr_Status FrameStore::headerFind(orr_Pkt *pkt, orr_PktLayer layer, uint3
    if (entry == nullptr || layer > ORR_PKT_LAYER_4) {
       return ORR_BAD_PARAM;
    }
-   // A frame has at most one header per layer: only instance 1 exists. The
-   // class bits of layers 2, 3 and 4 are consecutive.
-   if (instance != 1 || (frame.present & (1u << layer)) == 0 || (classMask & (ORR_PKT_HEADER_CLASS_L2 << layer)) == 0) {
+   // A frame has at most one header per layer: only instance 1 exists.
+   if (instance != 1 || (frame.present & (1u << layer)) == 0 || (classMask & headerClassOf(layer)) == 0) {
       return ORR_NOT_FOUND;
    }
    *entry = &frame.entries[layer];
@@ -805,7 +805,7 @@ ORR_API orr_Status orr_PktHeaderFind(orr_Pkt *pkt, orr_PktLayer layer, uint32_t 
    if (frame != nullptr && entry != nullptr && layer <= ORR_PKT_LAYER_4 &&
        faultTable().countQuietly(swsec::host::faultPoint("orr_PktHeaderFind"))) [[likely]] {
       if (instance != 1 || (frame->present & (1u << layer)) == 0 ||
-          (classMask & (ORR_PKT_HEADER_CLASS_L2 << layer)) == 0) {
+          (classMask & swsec::host::headerClassOf(layer)) == 0) {
          return ORR_NOT_FOUND;
       }
       *entry = &frame->entries[layer];

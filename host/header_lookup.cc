@@ -47,19 +47,6 @@ bool fits(std::span<const uint8_t> frame, uint32_t offset, uint32_t length)
 
 }  // namespace
 
-uint32_t headerClassOf(orr_PktLayer layer)
-{
-   switch (layer) {
-   case ORR_PKT_LAYER_2:
-      return ORR_PKT_HEADER_CLASS_L2;
-   case ORR_PKT_LAYER_3:
-      return ORR_PKT_HEADER_CLASS_L3;
-   case ORR_PKT_LAYER_4:
-      return ORR_PKT_HEADER_CLASS_L4;
-   }
-   return 0;
-}
-
 FrameHeaders findHeaders(std::span<const uint8_t> frame)
 {
    FrameHeaders headers;

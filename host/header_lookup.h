@@ -26,7 +26,13 @@ struct FrameHeaders {
 
 FrameHeaders findHeaders(std::span<const uint8_t> frame);
 
-// The header class bit of a layer (ORR_PKT_HEADER_CLASS_*).
-uint32_t headerClassOf(orr_PktLayer layer);
+// The header class bit of a layer (ORR_PKT_HEADER_CLASS_*): the bits of
+// layers 2, 3 and 4 are consecutive.
+static_assert(ORR_PKT_HEADER_CLASS_L3 == ORR_PKT_HEADER_CLASS_L2 << ORR_PKT_LAYER_3 &&
+              ORR_PKT_HEADER_CLASS_L4 == ORR_PKT_HEADER_CLASS_L2 << ORR_PKT_LAYER_4);
+constexpr uint32_t headerClassOf(uint32_t layer)
+{
+   return ORR_PKT_HEADER_CLASS_L2 << layer;
+}
 
 }  // namespace swsec::host

@@ -201,6 +201,9 @@ public:
    // buffer and its red zone) and opens them to reads and writes.
    uint8_t *place(size_t &offset, const uint8_t *bytes, size_t length)
    {
+      if (offset + alignedUp(length) + kRedZone > arenaSize_) {
+         throw std::logic_error("frame list arena laid out past its size");
+      }
       uint8_t *buffer = arena_ + offset;
       ASAN_UNPOISON_MEMORY_REGION(buffer, length);
       if (length != 0) {
@@ -396,8 +399,15 @@ std::unique_ptr<FrameList> FrameStore::build(std::span<const FrameInput> inputs,
          const uint32_t first = shape.splitCount != 0 ? input.split.front() : shape.rest;
          shape.mappedLen = std::min(std::max(first, minMappedLen), length);
       }
+      // Exactly what place() takes: each buffer rounded up on its own, and its red zone.
       elementCount += elements;
-      arenaSize += alignedUp(length) + elements * kRedZone + alignedUp(shape.mappedLen) + kRedZone;
+      for (uint32_t part : input.split) {
+         arenaSize += alignedUp(part) + kRedZone;
+      }
+      if (shape.restElement) {
+         arenaSize += alignedUp(shape.rest) + kRedZone;
+      }
+      arenaSize += alignedUp(shape.mappedLen) + kRedZone;
    }
 
    auto list = std::make_unique<List>(*this, inputs.size(), elementCount, arenaSize);

@@ -83,6 +83,24 @@ TEST_F(FramesTest, SplitBecomesElementsAndTheRestOneLastElement)
    EXPECT_EQ(orr_PktFrameLenGet(pkt), 60u);
 }
 
+TEST_F(FramesTest, ManySmallElementsEachGetTheirOwnBuffer)
+{
+   const Bytes bytes = sampleUdp();
+   std::vector<uint32_t> split(59, 1);   // 59 one-byte elements and a last one
+   orr_Pkt *pkt = single({.bytes = bytes, .split = split});
+   ASSERT_EQ(orr_PktSgArrayGet(pkt)->numElems, 60);
+   Bytes joined;
+   for (uint16_t index = 0; index < 60; ++index) {
+      void *va = nullptr;
+      ASSERT_EQ(orr_MA2VA(orr_PktSgElemGet(pkt, index)->addr, 1, &va), ORR_OK);
+      joined.push_back(*static_cast<uint8_t *>(va));
+   }
+   EXPECT_EQ(joined, bytes);
+   Bytes copy(bytes.size());
+   ASSERT_EQ(orr_PktCopyBytesOut(pkt, 0, static_cast<uint32_t>(copy.size()), copy.data()), ORR_OK);
+   EXPECT_EQ(copy, bytes);
+}
+
 TEST_F(FramesTest, SplitLongerThanTheFrameIsRefused)
 {
    EXPECT_THROW(host.frames().makeList({{.bytes = Bytes(20, 1), .split = {15, 6}}}), std::invalid_argument);

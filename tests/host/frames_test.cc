@@ -25,13 +25,26 @@ Bytes sampleUdp(std::optional<uint16_t> vlanTag = std::nullopt)
                     .srcPort = 68, .dstPort = 67, .vlanTag = vlanTag});
 }
 
-// Takes the only frame of a fresh list out of it.
+// A list iterator in stack storage, as a module keeps one.
+struct Iter {
+   explicit Iter(host::FrameList &frames) { orr_PktListIterStart(frames.list(), get()); }
+   orr_PktListIter *get() { return reinterpret_cast<orr_PktListIter *>(storage.data()); }
+   alignas(void *) std::array<uint8_t, ORR_PKT_LIST_ITER_MAX_SIZE> storage{};
+};
+
+// Takes the first frame of a list out of it.
 orr_Pkt *takeOut(host::FrameList &frames)
 {
-   alignas(void *) std::array<uint8_t, ORR_PKT_LIST_ITER_MAX_SIZE> storage{};
-   auto *iter = reinterpret_cast<orr_PktListIter *>(storage.data());
-   orr_PktListIterStart(frames.list(), iter);
-   return orr_PktListIterRemovePkt(iter);
+   return orr_PktListIterRemovePkt(Iter(frames).get());
+}
+
+// Maps the layer 2 header of a frame and leaves the mapping outstanding.
+void mapLayer2(orr_Pkt *pkt)
+{
+   orr_PktHeaderEntry *entry = nullptr;
+   uint8_t *data = nullptr;
+   ASSERT_EQ(orr_PktHeaderFind(pkt, ORR_PKT_LAYER_2, ORR_PKT_HEADER_CLASS_L2, 1, &entry, 0), ORR_OK);
+   ASSERT_EQ(orr_PktHeaderDataGet(pkt, entry, &data), ORR_OK);
 }
 
 void releaseTwice(host::FrameList &frames)
@@ -49,6 +62,14 @@ void releaseUnknownMapping(orr_Pkt *pkt)
    orr_PktHeaderDataRelease(pkt, entry, &unknown, 0);
 }
 
+// The whole frame, through orr_PktCopyBytesOut.
+Bytes copyOut(orr_Pkt *pkt)
+{
+   Bytes copy(orr_PktFrameLenGet(pkt));
+   EXPECT_EQ(orr_PktCopyBytesOut(pkt, 0, static_cast<uint32_t>(copy.size()), copy.data()), ORR_OK);
+   return copy;
+}
+
 class FramesTest : public HostUnitTest {
 public:
    orr_Pkt *single(FrameSpec frameSpec, uint32_t minMappedLen = 0)
@@ -62,43 +83,37 @@ public:
 
 // ---- scatter-gather and mapped length
 
-TEST_F(FramesTest, SplitBecomesElementsAndTheRestOneLastElement)
+TEST_F(FramesTest, SplitBecomesElementsEachInItsOwnBufferAndTheRestOneLastElement)
 {
+   struct Case {
+      const char *what;
+      std::vector<uint32_t> split;
+      std::vector<uint32_t> lengths;
+   };
+   const Case cases[] = {
+      {"a few, one empty", {10, 0, 20}, {10, 0, 20, 30}},
+      {"59 one-byte elements", std::vector<uint32_t>(59, 1), std::vector<uint32_t>(60, 1)},
+   };
    const Bytes bytes = sampleUdp();   // 14 + 20 + 8 + 18 = 60 bytes
-   orr_Pkt *pkt = single({.bytes = bytes, .split = {10, 0, 20}});
-   ASSERT_EQ(orr_PktSgArrayGet(pkt)->numElems, 4);
-   std::vector<uint32_t> lengths;
-   Bytes joined;
-   for (uint16_t index = 0; index < 4; ++index) {
-      const orr_SgElem *element = orr_PktSgElemGet(pkt, index);
-      ASSERT_NE(element, nullptr);
-      lengths.push_back(element->length);
-      void *va = nullptr;
-      ASSERT_EQ(orr_MA2VA(element->addr, element->length, &va), ORR_OK);
-      joined.insert(joined.end(), static_cast<uint8_t *>(va), static_cast<uint8_t *>(va) + element->length);
+   for (const Case &c : cases) {
+      SCOPED_TRACE(c.what);
+      orr_Pkt *pkt = single({.bytes = bytes, .split = c.split});
+      std::vector<uint32_t> lengths;
+      Bytes joined;
+      for (uint16_t index = 0; index < orr_PktSgArrayGet(pkt)->numElems; ++index) {
+         const orr_SgElem *element = orr_PktSgElemGet(pkt, index);
+         ASSERT_NE(element, nullptr);
+         lengths.push_back(element->length);
+         void *va = nullptr;
+         ASSERT_EQ(orr_MA2VA(element->addr, element->length, &va), ORR_OK);
+         joined.insert(joined.end(), static_cast<uint8_t *>(va), static_cast<uint8_t *>(va) + element->length);
+      }
+      EXPECT_EQ(lengths, c.lengths);
+      EXPECT_EQ(joined, bytes);
+      EXPECT_EQ(orr_PktSgElemGet(pkt, static_cast<uint16_t>(lengths.size())), nullptr);
+      EXPECT_EQ(orr_PktFrameLenGet(pkt), 60u);
+      EXPECT_EQ(copyOut(pkt), bytes);
    }
-   EXPECT_THAT(lengths, ElementsAre(10u, 0u, 20u, 30u));
-   EXPECT_EQ(joined, bytes);
-   EXPECT_EQ(orr_PktSgElemGet(pkt, 4), nullptr);
-   EXPECT_EQ(orr_PktFrameLenGet(pkt), 60u);
-}
-
-TEST_F(FramesTest, ManySmallElementsEachGetTheirOwnBuffer)
-{
-   const Bytes bytes = sampleUdp();
-   std::vector<uint32_t> split(59, 1);   // 59 one-byte elements and a last one
-   orr_Pkt *pkt = single({.bytes = bytes, .split = split});
-   ASSERT_EQ(orr_PktSgArrayGet(pkt)->numElems, 60);
-   Bytes joined;
-   for (uint16_t index = 0; index < 60; ++index) {
-      void *va = nullptr;
-      ASSERT_EQ(orr_MA2VA(orr_PktSgElemGet(pkt, index)->addr, 1, &va), ORR_OK);
-      joined.push_back(*static_cast<uint8_t *>(va));
-   }
-   EXPECT_EQ(joined, bytes);
-   Bytes copy(bytes.size());
-   ASSERT_EQ(orr_PktCopyBytesOut(pkt, 0, static_cast<uint32_t>(copy.size()), copy.data()), ORR_OK);
-   EXPECT_EQ(copy, bytes);
 }
 
 TEST_F(FramesTest, SplitLongerThanTheFrameIsRefused)
@@ -139,9 +154,7 @@ TEST_F(FramesTest, UntaggingMovesTheVlanIdIntoTheMetadata)
    orr_Pkt *pkt = single({.bytes = tagged, .untag = true});
    EXPECT_EQ(orr_PktVlanIDGet(pkt), 42);
    EXPECT_EQ(orr_PktFrameLenGet(pkt), tagged.size() - 4);
-   Bytes copy(orr_PktFrameLenGet(pkt));
-   ASSERT_EQ(orr_PktCopyBytesOut(pkt, 0, static_cast<uint32_t>(copy.size()), copy.data()), ORR_OK);
-   EXPECT_EQ(copy, sampleUdp());
+   EXPECT_EQ(copyOut(pkt), sampleUdp());
 
    pkt = single({.bytes = tagged, .vlanId = 7});
    EXPECT_EQ(orr_PktVlanIDGet(pkt), 7) << "without untagging the metadata is the test's";
@@ -204,31 +217,21 @@ TEST_F(FramesTest, MachineAddressesMapOnlyWithinOneLiveElement)
 
 // ---- header lookup
 
-struct Layers {
-   std::optional<orr_PktHeaderEntry> l2, l3, l4;
-};
+// Per layer 2, 3, 4: {offset, length, nextProto, nextHdrOffset} of the
+// header found, or nothing.
+using Entry = std::optional<std::array<uint16_t, 4>>;
 
-Layers lookUp(orr_Pkt *pkt)
+std::array<Entry, 3> lookUp(orr_Pkt *pkt)
 {
-   Layers found;
+   std::array<Entry, 3> found;
    const uint32_t classes[] = {ORR_PKT_HEADER_CLASS_L2, ORR_PKT_HEADER_CLASS_L3, ORR_PKT_HEADER_CLASS_L4};
-   std::optional<orr_PktHeaderEntry> *slots[] = {&found.l2, &found.l3, &found.l4};
    for (uint32_t layer = 0; layer < 3; ++layer) {
-      orr_PktHeaderEntry *entry = nullptr;
-      if (orr_PktHeaderFind(pkt, static_cast<orr_PktLayer>(layer), classes[layer], 1, &entry, 0) == ORR_OK) {
-         *slots[layer] = *entry;
+      orr_PktHeaderEntry *e = nullptr;
+      if (orr_PktHeaderFind(pkt, static_cast<orr_PktLayer>(layer), classes[layer], 1, &e, 0) == ORR_OK) {
+         found[layer] = std::array<uint16_t, 4>{e->offset, e->length, e->nextProto, e->nextHdrOffset};
       }
    }
    return found;
-}
-
-bool sameEntry(const std::optional<orr_PktHeaderEntry> &entry, std::optional<std::array<uint16_t, 4>> expected)
-{
-   if (!entry || !expected) {
-      return !entry && !expected;
-   }
-   return entry->offset == (*expected)[0] && entry->length == (*expected)[1] &&
-          entry->nextProto == (*expected)[2] && entry->nextHdrOffset == (*expected)[3];
 }
 
 TEST_F(FramesTest, HeaderLookupByFrameKind)
@@ -243,7 +246,7 @@ TEST_F(FramesTest, HeaderLookupByFrameKind)
    struct Case {
       const char *what;
       Bytes bytes;
-      std::optional<E> l2, l3, l4;
+      Entry l2, l3, l4;
    };
    const Case cases[] = {
       {"UDP over IPv4", sampleUdp(), E{0, 14, htons(0x0800), 14}, E{14, 20, 17, 34}, E{34, 8, 0, 42}},
@@ -261,10 +264,7 @@ TEST_F(FramesTest, HeaderLookupByFrameKind)
    };
    for (const Case &c : cases) {
       SCOPED_TRACE(c.what);
-      const Layers found = lookUp(single({.bytes = c.bytes}));
-      EXPECT_TRUE(sameEntry(found.l2, c.l2));
-      EXPECT_TRUE(sameEntry(found.l3, c.l3));
-      EXPECT_TRUE(sameEntry(found.l4, c.l4));
+      EXPECT_EQ(lookUp(single({.bytes = c.bytes})), (std::array<Entry, 3>{c.l2, c.l3, c.l4}));
    }
 }
 
@@ -351,9 +351,8 @@ TEST_F(FramesTest, IteratorRemovalAndReleaseAccounting)
    ASSERT_LE(orr_PktListIterSizeOf(), ORR_PKT_LIST_ITER_MAX_SIZE);
    list = host.frames().makeList({{.bytes = Bytes(60, 0)}, {.bytes = Bytes(61, 0)}, {.bytes = Bytes(62, 0)},
                                   {.bytes = Bytes(63, 0)}});
-   alignas(void *) std::array<uint8_t, ORR_PKT_LIST_ITER_MAX_SIZE> storage{};
-   auto *iter = reinterpret_cast<orr_PktListIter *>(storage.data());
-   orr_PktListIterStart(list->list(), iter);
+   Iter storage(*list);
+   orr_PktListIter *iter = storage.get();
    std::vector<uint32_t> seen;
    while (!orr_PktListIterIsAtEnd(iter)) {
       orr_Pkt *pkt = orr_PktListIterGetPkt(iter);
@@ -375,34 +374,21 @@ TEST_F(FramesTest, IteratorRemovalAndReleaseAccounting)
 TEST_F(FramesTest, ReturningFramesWithWorkOutstandingIsAViolation)
 {
    list = host.frames().makeList({{.bytes = sampleUdp()}, {.bytes = sampleUdp()}});
-   orr_PktHeaderEntry *entry = nullptr;
-   uint8_t *data = nullptr;
-   ASSERT_EQ(orr_PktHeaderFind(list->frame(0), ORR_PKT_LAYER_2, ORR_PKT_HEADER_CLASS_L2, 1, &entry, 0), ORR_OK);
-   ASSERT_EQ(orr_PktHeaderDataGet(list->frame(0), entry, &data), ORR_OK);
-   alignas(void *) std::array<uint8_t, ORR_PKT_LIST_ITER_MAX_SIZE> storage{};
-   auto *iter = reinterpret_cast<orr_PktListIter *>(storage.data());
-   orr_PktListIterStart(list->list(), iter);
-   orr_PktListIterMove(iter);
-   (void)orr_PktListIterRemovePkt(iter);   // taken out, never released
+   ASSERT_NO_FATAL_FAILURE(mapLayer2(list->frame(0)));
+   Iter iter(*list);
+   orr_PktListIterMove(iter.get());
+   (void)orr_PktListIterRemovePkt(iter.get());   // taken out, never released
    list.reset();
-   const auto violations = takeViolations();
-   ASSERT_EQ(violations.size(), 2u);
-   EXPECT_THAT(violations[0], HasSubstr("header mapping(s) outstanding"));
-   EXPECT_THAT(violations[1], HasSubstr("never released"));
+   EXPECT_THAT(takeViolations(),
+               ElementsAre(HasSubstr("header mapping(s) outstanding"), HasSubstr("never released")));
    EXPECT_EQ(host.frames().outstandingMappings(), 0u);
 }
 
 TEST_F(FramesTest, ReleasingWithAMappingOutstandingIsAViolation)
 {
-   orr_Pkt *pkt = single({.bytes = sampleUdp()});
-   orr_PktHeaderEntry *entry = nullptr;
-   uint8_t *data = nullptr;
-   ASSERT_EQ(orr_PktHeaderFind(pkt, ORR_PKT_LAYER_2, ORR_PKT_HEADER_CLASS_L2, 1, &entry, 0), ORR_OK);
-   ASSERT_EQ(orr_PktHeaderDataGet(pkt, entry, &data), ORR_OK);
+   ASSERT_NO_FATAL_FAILURE(mapLayer2(single({.bytes = sampleUdp()})));
    orr_PktRelease(takeOut(*list));
-   const auto violations = takeViolations();
-   ASSERT_EQ(violations.size(), 1u);
-   EXPECT_THAT(violations[0], HasSubstr("released with 1 header mapping(s) outstanding"));
+   EXPECT_THAT(takeViolations(), ElementsAre(HasSubstr("released with 1 header mapping(s) outstanding")));
 }
 
 using FramesDeathTest = FramesTest;

@@ -5,9 +5,15 @@
 #include <gmock/gmock.h>
 
 #include <algorithm>
+#include <array>
 #include <cstring>
 
+using ::testing::Contains;
+using ::testing::Each;
 using ::testing::ElementsAre;
+using ::testing::FieldsAre;
+using ::testing::IsSupersetOf;
+using ::testing::NotNull;
 using ::testing::HasSubstr;
 
 // Calling sites the heap must name in its reports: functions of this
@@ -23,16 +29,6 @@ namespace {
 const void *siteA() { return reinterpret_cast<const void *>(&heapTestSiteA); }
 const void *siteB() { return reinterpret_cast<const void *>(&heapTestSiteB); }
 
-const host::HeapSite *findSite(const std::vector<host::HeapSite> &sites, std::string_view name)
-{
-   for (const auto &site : sites) {
-      if (site.site == name) {
-         return &site;
-      }
-   }
-   return nullptr;
-}
-
 using HeapTest = HostUnitTest;
 
 TEST_F(HeapTest, AccountsLiveBlocksAndBytesPerCallingSite)
@@ -41,20 +37,12 @@ TEST_F(HeapTest, AccountsLiveBlocksAndBytesPerCallingSite)
    void *a1 = orr_HeapAllocWithRA(heap, 100, siteA());
    void *a2 = orr_HeapAllocWithRA(heap, 50, siteA());
    void *b1 = orr_HeapAllocWithRA(heap, 8, siteB());
-   ASSERT_NE(a1, nullptr);
-   ASSERT_NE(a2, nullptr);
-   ASSERT_NE(b1, nullptr);
+   ASSERT_THAT((std::array{a1, a2, b1}), Each(NotNull()));
    orr_HeapFree(heap, a1);
 
-   auto sites = host.heap().sites();
-   const host::HeapSite *a = findSite(sites, "heapTestSiteA+0x0");
-   const host::HeapSite *b = findSite(sites, "heapTestSiteB+0x0");
-   ASSERT_NE(a, nullptr) << "sites are named function+offset";
-   ASSERT_NE(b, nullptr);
-   EXPECT_EQ(a->liveBlocks, 1u);
-   EXPECT_EQ(a->liveBytes, 50u);
-   EXPECT_EQ(a->allocations, 2u);
-   EXPECT_EQ(b->liveBytes, 8u);
+   // Sites are named function+offset; then live bytes, live blocks, allocations.
+   EXPECT_THAT(host.heap().sites(),
+               IsSupersetOf({FieldsAre("heapTestSiteA+0x0", 50u, 1u, 2u), FieldsAre("heapTestSiteB+0x0", 8u, 1u, 1u)}));
    EXPECT_EQ(host.heap().liveBytes(), 58u);
    EXPECT_EQ(host.heap().liveBlocks(), 2u);
    EXPECT_EQ(host.heap().peakBytes(), 158u);
@@ -90,8 +78,7 @@ TEST_F(HeapTest, FreshBlocksAreNotZeroFilledAndAnEmptyRequestIsStillABlock)
    orr_HeapID heap = makeHeap("fresh");
    auto *block = static_cast<unsigned char *>(orr_HeapAllocWithRA(heap, 32, siteA()));
    void *empty = orr_HeapAllocWithRA(heap, 0, siteA());
-   ASSERT_NE(block, nullptr);
-   ASSERT_NE(empty, nullptr);
+   ASSERT_THAT((std::array<void *, 2>{block, empty}), Each(NotNull()));
    EXPECT_EQ(std::count(block, block + 32, 0), 0);
    EXPECT_EQ(host.heap().liveBlocks(), 2u);
    orr_HeapFree(heap, block);
@@ -198,10 +185,8 @@ TEST_F(HashTableTest, TableComesFromTheHeapWithEmptyBuckets)
       EXPECT_EQ(table->buckets[i].next, &table->buckets[i]);
       EXPECT_EQ(table->buckets[i].prev, &table->buckets[i]);
    }
-   auto sites = host.heap().sites();
-   const host::HeapSite *site = findSite(sites, "Hash_Alloc");
-   ASSERT_NE(site, nullptr);
-   EXPECT_EQ(site->liveBlocks, 1u);
+   EXPECT_THAT(host.heap().sites(),
+               Contains(FieldsAre("Hash_Alloc", ::testing::_, 1u, ::testing::_)));
    Hash_Free(table);
    EXPECT_EQ(host.heap().liveBlocks(), 0u);
    orr_HeapDestroy(heap);

@@ -4,6 +4,8 @@
 #include <gmock/gmock.h>
 
 using ::testing::ElementsAre;
+using ::testing::Field;
+using ::testing::FieldsAre;
 using ::testing::HasSubstr;
 
 namespace swsec::testing {
@@ -27,13 +29,8 @@ TEST_F(LogTest, ComponentMessageIsFormattedAndCarriesTheComponentName)
    orr_LogHandle log = makeLog("swsec");
    orr_LogLevel(ORR_LOG_ERROR, log, orr_LogGetCurrentLogLevel(log), "%s: value %d (%#x)\n", orr_LogGetName(log), 42,
                 0x0bad0014u);
-   auto records = host.log().records();
-   ASSERT_EQ(records.size(), 1u);
-   EXPECT_EQ(records[0].severity, 2u);
-   EXPECT_TRUE(records[0].hasComponent);
-   EXPECT_FALSE(records[0].viaNoLevel);
-   EXPECT_EQ(records[0].component, "swsec");
-   EXPECT_EQ(records[0].text, "swsec: value 42 (0xbad0014)\n");
+   // severity, viaNoLevel, hasComponent, component, text
+   EXPECT_THAT(host.log().records(), ElementsAre(FieldsAre(2u, false, true, "swsec", "swsec: value 42 (0xbad0014)\n")));
    orr_LogUnregister(log);
 }
 
@@ -54,14 +51,9 @@ TEST_F(LogTest, MessagesWithoutAComponentAreKeptAndMarkedAndNeedASeverityOfOneOr
 {
    orr_LogLevel(ORR_LOG_INFO, nullptr, 0, "before the log exists\n");
    orr_LogNoLevel(ORR_LOG_ERROR, "Registration failed (%#x): %s\n", 0x0bad0001u, "Failure");
-   auto records = host.log().records();
-   ASSERT_EQ(records.size(), 2u);
-   EXPECT_FALSE(records[0].hasComponent);
-   EXPECT_FALSE(records[0].viaNoLevel) << "went nowhere a user would see";
-   EXPECT_EQ(records[0].severity, 1u);
-   EXPECT_FALSE(records[1].hasComponent);
-   EXPECT_TRUE(records[1].viaNoLevel);
-   EXPECT_EQ(records[1].text, "Registration failed (0xbad0001): Failure\n");
+   // The first went nowhere a user would see.
+   EXPECT_THAT(host.log().records(), ElementsAre(FieldsAre(1u, false, false, "", "before the log exists\n"),
+                                                 FieldsAre(2u, true, false, "", "Registration failed (0xbad0001): Failure\n")));
    orr_LogNoLevel(3, "what kind\n");
    EXPECT_EQ(takeViolations().size(), 1u) << "severity outside 1 and 2";
 }
@@ -70,9 +62,7 @@ TEST_F(LogTest, LongMessagesAreKeptWhole)
 {
    const std::string long_text(5000, 'x');
    orr_LogNoLevel(ORR_LOG_ERROR, "%s|\n", long_text.c_str());
-   auto records = host.log().records();
-   ASSERT_EQ(records.size(), 1u);
-   EXPECT_EQ(records[0].text, long_text + "|\n");
+   EXPECT_THAT(host.log().records(), ElementsAre(Field(&host::LogRecord::text, long_text + "|\n")));
 }
 
 TEST_F(LogTest, RegistrationRefusesASecondComponentOfTheSameNameAnExtraSettingAndAnUnknownHeap)

@@ -6,6 +6,8 @@
 #include <cstring>
 
 using ::testing::ElementsAre;
+using ::testing::Field;
+using ::testing::FieldsAre;
 using ::testing::HasSubstr;
 
 namespace swsec::testing {
@@ -18,6 +20,7 @@ struct Delivery {
    std::string name;
    std::string payload;
    bool posterHeldLocks;
+   bool operator==(const Delivery &) const = default;
 };
 std::vector<Delivery> deliveries;
 
@@ -107,21 +110,14 @@ TEST_F(PortsetsTest, MessagesWaitUntilThePosterLetsGoOfItsLocks)
    EXPECT_EQ(host.portsets().pendingDeliveries(), 2u);
    orr_SpinlockWriteUnlock(config);
 
-   ASSERT_EQ(deliveries.size(), 2u);
-   EXPECT_EQ(deliveries[0].portID, 10u);
-   EXPECT_EQ(deliveries[0].name, "portdb.entry.added");
-   EXPECT_EQ(deliveries[0].payload, "one");
-   EXPECT_FALSE(deliveries[0].posterHeldLocks);
-   EXPECT_EQ(deliveries[1].name, "portdb.entry.removed");
-   EXPECT_EQ(deliveries[1].payload, "two");
+   EXPECT_THAT(deliveries, ElementsAre(Delivery{10, "portdb.entry.added", "one", false},
+                                       Delivery{11, "portdb.entry.removed", "two", false}));
    EXPECT_EQ(host.portsets().pendingDeliveries(), 0u);
 
-   const auto posted = host.portsets().posted();
-   ASSERT_EQ(posted.size(), 2u);
-   EXPECT_EQ(posted[1].portset, "vswitch0");
-   EXPECT_EQ(posted[1].portID, 11u);
-   EXPECT_EQ(posted[1].msgClass, kClass);
-   EXPECT_EQ(std::string(posted[1].payload.begin(), posted[1].payload.end()), "two");
+   // portset, portID, msgClass, name, payload
+   EXPECT_THAT(host.portsets().posted(),
+               ElementsAre(FieldsAre("vswitch0", 10u, kClass, "portdb.entry.added", ElementsAre('o', 'n', 'e')),
+                           FieldsAre("vswitch0", 11u, kClass, "portdb.entry.removed", ElementsAre('t', 'w', 'o'))));
 
    orr_PortsetUnregisterMessageCB(listener);
    orr_SpinlockDestroy(config);
@@ -143,10 +139,8 @@ TEST_F(PortsetsTest, ListenersMatchPortsetPortAndClass)
    EXPECT_EQ(orr_PortsetPostMessage(vswitch, 11, kClass, &message.header), ORR_OK);
    EXPECT_EQ(orr_PortsetPostMessage(vswitch, 10, kClass, &message.header), ORR_OK);
    orr_PortsetUnlockShared(vswitch);
-   ASSERT_EQ(deliveries.size(), 3u) << "port 11: the catch-all; port 10: both";
-   EXPECT_EQ(deliveries[0].portID, 11u);
-   EXPECT_EQ(deliveries[1].portID, 10u);
-   EXPECT_EQ(deliveries[2].portID, 10u);
+   const auto portID = [](uint32_t id) { return Field(&Delivery::portID, id); };
+   EXPECT_THAT(deliveries, ElementsAre(portID(11), portID(10), portID(10))) << "port 11: the catch-all; port 10: both";
    for (auto handle : handles) {
       orr_PortsetUnregisterMessageCB(handle);
    }

@@ -5,6 +5,7 @@
 #include <gmock/gmock.h>
 
 using ::testing::ElementsAre;
+using ::testing::FieldsAre;
 using ::testing::HasSubstr;
 
 namespace swsec::testing {
@@ -42,10 +43,7 @@ TEST_F(PlexTest, WriteHandsTheBytesAndTheirCountToTheHandler)
    ASSERT_EQ(orr_PlexClientPortRegister(&handle, 0, "com.example.agents", &writeOps), ORR_OK);
    seen.answer = ORR_TRY_AGAIN;
    EXPECT_EQ(host.plex().write("com.example.agents", "a b:c"), ORR_TRY_AGAIN) << "the handler's status comes back";
-   EXPECT_EQ(seen.calls, 1);
-   EXPECT_TRUE(seen.contextWasNull);
-   EXPECT_EQ(seen.bytes, "a b:c");
-   EXPECT_EQ(seen.count, 5);
+   EXPECT_THAT(seen, FieldsAre(1, true, "a b:c", 5, ORR_TRY_AGAIN));
    EXPECT_EQ(host.plex().write("com.example.agents", ""), ORR_TRY_AGAIN);
    EXPECT_EQ(seen.count, 0);
    EXPECT_EQ(orr_PlexClientPortUnregister(handle), ORR_OK);
@@ -96,14 +94,9 @@ TEST_F(SifraTest, FastPathsAreUniqueByNameAndListedWithTheirOperationsAndAgent)
    EXPECT_EQ(orr_SifraRegisterFastPath("future", 0x2000000, 0x2000000, 1, &opsA, nullptr, &refused),
              ORR_NOT_SUPPORTED) << "needs a newer host";
    EXPECT_EQ(refused, nullptr);
-   auto fastPaths = host.sifra().fastPaths();
-   ASSERT_EQ(fastPaths.size(), 2u);
-   EXPECT_EQ(fastPaths[0].name, "agent-a");
-   EXPECT_EQ(fastPaths[0].ops, &opsA);
-   EXPECT_EQ(fastPaths[0].agent, &agentA) << "the first registration stands";
-   EXPECT_EQ(fastPaths[0].module, 77u);
-   EXPECT_EQ(fastPaths[0].revision, 0x1010000u);
-   EXPECT_EQ(fastPaths[1].name, "agent-b");
+   // name, revision, compatRevision, module, ops, agent: the first registration stands.
+   EXPECT_THAT(host.sifra().fastPaths(), ElementsAre(FieldsAre("agent-a", 0x1010000u, 0x1010000u, 77u, &opsA, &agentA),
+                                                     FieldsAre("agent-b", 0x1010000u, 0x1010000u, 77u, &opsB, &agentB)));
    auto found = host.sifra().fastPath("agent-b");
    ASSERT_TRUE(found.has_value());
    EXPECT_EQ(found->agent, &agentB);
@@ -146,16 +139,12 @@ TEST_F(PortsetListenerTest, RegistrationsAreKeptUntilWithdrawn)
    ASSERT_EQ(orr_PortsetRegisterMessageCB(nullptr, 12, 1, listener, nullptr, &second), ORR_OK);
    EXPECT_NE(first, 0u);
    EXPECT_NE(first, second);
-   auto listeners = host.portsets().listeners();
-   ASSERT_EQ(listeners.size(), 2u);
-   EXPECT_EQ(listeners[0].handle, first);
-   EXPECT_EQ(listeners[0].msgClass, 0x0008000000000000ull);
-   EXPECT_EQ(listeners[0].callback, &listener);
-   EXPECT_EQ(listeners[0].priv, &priv);
-   EXPECT_EQ(listeners[1].portID, 12u);
+   // handle, portset, portID, msgClass, callback, priv
+   const auto secondInfo = FieldsAre(second, nullptr, 12u, 1u, &listener, nullptr);
+   EXPECT_THAT(host.portsets().listeners(),
+               ElementsAre(FieldsAre(first, nullptr, 0u, 0x0008000000000000ull, &listener, &priv), secondInfo));
    orr_PortsetUnregisterMessageCB(first);
-   ASSERT_EQ(host.portsets().listeners().size(), 1u);
-   EXPECT_EQ(host.portsets().listeners()[0].handle, second);
+   EXPECT_THAT(host.portsets().listeners(), ElementsAre(secondInfo));
    orr_PortsetUnregisterMessageCB(first);
    EXPECT_EQ(takeViolations().size(), 1u);
    orr_PortsetUnregisterMessageCB(second);

@@ -10,6 +10,7 @@
 #include <thread>
 
 using ::testing::ElementsAre;
+using ::testing::FieldsAre;
 using ::testing::HasSubstr;
 using namespace std::chrono_literals;
 
@@ -43,15 +44,6 @@ void *tag(int id)
    return reinterpret_cast<void *>(static_cast<intptr_t>(id));
 }
 
-std::vector<int> ids()
-{
-   std::vector<int> result;
-   for (const auto &firing : firings) {
-      result.push_back(firing.id);
-   }
-   return result;
-}
-
 class TimerTest : public HostUnitTest {
 public:
    TimerTest() : domain(makeDomain()), queue(makeQueue()), start(uptimeUs()) { firings.clear(); }
@@ -81,8 +73,7 @@ TEST_F(TimerTest, UptimeAndCyclesDeriveFromOneVirtualClock)
    host.clock().advance(2'500'000us);
    orr_TimeVal now{};
    orr_GetUptime(&now);
-   EXPECT_EQ(now.sec, 1002);
-   EXPECT_EQ(now.usec, 500'000);
+   EXPECT_THAT(now, FieldsAre(1002, 500'000));
    EXPECT_EQ(orr_GetTimerCycles() - cyclesBefore, cyclesPerSecond * 5 / 2);
    EXPECT_EQ(host.clock().now(), 2'500'000us);
 }
@@ -97,7 +88,7 @@ TEST_F(TimerTest, AdvanceFiresDueTimersInDueOrderAtTheirDueTimes)
    EXPECT_EQ(uptimeUs(), start + 250);
    EXPECT_EQ(host.clock().pendingTimers(), 1u);
    host.clock().advance(50us);
-   EXPECT_THAT(ids(), ElementsAre(1, 2, 3));
+   EXPECT_THAT(firings, ElementsAre(Firing{1, start + 100}, Firing{2, start + 200}, Firing{3, start + 300}));
    EXPECT_EQ(host.clock().pendingTimers(), 0u);
 }
 
@@ -135,26 +126,27 @@ TEST_F(TimerTest, ZeroTimeoutIsDueAtOnceButFiresOnlyWhenAsked)
    EXPECT_EQ(host.clock().now(), 0us);
 }
 
-struct SelfRemoving {
-   orr_Timer timer = 0;
-   int calls = 0;
-   bool removed = false;
-   static void callback(void *data)
-   {
-      auto *self = static_cast<SelfRemoving *>(data);
-      if (++self->calls == 2) {
-         self->removed = orr_TimerRemoveSync(self->timer);
-      }
-   }
-};
+// Runs the callable a timer's data points to.
+template <typename Fn>
+void invoke(void *data)
+{
+   (*static_cast<Fn *>(data))();
+}
 
 TEST_F(TimerTest, CallbackRemovingItsOwnTimerStopsItWithoutWaitingForItself)
 {
-   SelfRemoving self;
-   self.timer = schedule(&self, 10, 10, SelfRemoving::callback);
+   orr_Timer timer = 0;
+   int calls = 0;
+   bool removed = false;
+   auto callback = [&] {
+      if (++calls == 2) {
+         removed = orr_TimerRemoveSync(timer);
+      }
+   };
+   timer = schedule(&callback, 10, 10, invoke<decltype(callback)>);
    host.clock().advance(100us);
-   EXPECT_EQ(self.calls, 2);
-   EXPECT_TRUE(self.removed);
+   EXPECT_EQ(calls, 2);
+   EXPECT_TRUE(removed);
    EXPECT_EQ(host.clock().pendingTimers(), 0u);
 }
 
@@ -167,30 +159,22 @@ TEST_F(TimerTest, RemoveSyncTellsWhetherTheTimerWasStillPending)
    EXPECT_FALSE(orr_TimerRemoveSync(fired)) << "a one-shot timer that fired is gone";
    EXPECT_FALSE(orr_TimerRemoveSync(0));
    host.clock().advance(100us);
-   EXPECT_THAT(ids(), ElementsAre(2));
+   EXPECT_THAT(firings, ElementsAre(Firing{2, start + 10}));
 }
-
-struct Blocking {
-   std::promise<void> entered;
-   std::shared_future<void> release;
-   std::atomic<bool> finished{false};
-   static void callback(void *data)
-   {
-      auto *self = static_cast<Blocking *>(data);
-      self->entered.set_value();
-      self->release.wait();
-      self->finished = true;
-   }
-};
 
 TEST_F(TimerTest, RemoveSyncWaitsForACallbackRunningOnAnotherThread)
 {
+   std::promise<void> entered;
    std::promise<void> release;
-   Blocking blocking;
-   blocking.release = release.get_future().share();
-   orr_Timer timer = schedule(&blocking, 10, ORR_TIMER_ONE_SHOT, Blocking::callback);
+   std::atomic<bool> finished{false};
+   auto callback = [&, released = release.get_future().share()] {
+      entered.set_value();
+      released.wait();
+      finished = true;
+   };
+   orr_Timer timer = schedule(&callback, 10, ORR_TIMER_ONE_SHOT, invoke<decltype(callback)>);
    std::thread advancer([&] { host.clock().advance(10us); });
-   blocking.entered.get_future().wait();
+   entered.get_future().wait();
 
    std::atomic<bool> removerStarted{false};
    bool removed = false;
@@ -198,7 +182,7 @@ TEST_F(TimerTest, RemoveSyncWaitsForACallbackRunningOnAnotherThread)
    std::thread remover([&] {
       removerStarted = true;
       removed = orr_TimerRemoveSync(timer);
-      finishedWhenRemoved = blocking.finished;
+      finishedWhenRemoved = finished;
    });
    while (!removerStarted) {
       std::this_thread::yield();
@@ -206,7 +190,7 @@ TEST_F(TimerTest, RemoveSyncWaitsForACallbackRunningOnAnotherThread)
    release.set_value();
    remover.join();
    advancer.join();
-   EXPECT_TRUE(blocking.finished);
+   EXPECT_TRUE(finished);
    // The remover either waited for the running callback, or came after it
    // had finished and found nothing left to remove.
    if (removed) {
@@ -225,25 +209,19 @@ TEST_F(TimerTest, SleepMovesVirtualTimeAndFiresWhatFallsDue)
    EXPECT_EQ(host.clock().sleeps(), 1u);
 }
 
-struct RankedWork {
-   orr_Spinlock lock;
-   bool done = false;
-   static void callback(void *data)
-   {
-      auto *self = static_cast<RankedWork *>(data);
-      orr_SpinlockLock(self->lock);
-      self->done = true;
-      orr_SpinlockUnlock(self->lock);
-   }
-};
-
 TEST_F(TimerTest, CallbackMayTakeLocksAboveItsRank)
 {
-   RankedWork work{makeLock(domain, "sifg.fastpath", 2)};
-   schedule(&work, 0, ORR_TIMER_ONE_SHOT, RankedWork::callback);
+   const orr_Spinlock lock = makeLock(domain, "sifg.fastpath", 2);
+   bool done = false;
+   auto callback = [&] {
+      orr_SpinlockLock(lock);
+      done = true;
+      orr_SpinlockUnlock(lock);
+   };
+   schedule(&callback, 0, ORR_TIMER_ONE_SHOT, invoke<decltype(callback)>);
    host.clock().runDue();
-   EXPECT_TRUE(work.done);
-   orr_SpinlockDestroy(work.lock);
+   EXPECT_TRUE(done);
+   orr_SpinlockDestroy(lock);
 }
 
 TEST_F(TimerTest, DestroyingAQueueWithPendingTimersIsAViolationAndCancelsThem)

@@ -7,7 +7,6 @@
 
 enum TinyMode : int {
    TinyModeClean = 0,
-   TinyModeFailCleanly = 1,          /* init fails after undoing its work */
    TinyModeFailLeavingObjects = 2,   /* init fails and leaves registration, heap and block */
    TinyModeLeakAtUnload = 3,         /* cleanup destroys the heap with the block live */
    TinyModeUseDuringUnload = 4,      /* cleanup returns the status of taking a use */
@@ -48,10 +47,6 @@ static int TinyInit(void)
 {
    ++tinyInitCalls;
    if (orr_ModuleRegister(&tinyModuleID, ORR_MODULE_INTERFACE_REVISION) != ORR_OK) {
-      return 1;
-   }
-   if (tinyMode == TinyModeFailCleanly) {
-      (void)orr_ModuleUnregister(tinyModuleID);
       return 1;
    }
    orr_HeapProps props = {};

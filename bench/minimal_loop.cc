@@ -11,7 +11,7 @@ namespace {
 
 constexpr uint16_t kEtherIpv4 = 0x0800;
 constexpr uint32_t kEthHeaderLen = 14;
-constexpr uint32_t kIpv4SrcOffset = kEthHeaderLen + 12;
+constexpr uint32_t kIpv4SrcInHeader = 12;
 constexpr uint32_t kIpv4ProtocolOffset = kEthHeaderLen + 9;
 constexpr uint8_t kIpProtoUdp = 17;
 constexpr uint16_t kDhcpServerPort = 67;
@@ -44,6 +44,15 @@ const MinimalLoop::Entry *MinimalLoop::find(const Key &key) const
    return nullptr;
 }
 
+bool MinimalLoop::isBound(orr_Pkt *pkt, const uint8_t *ethHdr, const uint8_t *ipHdr) const
+{
+   Key key{};
+   key.vlanId = orr_PktVlanIDGet(pkt);
+   std::memcpy(key.macAddr, ethHdr + 6, 6);
+   std::memcpy(&key.ipAddr, ipHdr + kIpv4SrcInHeader, 4);
+   return find(key) != nullptr;
+}
+
 uint32_t MinimalLoop::run(orr_PktList *list) const
 {
    alignas(void *) unsigned char iterSpace[ORR_PKT_LIST_ITER_MAX_SIZE];
@@ -68,11 +77,7 @@ uint32_t MinimalLoop::run(orr_PktList *list) const
             continue;
          }
       }
-      Key key{};
-      key.vlanId = orr_PktVlanIDGet(pkt);
-      std::memcpy(key.macAddr, frame + 6, 6);
-      std::memcpy(&key.ipAddr, frame + kIpv4SrcOffset, 4);
-      if (find(key) == nullptr) {
+      if (!isBound(pkt, frame, frame + kEthHeaderLen)) {
          ++drops;
       }
    }
@@ -106,14 +111,8 @@ uint32_t MinimalLoop::runViaHeaders(orr_PktList *list) const
             toServer = (udpHdr[2] << 8 | udpHdr[3]) == kDhcpServerPort;
             orr_PktHeaderDataRelease(pkt, l4, udpHdr, 0);
          }
-         if (!toServer) {
-            Key key{};
-            key.vlanId = orr_PktVlanIDGet(pkt);
-            std::memcpy(key.macAddr, ethHdr + 6, 6);
-            std::memcpy(&key.ipAddr, ipHdr + 12, 4);
-            if (find(key) == nullptr) {
-               ++drops;
-            }
+         if (!toServer && !isBound(pkt, ethHdr, ipHdr)) {
+            ++drops;
          }
          orr_PktHeaderDataRelease(pkt, ip, ipHdr, 0);
       }

@@ -41,6 +41,8 @@ private:
    };
 
    const Entry *find(const Key &key) const;
+   // Whether the frame's VLAN, source MAC and IPv4 source are a binding.
+   bool isBound(orr_Pkt *pkt, const uint8_t *ethHdr, const uint8_t *ipHdr) const;
 
    static constexpr uint32_t kBuckets = 16;
    std::vector<Entry> entries_;

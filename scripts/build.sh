@@ -23,6 +23,9 @@ case "$flavour" in
   *) echo "build: unknown flavour '$flavour' (gcc, clang, asan, tsan, release)" >&2; exit 2 ;;
 esac
 
+# A compiler cache, where one is installed, makes rebuilds in several checkouts cheap.
+if command -v ccache >/dev/null; then args+=(-DCMAKE_CXX_COMPILER_LAUNCHER=ccache -DCMAKE_C_COMPILER_LAUNCHER=ccache); fi
+
 dir="build/$flavour"
 cmake -S . -B "$dir" "${args[@]}" >/dev/null
 ninja -C "$dir" -j "$(nproc)" "$@"

@@ -6,6 +6,7 @@
 #include "framework/sifra_generic_lock.h"
 #include "framework/sifra_generic_log.h"
 #include "framework/sifra_generic_ops.h"
+#include "framework/sifra_generic_slow_path.h"
 #include "platform/orr_text.h"
 #include "swsec/swsec_agent.h"
 #include "swsec/swsec_security_property.h"
@@ -178,6 +179,11 @@ void SifraGenericCleanupFastPathAgent(SifraGenericFastPathAgent *agent)
    if (agent->fastPath != nullptr) {
       orr_SifraUnregisterFastPath(agent->fastPath);
       agent->fastPath = nullptr;
+   }
+
+   /* An attach callback still scheduled would run on a freed agent. */
+   if (agent->lock != nullptr) {
+      SifraGenericCancelAttach(agent);
    }
 
    if (agent->lock != nullptr) {

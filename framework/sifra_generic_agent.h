@@ -149,7 +149,8 @@ orr_Status SifraGenericAgentPropWrite(void *portset, void *port, void *extra, co
  * Releases an agent already taken off agentList: property, fast path
  * registration, lock; then complements the magic and frees the record.
  * The host has destroyed the agent's filters and slow paths by the time
- * its fast path is withdrawn, so both lists are empty.
+ * its fast path is withdrawn, so both lists are empty; an attach callback
+ * still scheduled is cancelled before the record goes.
  */
 void SifraGenericCleanupFastPathAgent(SifraGenericFastPathAgent *agent);
 

@@ -126,10 +126,17 @@ orr_Status SifraGenericDestroyFilter(orr_SifraFilter record)
    orr_SpinlockLock(agent->lock);
    orr_SpinlockLock(filter->lock);
    /*
-    * An attached filter is detached here first. A filter becomes attached
-    * only once a slow path has registered, and the framework does not take
-    * slow path registrations yet, so no filter can be attached.
+    * An attached filter is detached first. After a transient clear failure
+    * it is still attached and counted by its slow path: freeing it would
+    * leave that count up for good (and the slow path's unregistration busy
+    * for ever), so the host is asked to call again.
     */
+   if (filter->attachState == SifraGenericAttachAttached &&
+       SifraGenericDetachSlowPath(filter) == ORR_BUSY) {
+      orr_SpinlockUnlock(filter->lock);
+      orr_SpinlockUnlock(agent->lock);
+      return ORR_BUSY;
+   }
    if (filter->refCount > 1) {
       orr_SpinlockUnlock(filter->lock);
       orr_SpinlockUnlock(agent->lock);

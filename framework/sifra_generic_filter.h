@@ -87,6 +87,12 @@ static inline bool SifraGenericFilterIsValid(const void *filter)
           static_cast<const SifraGenericFilter *>(filter)->magic == SIFRAGENERIC_FILTER_MAGIC;
 }
 
+static inline SifraGenericFilter *SifraGenericFilterFromLinks(orr_ListLinks *links)
+{
+   return reinterpret_cast<SifraGenericFilter *>(reinterpret_cast<char *>(links) -
+                                                 offsetof(SifraGenericFilter, links));
+}
+
 /*
  * Reads the filter's name, failure policy, endpoint type and, for a VM's
  * vNIC, its VM UUID (none is tolerated) and vNIC index from the host. At

@@ -230,6 +230,9 @@ struct FilterInfo {
    // orr_SifraSetMinPktMappedLen: length and directions (bit mask of ORR_SIFRA_DIR_*).
    uint32_t minMappedLen = 0;
    uint32_t minMappedDirections = 0;
+   // The slow path the host paired the filter with (a set request whose
+   // reply said success), until a clear request succeeds.
+   std::optional<uint32_t> slowPathID;
 };
 
 struct DestroyResult {
@@ -247,6 +250,86 @@ struct PacketsResult {
    orr_Status status = ORR_OK;
    std::vector<size_t> kept;     // indices of the input frames still in the list, in order
    size_t released = 0;          // frames the module released
+};
+
+// ---------------------------------------------------------------- Sifra slow paths
+
+// The requests a module makes about a filter's slow path. An accepted
+// asynchronous request (Set) owes the module exactly one reply; Clear is
+// answered by the call itself.
+enum class SlowPathRequestKind { Set, Clear };
+
+struct SlowPathInfo {
+   uint32_t id = 0;
+   std::string agent;                      // the fast path's name
+   orr_SifraSlowPath record = nullptr;     // the module's record, from registerSlowPath
+   bool withdrawing = false;               // unregistration answered ORR_BUSY so far
+   uint32_t unregisterCalls = 0;
+};
+
+// A request as the host saw it.
+struct SlowPathRequest {
+   SlowPathRequestKind kind = SlowPathRequestKind::Set;
+   FilterId filter = 0;
+   uint32_t slowPathID = 0;      // Set: the slow path asked for
+   int32_t timeoutMs = 0;        // Set: the communication timeout given
+   orr_Status result = ORR_OK;   // the call's status (Set: ORR_OK = accepted)
+};
+
+// A reply the host owes the module.
+struct PendingReply {
+   SlowPathRequestKind kind = SlowPathRequestKind::Set;
+   FilterId filter = 0;
+   uint32_t slowPathID = 0;
+   orr_Status status = ORR_OK;   // the outcome it will carry
+};
+
+// Slow paths as the hypervisor drives them. What a request does is
+// scripted: a request refused at once, or a clear's failure, is a fault
+// ("orr_SifraSetSlowPath", "orr_SifraClearSlowPath"); an accepted request's
+// reply status comes from scriptReplies, else the default (ORR_OK). Replies
+// wait until the test delivers them (or auto-delivery is on). The host
+// checks the contract: a request made with a module spinlock held, a
+// second reply owed for one filter, a reply lost with its filter, or a
+// reply delivered from a context holding a lock are violations.
+class SlowPaths {
+public:
+   virtual ~SlowPaths() = default;
+   // registerSlowPath of the fast path `agent` with `id`: the module's
+   // status. Throws std::invalid_argument for an unknown fast path or an ID
+   // already registered.
+   virtual orr_Status registerSlowPath(std::string_view agent, uint32_t id) = 0;
+   // One unregisterSlowPath call: ORR_BUSY leaves the slow path
+   // withdrawing (retryWithdrawals calls again); any other status forgets it.
+   virtual orr_Status unregisterSlowPath(uint32_t id) = 0;
+   // Calls unregisterSlowPath again for every withdrawing slow path, oldest
+   // first, as the hypervisor keeps doing; returns how many still are.
+   virtual size_t retryWithdrawals() = 0;
+   // Registered slow paths (withdrawing ones included), oldest first.
+   virtual std::vector<SlowPathInfo> registered() const = 0;
+
+   // The next accepted requests of `kind` reply with these statuses in order.
+   virtual void scriptReplies(SlowPathRequestKind kind, std::vector<orr_Status> statuses) = 0;
+   // The reply status once the script is used up.
+   virtual void setDefaultReply(SlowPathRequestKind kind, orr_Status status) = 0;
+   // Called on the requesting thread after each request's outcome is
+   // decided, before it returns to the module (whose locks are released
+   // then): a test may call into the module from here.
+   virtual void onRequest(std::function<void(const SlowPathRequest &)> hook) = 0;
+
+   // Replies owed, oldest first.
+   virtual std::vector<PendingReply> pendingReplies() const = 0;
+   // Delivers the replies owed when called (to one filter, or all), oldest
+   // first, on the calling thread, which must hold no lock; replies owed
+   // for requests the module makes meanwhile wait for the next call.
+   // Returns how many were delivered.
+   virtual size_t deliverReplies(std::optional<FilterId> filter = std::nullopt) = 0;
+   // With auto-delivery, the replies owed are delivered after every facade
+   // call into the module, as a hypervisor completes requests on its own.
+   virtual void setAutoDeliver(bool on) = 0;
+   // Every request so far, in order.
+   virtual std::vector<SlowPathRequest> requests() const = 0;
+   virtual void clearRequests() = 0;
 };
 
 class Sifra {
@@ -272,8 +355,8 @@ public:
    // keeps it (the hypervisor would call again).
    virtual orr_Status destroyFilter(FilterId id) = 0;
    // Destroys as the hypervisor does: calls again while the module answers
-   // ORR_BUSY, advancing virtual time by 1 ms between calls, at most
-   // `maxAttempts` calls.
+   // ORR_BUSY, advancing virtual time by 1 ms and delivering the filter's
+   // owed slow path replies between calls, at most `maxAttempts` calls.
    virtual DestroyResult destroyFilterAsHypervisor(FilterId id, uint32_t maxAttempts = 100) = 0;
    // Replaces the filter's configuration, then calls configurationChanged.
    virtual orr_Status changeConfiguration(FilterId id, const FilterConfig &config) = 0;
@@ -307,6 +390,9 @@ public:
                                    std::vector<uint8_t> &buffer) = 0;
    // The length a read needs, or nothing when the module has no value.
    virtual std::optional<uint32_t> pollProperty(std::string_view property, std::optional<FilterId> filter) = 0;
+
+   // ---- slow paths
+   virtual SlowPaths &slowPaths() = 0;
 };
 
 // ---------------------------------------------------------------- portsets

@@ -337,6 +337,16 @@ bool LockRegistry::threadHoldsNothing()
    return threadHolds().empty();
 }
 
+std::string LockRegistry::heldSpinlock()
+{
+   for (const Hold &hold : threadHolds()) {
+      if (hold.kind == HoldKind::Plain || hold.kind == HoldKind::Read || hold.kind == HoldKind::Write) {
+         return std::string(hold.name);
+      }
+   }
+   return {};
+}
+
 void LockRegistry::requireNoSpinlockHeld(const char *op)
 {
    for (const Hold &hold : threadHolds()) {

@@ -58,6 +58,10 @@ public:
    // True when the calling thread holds no lock and runs no callback.
    bool threadHoldsNothing();
 
+   // The name of a spinlock the calling thread holds (callback contexts do
+   // not count); empty when it holds none.
+   std::string heldSpinlock();
+
    // Aborts when the calling thread holds a spinlock (or runs a timer
    // callback, which counts as one): `op` is about to sleep.
    void requireNoSpinlockHeld(const char *op);

@@ -24,6 +24,7 @@ FilterInfo infoOf(const SifraRegistry::Filter &filter)
    // Both directions share a length when the module set them together.
    info.minMappedLen = std::max(filter.minMappedLen[0], filter.minMappedLen[1]);
    info.minMappedDirections = filter.minMappedDirections;
+   info.slowPathID = filter.slowPathID;
    return info;
 }
 
@@ -59,8 +60,43 @@ std::optional<SifraRegistry::Call> SifraRegistry::callOf(FilterId id, uint32_t d
 
 void SifraRegistry::afterModuleCall()
 {
-   // The host regains control: messages posted during the call go out now.
+   // The host regains control: messages posted during the call go out now,
+   // and owed replies too when the host completes requests on its own.
    portsets_.deliverIfQuiescent();
+   slowPaths_.afterModuleCall();
+}
+
+void SifraRegistry::stepTime()
+{
+   if (timers_.isVirtual()) {
+      timers_.advance(std::chrono::milliseconds(1));
+   }
+}
+
+std::optional<FilterId> SifraRegistry::filterIdOf(orr_SifraFilterHandle handle) const
+{
+   std::lock_guard guard(mutex_);
+   for (const auto &[id, filter] : filters_) {
+      if (filter.get() == handle) {
+         return id;
+      }
+   }
+   return std::nullopt;
+}
+
+orr_SifraFilter SifraRegistry::createdRecordOf(FilterId id) const
+{
+   std::lock_guard guard(mutex_);
+   auto found = filters_.find(id);
+   return found != filters_.end() && found->second->created ? found->second->record : nullptr;
+}
+
+void SifraRegistry::setHostSlowPath(FilterId id, std::optional<uint32_t> slowPathID)
+{
+   std::lock_guard guard(mutex_);
+   if (auto found = filters_.find(id); found != filters_.end()) {
+      found->second->slowPathID = slowPathID;
+   }
 }
 
 orr_Status SifraRegistry::createFilter(std::string_view agent, uint32_t portID, const FilterConfig &config,
@@ -120,8 +156,11 @@ orr_Status SifraRegistry::destroyFilter(FilterId id)
    }
    const orr_Status status = call->ops->destroyFilter != nullptr ? call->ops->destroyFilter(call->record) : ORR_OK;
    if (status == ORR_OK) {
-      std::lock_guard guard(mutex_);
-      filters_.erase(id);
+      {
+         std::lock_guard guard(mutex_);
+         filters_.erase(id);
+      }
+      slowPaths_.filterGone(id);
    }
    afterModuleCall();
    return status;
@@ -133,6 +172,7 @@ DestroyResult SifraRegistry::destroyFilterAsHypervisor(FilterId id, uint32_t max
    while (result.attempts < maxAttempts) {
       if (result.attempts != 0) {
          timers_.advance(std::chrono::milliseconds(1));
+         (void)slowPaths_.deliverReplies(id);
       }
       ++result.attempts;
       result.status = destroyFilter(id);
@@ -159,8 +199,9 @@ void SifraRegistry::destroyFiltersOf(const FastPath *fastPath)
    for (FilterId id : ids) {
       DestroyResult result;
       while (result.attempts < kMaxAttempts) {
-         if (result.attempts != 0 && timers_.isVirtual()) {
-            timers_.advance(std::chrono::milliseconds(1));
+         if (result.attempts != 0) {
+            stepTime();
+            (void)slowPaths_.deliverReplies(id);
          }
          ++result.attempts;
          auto call = callOf(id);
@@ -175,6 +216,7 @@ void SifraRegistry::destroyFiltersOf(const FastPath *fastPath)
          name = filters_.at(id)->config.name;
          filters_.erase(id);
       }
+      slowPaths_.filterGone(id);
       if (result.status != ORR_OK) {
          violations_.report("orr_SifraUnregisterFastPath: filter '" + name + "' of fast path '" +
                             fastPath->info.name + "' could not be destroyed after " +

@@ -29,6 +29,7 @@ struct SifraRegistry::Filter final : orr_SifraFilterHandleOpaque {
    bool created = false;                   // createFilter succeeded
    std::array<uint32_t, 2> minMappedLen{};   // by direction: RX, TX
    uint32_t minMappedDirections = 0;
+   std::optional<uint32_t> slowPathID;     // the host's pairing (FilterInfo::slowPathID)
 };
 
 }  // namespace swsec::host

@@ -32,9 +32,10 @@ std::vector<const Record *> inOrder(const auto &records)
 
 }  // namespace
 
-SifraRegistry::SifraRegistry(Violations &violations, FaultTable &faults, PortsetService &portsets,
-                             FrameStore &frames, TimerService &timers)
-   : violations_(violations), faults_(faults), portsets_(portsets), frames_(frames), timers_(timers)
+SifraRegistry::SifraRegistry(Violations &violations, FaultTable &faults, LockRegistry &locks,
+                             PortsetService &portsets, FrameStore &frames, TimerService &timers)
+   : violations_(violations), faults_(faults), portsets_(portsets), frames_(frames), timers_(timers),
+     slowPaths_(*this, violations, faults, locks)
 {
 }
 
@@ -80,8 +81,10 @@ void SifraRegistry::unregisterFastPath(orr_SifraFastPath fastPath)
       }
    }
    if (known != nullptr) {
-      // The module relies on its filters being gone when this returns.
+      // The module relies on its filters and slow paths being gone when
+      // this returns.
       destroyFiltersOf(known);
+      slowPaths_.withdrawAllOf(known);
       std::lock_guard guard(mutex_);
       fastPaths_.erase(fastPath);
       return;
@@ -126,8 +129,8 @@ void SifraRegistry::unregisterProperty(orr_SifraPropertyHandle handle)
 
 std::vector<std::string> SifraRegistry::purge(std::string_view when)
 {
+   std::vector<std::string> problems = slowPaths_.purge(when);
    std::lock_guard guard(mutex_);
-   std::vector<std::string> problems;
    for (const FastPath *fastPath : inOrder<FastPath>(fastPaths_)) {
       problems.push_back(std::string(when) + ": Sifra fast path '" + fastPath->info.name + "' is still registered");
    }
@@ -155,6 +158,17 @@ std::optional<FastPathInfo> SifraRegistry::fastPath(std::string_view name) const
    for (const auto &[key, fastPath] : fastPaths_) {
       if (fastPath->info.name == name) {
          return fastPath->info;
+      }
+   }
+   return std::nullopt;
+}
+
+std::optional<SifraRegistry::FastPathRef> SifraRegistry::fastPathRef(std::string_view name) const
+{
+   std::lock_guard guard(mutex_);
+   for (const auto &[key, fastPath] : fastPaths_) {
+      if (fastPath->info.name == name) {
+         return FastPathRef{fastPath.get(), fastPath->info};
       }
    }
    return std::nullopt;

@@ -7,6 +7,7 @@
 #include "host/frames.h"
 #include "host/host.h"
 #include "host/portsets.h"
+#include "host/sifra_slow_paths.h"
 #include "host/timers.h"
 #include "host/violations.h"
 
@@ -21,8 +22,8 @@ namespace swsec::host {
 
 class SifraRegistry final : public Sifra {
 public:
-   SifraRegistry(Violations &violations, FaultTable &faults, PortsetService &portsets, FrameStore &frames,
-                 TimerService &timers);
+   SifraRegistry(Violations &violations, FaultTable &faults, LockRegistry &locks, PortsetService &portsets,
+                 FrameStore &frames, TimerService &timers);
    ~SifraRegistry() override;
 
    // Platform operations.
@@ -46,6 +47,23 @@ public:
    // Reports and removes registrations still present.
    std::vector<std::string> purge(std::string_view when);
 
+   // For the slow path driver.
+   SlowPathDriver &slowPathDriver() { return slowPaths_; }
+   // The filter of a host handle, created or still in its creation.
+   std::optional<FilterId> filterIdOf(orr_SifraFilterHandle handle) const;
+   // The module's record of a created filter; null otherwise.
+   orr_SifraFilter createdRecordOf(FilterId id) const;
+   void setHostSlowPath(FilterId id, std::optional<uint32_t> slowPathID);
+   struct FastPathRef {
+      const void *key = nullptr;   // identifies the registration
+      FastPathInfo info;
+   };
+   std::optional<FastPathRef> fastPathRef(std::string_view name) const;
+   // Moves virtual time on by 1 ms between the calls of a retry loop.
+   void stepTime();
+   // The host regains control after a call into the module.
+   void afterModuleCall();
+
    // Sifra
    std::vector<FastPathInfo> fastPaths() const override;
    std::optional<FastPathInfo> fastPath(std::string_view name) const override;
@@ -67,6 +85,7 @@ public:
    orr_Status readProperty(std::string_view property, std::optional<FilterId> filter,
                            std::vector<uint8_t> &buffer) override;
    std::optional<uint32_t> pollProperty(std::string_view property, std::optional<FilterId> filter) override;
+   SlowPaths &slowPaths() override { return slowPaths_; }
 
    struct FastPath;
    struct Property;
@@ -92,7 +111,6 @@ private:
    Filter *lockedFilter(std::unique_lock<std::mutex> &guard, orr_SifraFilterHandle handle, const char *op);
    // Destroys every filter of a fast path being withdrawn.
    void destroyFiltersOf(const FastPath *fastPath);
-   void afterModuleCall();
    // Builds the list, hands it to the filter and collects what stayed.
    template <typename FrameInputs>
    PacketsResult judgeList(FilterId id, uint32_t direction, const FrameInputs &frames);
@@ -110,6 +128,8 @@ private:
    FilterId nextFilter_ = 1;
    std::map<FilterId, std::unique_ptr<Filter>> filters_;
    std::vector<IoctlReply> replies_;
+   // Calls back into the registry: made last, destroyed first.
+   SlowPathDriver slowPaths_;
 };
 
 }  // namespace swsec::host

@@ -36,7 +36,7 @@ struct Host::State {
    PlexRegistry plex{violations, faults};
    PortsetService portsets{violations, faults, locks};
    FrameStore frames{violations, faults};
-   SifraRegistry sifra{violations, faults, portsets, frames, timers};
+   SifraRegistry sifra{violations, faults, locks, portsets, frames, timers};
    HashTables hashTables{violations, faults, heaps};
    NexoRegistry nexo{violations, faults};
    Loader loader{*this};

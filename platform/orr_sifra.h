@@ -73,6 +73,29 @@ ORR_API orr_Status orr_SifraSetMinPktMappedLen(orr_SifraFilterHandle handle, uin
 ORR_API orr_Status orr_SifraSendFilterIoctlReply(orr_SifraFilterHandle handle, uint32_t requestId,
                                                  const void *data, uint64_t length);
 
+/*
+ * Slow paths. The host announces each slow path of a fast path with the
+ * operation registerSlowPath and withdraws it with unregisterSlowPath; the
+ * module pairs each filter with one of them through these requests. No
+ * spinlock may be held across any of them.
+ */
+
+/* The outcome of a set request: 0 when the filter now has the slow path. */
+typedef void (*orr_SifraSetSlowPathCB)(orr_SifraFilter filter, void *cookie, orr_Status status);
+
+/*
+ * Asks the host to give the filter the slow path `slowPathID`, with a
+ * communication timeout. ORR_OK: the request was accepted and exactly one
+ * call of `callback(filter record, cookie, outcome)` follows, from a
+ * context that holds none of the caller's locks. Any other status: the
+ * request was not made and no reply will come.
+ */
+ORR_API orr_Status orr_SifraSetSlowPath(orr_SifraFilterHandle handle, uint32_t slowPathID,
+                                        orr_SifraSetSlowPathCB callback, void *cookie,
+                                        int32_t timeoutMs);
+/* Synchronous: ORR_OK when the filter no longer has a slow path. */
+ORR_API orr_Status orr_SifraClearSlowPath(orr_SifraFilterHandle handle);
+
 /* Per-filter properties registered by name for all filters of a fast path. */
 typedef struct orr_SifraPropertyOpaque *orr_SifraPropertyHandle;
 

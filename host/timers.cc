@@ -177,13 +177,19 @@ orr_Status TimerService::add(orr_TimerCallback callback, void *data, int64_t tim
    return insert(std::move(record), timer);
 }
 
-void TimerService::fireDue(int64_t limitUs, bool moveClock)
+void TimerService::fireDue(int64_t limitUs, bool moveClock, bool skipPeriodic)
 {
    std::unique_lock guard(mutex_);
    while (!pending_.empty() && std::get<0>(*pending_.begin()) <= limitUs && !stopping_) {
       const orr_Timer id = std::get<2>(*pending_.begin());
       pending_.erase(pending_.begin());
       Timer &timer = timers_.at(id);
+      if (skipPeriodic && timer.periodUs > 0) {
+         // Its first tick after the limit, in one step.
+         timer.dueUs += ((limitUs - timer.dueUs) / timer.periodUs + 1) * timer.periodUs;
+         pending_.insert(Key{timer.dueUs, timer.seq, id});
+         continue;
+      }
       timer.running = true;
       timer.runner = std::this_thread::get_id();
       const orr_TimerCallback callback = timer.callback;
@@ -216,6 +222,16 @@ void TimerService::fireDue(int64_t limitUs, bool moveClock)
 
 void TimerService::advance(std::chrono::microseconds by)
 {
+   moveVirtual(by, false);
+}
+
+void TimerService::skipIdle(std::chrono::microseconds by)
+{
+   moveVirtual(by, true);
+}
+
+void TimerService::moveVirtual(std::chrono::microseconds by, bool skipPeriodic)
+{
    if (!time_.isVirtual()) {
       throw std::logic_error("Clock::advance: the host runs on real time");
    }
@@ -228,7 +244,7 @@ void TimerService::advance(std::chrono::microseconds by)
    std::lock_guard guard(advanceMutex_);
    advancing_.store(std::this_thread::get_id());
    const int64_t target = time_.nowUs() + std::min<int64_t>(by.count(), std::numeric_limits<int64_t>::max() / 4);
-   fireDue(target, true);
+   fireDue(target, true, skipPeriodic);
    time_.moveTo(target);
    advancing_.store(std::thread::id{});
 }

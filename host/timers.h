@@ -48,6 +48,7 @@ public:
 
    // Clock
    void advance(std::chrono::microseconds by) override;
+   void skipIdle(std::chrono::microseconds by) override;
    void runDue() override;
    std::chrono::microseconds now() const override;
    void useRealTime() override;
@@ -75,8 +76,11 @@ private:
 
    orr_Status insert(Timer timer, orr_Timer *handle);
    // Fires every pending timer due at or before `limitUs`, in order; with
-   // `moveClock`, virtual time steps to each timer's due time as it fires.
-   void fireDue(int64_t limitUs, bool moveClock);
+   // `moveClock`, virtual time steps to each timer's due time as it fires;
+   // with `skipPeriodic`, periodic timers are re-armed past `limitUs`
+   // instead of fired.
+   void fireDue(int64_t limitUs, bool moveClock, bool skipPeriodic = false);
+   void moveVirtual(std::chrono::microseconds by, bool skipPeriodic);
    void realTimeLoop();
    std::string describe(const Timer &timer);
 

@@ -117,6 +117,20 @@ TEST_F(TimerTest, PeriodicTimerFiresEveryPeriod)
    EXPECT_TRUE(orr_TimerRemoveSync(timer));
 }
 
+TEST_F(TimerTest, SkippingIdleTimeSkipsPeriodicTicksKeepsTheirPhaseAndFiresOneShots)
+{
+   orr_Timer periodic = 0;
+   ASSERT_EQ(orr_TimerAdd(record, tag(7), 10'000'000, true, 0x2001, &periodic), ORR_OK);
+   schedule(tag(1), 45'000'000);
+   host.clock().skipIdle(1'000'000'000s);
+   EXPECT_THAT(firings, ElementsAre(Firing{1, start + 45'000'000}));
+   EXPECT_EQ(uptimeUs(), start + 1'000'000'000'000'000);
+   // The tick due exactly at the new time is skipped too; the next keeps the phase.
+   host.clock().advance(10s);
+   EXPECT_THAT(firings, ElementsAre(Firing{1, start + 45'000'000}, Firing{7, start + 1'000'000'010'000'000}));
+   EXPECT_TRUE(orr_TimerRemoveSync(periodic));
+}
+
 TEST_F(TimerTest, ZeroTimeoutIsDueAtOnceButFiresOnlyWhenAsked)
 {
    schedule(tag(1), 0);

@@ -77,7 +77,7 @@ class ManifestReplay : public ::testing::TestWithParam<Case> {
 protected:
    // The capture as pcapng with the manifest's direction of every frame, so
    // that a frame the VM sends with a foreign source MAC is still from it.
-   replay::ReplayResult replayCase(uint32_t batch)
+   replay::ReplayResult replayCase(uint32_t batch, bool reasons = false)
    {
       const Case &c = GetParam();
       const json &entry = entryFor(c.capture);
@@ -92,6 +92,7 @@ protected:
       replay::ReplayOptions options;
       options.capturePath = capture.string();
       options.batch = batch;
+      options.reasons = reasons;
       if (c.setting == "enforcing") {
          options.config = replay::loadConfigFile((sourceDir() / "examples/enforcing.json").string());
       }
@@ -193,6 +194,51 @@ TEST_P(ManifestReplay, lists_of_frames_decide_as_single_frames_do)
       EXPECT_GE(batched.notifications[i].afterFrame, single.notifications[i].afterFrame);
    }
    EXPECT_EQ(single.counters, batched.counters);
+}
+
+// The manifest's model names each drop's rule; the replay finds it from
+// the counters and the frame, and each counter equals the drops it names.
+TEST_P(ManifestReplay, every_dropped_frame_has_the_reason_the_manifest_names_and_the_counters_agree)
+{
+   const Case &c = GetParam();
+   const json &expected = settingFor(entryFor(c.capture), c.setting);
+   static const std::map<std::string, std::string, std::less<>> kReasonOfRule = {
+      {"ARP inspection: sender MAC/IP not bound on its VLAN (daiDropCnt)", "DAI"},
+      {"ARP rate limit exceeded, port enters the error-rate-limit state", "ARP rate limit"},
+      {"ARP rate limit, to the VM (rxRateLimitDropCnt)", "ARP rate limit"},
+      {"error-rate-limit state (txRateLimitDropCnt)", "ARP rate limit: error state"},
+      {"BPDU filter", "BPDU filter"},
+      {"DHCP server block", "DHCP server block"},
+      {"DHCP from the VM with chaddr not its source MAC, untrusted port (dhcpSnoopingDropCnt)",
+       "DHCP snooping: chaddr mismatch"},
+      {"DHCPACK answers no pending request of the port", "DHCP snooping: unanswered ACK"},
+      {"IP source guard: source MAC/IP not bound on its VLAN (ipSrcGuardDropCnt)", "IP source guard"},
+   };
+   const replay::ReplayResult result = replayCase(32, true);
+   std::map<uint64_t, std::string> reasons;
+   std::map<std::string, uint64_t, std::less<>> perReason;
+   for (const auto &frame : result.frames) {
+      EXPECT_EQ(frame.passed, frame.reason == replay::DropReason::none) << frame.index;
+      if (!frame.passed) {
+         reasons[frame.index] = replay::dropReasonName(frame.reason);
+         ++perReason[reasons[frame.index]];
+      }
+   }
+   std::map<uint64_t, std::string> expectedReasons;
+   for (const auto &d : expected["dropped"]) {
+      expectedReasons[d["index"].get<uint64_t>()] = kReasonOfRule.at(d["rule"].get<std::string>());
+   }
+   EXPECT_EQ(reasons, expectedReasons);
+
+   auto counter = [&result](const char *name) {
+      const auto found = result.counters.find(name);
+      return found != result.counters.end() ? found->second : 0;
+   };
+   EXPECT_EQ(perReason["DAI"], counter("daiDropCnt"));
+   EXPECT_EQ(perReason["IP source guard"], counter("ipSrcGuardDropCnt"));
+   EXPECT_EQ(perReason["DHCP snooping: chaddr mismatch"], counter("dhcpSnoopingDropCnt"));
+   EXPECT_EQ(perReason["ARP rate limit"] + perReason["ARP rate limit: error state"],
+             counter("txRateLimitDropCnt") + counter("rxRateLimitDropCnt"));
 }
 
 std::string caseName(const ::testing::TestParamInfo<Case> &info)

@@ -23,6 +23,16 @@ std::filesystem::path toolPath()
    return std::filesystem::path(dir != nullptr ? dir : SWSEC_TEST_BINARY_DIR) / "tools" / "swsec";
 }
 
+std::string example()
+{
+   return (sourceDir() / "examples/example-dhcp-then-spoof.pcap").string();
+}
+
+std::string enforcing()
+{
+   return (sourceDir() / "examples/enforcing.json").string();
+}
+
 TempDir::TempDir()
 {
    std::string pattern = (std::filesystem::temp_directory_path() / "swsec-replay-XXXXXX").string();
@@ -124,10 +134,10 @@ void writeFile(const std::filesystem::path &path, const std::string &bytes)
    file << bytes;
 }
 
-ToolRun runTool(const std::vector<std::string> &args)
+ToolRun runTool(const std::vector<std::string> &args, const std::string &shell)
 {
    TempDir dir;
-   std::string command = "'" + toolPath().string() + "'";
+   std::string command = shell + " '" + toolPath().string() + "'";
    for (const auto &arg : args) {
       command += " '" + arg + "'";
    }

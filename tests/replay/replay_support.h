@@ -14,6 +14,11 @@ namespace swsec::testing {
 std::filesystem::path sourceDir();
 std::filesystem::path toolPath();
 
+// The example capture, its VM's MAC and the enforcing port configuration.
+inline const std::string kVmMac = "02:00:5e:c0:00:01";
+std::string example();
+std::string enforcing();
+
 // A fresh directory removed at the end of the test.
 class TempDir {
 public:
@@ -44,7 +49,8 @@ struct ToolRun {
    std::string out;
    std::string err;
 };
-// Runs the swsec binary with `args` (each quoted for the shell).
-ToolRun runTool(const std::vector<std::string> &args);
+// Runs the swsec binary with `args` (each quoted for the shell). `shell`
+// goes before the command as it is: "umask 077;", "cat 'x' |".
+ToolRun runTool(const std::vector<std::string> &args, const std::string &shell = "");
 
 }  // namespace swsec::testing

@@ -17,17 +17,6 @@
 namespace swsec::testing {
 namespace {
 
-const std::string kVmMac = "02:00:5e:c0:00:01";
-
-std::string example()
-{
-   return (sourceDir() / "examples/example-dhcp-then-spoof.pcap").string();
-}
-
-std::string enforcing()
-{
-   return (sourceDir() / "examples/enforcing.json").string();
-}
 
 std::string sourceMac(const std::vector<uint8_t> &bytes)
 {
@@ -286,7 +275,8 @@ TEST(ReplayReport, the_readable_report_shows_the_binding_the_spoofs_and_the_log)
    const ToolRun run = runTool({"replay", "-v", "--vm-mac", kVmMac, "--config", enforcing(), example()});
    ASSERT_EQ(run.status, 0) << run.err;
    for (const char *line : {"  from-vm          8        4\n",
-                            "dropped #16  10.344753  from-vm  02:00:5e:c0:00:01 > ff:ff:ff:ff:ff:ff ARP reply 192.0.2.1 is at 02:00:5e:c0:00:01\n",
+                            "dropped #16  10.344753  from-vm  DAI: 02:00:5e:c0:00:01 > ff:ff:ff:ff:ff:ff ARP reply 192.0.2.1 is at 02:00:5e:c0:00:01\n",
+                            "dropped #14  10.144753  from-vm  IP source guard: ",
                             "  0     02:00:5e:c0:00:01  192.0.2.101      DHCP Snooping",
                             "after #4     portdb.entry.added    VLAN 0    02:00:5e:c0:00:01  192.0.2.101      authoritative\n",
                             "   DAI drop count           : 2\n",

@@ -31,7 +31,7 @@ struct ReplayCommandOptions {
    std::string capture;
    std::string vmMac;
    std::string config;
-   double untilSeconds = 0;
+   std::string until;   // seconds, checked by the command
    uint32_t batch = 32;
    bool json = false;
    bool verbose = false;

@@ -199,6 +199,10 @@ int runInfo(const InfoOptions &options)
    } catch (const std::invalid_argument &e) {
       std::fprintf(stderr, "swsec info: %s\n", e.what());
       return kExitUsage;
+   } catch (const std::runtime_error &e) {
+      // The only one thrown: a module image that cannot be opened.
+      std::fprintf(stderr, "swsec info: %s\n", e.what());
+      return options.modulePath.empty() ? kExitFailure : kExitUsage;
    }
    if (options.json) {
       std::cout << toJson(snap).dump(2) << "\n";

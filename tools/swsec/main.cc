@@ -21,6 +21,13 @@ int main(int argc, char **argv)
       app.add_subcommand("replay", "run every frame of a capture through one switch-security port");
    swsec::tools::addReplayOptions(*replayCommand, replay);
 
+   // An unknown word where the subcommand goes is named as such, before
+   // the parser calls it a missing subcommand.
+   const auto known = app.get_subcommands([&](const CLI::App *sub) { return argc > 1 && sub->check_name(argv[1]); });
+   if (argc > 1 && argv[1][0] != '-' && known.empty()) {
+      std::fprintf(stderr, "swsec: unknown subcommand \"%s\" (known: info, replay)\n", argv[1]);
+      return swsec::tools::kExitUsage;
+   }
    try {
       app.parse(argc, argv);
    } catch (const CLI::ParseError &e) {

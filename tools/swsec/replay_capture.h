@@ -1,12 +1,17 @@
 // Reading a capture file (pcap or pcapng, through libpcap) frame by frame,
-// with the direction each pcapng Enhanced Packet Block records, if any.
+// with the direction each pcapng packet block records, if any. The file is
+// read once, in order, so a pipe or "-" (standard input) works as a file does.
 #pragma once
+
+#include "replay_pcapng_scan.h"
+
+#include <sys/types.h>
 
 #include <cstdint>
 #include <memory>
+#include <optional>
 #include <span>
 #include <string>
-#include <vector>
 
 struct pcap;
 
@@ -21,14 +26,26 @@ inline constexpr uint8_t kDirFromVm = 2;
 struct CaptureFrame {
    uint64_t index = 0;               // 1-based, as capture tools number frames
    int64_t timeNs = 0;               // capture timestamp, nanoseconds since the epoch
+   bool timeInRange = true;          // false: the timestamp does not fit (timeNs is then 0)
    std::span<const uint8_t> bytes;   // valid until the next call of next()
    uint8_t recordedDirection = kDirUnknown;
+};
+
+// Timestamps are kept within +-2^62 ns (about 146 years either side of
+// 1970), so that the difference of any two fits in 64 bits.
+inline constexpr int64_t kMaxCaptureTimeNs = int64_t{1} << 62;
+
+// The identity of a file, to tell that two paths name the same one.
+struct FileIdentity {
+   dev_t device = 0;
+   ino_t inode = 0;
+   bool operator==(const FileIdentity &) const = default;
 };
 
 class CaptureReader {
 public:
    // Throws ReplayError naming the file when it cannot be opened or is not
-   // an Ethernet capture.
+   // an Ethernet capture. "-" is standard input.
    explicit CaptureReader(const std::string &path);
    ~CaptureReader();
    CaptureReader(const CaptureReader &) = delete;
@@ -38,21 +55,23 @@ public:
    // file or a frame captured shorter than it was on the wire.
    bool next(CaptureFrame &frame);
 
-   uint64_t fileSize() const { return fileSize_; }
-   uint64_t bytesRead() const { return bytesRead_; }
+   uint64_t fileSize() const { return fileSize_; }   // 0 when unknown (a pipe)
+   uint64_t bytesRead() const { return scanner_.offset(); }
+   // The file's identity when it is a regular file.
+   std::optional<FileIdentity> identity() const { return identity_; }
 
 private:
+   static ssize_t readCookie(void *cookie, char *buffer, size_t size);
+   static int closeCookie(void *cookie);
+   [[noreturn]] void fail(const std::string &what);
+
    std::string path_;
+   int fd_ = -1;
    pcap *handle_ = nullptr;
-   std::vector<uint8_t> directions_;   // per frame, from pcapng EPB flags
+   PcapngDirectionScanner scanner_{std::nullopt};
    uint64_t count_ = 0;
    uint64_t fileSize_ = 0;
-   uint64_t bytesRead_ = 0;
+   std::optional<FileIdentity> identity_;
 };
-
-// The direction flags of every packet block of a pcapng file, in file
-// order (kDirUnknown where a block records none); empty for other formats.
-// Throws ReplayError on a block that runs past the file.
-std::vector<uint8_t> scanPcapngDirections(const std::string &path);
 
 }  // namespace swsec::replay

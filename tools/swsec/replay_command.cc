@@ -12,7 +12,9 @@
 
 #include <unistd.h>
 
+#include <charconv>
 #include <chrono>
+#include <cmath>
 #include <cstdio>
 #include <iostream>
 
@@ -23,8 +25,7 @@ void addReplayOptions(CLI::App &command, ReplayCommandOptions &options)
    command.add_option("CAPTURE", options.capture, "pcap or pcapng capture of the VM's port")->required();
    command.add_option("--vm-mac", options.vmMac, "frames from this MAC go from the VM, others to it");
    command.add_option("--config", options.config, "JSON security configuration of the port");
-   command.add_option("--until", options.untilSeconds, "run the clock on this many seconds after the last frame")
-      ->check(CLI::NonNegativeNumber);
+   command.add_option("--until", options.until, "run the clock on this many seconds after the last frame");
    command.add_option("--batch", options.batch, "most frames handed over in one list")
       ->check(CLI::Range(1u, 1u << 16));
    command.add_flag("--json", options.json, "print one JSON document");
@@ -35,6 +36,21 @@ void addReplayOptions(CLI::App &command, ReplayCommandOptions &options)
 }
 
 namespace {
+
+// A number of seconds from 0 to kMaxUntilSeconds, written as a decimal
+// number; not a NaN or an infinity, which strtod would take.
+double parseUntil(const std::string &text)
+{
+   double seconds = 0;
+   const char *end = text.data() + text.size();
+   const auto [stop, error] = std::from_chars(text.data(), end, seconds, std::chars_format::general);
+   if (text.empty() || error != std::errc{} || stop != end || !std::isfinite(seconds) || seconds < 0 ||
+       seconds > replay::kMaxUntilSeconds) {
+      throw replay::ReplayError("--until: expected seconds from 0 to 10000000000, got \"" +
+                                text.substr(0, 40) + (text.size() > 40 ? "...\"" : "\""));
+   }
+   return seconds;
+}
 
 // Prints "\r<progress>" on stderr once a run has taken a second.
 class ProgressLine {
@@ -78,13 +94,16 @@ int runReplay(const ReplayCommandOptions &options)
       if (!options.config.empty()) {
          run.config = replay::loadConfigFile(options.config);
       }
-      run.untilSeconds = options.untilSeconds;
+      if (!options.until.empty()) {
+         run.untilSeconds = parseUntil(options.until);
+      }
       run.batch = options.batch;
       // JSON lists every frame; the verbose report only the dropped ones.
       run.frameRecords = options.json      ? replay::FrameRecords::all
                          : options.verbose ? replay::FrameRecords::dropped
                                            : replay::FrameRecords::none;
       run.describeDrops = options.verbose || options.json;
+      run.reasons = options.verbose || options.json;
       run.writePassed = options.writePassed;
       run.writeDropped = options.writeDropped;
       run.modulePath = options.modulePath;
@@ -93,6 +112,13 @@ int runReplay(const ReplayCommandOptions &options)
          progress.update(frames, bytesRead, fileSize);
       };
       const replay::ReplayResult result = replay::runReplay(run);
+      for (const auto &warning : result.warnings) {
+         std::fprintf(stderr, "swsec replay: warning: %s\n", warning.c_str());
+      }
+      if (result.warningsNotShown != 0) {
+         std::fprintf(stderr, "swsec replay: warning: %llu more warnings\n",
+                      static_cast<unsigned long long>(result.warningsNotShown));
+      }
       if (options.json) {
          std::cout << replay::replayJson(result).dump(1) << "\n";
       } else {

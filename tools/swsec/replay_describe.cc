@@ -2,6 +2,7 @@
 // the frame's length; a frame too short for a layer says so.
 #include "replay_describe.h"
 
+#include <algorithm>
 #include <array>
 #include <cstdio>
 
@@ -124,6 +125,42 @@ uint16_t frameVlan(std::span<const uint8_t> bytes)
       return be16(bytes, 14) & 0x0fffu;
    }
    return 0;
+}
+
+FrameFacts frameFacts(std::span<const uint8_t> bytes)
+{
+   FrameFacts facts;
+   if (bytes.size() < 14) {
+      return facts;
+   }
+   static constexpr uint8_t kBpdu[6] = {0x01, 0x80, 0xc2, 0, 0, 0};
+   static constexpr uint8_t kPvst[6] = {0x01, 0x00, 0x0c, 0xcc, 0xcc, 0xcd};
+   facts.bpduDestination = std::equal(kBpdu, kBpdu + 6, bytes.begin()) || std::equal(kPvst, kPvst + 6, bytes.begin());
+   size_t at = 12;
+   uint16_t type = be16(bytes, at);
+   if (type == kEtherVlan && bytes.size() >= 18) {
+      at = 16;
+      type = be16(bytes, at);
+   }
+   const auto payload = bytes.subspan(at + 2);
+   std::span<const uint8_t> udp;
+   if (type == kEtherIpv4 && payload.size() >= 20 && (payload[0] >> 4) == 4 && payload[9] == 17 &&
+       (be16(payload, 6) & 0x1fffu) == 0) {
+      const size_t headerLength = size_t{payload[0] & 0x0fu} * 4;
+      if (headerLength >= 20 && payload.size() >= headerLength + 8) {
+         udp = payload.subspan(headerLength);
+      }
+   } else if (type == kEtherIpv6 && payload.size() >= 48 && payload[6] == 17) {
+      udp = payload.subspan(40);
+   }
+   if (!udp.empty()) {
+      facts.udpSourcePort = be16(udp, 0);
+      const uint16_t destination = be16(udp, 2);
+      if ((facts.udpSourcePort == 67 || facts.udpSourcePort == 68) && (destination == 67 || destination == 68)) {
+         facts.dhcpMessageType = dhcpMessageType(udp.subspan(8));
+      }
+   }
+   return facts;
 }
 
 std::string describeFrame(std::span<const uint8_t> bytes)

@@ -7,13 +7,16 @@
 #include "replay_describe.h"
 #include "replay_error.h"
 #include "replay_frame_batch.h"
+#include "replay_output_path.h"
 #include "replay_pcap_writer.h"
 
 #include "host/host.h"
 
 #include <algorithm>
 #include <array>
+#include <charconv>
 #include <chrono>
+#include <cmath>
 #include <cstring>
 
 namespace swsec::replay {
@@ -44,6 +47,12 @@ constexpr size_t kMaxInitialArenaBytes = size_t{1} << 20;
 // vector grows as it needs.
 constexpr uint64_t kSmallRecordBytes = 76;
 constexpr uint64_t kMaxReservedRecords = uint64_t{1} << 22;
+// A span of capture time without frames longer than this is crossed with
+// the port timers' idle ticks skipped (see crossIdle).
+constexpr std::chrono::microseconds kIdleSpan = 1h;
+// Three ticks of the port timer: every tick within this of an expiry is
+// fired as it falls due.
+constexpr std::chrono::microseconds kTickMargin = 30s;
 constexpr const char *kCounterFields[] = {"dhcpSnoopingDropCnt", "daiDropCnt",          "ipSrcGuardDropCnt",
                                           "txRateLimitDropCnt",  "rxRateLimitDropCnt", "txRateLimitErrEntryCnt"};
 
@@ -61,12 +70,6 @@ public:
       : options_(options), result_(result),
         list_(options.batch, std::min(size_t{options.batch} * kTypicalFrameBytes, kMaxInitialArenaBytes))
    {
-      if (!options.writePassed.empty()) {
-         passed_.emplace(options.writePassed);
-      }
-      if (!options.writeDropped.empty()) {
-         dropped_.emplace(options.writeDropped);
-      }
       kept_.reserve(options.batch);
    }
 
@@ -88,11 +91,18 @@ public:
    void execute();
 
 private:
+   void openOutputs(const CaptureReader &reader);
    void startPort();
+   void warn(uint64_t frame, const std::string &text);
+   int64_t frameTime(const CaptureFrame &frame);
+   void crossIdle(std::chrono::microseconds target);
+   std::optional<std::chrono::seconds> soonestExpiry();
    uint8_t directionOf(const CaptureFrame &frame) const;
    void add(const CaptureFrame &frame, uint8_t direction);
    void flush();
-   void record(size_t frame, bool passed);
+   void record(size_t frame, bool passed, DropReason reason);
+   DropCounters readCounters();
+   uint32_t batch() const { return options_.reasons ? 1 : options_.batch; }
    std::chrono::microseconds clockAt(int64_t timeNs) const;
    void advanceTo(std::chrono::microseconds target);
    void collectNotifications();
@@ -110,7 +120,10 @@ private:
    std::chrono::microseconds clockBase_{0};      // host time of the first frame
    std::chrono::microseconds clockReached_{0};   // the host clock is at least here
    int64_t firstTimeNs_ = 0;
-   int64_t lastTimeNs_ = 0;
+   DropCounters counters_;      // as last read, with options.reasons
+   int64_t lastTimeNs_ = 0;     // the frame before's time
+   int64_t latestTimeNs_ = 0;   // the latest time of any frame
+   bool haveTime_ = false;
    uint64_t lastHandedOver_ = 0;
 };
 
@@ -118,7 +131,17 @@ void Run::startPort()
 {
    host::LoadOptions load;
    load.modulePath = options_.modulePath;
-   if (host_.load(load) != 0) {
+   int loaded = 1;
+   try {
+      loaded = host_.load(load);
+   } catch (const std::runtime_error &e) {
+      // An image the user named that cannot be opened is bad input.
+      if (!options_.modulePath.empty()) {
+         throw ReplayError("--module " + options_.modulePath + ": " + e.what());
+      }
+      throw;
+   }
+   if (loaded != 0) {
       throw std::runtime_error("the module failed to load");
    }
    host_.portsets().addPortset(kPortset);
@@ -150,6 +173,9 @@ void Run::startPort()
          throw ConfigRefused("configuration refused: " + message);
       }
    }
+   if (options_.reasons) {
+      counters_ = readCounters();
+   }
    host_.clock().advance(kConfigLead);
    clockBase_ = host_.clock().now();
    clockReached_ = clockBase_;
@@ -173,7 +199,7 @@ uint8_t Run::directionOf(const CaptureFrame &frame) const
 void Run::add(const CaptureFrame &frame, uint8_t direction)
 {
    if (!list_.empty() && (direction != list_.direction() || frame.timeNs - list_.firstTimeNs() > kListSpanNs ||
-                          list_.size() >= options_.batch)) {
+                          list_.size() >= batch())) {
       flush();
    }
    list_.add(frame.index, frame.timeNs, direction, frame.bytes);
@@ -193,12 +219,123 @@ void Run::advanceTo(std::chrono::microseconds target)
    // Lists that start within the same microsecond need no look at the clock.
    if (target > clockReached_) {
       const auto now = host_.clock().now();
-      if (target > now) {
+      if (target - now > kIdleSpan && options_.skipIdleTime) {
+         crossIdle(target);
+      } else if (target > now) {
          host_.clock().advance(target - now);
       }
       clockReached_ = std::max(target, now);
    }
    collectNotifications();
+}
+
+// The port timer's tick ages the port database, pending DHCP requests and
+// the error-rate-limit state; between frames, a tick changes something
+// only when a binding's lifetime ends (requests and the error state end
+// the same whichever tick after their end removes them, and say nothing).
+// So idle time is skipped up to a margin before the soonest binding's
+// expiry, ticked through that expiry, and so on; the ticks just before
+// the target always fire. The outcome is that of firing every tick.
+void Run::crossIdle(std::chrono::microseconds target)
+{
+   while (host_.clock().now() < target) {
+      auto now = host_.clock().now();
+      const std::optional<std::chrono::seconds> soonest = soonestExpiry();
+      const auto until = soonest ? std::min(target, now + std::chrono::microseconds(*soonest)) : target;
+      if (until - kTickMargin > now) {
+         host_.clock().skipIdle(until - kTickMargin - now);
+      }
+      now = host_.clock().now();
+      host_.clock().advance(std::min(target, until + kTickMargin) - now);
+      if (options_.progress) {
+         options_.progress(lastHandedOver_, 0, 0);
+      }
+   }
+}
+
+// The time left to the binding that expires first, as the "vmi" nodes show it.
+std::optional<std::chrono::seconds> Run::soonestExpiry()
+{
+   const std::string port = "/security/" + std::to_string(kPortId) + "/vmi";
+   std::vector<int64_t> instances;
+   if (host_.nexo().list(port, &instances) != ORR_OK) {
+      return std::nullopt;
+   }
+   std::optional<std::chrono::seconds> soonest;
+   for (int64_t instance : instances) {
+      host::NexoRecord vmi;
+      if (host_.nexo().get(port + "/" + std::to_string(instance), &vmi) != ORR_OK) {
+         return std::chrono::seconds(0);   // unknown: tick on
+      }
+      const auto values = vmi.values();
+      const auto found = values.find("timeRemaining");
+      if (found == values.end() || found->second == "N/A") {
+         continue;   // a static binding does not expire
+      }
+      uint32_t seconds = 0;
+      const std::string &text = found->second;
+      if (std::from_chars(text.data(), text.data() + text.size(), seconds).ec != std::errc{}) {
+         return std::chrono::seconds(0);
+      }
+      soonest = std::min(soonest.value_or(std::chrono::seconds(seconds)), std::chrono::seconds(seconds));
+   }
+   return soonest;
+}
+
+void Run::warn(uint64_t frame, const std::string &text)
+{
+   if (result_.warnings.size() < kMaxWarnings) {
+      result_.warnings.push_back(options_.capturePath + ": frame " + std::to_string(frame) + ": " + text);
+   } else {
+      ++result_.warningsNotShown;
+   }
+}
+
+// The time a frame is replayed at. Timestamps that do not fit, lie before
+// 1970 or go backwards are reported; the clock never goes back, so a frame
+// earlier than the one before is judged at the time already reached.
+int64_t Run::frameTime(const CaptureFrame &frame)
+{
+   if (!frame.timeInRange) {
+      warn(frame.index, "timestamp out of range; replayed at the time of the frame before");
+      return haveTime_ ? lastTimeNs_ : 0;
+   }
+   if (frame.timeNs < 0) {
+      warn(frame.index, "timestamp before 1970 (" + std::to_string(frame.timeNs / 1'000'000'000) + " s)");
+   }
+   if (haveTime_ && frame.timeNs < lastTimeNs_) {
+      std::array<char, 64> text{};
+      std::snprintf(text.data(), text.size(), "timestamp %.6f s before the frame before's",
+                    static_cast<double>(lastTimeNs_ - frame.timeNs) / 1e9);
+      warn(frame.index, text.data());
+   }
+   return frame.timeNs;
+}
+
+void Run::openOutputs(const CaptureReader &reader)
+{
+   std::optional<OutputTarget> passed;
+   std::optional<OutputTarget> dropped;
+   if (!options_.writePassed.empty()) {
+      passed = resolveOutput(options_.writePassed);
+   }
+   if (!options_.writeDropped.empty()) {
+      dropped = resolveOutput(options_.writeDropped);
+   }
+   for (const auto *target : {&passed, &dropped}) {
+      if (*target && (*target)->identity && reader.identity() && *(*target)->identity == *reader.identity()) {
+         throw ReplayError((*target)->named + ": cannot write: it is the input capture");
+      }
+   }
+   if (passed && dropped && sameFile(*passed, *dropped)) {
+      throw ReplayError(dropped->named + ": cannot write: it is also the --write-passed file");
+   }
+   if (passed) {
+      passed_.emplace(*passed);
+   }
+   if (dropped) {
+      dropped_.emplace(*dropped);
+   }
 }
 
 void Run::flush()
@@ -220,8 +357,15 @@ void Run::flush()
    for (size_t i = 0; i < list_.size(); ++i) {
       const bool passed = kept_[i] != 0;
       ++totals[passed ? 0 : 1];
+      DropReason reason = DropReason::none;
+      if (!passed && options_.reasons) {
+         // Alone in its list, so whatever counter moved moved for it.
+         DropCounters after = readCounters();
+         reason = explainDrop(counters_, after, list_.bytes(i), list_.direction());
+         counters_ = std::move(after);
+      }
       if (records == FrameRecords::all || (records == FrameRecords::dropped && !passed)) {
-         record(i, passed);
+         record(i, passed, reason);
       }
       std::optional<PcapWriter> &writer = passed ? passed_ : dropped_;
       if (writer) {
@@ -232,7 +376,27 @@ void Run::flush()
    list_.clear();
 }
 
-void Run::record(size_t frame, bool passed)
+DropCounters Run::readCounters()
+{
+   DropCounters counters;
+   host::NexoRecord summary;
+   if (host_.nexo().get("/security/" + std::to_string(kPortId) + "/featureSummary", &summary) != ORR_OK) {
+      return counters;   // no IP discovery: the port shows no counters
+   }
+   const auto values = summary.values();
+   for (const char *field : kCounterFields) {
+      const auto found = values.find(field);
+      uint64_t value = 0;
+      if (found != values.end() &&
+          std::from_chars(found->second.data(), found->second.data() + found->second.size(), value).ec ==
+             std::errc{}) {
+         counters[field] = value;
+      }
+   }
+   return counters;
+}
+
+void Run::record(size_t frame, bool passed, DropReason reason)
 {
    const std::span<const uint8_t> bytes = list_.bytes(frame);
    FrameVerdict &verdict = result_.frames.emplace_back();
@@ -240,6 +404,7 @@ void Run::record(size_t frame, bool passed)
    verdict.timeNs = list_.timeNs(frame) - firstTimeNs_;
    verdict.direction = list_.direction();
    verdict.passed = passed;
+   verdict.reason = reason;
    verdict.vlan = frameVlan(bytes);
    if (!passed && options_.describeDrops) {
       verdict.description = static_cast<uint32_t>(result_.descriptions.size());
@@ -312,6 +477,7 @@ void Run::execute()
 {
    host_.setViolationHandler([this](const std::string &v) { result_.violations.push_back(v); });
    CaptureReader reader(options_.capturePath);
+   openOutputs(reader);
    if (options_.frameRecords == FrameRecords::all) {
       result_.frames.reserve(std::min(reader.fileSize() / kSmallRecordBytes, kMaxReservedRecords));
    }
@@ -320,10 +486,14 @@ void Run::execute()
    CaptureFrame frame;
    bool first = true;
    while (reader.next(frame)) {
+      frame.timeNs = frameTime(frame);
       if (first) {
          firstTimeNs_ = frame.timeNs;
+         latestTimeNs_ = frame.timeNs;
          first = false;
       }
+      haveTime_ = true;
+      latestTimeNs_ = std::max(latestTimeNs_, frame.timeNs);
       add(frame, directionOf(frame));
       if (options_.progress && frame.index % 4096 == 0) {
          options_.progress(frame.index, reader.bytesRead(), reader.fileSize());
@@ -331,9 +501,11 @@ void Run::execute()
    }
    flush();
    if (options_.untilSeconds > 0) {
-      const double lastTime = first ? 0.0 : static_cast<double>(lastTimeNs_ - firstTimeNs_) / 1e9;
-      advanceTo(clockBase_ + std::chrono::duration_cast<std::chrono::microseconds>(
-                                std::chrono::duration<double>(lastTime + options_.untilSeconds)));
+      // Both terms are bounded (timestamps within +-2^62 ns, --until within
+      // kMaxUntilSeconds), so the sum of microseconds fits.
+      const auto until = std::chrono::microseconds(static_cast<int64_t>(std::llround(options_.untilSeconds * 1e6)));
+      const auto last = std::chrono::microseconds(first ? 0 : (latestTimeNs_ - firstTimeNs_) / 1000);
+      advanceTo(clockBase_ + last + until);
    }
    collectNotifications();
    readPortState();
@@ -366,6 +538,9 @@ ReplayResult runReplay(const ReplayOptions &options)
 {
    if (options.batch == 0) {
       throw ReplayError("--batch must be at least 1");
+   }
+   if (!(options.untilSeconds >= 0 && options.untilSeconds <= kMaxUntilSeconds)) {
+      throw ReplayError("--until must be a number of seconds from 0 to 10000000000");
    }
    ReplayResult result;
    Run run(options, result);

@@ -4,6 +4,7 @@
 #pragma once
 
 #include "replay_config.h"
+#include "replay_drop_reason.h"
 
 #include <array>
 #include <cstdint>
@@ -29,18 +30,31 @@ struct ReplayOptions {
    std::string capturePath;
    std::optional<std::array<uint8_t, 6>> vmMac;   // frames from it go from the VM
    std::optional<PortSecurityConfig> config;      // none: the new port's defaults
-   double untilSeconds = 0;                       // clock runs on after the last frame
+   double untilSeconds = 0;                       // clock runs on after the last frame (0 to kMaxUntilSeconds)
    uint32_t batch = 32;                           // most frames in one list
    FrameRecords frameRecords = FrameRecords::all;
    bool describeDrops = false;                    // one-line description per recorded dropped frame
+   // The check behind every dropped frame: frames then go to the port one
+   // a list, and the drop counters are read after each list with a drop.
+   bool reasons = false;
    std::string writePassed;                       // pcap of passed frames ("" none)
    std::string writeDropped;                      // pcap of dropped frames ("" none)
    std::string modulePath;                        // "" the built module
-   // Called now and then with frames done and bytes read of the file's size.
+   // Idle capture time (no frame for a long span) is crossed in one step
+   // where no timer's tick can change anything; false ticks through it, for
+   // tests that compare the two.
+   bool skipIdleTime = true;
+   // Called now and then with frames done and bytes read of the file's size
+   // (0: unknown), and while the clock runs on after the last frame.
    std::function<void(uint64_t frames, uint64_t bytesRead, uint64_t fileSize)> progress;
 };
 
+// The longest --until: past any lease (a 32-bit count of seconds), and
+// small enough that the clock's microseconds cannot overflow.
+inline constexpr double kMaxUntilSeconds = 1e10;
+
 inline constexpr uint32_t kNoDescription = UINT32_MAX;
+inline constexpr size_t kMaxWarnings = 20;
 
 // One frame's record: a plain struct, so that a million of them are one
 // allocation without a destructor to run.
@@ -51,10 +65,11 @@ struct FrameVerdict {
    uint16_t vlan = 0;
    uint8_t direction = 0;                 // kDirToVm or kDirFromVm
    bool passed = true;
+   DropReason reason = DropReason::none;  // with ReplayOptions::reasons
 
    double seconds() const { return static_cast<double>(timeNs) / 1e9; }
 };
-static_assert(sizeof(FrameVerdict) == 24);
+static_assert(sizeof(FrameVerdict) == 32);
 
 struct PortDbEntry {
    uint16_t vlan = 0;
@@ -97,6 +112,11 @@ struct ReplayResult {
    std::vector<Notification> notifications;
    std::vector<LogLine> log;
    std::vector<std::string> violations;   // host checks (leaks at unload, ...)
+   // What the capture got wrong without making the run fail (timestamps
+   // that go backwards, ...), each naming the frame; at most kMaxWarnings,
+   // the rest counted.
+   std::vector<std::string> warnings;
+   uint64_t warningsNotShown = 0;
 
    // The frame's description, "" when it has none.
    std::string_view description(const FrameVerdict &frame) const

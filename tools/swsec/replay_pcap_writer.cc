@@ -6,6 +6,7 @@
 
 #include <pcap/pcap.h>
 
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -25,9 +26,10 @@ std::string systemError()
 
 }  // namespace
 
-PcapWriter::PcapWriter(const std::string &path) : path_(path)
+PcapWriter::PcapWriter(const OutputTarget &target) : named_(target.named), path_(target.path)
 {
-   std::vector<char> name(path.begin(), path.end());
+   const std::string &path = named_;
+   std::vector<char> name(path_.begin(), path_.end());
    static constexpr char kSuffix[] = ".partial-XXXXXX";
    name.insert(name.end(), kSuffix, kSuffix + sizeof kSuffix);
    const int fd = mkstemp(name.data());
@@ -35,7 +37,7 @@ PcapWriter::PcapWriter(const std::string &path) : path_(path)
       throw ReplayError(path + ": cannot write: " + systemError());
    }
    tempPath_ = name.data();
-   FILE *file = fdopen(fd, "wb");
+   FILE *file = ::fchmod(fd, target.mode) == 0 ? fdopen(fd, "wb") : nullptr;
    if (file == nullptr) {
       const std::string error = systemError();
       ::close(fd);
@@ -75,8 +77,10 @@ void PcapWriter::discard()
 void PcapWriter::write(int64_t timeNs, std::span<const uint8_t> bytes)
 {
    pcap_pkthdr header{};
-   header.ts.tv_sec = static_cast<time_t>(timeNs / 1'000'000'000);
-   header.ts.tv_usec = static_cast<suseconds_t>((timeNs % 1'000'000'000) / 1000);
+   // Floor division, so that a time before 1970 keeps microseconds in 0..999999.
+   const int64_t micros = timeNs / 1000 - (timeNs % 1000 < 0 ? 1 : 0);
+   header.ts.tv_sec = static_cast<time_t>(micros / 1'000'000 - (micros % 1'000'000 < 0 ? 1 : 0));
+   header.ts.tv_usec = static_cast<suseconds_t>(micros - static_cast<int64_t>(header.ts.tv_sec) * 1'000'000);
    header.caplen = static_cast<bpf_u_int32>(bytes.size());
    header.len = header.caplen;
    pcap_dump(reinterpret_cast<u_char *>(dumper_), &header, bytes.data());
@@ -91,12 +95,12 @@ void PcapWriter::commit()
    if (failed) {
       const std::string error = systemError();
       discard();
-      throw ReplayError(path_ + ": write failed: " + error);
+      throw ReplayError(named_ + ": write failed: " + error);
    }
    if (std::rename(tempPath_.c_str(), path_.c_str()) != 0) {
       const std::string error = systemError();
       discard();
-      throw ReplayError(path_ + ": cannot write: " + error);
+      throw ReplayError(named_ + ": cannot write: " + error);
    }
    tempPath_.clear();
    discard();

@@ -3,6 +3,8 @@
 // destroyed without commit removes its temporary file.
 #pragma once
 
+#include "replay_output_path.h"
+
 #include <cstdint>
 #include <span>
 #include <string>
@@ -14,8 +16,9 @@ namespace swsec::replay {
 
 class PcapWriter {
 public:
-   // Throws ReplayError naming `path` when the temporary file cannot be made.
-   explicit PcapWriter(const std::string &path);
+   // Throws ReplayError naming the output when the temporary file cannot be
+   // made. The file gets the target's mode.
+   explicit PcapWriter(const OutputTarget &target);
    ~PcapWriter();
    PcapWriter(const PcapWriter &) = delete;
    PcapWriter &operator=(const PcapWriter &) = delete;
@@ -27,6 +30,7 @@ public:
 private:
    void discard();
 
+   std::string named_;
    std::string path_;
    std::string tempPath_;
    pcap *dead_ = nullptr;

@@ -41,6 +41,9 @@ nlohmann::json replayJson(const ReplayResult &result)
                     {"direction", directionName(frame.direction)},
                     {"vlan", frame.vlan},
                     {"verdict", frame.passed ? "passed" : "dropped"}};
+      if (frame.reason != DropReason::none) {
+         entry["reason"] = dropReasonName(frame.reason);
+      }
       if (const std::string_view description = result.description(frame); !description.empty()) {
          entry["description"] = description;
       }
@@ -83,6 +86,8 @@ nlohmann::json replayJson(const ReplayResult &result)
    }
    doc["log"] = std::move(log);
    doc["violations"] = result.violations;
+   doc["warnings"] = result.warnings;
+   doc["warningsNotShown"] = result.warningsNotShown;
    return doc;
 }
 
@@ -97,7 +102,8 @@ void printReplayReport(std::ostream &out, const ReplayResult &result, bool verbo
       for (const auto &frame : result.frames) {
          if (!frame.passed) {
             out << "  dropped #" << frame.index << "  " << seconds(frame.seconds()) << "  "
-                << directionName(frame.direction) << "  " << result.description(frame) << "\n";
+                << directionName(frame.direction) << "  " << dropReasonName(frame.reason) << ": "
+                << result.description(frame) << "\n";
          }
       }
    }

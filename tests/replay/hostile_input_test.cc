@@ -1,0 +1,405 @@
+// Captures and command lines as an attacker writes them: lengths that
+// claim more than the file holds, timestamps that overflow or go back,
+// outputs that point at the input, a device or each other, and long idle
+// spans. Each fails cleanly (exit status 2, one line naming the culprit,
+// nothing written) or is replayed with a warning naming the frame.
+#include "replay_support.h"
+
+#include "replay_config.h"
+#include "replay_describe.h"
+#include "replay_engine.h"
+#include "replay_error.h"
+#include "replay_report.h"
+
+#include <gtest/gtest.h>
+#include <nlohmann/json.hpp>
+
+#include <sys/stat.h>
+#include <sys/sysmacros.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <cstring>
+#include <functional>
+#include <fstream>
+#include <sstream>
+
+namespace swsec::testing {
+namespace {
+
+
+std::string slurp(const std::filesystem::path &path)
+{
+   std::ifstream in(path, std::ios::binary);
+   std::ostringstream text;
+   text << in.rdbuf();
+   return text.str();
+}
+
+void put32(std::string &out, uint32_t v)
+{
+   out.append(reinterpret_cast<const char *>(&v), 4);
+}
+
+// A pcap file of one link type with records (seconds, bytes).
+std::string pcapFile(uint32_t linkType, const std::vector<std::pair<uint32_t, std::vector<uint8_t>>> &records)
+{
+   std::string out;
+   for (uint32_t word : {0xa1b2c3d4u, 0x00040002u, 0u, 0u, 65535u, linkType}) {
+      put32(out, word);
+   }
+   for (const auto &[seconds, bytes] : records) {
+      for (uint32_t word : {seconds, 0u, static_cast<uint32_t>(bytes.size()), static_cast<uint32_t>(bytes.size())}) {
+         put32(out, word);
+      }
+      out.append(bytes.begin(), bytes.end());
+   }
+   return out;
+}
+
+// A pcapng section (microsecond timestamps) with one EPB per (timestamp
+// in microseconds, direction flag) over the same frame.
+std::string pcapngFile(const std::vector<uint8_t> &frame, const std::vector<std::pair<uint64_t, uint32_t>> &packets)
+{
+   std::string out;
+   for (uint32_t word : {0x0A0D0D0Au, 28u, 0x1A2B3C4Du, 0x00000001u, 0xffffffffu, 0xffffffffu, 28u}) {
+      put32(out, word);
+   }
+   for (uint32_t word : {1u, 20u, 1u, 262144u, 20u}) {
+      put32(out, word);
+   }
+   const uint32_t padded = (static_cast<uint32_t>(frame.size()) + 3u) & ~3u;
+   for (const auto &[micros, flags] : packets) {
+      const uint32_t length = 32 + padded + 12;
+      for (uint32_t word : {6u, length, 0u, static_cast<uint32_t>(micros >> 32), static_cast<uint32_t>(micros),
+                            static_cast<uint32_t>(frame.size()), static_cast<uint32_t>(frame.size())}) {
+         put32(out, word);
+      }
+      out.append(frame.begin(), frame.end());
+      out.append(padded - frame.size(), '\0');
+      for (uint32_t word : {0x00040002u, flags, 0u, length}) {
+         put32(out, word);
+      }
+   }
+   return out;
+}
+
+std::vector<uint8_t> firstExampleFrame()
+{
+   return readCapture(example()).front().bytes;
+}
+
+// ---------------------------------------------------------------- reading
+
+TEST(HostileCapture, a_link_type_that_is_not_ethernet_is_named_after_the_file_is_closed)
+{
+   TempDir dir;
+   const auto frame = firstExampleFrame();
+   for (const auto &[linkType, name] : std::vector<std::pair<uint32_t, std::string>>{
+           {105, "link type IEEE802_11"}, {4000, "link type 4000"}}) {
+      writeFile(dir.path() / "in.pcap", pcapFile(linkType, {{1, frame}}));
+      const ToolRun run = runTool({"replay", "--vm-mac", kVmMac, (dir.path() / "in.pcap").string()});
+      EXPECT_EQ(run.status, 2);
+      EXPECT_NE(run.err.find("not an Ethernet capture (" + name + ")"), std::string::npos) << run.err;
+   }
+}
+
+TEST(HostileCapture, a_pcapng_block_longer_than_the_file_is_refused_before_anything_is_allocated)
+{
+   TempDir dir;
+   // 248 bytes: a section, an interface and a packet block that says it is
+   // 0xFFFFFFF0 bytes long.
+   std::string bytes = pcapngFile(std::vector<uint8_t>(156, 0x11), {{1, 2}});
+   ASSERT_EQ(bytes.size(), 248u);
+   const size_t packetBlock = 28 + 20;
+   const uint32_t huge = 0xFFFFFFF0u;
+   std::memcpy(bytes.data() + packetBlock + 4, &huge, 4);
+   writeFile(dir.path() / "huge.pcapng", bytes);
+   try {
+      readCapture(dir.path() / "huge.pcapng");
+      ADD_FAILURE() << "read a block longer than the file";
+   } catch (const replay::ReplayError &e) {
+      EXPECT_NE(std::string(e.what()).find("corrupt pcapng block at offset 48 (length 4294967280, 200 bytes left"),
+                std::string::npos)
+         << e.what();
+   }
+   // Within the file but past the block limit, and in a pipe where the
+   // file's size is unknown.
+   const ToolRun piped = runTool({"replay", "-"}, "cat '" + (dir.path() / "huge.pcapng").string() + "' |");
+   EXPECT_EQ(piped.status, 2);
+   EXPECT_NE(piped.err.find("-: corrupt pcapng block at offset 48 (length 4294967280)"), std::string::npos)
+      << piped.err;
+}
+
+TEST(HostileCapture, timestamps_that_overflow_go_back_or_lie_before_1970_are_warned_with_the_frame)
+{
+   TempDir dir;
+   const auto frame = firstExampleFrame();
+   // Frame 2's timestamp (2^62 microseconds) overflows nanoseconds; frame 4
+   // goes back 2 s.
+   writeFile(dir.path() / "times.pcapng",
+             pcapngFile(frame, {{10'000'000, 2}, {uint64_t{1} << 62, 2}, {13'000'000, 2}, {11'000'000, 2}}));
+   ToolRun run = runTool({"replay", (dir.path() / "times.pcapng").string()});
+   EXPECT_EQ(run.status, 0) << run.err;
+   EXPECT_NE(run.err.find("times.pcapng: frame 2: timestamp out of range"), std::string::npos) << run.err;
+   EXPECT_NE(run.err.find("times.pcapng: frame 4: timestamp 2.000000 s before the frame before's"),
+             std::string::npos)
+      << run.err;
+   EXPECT_EQ(run.err.find("frame 3"), std::string::npos) << run.err;
+
+   // libpcap reads a pcap record's seconds as signed: 0xfffffff0 is 16 s before 1970.
+   writeFile(dir.path() / "old.pcap", pcapFile(1, {{0xfffffff0u, frame}}));
+   run = runTool({"replay", "--json", "--vm-mac", kVmMac, (dir.path() / "old.pcap").string()});
+   EXPECT_EQ(run.status, 0) << run.err;
+   EXPECT_NE(run.err.find("old.pcap: frame 1: timestamp before 1970 (-16 s)"), std::string::npos) << run.err;
+   EXPECT_EQ(nlohmann::json::parse(run.out)["warnings"].size(), 1u);
+}
+
+TEST(HostileCapture, a_piped_pcapng_keeps_its_direction_flags)
+{
+   TempDir dir;
+   auto frames = readCapture(example());
+   for (auto &frame : frames) {
+      frame.direction = replay::kDirToVm;
+   }
+   writePcapng(dir.path() / "in.pcapng", frames);
+   for (const std::string &shell : {std::string("cat '") + (dir.path() / "in.pcapng").string() + "' |",
+                                    std::string("<'") + (dir.path() / "in.pcapng").string() + "'"}) {
+      const ToolRun run = runTool({"replay", "--json", "-"}, shell);
+      ASSERT_EQ(run.status, 0) << run.err;
+      const auto doc = nlohmann::json::parse(run.out);
+      ASSERT_EQ(doc["frames"].size(), frames.size());
+      for (const auto &frame : doc["frames"]) {
+         EXPECT_EQ(frame["direction"], "to-vm");
+      }
+   }
+}
+
+// ---------------------------------------------------------------- command line
+
+struct BadCommand {
+   const char *name;
+   std::vector<std::string> args;
+   const char *message;
+};
+
+class HostileCommandLine : public ::testing::TestWithParam<BadCommand> {};
+
+TEST_P(HostileCommandLine, is_bad_usage_named_in_one_short_line)
+{
+   std::vector<std::string> args = GetParam().args;
+   for (auto &arg : args) {
+      if (arg == "EXAMPLE") {
+         arg = example();
+      }
+   }
+   const ToolRun run = runTool(args);
+   EXPECT_EQ(run.status, 2);
+   EXPECT_EQ(run.out, "");
+   EXPECT_NE(run.err.find(GetParam().message), std::string::npos) << run.err;
+   EXPECT_EQ(std::count(run.err.begin(), run.err.end(), '\n'), 1) << run.err;
+   EXPECT_LT(run.err.size(), 200u) << run.err;
+}
+
+INSTANTIATE_TEST_SUITE_P(
+   Arguments, HostileCommandLine,
+   ::testing::Values(
+      BadCommand{"until_past_the_clock", {"replay", "--vm-mac", kVmMac, "--until", "1e15", "EXAMPLE"},
+                 "--until: expected seconds from 0 to 10000000000, got \"1e15\""},
+      BadCommand{"until_nan", {"replay", "--vm-mac", kVmMac, "--until", "nan", "EXAMPLE"}, "got \"nan\""},
+      BadCommand{"until_inf", {"replay", "--vm-mac", kVmMac, "--until", "inf", "EXAMPLE"}, "got \"inf\""},
+      BadCommand{"until_negative", {"replay", "--vm-mac", kVmMac, "--until", "-1", "EXAMPLE"}, "got \"-1\""},
+      BadCommand{"replay_module_missing", {"replay", "--vm-mac", kVmMac, "--module", "/nonexistent.so", "EXAMPLE"},
+                 "--module /nonexistent.so: "},
+      BadCommand{"info_module_missing", {"info", "--module", "/nonexistent.so"}, "/nonexistent.so"},
+      BadCommand{"unknown_subcommand", {"frobnicate", "EXAMPLE"}, "unknown subcommand \"frobnicate\""}),
+   [](const auto &param) { return std::string(param.param.name); });
+
+TEST(HostileCommandLine, until_takes_decimal_and_exponent_seconds)
+{
+   const ToolRun run = runTool({"replay", "--json", "--vm-mac", kVmMac, "--until", "2e2", example()});
+   ASSERT_EQ(run.status, 0) << run.err;
+   EXPECT_TRUE(nlohmann::json::parse(run.out)["portDb"].empty());
+}
+
+// ---------------------------------------------------------------- outputs
+
+struct OutputCase {
+   const char *name;
+   // Prepares the directory; returns the --write-passed and --write-dropped paths.
+   std::function<std::pair<std::string, std::string>(const std::filesystem::path &dir, const std::string &input)>
+      prepare;
+   const char *message;
+};
+
+class HostileOutput : public ::testing::TestWithParam<OutputCase> {};
+
+TEST_P(HostileOutput, is_refused_and_nothing_is_written)
+{
+   TempDir dir;
+   const std::string input = (dir.path() / "in.pcap").string();
+   std::filesystem::copy_file(example(), input);
+   const auto [passed, dropped] = GetParam().prepare(dir.path(), input);
+   const auto before = dir.files();
+   const ToolRun run = runTool({"replay", "--vm-mac", kVmMac, "--config", enforcing(), "--write-passed", passed,
+                                "--write-dropped", dropped, input});
+   EXPECT_EQ(run.status, 2);
+   EXPECT_NE(run.err.find(GetParam().message), std::string::npos) << run.err;
+   EXPECT_EQ(dir.files(), before);
+   EXPECT_EQ(slurp(input), slurp(example()));
+}
+
+INSTANTIATE_TEST_SUITE_P(
+   Targets, HostileOutput,
+   ::testing::Values(
+      OutputCase{"the_input",
+                 [](const auto &dir, const std::string &input) {
+                    return std::pair{input, (dir / "d.pcap").string()};
+                 },
+                 "in.pcap: cannot write: it is the input capture"},
+      OutputCase{"a_link_to_the_input",
+                 [](const auto &dir, const std::string &input) {
+                    std::filesystem::create_symlink(input, dir / "link.pcap");
+                    return std::pair{(dir / "p.pcap").string(), (dir / "link.pcap").string()};
+                 },
+                 "link.pcap: cannot write: it is the input capture"},
+      OutputCase{"the_same_file_twice",
+                 [](const auto &dir, const std::string &) {
+                    return std::pair{(dir / "out.pcap").string(), (dir / "." / "out.pcap").string()};
+                 },
+                 "out.pcap: cannot write: it is also the --write-passed file"},
+      OutputCase{"a_fifo",
+                 [](const auto &dir, const std::string &) {
+                    EXPECT_EQ(mkfifo((dir / "fifo").c_str(), 0600), 0);
+                    return std::pair{(dir / "p.pcap").string(), (dir / "fifo").string()};
+                 },
+                 "fifo: cannot write: not a regular file"},
+      OutputCase{"a_directory",
+                 [](const auto &dir, const std::string &) {
+                    std::filesystem::create_directory(dir / "sub");
+                    return std::pair{(dir / "sub").string(), (dir / "d.pcap").string()};
+                 },
+                 "sub: cannot write: not a regular file"}),
+   [](const auto &param) { return std::string(param.param.name); });
+
+TEST(HostileOutput, a_character_device_is_refused)
+{
+   TempDir dir;
+   // The null device's numbers, made in the test's own directory (as root).
+   if (mknod((dir.path() / "null").c_str(), S_IFCHR | 0666, makedev(1, 3)) != 0) {
+      GTEST_SKIP() << "cannot make a device node here";
+   }
+   const ToolRun run = runTool({"replay", "--vm-mac", kVmMac, "--write-dropped", (dir.path() / "null").string(),
+                                example()});
+   EXPECT_EQ(run.status, 2);
+   EXPECT_NE(run.err.find("null: cannot write: not a regular file"), std::string::npos) << run.err;
+   struct stat st {};
+   ASSERT_EQ(lstat((dir.path() / "null").c_str(), &st), 0);
+   EXPECT_TRUE(S_ISCHR(st.st_mode));
+}
+
+TEST(ReplayOutputPaths, a_link_is_followed_to_the_file_it_names_and_stays_a_link)
+{
+   TempDir dir;
+   writeFile(dir.path() / "target.pcap", "old contents");
+   std::filesystem::create_symlink("target.pcap", dir.path() / "link.pcap");
+   std::filesystem::create_symlink("new.pcap", dir.path() / "dangling.pcap");
+   const ToolRun run = runTool({"replay", "--vm-mac", kVmMac, "--config", enforcing(), "--write-passed",
+                                (dir.path() / "link.pcap").string(), "--write-dropped",
+                                (dir.path() / "dangling.pcap").string(), example()});
+   ASSERT_EQ(run.status, 0) << run.err;
+   EXPECT_TRUE(std::filesystem::is_symlink(dir.path() / "link.pcap"));
+   EXPECT_TRUE(std::filesystem::is_symlink(dir.path() / "dangling.pcap"));
+   EXPECT_EQ(readCapture(dir.path() / "target.pcap").size(), 14u);
+   EXPECT_EQ(readCapture(dir.path() / "new.pcap").size(), 4u);
+   EXPECT_EQ(dir.files(), (std::vector<std::string>{"dangling.pcap", "link.pcap", "new.pcap", "target.pcap"}));
+}
+
+TEST(ReplayOutputPaths, a_new_file_honours_the_umask_and_a_replaced_one_keeps_its_mode)
+{
+   TempDir dir;
+   writeFile(dir.path() / "kept.pcap", "");
+   std::filesystem::permissions(dir.path() / "kept.pcap", std::filesystem::perms(0640));
+   for (const auto &[mask, mode] : std::vector<std::pair<std::string, unsigned>>{{"022", 0644}, {"077", 0600}}) {
+      const auto fresh = dir.path() / ("fresh-" + mask + ".pcap");
+      const ToolRun run = runTool({"replay", "--vm-mac", kVmMac, "--write-passed", fresh.string(), "--write-dropped",
+                                   (dir.path() / "kept.pcap").string(), example()},
+                                  "umask " + mask + ";");
+      ASSERT_EQ(run.status, 0) << run.err;
+      struct stat st {};
+      ASSERT_EQ(stat(fresh.c_str(), &st), 0);
+      EXPECT_EQ(st.st_mode & 0777, mode) << mask;
+      ASSERT_EQ(stat((dir.path() / "kept.pcap").c_str(), &st), 0);
+      EXPECT_EQ(st.st_mode & 0777, 0640u) << mask;
+   }
+}
+
+// ---------------------------------------------------------------- idle time
+
+// The example, then its first frames again after `gap` seconds of silence:
+// bindings learned before the gap age out in it, in expiry order.
+std::filesystem::path exampleWithGap(const std::filesystem::path &dir, int64_t gapSeconds)
+{
+   auto frames = readCapture(example());
+   const size_t count = frames.size();
+   for (size_t i = 0; i < 6; ++i) {
+      CapturedFrame again = frames[i];
+      again.timeNs += gapSeconds * 1'000'000'000;
+      frames.push_back(again);
+   }
+   for (size_t i = 0; i < frames.size(); ++i) {
+      const bool fromVm = replay::macText(frames[i].bytes.data() + 6) == kVmMac;
+      frames[i].direction = fromVm ? replay::kDirFromVm : replay::kDirToVm;
+   }
+   EXPECT_EQ(frames.size(), count + 6);
+   const auto path = dir / "gap.pcapng";
+   writePcapng(path, frames);
+   return path;
+}
+
+TEST(ReplayIdleTime, skipping_idle_ticks_gives_what_firing_every_tick_gives)
+{
+   TempDir dir;
+   const auto capture = exampleWithGap(dir.path(), 100'000);
+   // The learning port keeps an ARP-snooped binding (180 s) beside the
+   // lease (120 s); the enforcing port a static one that never expires.
+   TempDir configs;
+   writeFile(configs.path() / "static.json",
+             R"({"features":["ip-discovery","dai","ip-source-guard"],"trusted":false,)"
+             R"("static":[{"vlan":0,"mac":"02:00:5e:c0:00:09","ip":"192.0.2.9"}]})");
+   for (const std::optional<std::string> &config : {std::optional<std::string>{},
+                                                   std::optional<std::string>{(configs.path() / "static.json").string()}}) {
+      for (double until : {0.0, 250'000.0}) {
+         replay::ReplayOptions options;
+         options.capturePath = capture.string();
+         options.untilSeconds = until;
+         if (config) {
+            options.config = replay::loadConfigFile(*config);
+         }
+         options.skipIdleTime = false;
+         const auto ticked = replay::replayJson(replay::runReplay(options));
+         options.skipIdleTime = true;
+         const auto skipped = replay::replayJson(replay::runReplay(options));
+         EXPECT_EQ(ticked, skipped) << "until " << until;
+         EXPECT_GE(ticked["notifications"].size(), 3u);
+      }
+   }
+}
+
+TEST(ReplayIdleTime, a_gap_of_a_billion_seconds_is_crossed_at_once)
+{
+   TempDir dir;
+   const auto capture = exampleWithGap(dir.path(), 1'000'000'000);
+   replay::ReplayOptions options;
+   options.capturePath = capture.string();
+   options.untilSeconds = 1e10;
+   const auto start = std::chrono::steady_clock::now();
+   const auto result = replay::runReplay(options);
+   EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(5));
+   // The renewed lease and the ARP entry learned after the gap aged out at the end.
+   EXPECT_TRUE(result.portDb.empty());
+   EXPECT_EQ(result.frames.size(), 24u);
+}
+
+}  // namespace
+}  // namespace swsec::testing

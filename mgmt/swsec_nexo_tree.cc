@@ -243,14 +243,20 @@ constexpr uint32_t SwSecNexoId(SwSecNexoNodeId id)
    return static_cast<uint32_t>(id);
 }
 
-/* Parents before children; children in the order they are listed. */
+/*
+ * Parents before children; children in the order they are listed. The set
+ * handlers of "createAgent" and "clearVmi" judge their own argument counts
+ * (an absent name is the parameter list's status, a wrong clear count has
+ * its message), so the host hands them any count its lists can hold.
+ */
 static constexpr Nexo_NodeDef swsecNexoNodes[] = {
    {.id = SwSecNexoId(SwSecNexoNodeId::Root), .name = "root", .parentId = NEXO_NO_PARENT,
     .kind = NEXO_NODE_BRANCH, .list = nullptr, .get = nullptr, .set = nullptr, .minArgs = 0, .maxArgs = 0,
     .output = nullptr},
    {.id = SwSecNexoId(SwSecNexoNodeId::CreateAgent), .name = "createAgent",
     .parentId = SwSecNexoId(SwSecNexoNodeId::Root), .kind = NEXO_NODE_LEAF, .list = nullptr,
-    .get = Nexo_NULL_Get, .set = SwSecNexoCreateAgent, .minArgs = 1, .maxArgs = 1, .output = nullptr},
+    .get = Nexo_NULL_Get, .set = SwSecNexoCreateAgent, .minArgs = 0, .maxArgs = NEXO_PARAM_LIST_CAPACITY,
+    .output = nullptr},
    {.id = SwSecNexoId(SwSecNexoNodeId::Security), .name = "security",
     .parentId = SwSecNexoId(SwSecNexoNodeId::Root), .kind = NEXO_NODE_LIST, .list = SwSecNexoListPortIds,
     .get = nullptr, .set = nullptr, .minArgs = 0, .maxArgs = 0, .output = nullptr},
@@ -258,10 +264,10 @@ static constexpr Nexo_NodeDef swsecNexoNodes[] = {
     .parentId = SwSecNexoId(SwSecNexoNodeId::Security), .kind = NEXO_NODE_LEAF, .list = nullptr,
     .get = SwSecNexoFeatureSummaryGet, .set = Nexo_NULL_Set, .minArgs = 0, .maxArgs = 0,
     .output = &swsecNexoFeatureSummaryRecord},
-   /* 1 or 4 arguments; the handler itself refuses 2 and 3, with a message. */
    {.id = SwSecNexoId(SwSecNexoNodeId::ClearVmi), .name = "clearVmi",
     .parentId = SwSecNexoId(SwSecNexoNodeId::Security), .kind = NEXO_NODE_LEAF, .list = nullptr,
-    .get = Nexo_NULL_Get, .set = SwSecNexoClearVmi, .minArgs = 1, .maxArgs = 4, .output = nullptr},
+    .get = Nexo_NULL_Get, .set = SwSecNexoClearVmi, .minArgs = 0, .maxArgs = NEXO_PARAM_LIST_CAPACITY,
+    .output = nullptr},
    {.id = SwSecNexoId(SwSecNexoNodeId::Vmi), .name = "vmi", .parentId = SwSecNexoId(SwSecNexoNodeId::Security),
     .kind = NEXO_NODE_LEAF_LIST, .list = SwSecNexoListVmi, .get = SwSecNexoVmiSummaryGet, .set = Nexo_NULL_Set,
     .minArgs = 0, .maxArgs = 0, .output = &swsecNexoVmiSummaryRecord},

@@ -3,8 +3,7 @@
 // the configuration and the per-packet policy on the virtual clock.
 #include "port_fixture.h"
 
-#include "framework/sifra_generic_filter.h"
-#include "swsec/swsec_context.h"
+#include "framework/sifra_generic_agent.h"
 
 #include <gmock/gmock.h>
 
@@ -44,12 +43,6 @@ Bytes udpFrom(const Ip4 &src, uint16_t srcPort = 1024, uint16_t dstPort = 80, co
 
 class FilterTest : public PortTest {
 protected:
-   SifraGenericFilter *record(host::FilterId id)
-   {
-      return static_cast<SifraGenericFilter *>(host().sifra().filter(id)->record);
-   }
-   SwSecContext *context(host::FilterId id) { return static_cast<SwSecContext *>(record(id)->agentData); }
-
    // A new port with the configuration accepted by set-features.
    host::FilterId port(const PortConfig &config)
    {
@@ -112,9 +105,10 @@ TEST_F(FilterTest, a_new_port_has_ip_discovery_on_a_trusted_port_and_its_timer)
    EXPECT_EQ(host().portsets().outstandingAcquisitions(), 0u);
 }
 
-TEST_F(FilterTest, destroy_is_refused_while_a_reference_is_held)
+TEST_F(FilterTest, destroy_is_refused_while_a_reference_is_held_and_unlinks_the_filter)
 {
    const host::FilterId id = create();
+   SifraGenericFastPathAgent *agent = record(id)->agent;
    record(id)->refCount = 2;   // as a slow path request in flight holds it
    EXPECT_EQ(host().sifra().destroyFilter(id), ORR_BUSY);
    ASSERT_EQ(host().sifra().filters().size(), 1u);
@@ -123,6 +117,10 @@ TEST_F(FilterTest, destroy_is_refused_while_a_reference_is_held)
    record(id)->refCount = 1;
    EXPECT_EQ(host().sifra().destroyFilter(id), ORR_OK);
    EXPECT_TRUE(host().sifra().filters().empty());
+   // The agent's list lost the freed record: the next filter is its only one.
+   const host::FilterId next = create();
+   EXPECT_EQ(agent->filterList.next, &record(next)->links);
+   EXPECT_EQ(record(next)->links.prev, &agent->filterList);
 }
 
 TEST_F(FilterTest, calls_with_a_bad_magic_never_reach_the_agent)
@@ -180,7 +178,7 @@ TEST_F(FilterTest, a_frame_without_an_ethernet_header_passes)
 
 // ---------------------------------------------------------------- ioctls
 
-TEST_F(FilterTest, echo_upper_cases_the_text_and_answers_only_a_request_with_an_id)
+TEST_F(FilterTest, echo_answers_only_a_request_with_an_id_and_set_features_answers_every_one)
 {
    const host::FilterId id = create();
    const Bytes echo = {1, 0, 0, 0, 'a', 'b', 'c', 0, 'x', 'y', '1'};
@@ -195,6 +193,11 @@ TEST_F(FilterTest, echo_upper_cases_the_text_and_answers_only_a_request_with_an_
    EXPECT_EQ(replies[0].requestId, 9u);
    EXPECT_EQ(replies[0].bytes, (Bytes{1, 0, 0, 0, 'A', 'B', 'C', 0, 'x', 'y', '1'}));
    EXPECT_EQ(replies[1].bytes, (Bytes{1, 0, 0, 0, 'Q', 'Z'}));
+
+   host().sifra().clearIoctlReplies();
+   EXPECT_EQ(host().sifra().sendIoctl(id, 0, setFeaturesPayload({})), ORR_OK);
+   ASSERT_EQ(host().sifra().ioctlReplies().size(), 1u);
+   EXPECT_EQ(host().sifra().ioctlReplies()[0].bytes, (Bytes{8, 0, 0, 0, 1, 0, 0, 0}));
 }
 
 TEST_F(FilterTest, short_unknown_and_reply_types_are_ignored)
@@ -234,7 +237,7 @@ TEST_F(FilterTest, set_features_and_clear_payloads_shorter_than_their_records_ar
    EXPECT_EQ(+context(id)->config.numStatic, 1u);
 }
 
-TEST_F(FilterTest, get_vmi_lists_every_entry_and_an_empty_database_as_count_zero)
+TEST_F(FilterTest, get_vmi_lists_entries_of_every_method_and_an_empty_database_as_count_zero)
 {
    const host::FilterId id = create();
    EXPECT_EQ(host().sifra().sendIoctl(id, 12, typeOnly(9)), ORR_OK);
@@ -242,9 +245,56 @@ TEST_F(FilterTest, get_vmi_lists_every_entry_and_an_empty_database_as_count_zero
    EXPECT_EQ(host().sifra().ioctlReplies()[0].bytes, (Bytes{10, 0, 0, 0, 0, 0, 0, 0}));
 
    ASSERT_EQ(setFeatures(id, {.statics = {binding(5, kVmMac, kVmIp)}}), 1u);
+   bindByDhcp(id, {.mac = kPeerMac, .ip = Ip4::parse("10.0.0.20"), .server = kPeerIp});
+   ASSERT_TRUE(passes(id, kTx, arpFrom(kPeerMac, kPeerIp, 1)));
    EXPECT_EQ(host().sifra().sendIoctl(id, 13, typeOnly(9)), ORR_OK);
    EXPECT_EQ(host().sifra().ioctlReplies().back().bytes,
-             (Bytes{10, 0, 0, 0, 1, 0, 0, 0, 5, 0, 0x02, 0, 0, 0, 0, 0x01, 10, 0, 0, 5}));
+             (Bytes{10, 0, 0, 0, 3, 0, 0, 0,                        // type, count
+                    5, 0, 0x02, 0, 0, 0, 0, 0x01, 10, 0, 0, 5,      // static
+                    0, 0, 0x02, 0, 0, 0, 0, 0x02, 10, 0, 0, 20,     // DHCP
+                    0, 0, 0x02, 0, 0, 0, 0, 0x02, 10, 0, 0, 9}));   // ARP
+}
+
+TEST_F(FilterTest, clear_vmi_removes_the_keys_it_lists_or_with_clear_all_every_learned_entry)
+{
+   const host::FilterId id = port({.statics = {binding(5, kVmMac, kVmIp)}});
+   (void)send(id, kTx, {arpFrom(kPeerMac, kPeerIp, 1), arpFrom(kVmMac, kPeerIp, 1)});
+   ASSERT_EQ(context(id)->numVmiEntries, 3u);
+   host().sifra().clearIoctlReplies();
+   Bytes one = typeOnly(11);
+   one.push_back(0);
+   put32(one, 1);
+   one.insert(one.end(), {0, 0, 0x02, 0, 0, 0, 0, 0x02, 10, 0, 0, 9});
+   EXPECT_EQ(host().sifra().sendIoctl(id, 4, one), ORR_OK);
+   EXPECT_EQ(context(id)->numVmiEntries, 2u);
+
+   Bytes all = typeOnly(11);
+   all.push_back(1);
+   put32(all, 0);
+   EXPECT_EQ(host().sifra().sendIoctl(id, 4, all), ORR_OK);
+   EXPECT_EQ(context(id)->numVmiEntries, 1u);
+   EXPECT_EQ(context(id)->config.numStatic, 1u);
+   EXPECT_TRUE(host().sifra().ioctlReplies().empty());
+}
+
+TEST_F(FilterTest, the_security_property_reads_back_the_header_and_the_static_keys)
+{
+   const PortConfig config{.statics = {binding(1, kVmMac, kVmIp), binding(2, kPeerMac, kPeerIp),
+                                       binding(3, kVmMac, kPeerIp)}};
+   const host::FilterId id = create();
+   ASSERT_EQ(writeConfig(id, config), ORR_OK);
+   const char *property = "sifra-generic-tarlin-swsec.security";
+   EXPECT_EQ(host().sifra().pollProperty(property, id), 62u);
+   Bytes exact(62);
+   EXPECT_EQ(host().sifra().readProperty(property, id, exact), ORR_OK);
+   EXPECT_EQ(exact, configBytes(config));
+   Bytes larger(64);
+   EXPECT_EQ(host().sifra().readProperty(property, id, larger), ORR_OK);
+   EXPECT_TRUE(std::equal(exact.begin(), exact.end(), larger.begin()) && larger[62] == 0 && larger[63] == 0);
+
+   Bytes cut(61);
+   EXPECT_EQ(host().sifra().readProperty(property, id, cut), ORR_BAD_PARAM);
+   EXPECT_TRUE(logged("filter: Invalid security config read length for version 1. Got 61, expecting 62"));
 }
 
 // ---------------------------------------------------------------- configuration
@@ -347,6 +397,17 @@ TEST_F(BoundPortTest, arp_inspection_admits_only_bound_senders_from_the_vm)
    EXPECT_FALSE(passes(id_, kTx, arpFrom(kVmMac, kPeerIp)));
    EXPECT_FALSE(passes(id_, kTx, arpFrom(kPeerMac, kVmIp)));
    EXPECT_TRUE(passes(id_, kRx, arpFrom(kPeerMac, kPeerIp)));
+   // An unbound sender in a header that is not Ethernet/IPv4, or shorter than 28 bytes, is not inspected.
+   for (const Arp &header : {Arp{.hardwareType = 6}, Arp{.protocolType = kEtherIpv6}, Arp{.hardwareLength = 8},
+                             Arp{.protocolLength = 16}}) {
+      Arp arp = header;
+      arp.senderMac = kPeerMac;
+      arp.senderIp = kPeerIp;
+      EXPECT_TRUE(passes(id_, kTx, arpFrame(kPeerMac, kBroadcastMac, arp)));
+   }
+   Bytes cut = arpFrom(kPeerMac, kPeerIp);
+   cut.resize(14 + 27);
+   EXPECT_TRUE(passes(id_, kTx, cut));
    EXPECT_EQ(context(id_)->counters.daiDropCnt, 2u);
 }
 

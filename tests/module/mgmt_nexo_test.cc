@@ -3,6 +3,8 @@
 // agent creation.
 #include "port_fixture.h"
 
+#include "swsec/swsec_port_db_links.h"
+
 #include <chrono>
 #include <string>
 #include <vector>
@@ -102,6 +104,12 @@ TEST_F(NexoTest, feature_summary_of_an_untrusted_dai_port_with_rate_limits)
       {"errRateLimit", "10 pps"}, {"errRateLimitPeriod", "30 sec"}, {"txRateLimitDropCnt", "0"},
       {"txRateLimitErr", "No"}, {"txRateLimitErrEntryCnt", "0"}, {"rxRateLimitDropCnt", "0"}};
    EXPECT_EQ(get(portPath(kPort, "featureSummary")).values(), expected);
+
+   // 101 ARP frames within a second: the port enters the error-rate-limit state.
+   (void)send(id, kTx, std::vector<Bytes>(101, arpRequest(kVmMac, Ip4{})));
+   const auto limited = get(portPath(kPort, "featureSummary"));
+   EXPECT_EQ(limited.value("txRateLimitErr"), "Yes");
+   EXPECT_EQ(limited.value("txRateLimitErrEntryCnt"), "1");
 }
 
 TEST_F(NexoTest, dai_without_an_arp_rate_limit_shows_na_for_the_rate_fields_but_counts_dai_drops)
@@ -142,6 +150,20 @@ TEST_F(NexoTest, a_static_vmi_shows_na_for_its_lifetime_and_dhcp_fields)
       {"portID", "7"}, {"vlanId", "100"}, {"macAddr", "02:00:00:0a:bc:0d"}, {"ipAddr", "192.168.1.20"},
       {"discoveryMethod", "Static"}, {"timeRemaining", "N/A"}, {"chaddr", "N/A"}, {"clientIdLen", "N/A"},
       {"serverIp", "N/A"}, {"leaseTime", "N/A"}};
+   EXPECT_EQ(get(portPath(kPort, "vmi/0")).values(), expected);
+}
+
+TEST_F(NexoTest, a_dhcp_vmi_shows_the_details_of_its_lease_not_its_mac_or_address)
+{
+   const host::FilterId id = create();
+   bindByDhcp(id, {.mac = kVmMac, .ip = kVmIp, .server = kPeerIp, .lease = 600, .clientId = Bytes{1, 2, 3}});
+   ASSERT_EQ(context(id)->numVmiEntries, 1u);
+   // The client hardware address is kept apart from the MAC: tell them apart.
+   SwSecVmiFromListLinks(context(id)->portDbList.next)->chaddr[5] = 0x33;
+   const std::map<std::string, std::string, std::less<>> expected = {
+      {"portID", "7"}, {"vlanId", "0"}, {"macAddr", "02:00:00:01:02:03"}, {"ipAddr", "10.0.0.5"},
+      {"discoveryMethod", "DHCP Snooping"}, {"timeRemaining", "600 sec"}, {"chaddr", "02:00:00:01:02:33"},
+      {"clientIdLen", "3"}, {"serverIp", "10.0.0.254"}, {"leaseTime", "600"}};
    EXPECT_EQ(get(portPath(kPort, "vmi/0")).values(), expected);
 }
 
@@ -198,10 +220,11 @@ TEST_F(NexoTest, a_vmi_summary_without_an_index_or_memory_fails_and_lets_the_por
 
 // ---------------------------------------------------------------- clearVmi
 
-TEST_F(NexoTest, clear_with_two_or_three_arguments_is_refused_before_the_port_is_looked_up)
+TEST_F(NexoTest, clear_with_other_than_one_or_four_arguments_is_refused_before_the_port_is_looked_up)
 {
    for (const std::vector<std::string> &args :
-        {std::vector<std::string>{"a", "b"}, std::vector<std::string>{"a", "b", "c"}}) {
+        {std::vector<std::string>{}, std::vector<std::string>{"a", "b"}, std::vector<std::string>{"a", "b", "c"},
+         std::vector<std::string>{"a", "0", "02:00:00:01:02:03", "10.0.0.5", "e"}}) {
       host().log().clear();
       // Port 99 does not exist: the count is checked first.
       EXPECT_EQ(host().nexo().set(portPath(99, "clearVmi"), args), ORR_BAD_PARAM);
@@ -289,7 +312,11 @@ TEST_F(NexoTest, create_agent_registers_a_new_fast_path_and_returns_the_hosts_re
    EXPECT_EQ(host().sifra().fastPaths().size(), registered);
    EXPECT_NE(host().nexo().set("/createAgent", {kAgent}), ORR_OK);
 
-   EXPECT_EQ(host().nexo().set("/createAgent", {}), ORR_BAD_PARAM);
+   // No name: the parameter list's own status; several: the first is the name.
+   EXPECT_EQ(host().nexo().set("/createAgent", {}), ORR_NOT_FOUND);
+   EXPECT_EQ(host().nexo().set("/createAgent", {"sifra-generic-two", "sifra-generic-three"}), ORR_OK);
+   EXPECT_TRUE(host().sifra().fastPath("sifra-generic-two").has_value());
+   EXPECT_FALSE(host().sifra().fastPath("sifra-generic-three").has_value());
 }
 
 }  // namespace

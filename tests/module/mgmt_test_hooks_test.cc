@@ -3,6 +3,7 @@
 // through the exported queries once per selector.
 #include "port_fixture.h"
 
+#include <chrono>
 #include <cstdint>
 
 namespace swsec::testing {
@@ -82,9 +83,30 @@ TEST_F(TestHooksTest, each_vmi_added_while_on_reads_the_port_once_per_selector)
    EXPECT_EQ(host().useCount(), 0u);
    EXPECT_EQ(host().portsets().outstandingAcquisitions(), 0u);
 
+   // A failed query (selector 1's buffer refused) skips selector 2 and lets the portset go.
+   host().faults().failOnce("orr_ModuleIncUseCount", ORR_FAILURE);
+   const Traffic failed = learnOneVmi("02:00:00:00:00:03", "10.0.0.3");
+   EXPECT_EQ(failed.acquisitions, 1u);
+   EXPECT_EQ(failed.useCountIncrements, 1u);
+   EXPECT_EQ(host().portsets().outstandingAcquisitions(), 0u);
+
    ASSERT_EQ(host().nexo().set("/stopTest", {}), ORR_OK);
-   const Traffic stopped = learnOneVmi("02:00:00:00:00:03", "10.0.0.3");
+   const Traffic stopped = learnOneVmi("02:00:00:00:00:04", "10.0.0.4");
    EXPECT_EQ(stopped.acquisitions, 0u);
+}
+
+TEST_F(TestHooksTest, removals_by_a_management_clear_and_by_the_ageing_timer_reach_the_hooks)
+{
+   (void)learnOneVmi("02:00:00:00:00:01", "10.0.0.1");
+   (void)learnOneVmi("02:00:00:00:00:02", "10.0.0.2");
+   ASSERT_EQ(host().nexo().set("/startTest", {}), ORR_OK);
+   const uint64_t acquisitions = host().faults().calls("orr_PortsetAcquireByPortID");
+   ASSERT_EQ(host().nexo().set("/security/7/clearVmi", {"one", "0", "02:00:00:00:00:01", "10.0.0.1"}), ORR_OK);
+   EXPECT_EQ(host().faults().calls("orr_PortsetAcquireByPortID") - acquisitions, 1u);
+   host().clock().advance(std::chrono::seconds(190));   // the other one ages out
+   EXPECT_EQ(host().faults().calls("orr_PortsetAcquireByPortID") - acquisitions, 2u);
+   EXPECT_EQ(host().portsets().pendingDeliveries(), 0u);
+   EXPECT_EQ(host().portsets().outstandingAcquisitions(), 0u);
 }
 
 TEST_F(TestHooksTest, messages_of_another_class_or_without_a_message_are_ignored)

@@ -6,7 +6,9 @@
 // failed to drop fails the test.
 #pragma once
 
+#include "framework/sifra_generic_filter.h"
 #include "module_checks.h"
+#include "swsec/swsec_context.h"
 #include "support/frames.h"
 #include "support/host_fixture.h"
 #include "support/security_config.h"
@@ -64,6 +66,15 @@ inline Bytes arpRequest(const Mac &mac, const Ip4 &ip)
    return arpFrame(mac, kBroadcastMac, {.op = 1, .senderMac = mac, .senderIp = ip, .targetIp = Ip4{{10, 0, 0, 254}}});
 }
 
+// A DHCP binding as a VM and its server make it.
+struct DhcpLease {
+   Mac mac;
+   Ip4 ip;
+   Ip4 server;
+   uint32_t lease = 3600;
+   std::optional<Bytes> clientId;
+};
+
 class PortTest : public ModuleTest {
 protected:
    void SetUp() override
@@ -87,6 +98,23 @@ protected:
       host::FilterId id = 0;
       EXPECT_EQ(host().sifra().createFilter(kAgent, port, config, &id), ORR_OK);
       return id;
+   }
+
+   SifraGenericFilter *record(host::FilterId id)
+   {
+      return static_cast<SifraGenericFilter *>(host().sifra().filter(id)->record);
+   }
+   SwSecContext *context(host::FilterId id) { return static_cast<SwSecContext *>(record(id)->agentData); }
+
+   // The VM's DHCPREQUEST and the server's DHCPACK, each passed.
+   void bindByDhcp(host::FilterId id, const DhcpLease &l)
+   {
+      const Dhcp request{.xid = 0x5eed, .chaddr = l.mac, .type = kDhcpRequest, .clientId = l.clientId};
+      ASSERT_TRUE(passes(id, kTx, dhcpFrame({.src = l.mac, .dhcp = request})));
+      const Dhcp ack{.op = 2, .xid = 0x5eed, .yiaddr = l.ip, .siaddr = l.server, .chaddr = l.mac,
+                     .type = kDhcpAck, .leaseTime = l.lease};
+      ASSERT_TRUE(passes(id, kRx, dhcpFrame({.dst = l.mac, .ipSrc = l.server, .ipDst = l.ip, .fromServer = true,
+                                             .dhcp = ack})));
    }
 
    orr_Status writeConfig(host::FilterId id, const PortConfig &config)

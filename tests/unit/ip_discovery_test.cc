@@ -18,6 +18,8 @@ const Ip4 kLeased = Ip4::parse("10.0.0.10");
 const Ip4 kRenumbered = Ip4::parse("10.0.0.20");
 const Ip4 kVmIp = Ip4::parse("10.0.0.5");
 const Ip4 kPeerIp = Ip4::parse("10.0.0.6");
+const Ip4 kBroadcastIp{{255, 255, 255, 255}};
+constexpr uint32_t kInfiniteLease = 0xffffffffu;
 
 struct Outcome {
    orr_Status status = ORR_OK;   // of the last pass
@@ -43,16 +45,16 @@ protected:
       return out;
    }
 
-   Outcome fromVm(const Dhcp &dhcp, const Mac &src = kVmMac, Ip4 ipDst = Ip4{{255, 255, 255, 255}})
+   Outcome fromVm(const Dhcp &dhcp, const Mac &src = kVmMac, Ip4 ipDst = kBroadcastIp, uint16_t vlanId = 0)
    {
-      return judge(dhcpFrame({.src = src, .ipDst = ipDst, .dhcp = dhcp}), SwSecDirectionTx);
+      return judge(dhcpFrame({.src = src, .ipDst = ipDst, .dhcp = dhcp}), SwSecDirectionTx, vlanId);
    }
 
-   Outcome fromServer(const Dhcp &dhcp)
+   Outcome fromServer(const Dhcp &dhcp, uint16_t vlanId = 0)
    {
       return judge(dhcpFrame({.src = kServerMac, .dst = kVmMac, .ipSrc = kServerIp,
                               .ipDst = dhcp.yiaddr, .fromServer = true, .dhcp = dhcp}),
-                   SwSecDirectionRx);
+                   SwSecDirectionRx, vlanId);
    }
 
    static Dhcp clientMsg(uint8_t type, uint32_t xid, std::optional<Bytes> clientId = std::nullopt)
@@ -118,14 +120,14 @@ protected:
 
 // ---------------------------------------------------------------- DHCP snooping
 
-TEST_F(IpDiscoveryTest, full_exchange_creates_one_dhcp_binding_with_the_lease)
+TEST_F(IpDiscoveryTest, full_exchange_creates_one_dhcp_binding_with_the_lease_counted_unsigned)
 {
    advanceSeconds(5);
    EXPECT_EQ(fromVm(clientMsg(kDhcpDiscover, 0x77)).verdict, SwSecVerdictPass);
    EXPECT_EQ(fromServer(serverMsg(kDhcpOffer, 0x77, kLeased)).verdict, SwSecVerdictPass);
    EXPECT_EQ(fromVm(clientMsg(kDhcpRequest, 0x77)).verdict, SwSecVerdictPass);
    EXPECT_EQ(ctx_.numDhcpReqs, 1u);
-   const Outcome ack = fromServer(serverMsg(kDhcpAck, 0x77, kLeased, 3600));
+   const Outcome ack = fromServer(serverMsg(kDhcpAck, 0x77, kLeased, kInfiniteLease));
    EXPECT_EQ(ack.status, ORR_OK);
    EXPECT_EQ(ack.verdict, SwSecVerdictPass);
 
@@ -136,10 +138,13 @@ TEST_F(IpDiscoveryTest, full_exchange_creates_one_dhcp_binding_with_the_lease)
    EXPECT_EQ(0, std::memcmp(vmi->macAddr, kVmMac.bytes.data(), 6));
    EXPECT_EQ(0, std::memcmp(vmi->chaddr, kVmMac.bytes.data(), 6));
    EXPECT_EQ(vmi->serverIp, kServerIp.raw());
-   EXPECT_EQ(vmi->leaseTime, 3600u);
-   EXPECT_EQ(vmi->expiryTime, uptime() + 3600);
+   EXPECT_EQ(vmi->leaseTime, kInfiniteLease);
+   EXPECT_EQ(vmi->expiryTime, uptime() + int64_t{kInfiniteLease});
    EXPECT_EQ(ctx_.numDhcpReqs, 0u);
    EXPECT_EQ(posts(), (std::vector<std::string>{"portdb.entry.added"}));
+   advanceSeconds(10);
+   SwSecPortDbTimerCb(&ctx_);
+   EXPECT_EQ(vmis().size(), 1u);
 }
 
 TEST_F(IpDiscoveryTest, renewal_keeping_the_address_only_extends_the_lease)
@@ -149,11 +154,11 @@ TEST_F(IpDiscoveryTest, renewal_keeping_the_address_only_extends_the_lease)
    advanceSeconds(300);
    ASSERT_EQ(renew(0x101).status, ORR_OK);
    ASSERT_EQ(vmis().size(), 1u) << "a renewing request keeps the binding";
-   ASSERT_EQ(fromServer(serverMsg(kDhcpAck, 0x101, kLeased, 900)).verdict, SwSecVerdictPass);
+   ASSERT_EQ(fromServer(serverMsg(kDhcpAck, 0x101, kLeased, kInfiniteLease)).verdict, SwSecVerdictPass);
 
    ASSERT_EQ(vmis().size(), 1u);
-   EXPECT_EQ(vmis()[0]->leaseTime, 900u);
-   EXPECT_EQ(vmis()[0]->expiryTime, uptime() + 900);
+   EXPECT_EQ(vmis()[0]->leaseTime, kInfiniteLease);
+   EXPECT_EQ(vmis()[0]->expiryTime, uptime() + int64_t{kInfiniteLease});
    EXPECT_TRUE(posts().empty());
 }
 
@@ -236,9 +241,13 @@ INSTANTIATE_TEST_SUITE_P(Messages, IpDiscoveryRemovalTest,
                                            RemovalCase{"nak", kDhcpNak, true}),
                          [](const auto &test) { return std::string(test.param.name); });
 
-TEST_F(IpDiscoveryTest, broadcast_request_without_ciaddr_ends_the_old_binding_at_once)
+TEST_F(IpDiscoveryTest, broadcast_request_ends_the_old_binding_at_once_only_without_ciaddr)
 {
    bind(kLeased);
+   Dhcp rebinding = clientMsg(kDhcpRequest, 0x4ff);
+   rebinding.ciaddr = kLeased;
+   ASSERT_EQ(fromVm(rebinding).status, ORR_OK);
+   EXPECT_EQ(vmis().size(), 1u);
    ASSERT_EQ(fromVm(clientMsg(kDhcpRequest, 0x500)).status, ORR_OK);
    EXPECT_TRUE(vmis().empty());
    EXPECT_EQ(ctx_.numDhcpReqs, 1u);
@@ -264,6 +273,27 @@ TEST_F(IpDiscoveryTest, ack_without_a_request_is_dropped_and_a_nak_without_one_p
    bind(kLeased, 0x601);
    EXPECT_EQ(fromServer(serverMsg(kDhcpNak, 0x999, kLeased)).verdict, SwSecVerdictPass);
    EXPECT_EQ(vmis().size(), 1u);
+}
+
+TEST_F(IpDiscoveryTest, a_client_on_one_vlan_never_touches_its_binding_or_request_on_another)
+{
+   bind(kLeased);
+   // Selecting on VLAN 5 (broadcast, ciaddr 0) ends no binding on VLAN 0.
+   ASSERT_EQ(fromVm(clientMsg(kDhcpRequest, 0x110), kVmMac, kBroadcastIp, 5).status, ORR_OK);
+   ASSERT_EQ(vmis().size(), 1u);
+   // An ACK or a NAK on VLAN 0 answers no request of VLAN 5.
+   EXPECT_EQ(fromServer(serverMsg(kDhcpAck, 0x110, kRenumbered)).verdict, SwSecVerdictDrop);
+   EXPECT_EQ(fromServer(serverMsg(kDhcpNak, 0x110, kLeased)).verdict, SwSecVerdictPass);
+   // A request on VLAN 0 is pending on its own; release and discover on VLAN 5 end VLAN 5's only.
+   ASSERT_EQ(renew(0x111).status, ORR_OK);
+   EXPECT_EQ(ctx_.numDhcpReqs, 2u);
+   for (const uint8_t type : {kDhcpRelease, kDhcpDiscover}) {
+      ASSERT_EQ(fromVm(clientMsg(type, 0x112), kVmMac, kBroadcastIp, 5).status, ORR_OK);
+   }
+   ASSERT_EQ(requests().size(), 1u);
+   EXPECT_EQ(requests()[0]->vlanId, 0);
+   ASSERT_EQ(vmis().size(), 1u);
+   EXPECT_EQ(vmis()[0]->vlanId, 0);
 }
 
 TEST_F(IpDiscoveryTest, foreign_chaddr_is_dropped_on_an_untrusted_port_only)

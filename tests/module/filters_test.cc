@@ -123,27 +123,6 @@ TEST_F(FilterTest, destroy_is_refused_while_a_reference_is_held_and_unlinks_the_
    EXPECT_EQ(record(next)->links.prev, &agent->filterList);
 }
 
-TEST_F(FilterTest, calls_with_a_bad_magic_never_reach_the_agent)
-{
-   const host::FilterId id = port({.features = SwSecFeatureBpduFilter});
-   host().sifra().clearIoctlReplies();
-   host().log().clear();
-
-   SifraGenericFilter *filter = record(id);
-   const uint64_t magic = filter->magic;
-   filter->magic = ~magic;
-   EXPECT_EQ(host().sifra().sendIoctl(id, 5, {1, 0, 0, 0, 'a', 0}), ORR_BAD_PARAM);
-   const auto frames = send(id, kTx, {bpduFrame(kVmMac)});
-   EXPECT_EQ(frames.status, ORR_BAD_PARAM);
-   EXPECT_EQ(host().sifra().changeConfiguration(id, {.name = "renamed"}), ORR_BAD_PARAM);
-   filter->magic = magic;
-
-   EXPECT_TRUE(host().sifra().ioctlReplies().empty());
-   EXPECT_THAT(frames.kept, ElementsAre(0u));
-   EXPECT_STREQ(filter->name, "filter");
-   EXPECT_EQ(host().log().count("Bad magic for filter"), 3u);
-}
-
 // ---------------------------------------------------------------- frame loop
 
 TEST_F(FilterTest, a_port_without_features_leaves_the_list_untouched)

@@ -65,6 +65,7 @@ struct SwSecContext {
    uint32_t totalClientIdLen;          /* over the DHCP entries */
    orr_ListLinks dhcpReqList;          /* SwSecDhcpReq, oldest first */
    uint32_t numDhcpReqs;
+   SwSecDhcpReqIndex dhcpReqIndex;     /* lookups beside dhcpReqList */
 
    /* ARP rate limiting. */
    SifraGenericRateLimit txRateLimit;  /* frames from the VM */

@@ -14,6 +14,7 @@
 #include "platform/orr_hash.h"
 #include "platform/orr_text.h"
 #include "swsec/swsec_dhcp_parse.h"
+#include "swsec/swsec_dhcp_req_index.h"
 #include "swsec/swsec_notify.h"
 #include "swsec/swsec_port_db.h"
 #include "swsec/swsec_port_db_links.h"
@@ -113,12 +114,6 @@ SwSecVmi *VmiOfListLinks(orr_ListLinks *links)
                                        offsetof(SwSecVmi, listLinks));
 }
 
-SwSecDhcpReq *ReqOfLinks(orr_ListLinks *links)
-{
-   return reinterpret_cast<SwSecDhcpReq *>(reinterpret_cast<uint8_t *>(links) -
-                                           offsetof(SwSecDhcpReq, links));
-}
-
 bool IsNonAuthoritative(const SwSecVmi *vmi)
 {
    return (vmi->discoveryMethod & SwSecDiscNonAuthoritativeMask) != 0;
@@ -141,33 +136,6 @@ int ClientIdCmp(const uint8_t *storedChaddr, uint8_t storedLen, const uint8_t *s
       return orr_Memcmp(storedId, clientId, clientIdLen);
    }
    return orr_Memcmp(storedChaddr, chaddr, MAC_LEN);
-}
-
-/* The first pending request of the client on the VLAN, or null. */
-SwSecDhcpReq *FindDhcpReqByClient(SwSecContext *ctx, uint16_t vlanId, const uint8_t *chaddr,
-                                  uint32_t clientIdLen, const uint8_t *clientId)
-{
-   for (orr_ListLinks *l = ctx->dhcpReqList.next; l != &ctx->dhcpReqList; l = l->next) {
-      SwSecDhcpReq *req = ReqOfLinks(l);
-      if (req->vlanId == vlanId &&
-          SwSecDhcpClientIdCmp(req, chaddr, clientIdLen, clientId) == 0) {
-         return req;
-      }
-   }
-   return nullptr;
-}
-
-/* The first pending request that a server's answer matches (VLAN, xid, chaddr), or null. */
-SwSecDhcpReq *FindDhcpReqByXid(SwSecContext *ctx, uint16_t vlanId, uint32_t xid,
-                               const uint8_t *chaddr)
-{
-   for (orr_ListLinks *l = ctx->dhcpReqList.next; l != &ctx->dhcpReqList; l = l->next) {
-      SwSecDhcpReq *req = ReqOfLinks(l);
-      if (req->vlanId == vlanId && req->xid == xid && orr_Memcmp(req->chaddr, chaddr, MAC_LEN) == 0) {
-         return req;
-      }
-   }
-   return nullptr;
 }
 
 /* Records a client's request as pending for 60 seconds (SwSecAddDhcpReq). */
@@ -196,8 +164,7 @@ orr_Status SwSecAddDhcpReq(SwSecContext *ctx, const SwSecPktInfo *info)
    req->clientIdLen = clientIdLen;
    orr_Memcpy(req->chaddr, hdr + DHCP_CHADDR_OFFSET, MAC_LEN);
    req->expiryTime = SifraGenericGetExpirySec(DHCP_REQ_LIFETIME_SEC);
-   SifraGenericListAppend(&ctx->dhcpReqList, &req->links);
-   ctx->numDhcpReqs++;
+   SwSecLinkDhcpReq(ctx, req);
    return ORR_OK;
 }
 
@@ -266,7 +233,7 @@ void RenewDhcpVmi(SwSecContext *ctx, SwSecVmi *vmi, uint32_t leaseTime, uint32_t
 orr_Status FwProcessDhcpAck(SwSecContext *ctx, const SwSecPktInfo *info, uint32_t *verdict)
 {
    const uint8_t *hdr = info->dhcpHdr;
-   SwSecDhcpReq *req = FindDhcpReqByXid(ctx, info->vlanId, LoadRaw32(hdr + DHCP_XID_OFFSET),
+   SwSecDhcpReq *req = SwSecFindDhcpReqByAnswer(ctx, info->vlanId, LoadRaw32(hdr + DHCP_XID_OFFSET),
                                         hdr + DHCP_CHADDR_OFFSET);
    if (req == nullptr) {
       /* An acknowledgement that answers no request of this port is not delivered. */
@@ -354,7 +321,7 @@ orr_Status ClientSideDhcp(SwSecContext *ctx, orr_Pkt *pkt, SwSecPktInfo *info, u
    case DHCP_DISCOVER:
    case DHCP_DECLINE:
    case DHCP_RELEASE: {
-      SwSecDhcpReq *req = FindDhcpReqByClient(ctx, info->vlanId, chaddr, clientIdLen, clientId);
+      SwSecDhcpReq *req = SwSecFindDhcpReqByClient(ctx, info->vlanId, chaddr, clientIdLen, clientId);
       if (req != nullptr) {
          SwSecDelDhcpReq(ctx, req);
       }
@@ -367,10 +334,10 @@ orr_Status ClientSideDhcp(SwSecContext *ctx, orr_Pkt *pkt, SwSecPktInfo *info, u
           LoadRaw32(hdr + DHCP_CIADDR_OFFSET) == 0) {
          DelDhcpClientVmi(ctx, info->vlanId, chaddr, clientIdLen, clientId);
       }
-      SwSecDhcpReq *req = FindDhcpReqByClient(ctx, info->vlanId, chaddr, clientIdLen, clientId);
+      SwSecDhcpReq *req = SwSecFindDhcpReqByClient(ctx, info->vlanId, chaddr, clientIdLen, clientId);
       if (req != nullptr) {
          /* A repeated request follows the latest xid but keeps its first expiry. */
-         req->xid = LoadRaw32(hdr + DHCP_XID_OFFSET);
+         SwSecSetDhcpReqXid(ctx, req, LoadRaw32(hdr + DHCP_XID_OFFSET));
          return ORR_OK;
       }
       return SwSecAddDhcpReq(ctx, info);
@@ -395,7 +362,7 @@ orr_Status ServerSideDhcp(SwSecContext *ctx, orr_Pkt *pkt, SwSecPktInfo *info, u
       return FwProcessDhcpAck(ctx, info, verdict);
    case DHCP_NAK: {
       const uint8_t *hdr = info->dhcpHdr;
-      SwSecDhcpReq *req = FindDhcpReqByXid(ctx, info->vlanId, LoadRaw32(hdr + DHCP_XID_OFFSET),
+      SwSecDhcpReq *req = SwSecFindDhcpReqByAnswer(ctx, info->vlanId, LoadRaw32(hdr + DHCP_XID_OFFSET),
                                            hdr + DHCP_CHADDR_OFFSET);
       if (req == nullptr) {
          return ORR_OK;

@@ -6,6 +6,7 @@
  * single VMI is found by comparing the list's first entry.
  */
 #include "swsec/swsec_port_db.h"
+#include "swsec/swsec_dhcp_req_index.h"
 #include "swsec/swsec_wire.h"
 
 #include "framework/sifra_generic.h"
@@ -246,13 +247,12 @@ orr_Status SwSecClearVmi(SwSecContext *ctx, bool all, uint32_t count, const SwSe
 
 void SwSecDelDhcpReq(SwSecContext *ctx, SwSecDhcpReq *req)
 {
-   SifraGenericListUnlink(&req->links);
+   SwSecUnlinkDhcpReq(ctx, req);
    if (req->clientIdLen != 0 && req->clientIdStr != nullptr) {
       SifraGenericFree(req->clientIdStr);
       req->clientIdStr = nullptr;
    }
    SifraGenericFree(req);
-   ctx->numDhcpReqs--;
 }
 
 void SwSecPortDbTimerCb(SwSecContext *ctx)

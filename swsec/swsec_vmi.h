@@ -58,7 +58,9 @@ struct SwSecVmi {
 
 /*
  * A DHCP request seen from the VM and not yet answered, a zeroed heap
- * record in dhcpReqList; aged with the database.
+ * record in dhcpReqList (and in the index beside it, when there is one);
+ * aged with the database. Made by IP discovery, owned by the port from
+ * SwSecLinkDhcpReq to SwSecDelDhcpReq.
  */
 struct SwSecDhcpReq {
    orr_ListLinks links;
@@ -68,6 +70,22 @@ struct SwSecDhcpReq {
    uint8_t clientIdLen;
    uint8_t *clientIdStr;
    int64_t expiryTime;
+   /* The index (swsec_dhcp_req_index.h); unlinked while there is none. */
+   orr_ListLinks clientLinks;  /* in a by-client bucket */
+   orr_ListLinks answerLinks;  /* in a by-answer bucket, arrival order */
+   uint64_t arrival;           /* the port's count of requests when this one came */
+};
+
+/*
+ * The index of a port's pending requests: one heap block of 2 x numBuckets
+ * list heads (by client, then by answer); no block while few are pending.
+ */
+struct SwSecDhcpReqIndex {
+   orr_ListLinks *byClient;    /* numBuckets heads, or null: no index */
+   orr_ListLinks *byAnswer;    /* the block's second half */
+   uint32_t bucketMask;        /* numBuckets - 1 */
+   uint64_t seed;              /* keys the hashes; set when the block is made */
+   uint64_t nextArrival;       /* stamps SwSecDhcpReq::arrival */
 };
 
 /* The client identity group has one shape in both records. */

@@ -12,6 +12,7 @@
 #include "framework/sifra_generic_filter.h"
 #include "framework/sifra_generic_list.h"
 #include "swsec/swsec_context.h"
+#include "swsec/swsec_ip_discovery.h"
 #include "swsec/swsec_pkt_info.h"
 #include "swsec/swsec_port_db.h"
 
@@ -48,6 +49,13 @@ struct WrappedFrame {
       }
    }
    ~WrappedFrame() { releaseCopy(); }
+};
+
+// What IP discovery made of one frame.
+struct Outcome {
+   orr_Status status = ORR_OK;   // of the last pass
+   uint32_t verdict = 0;
+   bool askedForWriteLock = false;
 };
 
 class DiscoveryTest : public HandMadePortTest {
@@ -118,6 +126,21 @@ protected:
       return frame;
    }
 
+   // Judges one frame as the frame loop does: shared first, exclusive on ORR_BUSY.
+   Outcome judge(const Bytes &bytes, uint32_t direction, uint16_t vlanId = 0)
+   {
+      auto frame = wrap(bytes, vlanId);
+      Outcome out;
+      frame->info.readLocked = 1;
+      out.status = SwSecIpDiscovery(&ctx_, frame->pkt, &frame->info, direction, &out.verdict);
+      if (out.status == ORR_BUSY) {
+         out.askedForWriteLock = true;
+         frame->releaseCopy();
+         frame->info.readLocked = 0;
+         out.status = SwSecIpDiscovery(&ctx_, frame->pkt, &frame->info, direction, &out.verdict);
+      }
+      return out;
+   }
 };
 
 }  // namespace swsec::testing

@@ -21,30 +21,8 @@ const Ip4 kPeerIp = Ip4::parse("10.0.0.6");
 const Ip4 kBroadcastIp{{255, 255, 255, 255}};
 constexpr uint32_t kInfiniteLease = 0xffffffffu;
 
-struct Outcome {
-   orr_Status status = ORR_OK;   // of the last pass
-   uint32_t verdict = 0;
-   bool askedForWriteLock = false;
-};
-
 class IpDiscoveryTest : public DiscoveryTest {
 protected:
-   // Judges one frame as the frame loop does: shared first, exclusive on ORR_BUSY.
-   Outcome judge(const Bytes &bytes, uint32_t direction, uint16_t vlanId = 0)
-   {
-      auto frame = wrap(bytes, vlanId);
-      Outcome out;
-      frame->info.readLocked = 1;
-      out.status = SwSecIpDiscovery(&ctx_, frame->pkt, &frame->info, direction, &out.verdict);
-      if (out.status == ORR_BUSY) {
-         out.askedForWriteLock = true;
-         frame->releaseCopy();
-         frame->info.readLocked = 0;
-         out.status = SwSecIpDiscovery(&ctx_, frame->pkt, &frame->info, direction, &out.verdict);
-      }
-      return out;
-   }
-
    Outcome fromVm(const Dhcp &dhcp, const Mac &src = kVmMac, Ip4 ipDst = kBroadcastIp, uint16_t vlanId = 0)
    {
       return judge(dhcpFrame({.src = src, .ipDst = ipDst, .dhcp = dhcp}), SwSecDirectionTx, vlanId);

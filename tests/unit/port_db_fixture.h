@@ -15,6 +15,7 @@
 #include "framework/sifra_generic_list.h"
 #include "framework/sifra_generic_lock.h"
 #include "swsec/swsec_context.h"
+#include "swsec/swsec_dhcp_req_index.h"
 #include "swsec/swsec_notify.h"
 #include "swsec/swsec_port_db.h"
 #include "swsec/swsec_port_db_export.h"
@@ -149,8 +150,7 @@ protected:
          req->clientIdLen = clientIdLen;
          req->clientIdStr = static_cast<uint8_t *>(SifraGenericAlloc(clientIdLen));
       }
-      SifraGenericListAppend(&ctx_.dhcpReqList, &req->links);
-      ctx_.numDhcpReqs++;
+      SwSecLinkDhcpReq(&ctx_, req);
    }
 
    SwSecVmi *find(Key key) { return SwSecFindVmi(&ctx_, key.vlan, key.macBytes().data(), key.ipAddr()); }

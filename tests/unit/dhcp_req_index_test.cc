@@ -66,7 +66,8 @@ protected:
          }
          Mac mac;
          std::memcpy(mac.bytes.data(), req->chaddr, 6);
-         out.push_back(describe({req->vlanId, req->xid, mac, id, req->expiryTime}));
+         // The port keeps the xid as the message carries it (network order).
+         out.push_back(describe({req->vlanId, __builtin_bswap32(req->xid), mac, id, req->expiryTime}));
       }
       return out;
    }

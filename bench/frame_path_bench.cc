@@ -24,6 +24,8 @@
 #include <utility>
 #include <vector>
 
+extern "C" const orr_ModuleInfo orr_moduleInfo;
+
 namespace swsec::bench {
 namespace {
 
@@ -287,11 +289,23 @@ int main(int argc, char **argv)
       args.push_back(repetitions.data());
       args.push_back(aggregatesOnly.data());
    }
+   // --module IMAGE: the image as deployed, opened by the host's loader;
+   // by default the module linked into this program.
+   swsec::host::LoadOptions load;
+   load.linkedModule = &orr_moduleInfo;
+   for (auto arg = args.begin() + 1; arg != args.end(); ++arg) {
+      if (std::string_view(*arg) == "--module" && arg + 1 != args.end()) {
+         load.modulePath = *(arg + 1);
+         load.linkedModule = nullptr;
+         args.erase(arg, arg + 2);
+         break;
+      }
+   }
    int argCount = static_cast<int>(args.size());
    benchmark::Initialize(&argCount, args.data());
 
    swsec::host::Host host;
-   if (host.load() != 0) {
+   if (host.load(load) != 0) {
       std::fprintf(stderr, "frame path bench: the module failed to load\n");
       return 1;
    }

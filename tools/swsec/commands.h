@@ -1,6 +1,8 @@
 // The subcommands of the swsec tool.
 #pragma once
 
+#include "platform/orr_module.h"
+
 #include <cstdint>
 #include <map>
 #include <string>
@@ -21,8 +23,11 @@ struct InfoOptions {
    bool json = false;
    bool verbose = false;
    std::vector<std::string> parameters;  // NAME=VALUE
-   std::string modulePath;
+   std::string modulePath;               // "" the module linked into swsec
 };
+
+// The module linked into swsec: what runs unless --module names an image.
+const orr_ModuleInfo *linkedModule();
 
 void addInfoOptions(CLI::App &command, InfoOptions &options);
 int runInfo(const InfoOptions &options);
@@ -37,7 +42,7 @@ struct ReplayCommandOptions {
    bool verbose = false;
    std::string writePassed;
    std::string writeDropped;
-   std::string modulePath;
+   std::string modulePath;               // "" the module linked into swsec
 };
 
 void addReplayOptions(CLI::App &command, ReplayCommandOptions &options);

@@ -20,7 +20,7 @@ void addInfoOptions(CLI::App &command, InfoOptions &options)
    command.add_flag("--json", options.json, "print one JSON document");
    command.add_flag("-v,--verbose", options.verbose, "also print the module's log lines");
    command.add_option("--param", options.parameters, "module parameter NAME=VALUE (repeatable)");
-   command.add_option("--module", options.modulePath, "module image (default: the built one)");
+   command.add_option("--module", options.modulePath, "open this module image instead of the module linked into swsec");
 }
 
 namespace {
@@ -71,6 +71,9 @@ Snapshot takeSnapshot(const InfoOptions &options)
    host.setViolationHandler([&snap](const std::string &v) { snap.violations.push_back(v); });
    host::LoadOptions load;
    load.modulePath = options.modulePath;
+   if (options.modulePath.empty()) {
+      load.linkedModule = linkedModule();
+   }
    load.parameters = parseParameters(options.parameters);
    snap.loadResult = host.load(load);
    if (snap.loadResult == 0) {

@@ -32,7 +32,7 @@ void addReplayOptions(CLI::App &command, ReplayCommandOptions &options)
    command.add_flag("-v,--verbose", options.verbose, "one line per dropped frame");
    command.add_option("--write-passed", options.writePassed, "write the frames that passed to this pcap file");
    command.add_option("--write-dropped", options.writeDropped, "write the dropped frames to this pcap file");
-   command.add_option("--module", options.modulePath, "module image (default: the built one)");
+   command.add_option("--module", options.modulePath, "open this module image instead of the module linked into swsec");
 }
 
 namespace {
@@ -107,6 +107,7 @@ int runReplay(const ReplayCommandOptions &options)
       run.writePassed = options.writePassed;
       run.writeDropped = options.writeDropped;
       run.modulePath = options.modulePath;
+      run.linkedModule = linkedModule();
       ProgressLine progress;
       run.progress = [&progress](uint64_t frames, uint64_t bytesRead, uint64_t fileSize) {
          progress.update(frames, bytesRead, fileSize);

@@ -131,6 +131,9 @@ void Run::startPort()
 {
    host::LoadOptions load;
    load.modulePath = options_.modulePath;
+   if (options_.modulePath.empty()) {
+      load.linkedModule = options_.linkedModule;
+   }
    int loaded = 1;
    try {
       loaded = host_.load(load);

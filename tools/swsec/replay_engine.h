@@ -6,6 +6,8 @@
 #include "replay_config.h"
 #include "replay_drop_reason.h"
 
+#include "platform/orr_module.h"
+
 #include <array>
 #include <cstdint>
 #include <functional>
@@ -39,7 +41,10 @@ struct ReplayOptions {
    bool reasons = false;
    std::string writePassed;                       // pcap of passed frames ("" none)
    std::string writeDropped;                      // pcap of dropped frames ("" none)
-   std::string modulePath;                        // "" the built module
+   std::string modulePath;                        // a module image to open ("" none)
+   // The module linked into the program, loaded when no image is named;
+   // null: the image built with the host.
+   const orr_ModuleInfo *linkedModule = nullptr;
    // Idle capture time (no frame for a long span) is crossed in one step
    // where no timer's tick can change anything; false ticks through it, for
    // tests that compare the two.

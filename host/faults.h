@@ -3,6 +3,7 @@
 #pragma once
 
 #include "host/host.h"
+#include "host/lean.h"
 #include "host/sharded_counter.h"
 
 #include <array>
@@ -89,9 +90,16 @@ public:
    // Counts one call of the point (an index from faultPoint); the status to
    // fail it with, when a rule says so. The frame path calls this for every
    // header lookup, so the common case is a per-thread count and one load.
+   // The lean host counts calls only while a rule is armed (a rule's n-th
+   // call counts from its arming, so rules behave alike; `calls` does not).
    std::optional<orr_Status> hit(size_t point)
    {
       Point &p = points_[point];
+      if constexpr (kLeanHost) {
+         if (armedRules_.load(std::memory_order_acquire) == 0) [[likely]] {
+            return std::nullopt;
+         }
+      }
       p.calls.add(1);
       if (armedRules_.load(std::memory_order_acquire) == 0) [[likely]] {
          return std::nullopt;
@@ -104,6 +112,9 @@ public:
    // through hit().
    bool countQuietly(size_t point)
    {
+      if constexpr (kLeanHost) {
+         return armedRules_.load(std::memory_order_acquire) == 0;
+      }
       return armedRules_.load(std::memory_order_acquire) == 0 && points_[point].calls.tryAddToOwnShard(1);
    }
    // The same for an operation that passes its name along (looked up by name).

@@ -1,9 +1,11 @@
 #include "host/locks.h"
 
+#include "host/lean.h"
 #include "host/state.h"
 
 #include <algorithm>
 #include <cstring>
+#include <span>
 
 // The record behind an orr_Spinlock.
 struct orr_SpinlockOpaque {};
@@ -129,7 +131,7 @@ std::vector<LockRegistry::Hold> &LockRegistry::threadHolds()
 LockRegistry::Spinlock *LockRegistry::findLock(orr_Spinlock lock) const
 {
    auto *record = static_cast<Spinlock *>(lock);
-   if (lock == nullptr || record->magic.load(std::memory_order_relaxed) != kLiveLock) {
+   if (lock == nullptr || (!kLeanHost && record->magic.load(std::memory_order_relaxed) != kLiveLock)) {
       return nullptr;
    }
    return record;
@@ -257,7 +259,8 @@ void LockRegistry::acquire(orr_Spinlock lock, Mode mode, const char *op)
    }
    auto &holds = threadHolds();
    const Hold *highest = nullptr;
-   for (const Hold &hold : holds) {
+   // The lean host takes the rank order on trust (every test checks it).
+   for (const Hold &hold : kLeanHost ? std::span<const Hold>{} : std::span<const Hold>{holds}) {
       if (hold.object == record) {
          fatal(std::string(op) + ": " + quoted(record->name) + " (rank " + std::to_string(record->rank) +
                ") is already held by this thread");
@@ -285,7 +288,9 @@ void LockRegistry::acquire(orr_Spinlock lock, Mode mode, const char *op)
       break;
    }
    ++record->holders;
-   ++record->acquisitions;
+   if constexpr (!kLeanHost) {
+      ++record->acquisitions;   // for the host's lock listing
+   }
    holds.push_back(Hold{record, kind, record->rank, record->name});
 }
 

@@ -6,6 +6,8 @@
 #   tsan     clang++ with ThreadSanitizer
 #   release  g++ optimised with link-time optimisation, for the tools and
 #            benchmarks (their host without the test-only checks)
+#   profile  the release flavour for x86-64-v3, which valgrind can run
+#            (it rejects AVX-512): bench/instructions.sh counts with it
 # Further arguments name the targets to build (default: all).
 set -euo pipefail
 cd "$(dirname "$0")/.."
@@ -20,8 +22,10 @@ case "$flavour" in
                   "-DSWSEC_SANITIZE=address;undefined") ;;
   tsan)    args+=(-DCMAKE_CXX_COMPILER=clang++ -DCMAKE_C_COMPILER=clang -DCMAKE_BUILD_TYPE=RelWithDebInfo
                   -DSWSEC_SANITIZE=thread) ;;
-  release) args+=(-DCMAKE_CXX_COMPILER=g++ -DCMAKE_C_COMPILER=gcc -DCMAKE_BUILD_TYPE=Release -DSWSEC_LTO=ON) ;;
-  *) echo "build: unknown flavour '$flavour' (gcc, clang, asan, tsan, release)" >&2; exit 2 ;;
+  release) args+=(-DCMAKE_CXX_COMPILER=g++ -DCMAKE_C_COMPILER=gcc -DCMAKE_BUILD_TYPE=Release -DSWSEC_LTO=ON -DSWSEC_LEAN_HOST=ON) ;;
+  profile) args+=(-DCMAKE_CXX_COMPILER=g++ -DCMAKE_C_COMPILER=gcc -DCMAKE_BUILD_TYPE=Release -DSWSEC_LTO=ON
+                  -DSWSEC_LEAN_HOST=ON -DSWSEC_MARCH=x86-64-v3) ;;
+  *) echo "build: unknown flavour '$flavour' (gcc, clang, asan, tsan, release, profile)" >&2; exit 2 ;;
 esac
 
 # A compiler cache, where one is installed, makes rebuilds in several checkouts cheap.

@@ -15,7 +15,8 @@ constexpr const char *kSecurityProperty = "sifra-generic-tarlin-swsec.security";
 
 }  // namespace
 
-ModulePort::ModulePort(host::Host &host, uint32_t portId, const std::vector<Binding> &bindings) : host_(host)
+ModulePort::ModulePort(host::Host &host, uint32_t portId, const std::vector<Binding> &bindings, bool arpLimits)
+   : host_(host)
 {
    if (host.portsets().portset("vs0") == nullptr) {
       host.portsets().addPortset("vs0");
@@ -28,12 +29,13 @@ ModulePort::ModulePort(host::Host &host, uint32_t portId, const std::vector<Bind
    if (host.sifra().createFilter(kAgent, portId, filterConfig, &id_) != ORR_OK) {
       throw std::runtime_error("createFilter refused");
    }
-   // Every feature on an untrusted port; no rate limits, so that repeated
-   // runs over the same frames judge them the same way.
+   // Every feature on an untrusted port.
    testing::PortConfig config = testing::enforcingConfig();
-   config.arpRateLimit = 0;
-   config.errRateLimit = 0;
-   config.errRateLimitPeriod = 0;
+   if (!arpLimits) {
+      config.arpRateLimit = 0;
+      config.errRateLimit = 0;
+      config.errRateLimitPeriod = 0;
+   }
    config.portDbSize = 32;
    for (const auto &binding : bindings) {
       testing::StaticBinding entry;

@@ -17,8 +17,11 @@ namespace swsec::bench {
 class ModulePort {
 public:
    // Adds port `portId` to the portset "vs0" (made on first use) and
-   // configures it; throws std::runtime_error when the module refuses.
-   ModulePort(host::Host &host, uint32_t portId, const std::vector<Binding> &bindings);
+   // configures it as examples/enforcing.json does, with the bindings as
+   // static entries; without `arpLimits`, ARP rate limiting is off (so that
+   // a mix with ARP frames judged again and again is judged alike).
+   // Throws std::runtime_error when the module refuses.
+   ModulePort(host::Host &host, uint32_t portId, const std::vector<Binding> &bindings, bool arpLimits);
    ~ModulePort();
    ModulePort(const ModulePort &) = delete;
    ModulePort &operator=(const ModulePort &) = delete;

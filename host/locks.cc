@@ -352,6 +352,12 @@ std::string LockRegistry::heldSpinlock()
    return {};
 }
 
+bool LockRegistry::inAtomicContext()
+{
+   const auto &holds = threadHolds();
+   return std::any_of(holds.begin(), holds.end(), [](const Hold &hold) { return isSpinning(hold.kind); });
+}
+
 void LockRegistry::requireNoSpinlockHeld(const char *op)
 {
    for (const Hold &hold : threadHolds()) {

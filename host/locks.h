@@ -61,6 +61,9 @@ public:
    // The name of a spinlock the calling thread holds (callback contexts do
    // not count); empty when it holds none.
    std::string heldSpinlock();
+   // True when the calling thread holds a spinlock or runs a callback (a
+   // context that may not sleep); sleeping mutexes do not count.
+   bool inAtomicContext();
 
    // Aborts when the calling thread holds a spinlock (or runs a timer
    // callback, which counts as one): `op` is about to sleep.

@@ -194,7 +194,7 @@ TEST_F(SifraSlowPathsTest, ContractBreachesAreViolations)
           orr_SpinlockUnlock(lock);
           EXPECT_EQ(t.slowPaths().deliverReplies(), 1u);
        },
-       "slow path replies delivered from a context that holds a lock"},
+       "slow path replies delivered from a context that holds a spinlock"},
       {"unknown filter",
        [](SifraSlowPathsTest &) { EXPECT_EQ(orr_SifraClearSlowPath(nullptr), ORR_INVALID_HANDLE); },
        "orr_SifraClearSlowPath: unknown filter handle"},

@@ -142,7 +142,7 @@ TEST_P(SlowPathSweepTest, each_failure_in_turn_is_reported_and_undone)
       }
    }
    EXPECT_GE(n, 3u) << "the cycle makes at least two such calls";
-   RecordProperty("failures", std::to_string(n - 1));
+   RecordProperty("failedCalls", std::to_string(n - 1));
 }
 
 INSTANTIATE_TEST_SUITE_P(

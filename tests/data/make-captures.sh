@@ -4,7 +4,10 @@
 # Run as root (network namespaces). Needs: iproute2, dnsmasq, isc-dhcp-client,
 # udhcpc (busybox), tcpdump, tshark  (bash scripts/setup.sh --capture-tools).
 #
-#   bash tests/data/make-captures.sh [OUTDIR]     (default: this folder)
+#   bash tests/data/make-captures.sh [OUTDIR [SCENARIO...]]   (default: this folder, every scenario)
+#
+# SCENARIO: dhclient dhclient_nak udhcpc_no_clientid udhcpc_custom_clientid
+# udhcpc_renew_nak arp bridge.
 #
 # Network, made fresh for every run and removed on exit:
 #
@@ -28,7 +31,7 @@ done
 here=$(cd "$(dirname "$0")" && pwd)
 out=$(mkdir -p "${1:-$here}" && cd "${1:-$here}" && pwd)
 tag="swcap$$"
-NS_SW="$tag-sw" NS_SRV="$tag-srv" NS_VM="$tag-vm"
+NS_SW="$tag-sw" NS_SRV="$tag-srv" NS_VM="$tag-vm" NS_VM2="$tag-vm2" NS_VM3="$tag-vm3"
 work=$(mktemp -d "/tmp/$tag.XXXXXX")
 pids=()
 started=$(date +%s)
@@ -44,7 +47,7 @@ cleanup() {
   set +e
   for pid in "${pids[@]}"; do kill "$pid" 2>/dev/null; done
   for pid in "${pids[@]}"; do wait "$pid" 2>/dev/null; done
-  for ns in "$NS_VM" "$NS_SRV" "$NS_SW"; do
+  for ns in "$NS_VM3" "$NS_VM2" "$NS_VM" "$NS_SRV" "$NS_SW"; do
     ip netns pids "$ns" 2>/dev/null | xargs -r kill 2>/dev/null
     ip netns del "$ns" 2>/dev/null
   done
@@ -272,11 +275,57 @@ scenario_arp() {
   stop_capture
 }
 
+# Three VMs on one bridge, captured on the server's port, as a capture taken
+# on a bridge holds them: each VM (vm0 in its own namespace, MACs :11, :12,
+# :13) gets its lease from one dnsmasq (udhcpc, one after the other, .111 to
+# .113) and pings the server; the broadcasts of each reach the others'
+# ports too. `swsec replay --port` gives each VM its own port.
+scenario_bridge() {
+  local name=bridge-three-vms
+  : > "$work/events"
+  set_vm_mac 02:00:5e:c0:00:11
+  local n=2
+  for ns in "$NS_VM2" "$NS_VM3"; do
+    ip netns add "$ns"
+    ip netns exec "$ns" sysctl -qw net.ipv6.conf.all.disable_ipv6=1 net.ipv6.conf.default.disable_ipv6=1
+    ip -n "$ns" link set lo up
+    ip -n "$NS_SW" link add "sw-vm$n" type veth peer name vm0 netns "$ns"
+    ip -n "$NS_SW" link set "sw-vm$n" master br0
+    ip -n "$NS_SW" link set "sw-vm$n" up
+    ip -n "$ns" link set vm0 address "02:00:5e:c0:00:1$n"
+    ip -n "$ns" link set vm0 up
+    n=$((n + 1))
+  done
+  start_dnsmasq --dhcp-host=02:00:5e:c0:00:11,192.0.2.111 --dhcp-host=02:00:5e:c0:00:12,192.0.2.112 \
+    --dhcp-host=02:00:5e:c0:00:13,192.0.2.113
+  cap_name=$name
+  ip netns exec "$NS_SW" tcpdump -i sw-srv -s 0 -U --immediate-mode -Z root \
+    -w "$work/$name.raw.pcap" 'arp or (ip and (udp port 67 or udp port 68 or icmp))' \
+    2>"$work/$name.tcpdump.log" &
+  cap_pid=$!; pids+=("$cap_pid")
+  wait_for 5 grep -qs "listening on" "$work/$name.tcpdump.log"
+  local count=1
+  for ns in "$NS_VM" "$NS_VM2" "$NS_VM3"; do
+    ip netns exec "$ns" udhcpc -q -f -i vm0 -s "$work/udhcpc.script" -t 5 -T 1 -A 1 -C \
+      2>"$work/$name.client$count.log"
+    wait_for 10 has_events bound "$count"
+    ip netns exec "$ns" busybox ping -s 16 -c 1 -W 1 $SRV_IP >/dev/null
+    count=$((count + 1))
+  done
+  stop_capture; stop_dnsmasq
+}
+
 make_network
-scenario_dhclient
-scenario_dhclient_nak
-scenario_udhcpc udhcpc-no-clientid 02:00:5e:c0:00:03 192.0.2.104 -C -a
-scenario_udhcpc udhcpc-custom-clientid 02:00:5e:c0:00:04 192.0.2.105 -x 0x3d:ff00000001000100015ec00004
-scenario_udhcpc_renew_nak
-scenario_arp
+scenarios=("${@:2}")
+[ ${#scenarios[@]} -ne 0 ] || scenarios=(dhclient dhclient_nak udhcpc_no_clientid udhcpc_custom_clientid
+                                         udhcpc_renew_nak arp bridge)
+for scenario in "${scenarios[@]}"; do
+  case $scenario in
+    udhcpc_no_clientid) scenario_udhcpc udhcpc-no-clientid 02:00:5e:c0:00:03 192.0.2.104 -C -a ;;
+    udhcpc_custom_clientid)
+      scenario_udhcpc udhcpc-custom-clientid 02:00:5e:c0:00:04 192.0.2.105 -x 0x3d:ff00000001000100015ec00004 ;;
+    dhclient|dhclient_nak|udhcpc_renew_nak|arp|bridge) "scenario_$scenario" ;;
+    *) log "unknown scenario $scenario"; exit 2 ;;
+  esac
+done
 log "done in $(( $(date +%s) - started )) s; captures in $out"

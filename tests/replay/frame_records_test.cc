@@ -66,18 +66,18 @@ TEST(FrameRecords, fewer_records_keep_the_totals_notifications_and_clock)
    ASSERT_EQ(all.frames.size(), 18u);
    for (auto records : {replay::FrameRecords::none, replay::FrameRecords::dropped}) {
       const auto fewer = replayExample(records);
-      EXPECT_EQ(fewer.totals, all.totals);
-      EXPECT_EQ(fewer.counters, all.counters);
-      ASSERT_EQ(fewer.notifications.size(), all.notifications.size());
-      for (size_t i = 0; i < all.notifications.size(); ++i) {
-         EXPECT_EQ(fewer.notifications[i].afterFrame, all.notifications[i].afterFrame) << i;
-         EXPECT_EQ(fewer.notifications[i].name, all.notifications[i].name) << i;
+      EXPECT_EQ(fewer.ports[0].totals, all.ports[0].totals);
+      EXPECT_EQ(fewer.ports[0].counters, all.ports[0].counters);
+      ASSERT_EQ(fewer.ports[0].notifications.size(), all.ports[0].notifications.size());
+      for (size_t i = 0; i < all.ports[0].notifications.size(); ++i) {
+         EXPECT_EQ(fewer.ports[0].notifications[i].afterFrame, all.ports[0].notifications[i].afterFrame) << i;
+         EXPECT_EQ(fewer.ports[0].notifications[i].name, all.ports[0].notifications[i].name) << i;
       }
-      EXPECT_EQ(fewer.portDb.size(), all.portDb.size());
+      EXPECT_EQ(fewer.ports[0].portDb.size(), all.ports[0].portDb.size());
    }
    // The clock ran on from the last frame's time whatever was recorded: the
    // bindings were removed after it.
-   EXPECT_TRUE(all.portDb.empty());
+   EXPECT_TRUE(all.ports[0].portDb.empty());
 }
 
 TEST(FrameRecords, dropped_records_are_the_dropped_frames_with_their_descriptions)

@@ -9,7 +9,7 @@
 #include "replay_describe.h"
 #include "replay_engine.h"
 #include "replay_error.h"
-#include "replay_report.h"
+#include "replay_json.h"
 
 #include <gtest/gtest.h>
 #include <nlohmann/json.hpp>
@@ -219,7 +219,7 @@ TEST(HostileCommandLine, until_takes_decimal_and_exponent_seconds)
 {
    const ToolRun run = runTool({"replay", "--json", "--vm-mac", kVmMac, "--until", "2e2", example()});
    ASSERT_EQ(run.status, 0) << run.err;
-   EXPECT_TRUE(nlohmann::json::parse(run.out)["portDb"].empty());
+   EXPECT_TRUE(nlohmann::json::parse(run.out)["ports"][0]["portDb"].empty());
 }
 
 // ---------------------------------------------------------------- outputs
@@ -381,7 +381,7 @@ TEST(ReplayIdleTime, skipping_idle_ticks_gives_what_firing_every_tick_gives)
          options.skipIdleTime = true;
          const auto skipped = replay::replayJson(replay::runReplay(options));
          EXPECT_EQ(ticked, skipped) << "until " << until;
-         EXPECT_GE(ticked["notifications"].size(), 3u);
+         EXPECT_GE(ticked["ports"][0]["notifications"].size(), 3u);
       }
    }
 }
@@ -397,7 +397,7 @@ TEST(ReplayIdleTime, a_gap_of_a_billion_seconds_is_crossed_at_once)
    const auto result = replay::runReplay(options);
    EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(5));
    // The renewed lease and the ARP entry learned after the gap aged out at the end.
-   EXPECT_TRUE(result.portDb.empty());
+   EXPECT_TRUE(result.ports[0].portDb.empty());
    EXPECT_EQ(result.frames.size(), 24u);
 }
 

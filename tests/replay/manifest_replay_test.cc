@@ -141,7 +141,7 @@ TEST_P(ManifestReplay, verdicts_events_database_and_counters_match_the_manifest)
 
    // With one frame a list, each event is seen right after the frame that made it.
    std::vector<Event> events;
-   for (const auto &n : result.notifications) {
+   for (const auto &n : result.ports[0].notifications) {
       events.emplace_back(n.afterFrame, n.name, n.vlan, n.mac, n.ip, n.authoritative);
    }
    std::vector<Event> expectedEvents;
@@ -152,7 +152,7 @@ TEST_P(ManifestReplay, verdicts_events_database_and_counters_match_the_manifest)
    EXPECT_EQ(events, expectedEvents);
 
    std::multiset<Binding> bindings;
-   for (const auto &b : result.portDb) {
+   for (const auto &b : result.ports[0].portDb) {
       bindings.emplace(b.vlan, b.mac, b.ip, b.method, b.method == "DHCP Snooping" ? b.leaseTime : "");
    }
    std::multiset<Binding> expectedBindings;
@@ -164,7 +164,7 @@ TEST_P(ManifestReplay, verdicts_events_database_and_counters_match_the_manifest)
    EXPECT_EQ(bindings, expectedBindings);
 
    std::map<std::string, uint64_t, std::less<>> counters;
-   for (const auto &[name, value] : result.counters) {
+   for (const auto &[name, value] : result.ports[0].counters) {
       if (value != 0) {
          counters[name] = value;
       }
@@ -186,14 +186,14 @@ TEST_P(ManifestReplay, lists_of_frames_decide_as_single_frames_do)
    for (size_t i = 0; i < single.frames.size(); ++i) {
       EXPECT_EQ(single.frames[i].passed, batched.frames[i].passed) << "frame " << single.frames[i].index;
    }
-   ASSERT_EQ(single.notifications.size(), batched.notifications.size());
-   for (size_t i = 0; i < single.notifications.size(); ++i) {
-      EXPECT_EQ(single.notifications[i].name, batched.notifications[i].name);
-      EXPECT_EQ(single.notifications[i].ip, batched.notifications[i].ip);
+   ASSERT_EQ(single.ports[0].notifications.size(), batched.ports[0].notifications.size());
+   for (size_t i = 0; i < single.ports[0].notifications.size(); ++i) {
+      EXPECT_EQ(single.ports[0].notifications[i].name, batched.ports[0].notifications[i].name);
+      EXPECT_EQ(single.ports[0].notifications[i].ip, batched.ports[0].notifications[i].ip);
       // A list's events are seen after its last frame, never before the frame that made them.
-      EXPECT_GE(batched.notifications[i].afterFrame, single.notifications[i].afterFrame);
+      EXPECT_GE(batched.ports[0].notifications[i].afterFrame, single.ports[0].notifications[i].afterFrame);
    }
-   EXPECT_EQ(single.counters, batched.counters);
+   EXPECT_EQ(single.ports[0].counters, batched.ports[0].counters);
 }
 
 // The manifest's model names each drop's rule; the replay finds it from
@@ -231,8 +231,8 @@ TEST_P(ManifestReplay, every_dropped_frame_has_the_reason_the_manifest_names_and
    EXPECT_EQ(reasons, expectedReasons);
 
    auto counter = [&result](const char *name) {
-      const auto found = result.counters.find(name);
-      return found != result.counters.end() ? found->second : 0;
+      const auto found = result.ports[0].counters.find(name);
+      return found != result.ports[0].counters.end() ? found->second : 0;
    };
    EXPECT_EQ(perReason["DAI"], counter("daiDropCnt"));
    EXPECT_EQ(perReason["IP source guard"], counter("ipSrcGuardDropCnt"));

@@ -65,13 +65,13 @@ TEST(ReplayClock, running_on_past_the_lease_and_arp_lifetimes_ages_the_bindings_
    options.capturePath = example();
    options.vmMac = replay::parseMac(kVmMac, "test");
    const auto atEnd = replay::runReplay(options);
-   ASSERT_EQ(atEnd.portDb.size(), 2u);   // the DHCP lease and the ARP-snooped 192.0.2.1
+   ASSERT_EQ(atEnd.ports[0].portDb.size(), 2u);   // the DHCP lease and the ARP-snooped 192.0.2.1
 
    options.untilSeconds = 200;
    const auto later = replay::runReplay(options);
-   EXPECT_TRUE(later.portDb.empty());
+   EXPECT_TRUE(later.ports[0].portDb.empty());
    std::vector<std::string> removed;
-   for (const auto &n : later.notifications) {
+   for (const auto &n : later.ports[0].notifications) {
       if (n.name == "portdb.entry.removed") {
          EXPECT_EQ(n.afterFrame, 18u);   // after the last frame, as the clock ran on
          removed.push_back(n.ip);
@@ -88,10 +88,10 @@ TEST(ReplayClock, the_lease_counts_down_on_capture_time)
    options.vmMac = replay::parseMac(kVmMac, "test");
    options.untilSeconds = 50;
    const auto result = replay::runReplay(options);
-   ASSERT_FALSE(result.portDb.empty());
+   ASSERT_FALSE(result.ports[0].portDb.empty());
    // Renewed at 9.04 s for 120 s; the clock stops at 10.54 + 50 s.
-   EXPECT_EQ(result.portDb.front().method, "DHCP Snooping");
-   EXPECT_EQ(result.portDb.front().timeRemaining, "68 sec");
+   EXPECT_EQ(result.ports[0].portDb.front().method, "DHCP Snooping");
+   EXPECT_EQ(result.ports[0].portDb.front().timeRemaining, "68 sec");
 }
 
 // ---------------------------------------------------------------- configuration
@@ -124,8 +124,8 @@ TEST(ReplayConfig, a_static_binding_lets_its_owner_pass_inspection_without_dhcp)
    const auto result = replay::runReplay(options);
    // Frame 10, the VM's ARP reply from 192.0.2.101, passes on the static binding.
    EXPECT_TRUE(result.frames.at(9).passed);
-   ASSERT_FALSE(result.portDb.empty());
-   EXPECT_EQ(result.portDb.front().method, "Static");
+   ASSERT_FALSE(result.ports[0].portDb.empty());
+   EXPECT_EQ(result.ports[0].portDb.front().method, "Static");
 }
 
 struct BadConfig {

@@ -35,10 +35,15 @@ int runInfo(const InfoOptions &options);
 struct ReplayCommandOptions {
    std::string capture;
    std::string vmMac;
+   std::vector<std::string> ports;         // NAME=MAC[,MAC...]
+   std::vector<std::string> portConfigs;   // NAME=FILE
+   std::vector<std::string> networkMacs;
+   int vlan = -1;                          // -1: every VLAN
    std::string config;
    std::string until;   // seconds, checked by the command
    uint32_t batch = 32;
    bool json = false;
+   bool jsonLines = false;
    bool verbose = false;
    std::string writePassed;
    std::string writeDropped;

@@ -108,6 +108,7 @@ PortSecurityConfig parseConfig(std::string_view text, const std::string &origin)
       throw ReplayError(origin + ": expected a JSON object");
    }
    PortSecurityConfig config;
+   config.origin = origin;
    for (const auto &[key, value] : doc.items()) {
       if (key == "features") {
          if (!value.is_array()) {

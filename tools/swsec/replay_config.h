@@ -25,6 +25,7 @@ struct PortSecurityConfig {
    uint32_t errRateLimit = 0;
    uint32_t errRateLimitPeriod = 0;
    std::vector<StaticBinding> statics;
+   std::string origin;   // where it was read from, for messages
 };
 
 // Parses a document; `origin` names it in errors. Throws ReplayError on bad

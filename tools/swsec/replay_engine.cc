@@ -1,5 +1,5 @@
-// The replay run: host, port, configuration, the frame lists on the
-// capture's clock, then the port's state read back through the management
+// The replay run: host, ports, configurations, the frame lists on the
+// capture's clock, then each port's state read back through the management
 // nodes, as an administrator would.
 #include "replay_engine.h"
 
@@ -9,14 +9,16 @@
 #include "replay_frame_batch.h"
 #include "replay_output_path.h"
 #include "replay_pcap_writer.h"
+#include "replay_port_nodes.h"
+#include "replay_routing.h"
 
 #include "host/host.h"
 
 #include <algorithm>
 #include <array>
-#include <charconv>
 #include <chrono>
 #include <cmath>
+#include <cstdio>
 #include <cstring>
 
 namespace swsec::replay {
@@ -28,7 +30,6 @@ using namespace std::chrono_literals;
 constexpr const char *kAgent = "sifra-generic-tarlin-swsec";
 constexpr const char *kSecurityProperty = "sifra-generic-tarlin-swsec.security";
 constexpr const char *kPortset = "vs0";
-constexpr uint32_t kPortId = 1;
 // The port is configured this long before the first frame, so that a first
 // frame is not seen in the same instant as the configuration.
 constexpr std::chrono::microseconds kConfigLead = 500ms;
@@ -43,7 +44,7 @@ constexpr size_t kTypicalFrameBytes = 1514;
 constexpr size_t kMaxInitialArenaBytes = size_t{1} << 20;
 // A pcap record of a minimum-size frame (16-byte record header, 60 bytes):
 // the file size over it bounds the frame count of ordinary captures, to
-// reserve every frame's record at once; past 4 Mi records (96 MiB) the
+// reserve every frame's record at once; past 4 Mi records (128 MiB) the
 // vector grows as it needs.
 constexpr uint64_t kSmallRecordBytes = 76;
 constexpr uint64_t kMaxReservedRecords = uint64_t{1} << 22;
@@ -53,8 +54,9 @@ constexpr std::chrono::microseconds kIdleSpan = 1h;
 // Three ticks of the port timer: every tick within this of an expiry is
 // fired as it falls due.
 constexpr std::chrono::microseconds kTickMargin = 30s;
-constexpr const char *kCounterFields[] = {"dhcpSnoopingDropCnt", "daiDropCnt",          "ipSrcGuardDropCnt",
-                                          "txRateLimitDropCnt",  "rxRateLimitDropCnt", "txRateLimitErrEntryCnt"};
+// Progress, the module's log and posted messages are looked at after this
+// many frames.
+constexpr uint64_t kFramesBetweenLooks = 4096;
 
 std::string withoutNewline(std::string text)
 {
@@ -64,24 +66,29 @@ std::string withoutNewline(std::string text)
    return text;
 }
 
+struct Port {
+   PortSpec spec;
+   uint32_t id = 0;   // the switch port number, index + 1
+   host::FilterId filter = 0;
+   bool made = false;
+   DropCounters counters;   // as last read, with options.reasons
+};
+
 class Run {
 public:
-   Run(const ReplayOptions &options, ReplayResult &result)
-      : options_(options), result_(result),
-        list_(options.batch, std::min(size_t{options.batch} * kTypicalFrameBytes, kMaxInitialArenaBytes))
-   {
-      kept_.reserve(options.batch);
-   }
+   Run(const ReplayOptions &options, ReplayResult &result);
 
-   // A run cut short by bad input still takes the port down and unloads
+   // A run cut short by bad input still takes the ports down and unloads
    // the module, as the hypervisor would, before the error is reported.
    ~Run()
    {
       if (!host_.loaded()) {
          return;
       }
-      if (portMade_) {
-         (void)host_.sifra().destroyFilterAsHypervisor(filter_);
+      for (Port &port : ports_) {
+         if (port.made) {
+            (void)host_.sifra().destroyFilterAsHypervisor(port.filter);
+         }
       }
       (void)host_.unload();
    }
@@ -92,42 +99,78 @@ public:
 
 private:
    void openOutputs(const CaptureReader &reader);
-   void startPort();
-   void warn(uint64_t frame, const std::string &text);
+   void loadModule();
+   void startPort(Port &port);
+   void warn(const std::string &text);
+   void warnFrame(uint64_t frame, const std::string &text);
    int64_t frameTime(const CaptureFrame &frame);
    void crossIdle(std::chrono::microseconds target);
-   std::optional<std::chrono::seconds> soonestExpiry();
-   uint8_t directionOf(const CaptureFrame &frame) const;
-   void add(const CaptureFrame &frame, uint8_t direction);
+   void handle(const CaptureFrame &frame);
+   void add(const CaptureFrame &frame, const Delivery &delivery);
    void flush();
    void record(size_t frame, bool passed, DropReason reason);
-   DropCounters readCounters();
    uint32_t batch() const { return options_.reasons ? 1 : options_.batch; }
    std::chrono::microseconds clockAt(int64_t timeNs) const;
    void advanceTo(std::chrono::microseconds target);
    void collectNotifications();
-   void readPortState();
+   void drainLog();
+   void warnUnseenMacs(const FrameRouter &router);
 
    const ReplayOptions &options_;
    ReplayResult &result_;
    host::Host host_;
-   host::FilterId filter_ = 0;
-   bool portMade_ = false;
+   std::vector<Port> ports_;
+   std::optional<FrameRouter> router_;
+   Route route_;
    std::optional<PcapWriter> passed_;
    std::optional<PcapWriter> dropped_;
    FrameBatch list_;
+   uint16_t listPort_ = 0;
    std::vector<uint8_t> kept_;                   // per frame of the list handed over
+   // A frame handed to several ports is written out once all have judged
+   // it: dropped if any dropped it.
+   uint64_t sharedFrame_ = 0;
+   bool sharedDropped_ = false;
    std::chrono::microseconds clockBase_{0};      // host time of the first frame
    std::chrono::microseconds clockReached_{0};   // the host clock is at least here
    int64_t firstTimeNs_ = 0;
-   DropCounters counters_;      // as last read, with options.reasons
    int64_t lastTimeNs_ = 0;     // the frame before's time
    int64_t latestTimeNs_ = 0;   // the latest time of any frame
    bool haveTime_ = false;
    uint64_t lastHandedOver_ = 0;
+   bool haveLog_ = false;   // result_.log's last line can take repeats
 };
 
-void Run::startPort()
+Run::Run(const ReplayOptions &options, ReplayResult &result)
+   : options_(options), result_(result),
+     list_(options.batch, std::min(size_t{options.batch} * kTypicalFrameBytes, kMaxInitialArenaBytes))
+{
+   kept_.reserve(options.batch);
+   std::vector<PortSpec> specs = options.ports;
+   if (specs.empty()) {
+      PortSpec only;
+      only.name = "vm";
+      if (options.vmMac) {
+         only.macs.push_back(*options.vmMac);
+      }
+      specs.push_back(std::move(only));
+   }
+   std::vector<std::vector<Mac>> macs;
+   for (size_t i = 0; i < specs.size(); ++i) {
+      Port &port = ports_.emplace_back();
+      port.spec = specs[i];
+      port.id = static_cast<uint32_t>(i + 1);
+      macs.push_back(port.spec.macs);
+      PortResult &shown = result_.ports.emplace_back();
+      shown.name = port.spec.name;
+      for (const Mac &mac : port.spec.macs) {
+         shown.macs.push_back(macText(mac.data()));
+      }
+   }
+   router_.emplace(std::move(macs), options.networkMacs);
+}
+
+void Run::loadModule()
 {
    host::LoadOptions load;
    load.modulePath = options_.modulePath;
@@ -148,19 +191,23 @@ void Run::startPort()
       throw std::runtime_error("the module failed to load");
    }
    host_.portsets().addPortset(kPortset);
-   host_.portsets().addPort(kPortset, kPortId);
+}
+
+void Run::startPort(Port &port)
+{
+   host_.portsets().addPort(kPortset, port.id);
    host::FilterConfig filterConfig;
-   filterConfig.name = "vm.eth0";
-   filterConfig.vmUuid = "replay";
-   const orr_Status status = host_.sifra().createFilter(kAgent, kPortId, filterConfig, &filter_);
+   filterConfig.name = port.spec.name;
+   filterConfig.vmUuid = "replay-" + port.spec.name;
+   const orr_Status status = host_.sifra().createFilter(kAgent, port.id, filterConfig, &port.filter);
    if (status != ORR_OK) {
-      throw std::runtime_error(std::string("the port could not be made: ") + orr_StatusToString(status));
+      throw std::runtime_error("port " + port.spec.name + " could not be made: " + orr_StatusToString(status));
    }
-   portMade_ = true;
-   if (options_.config) {
+   port.made = true;
+   const std::optional<PortSecurityConfig> &config = port.spec.config ? port.spec.config : options_.config;
+   if (config) {
       const size_t logBefore = host_.log().records().size();
-      const orr_Status written =
-         host_.sifra().writeProperty(kSecurityProperty, filter_, configRecord(*options_.config));
+      const orr_Status written = host_.sifra().writeProperty(kSecurityProperty, port.filter, configRecord(*config));
       if (written != ORR_OK) {
          // The module says why in its log; its error lines are the message.
          const auto records = host_.log().records();
@@ -173,40 +220,23 @@ void Run::startPort()
          if (message.empty()) {
             message = orr_StatusToString(written);
          }
-         throw ConfigRefused("configuration refused: " + message);
+         throw ConfigRefused((config->origin.empty() ? "port " + port.spec.name : config->origin) +
+                             ": configuration refused: " + message);
       }
    }
    if (options_.reasons) {
-      counters_ = readCounters();
+      port.counters = readDropCounters(host_, port.id);
    }
-   host_.clock().advance(kConfigLead);
-   clockBase_ = host_.clock().now();
-   clockReached_ = clockBase_;
 }
 
-uint8_t Run::directionOf(const CaptureFrame &frame) const
+void Run::add(const CaptureFrame &frame, const Delivery &delivery)
 {
-   if (frame.recordedDirection != kDirUnknown) {
-      return frame.recordedDirection;
-   }
-   if (options_.vmMac) {
-      if (frame.bytes.size() >= 12 && std::memcmp(frame.bytes.data() + 6, options_.vmMac->data(), 6) == 0) {
-         return kDirFromVm;
-      }
-      return kDirToVm;
-   }
-   throw ReplayError(options_.capturePath + ": frame " + std::to_string(frame.index) +
-                     " has no recorded direction; give the VM's MAC with --vm-mac");
-}
-
-void Run::add(const CaptureFrame &frame, uint8_t direction)
-{
-   if (!list_.empty() && (direction != list_.direction() || frame.timeNs - list_.firstTimeNs() > kListSpanNs ||
-                          list_.size() >= batch())) {
+   if (!list_.empty() && (delivery.port != listPort_ || delivery.direction != list_.direction() ||
+                          frame.timeNs - list_.firstTimeNs() > kListSpanNs || list_.size() >= batch())) {
       flush();
    }
-   list_.add(frame.index, frame.timeNs, direction, frame.bytes);
-   lastTimeNs_ = frame.timeNs;
+   listPort_ = delivery.port;
+   list_.add(frame.index, frame.timeNs, delivery.direction, frame.bytes);
 }
 
 std::chrono::microseconds Run::clockAt(int64_t timeNs) const
@@ -243,7 +273,13 @@ void Run::crossIdle(std::chrono::microseconds target)
 {
    while (host_.clock().now() < target) {
       auto now = host_.clock().now();
-      const std::optional<std::chrono::seconds> soonest = soonestExpiry();
+      std::optional<std::chrono::seconds> soonest;
+      for (const Port &port : ports_) {
+         const auto left = soonestExpiry(host_, port.id);
+         if (left) {
+            soonest = soonest ? std::min(*soonest, *left) : *left;
+         }
+      }
       const auto until = soonest ? std::min(target, now + std::chrono::microseconds(*soonest)) : target;
       if (until - kTickMargin > now) {
          host_.clock().skipIdle(until - kTickMargin - now);
@@ -251,44 +287,24 @@ void Run::crossIdle(std::chrono::microseconds target)
       now = host_.clock().now();
       host_.clock().advance(std::min(target, until + kTickMargin) - now);
       if (options_.progress) {
-         options_.progress(lastHandedOver_, 0, 0);
+         options_.progress(result_.framesRead, 0, 0);
       }
    }
 }
 
-// The time left to the binding that expires first, as the "vmi" nodes show it.
-std::optional<std::chrono::seconds> Run::soonestExpiry()
-{
-   const std::string port = "/security/" + std::to_string(kPortId) + "/vmi";
-   std::vector<int64_t> instances;
-   if (host_.nexo().list(port, &instances) != ORR_OK) {
-      return std::nullopt;
-   }
-   std::optional<std::chrono::seconds> soonest;
-   for (int64_t instance : instances) {
-      host::NexoRecord vmi;
-      if (host_.nexo().get(port + "/" + std::to_string(instance), &vmi) != ORR_OK) {
-         return std::chrono::seconds(0);   // unknown: tick on
-      }
-      const auto values = vmi.values();
-      const auto found = values.find("timeRemaining");
-      if (found == values.end() || found->second == "N/A") {
-         continue;   // a static binding does not expire
-      }
-      uint32_t seconds = 0;
-      const std::string &text = found->second;
-      if (std::from_chars(text.data(), text.data() + text.size(), seconds).ec != std::errc{}) {
-         return std::chrono::seconds(0);
-      }
-      soonest = std::min(soonest.value_or(std::chrono::seconds(seconds)), std::chrono::seconds(seconds));
-   }
-   return soonest;
-}
-
-void Run::warn(uint64_t frame, const std::string &text)
+void Run::warn(const std::string &text)
 {
    if (result_.warnings.size() < kMaxWarnings) {
-      result_.warnings.push_back(options_.capturePath + ": frame " + std::to_string(frame) + ": " + text);
+      result_.warnings.push_back(text);
+   } else {
+      ++result_.warningsNotShown;
+   }
+}
+
+void Run::warnFrame(uint64_t frame, const std::string &text)
+{
+   if (result_.warnings.size() < kMaxWarnings) {
+      warn(options_.capturePath + ": frame " + std::to_string(frame) + ": " + text);
    } else {
       ++result_.warningsNotShown;
    }
@@ -300,17 +316,17 @@ void Run::warn(uint64_t frame, const std::string &text)
 int64_t Run::frameTime(const CaptureFrame &frame)
 {
    if (!frame.timeInRange) {
-      warn(frame.index, "timestamp out of range; replayed at the time of the frame before");
+      warnFrame(frame.index, "timestamp out of range; replayed at the time of the frame before");
       return haveTime_ ? lastTimeNs_ : 0;
    }
    if (frame.timeNs < 0) {
-      warn(frame.index, "timestamp before 1970 (" + std::to_string(frame.timeNs / 1'000'000'000) + " s)");
+      warnFrame(frame.index, "timestamp before 1970 (" + std::to_string(frame.timeNs / 1'000'000'000) + " s)");
    }
    if (haveTime_ && frame.timeNs < lastTimeNs_) {
       std::array<char, 64> text{};
       std::snprintf(text.data(), text.size(), "timestamp %.6f s before the frame before's",
                     static_cast<double>(lastTimeNs_ - frame.timeNs) / 1e9);
-      warn(frame.index, text.data());
+      warnFrame(frame.index, text.data());
    }
    return frame.timeNs;
 }
@@ -348,14 +364,15 @@ void Run::flush()
    }
    // Capture time that goes backwards leaves the clock where it is.
    advanceTo(clockAt(list_.firstTimeNs()));
-   const host::PacketsResult out = host_.sifra().processPackets(filter_, list_.direction(), list_.views());
+   Port &port = ports_[listPort_];
+   const host::PacketsResult out = host_.sifra().processPackets(port.filter, list_.direction(), list_.views());
    kept_.assign(list_.size(), 0);
    for (size_t index : out.kept) {
       if (index < kept_.size()) {
          kept_[index] = 1;
       }
    }
-   std::array<uint64_t, 2> &totals = result_.totals[list_.direction()];
+   std::array<uint64_t, 2> &totals = result_.ports[listPort_].totals[list_.direction()];
    const FrameRecords records = options_.frameRecords;
    for (size_t i = 0; i < list_.size(); ++i) {
       const bool passed = kept_[i] != 0;
@@ -363,12 +380,16 @@ void Run::flush()
       DropReason reason = DropReason::none;
       if (!passed && options_.reasons) {
          // Alone in its list, so whatever counter moved moved for it.
-         DropCounters after = readCounters();
-         reason = explainDrop(counters_, after, list_.bytes(i), list_.direction());
-         counters_ = std::move(after);
+         DropCounters after = readDropCounters(host_, port.id);
+         reason = explainDrop(port.counters, after, list_.bytes(i), list_.direction());
+         port.counters = std::move(after);
       }
-      if (records == FrameRecords::all || (records == FrameRecords::dropped && !passed)) {
+      if (options_.sink || records == FrameRecords::all || (records == FrameRecords::dropped && !passed)) {
          record(i, passed, reason);
+      }
+      if (list_.index(i) == sharedFrame_) {
+         sharedDropped_ = sharedDropped_ || !passed;
+         continue;
       }
       std::optional<PcapWriter> &writer = passed ? passed_ : dropped_;
       if (writer) {
@@ -379,39 +400,31 @@ void Run::flush()
    list_.clear();
 }
 
-DropCounters Run::readCounters()
-{
-   DropCounters counters;
-   host::NexoRecord summary;
-   if (host_.nexo().get("/security/" + std::to_string(kPortId) + "/featureSummary", &summary) != ORR_OK) {
-      return counters;   // no IP discovery: the port shows no counters
-   }
-   const auto values = summary.values();
-   for (const char *field : kCounterFields) {
-      const auto found = values.find(field);
-      uint64_t value = 0;
-      if (found != values.end() &&
-          std::from_chars(found->second.data(), found->second.data() + found->second.size(), value).ec ==
-             std::errc{}) {
-         counters[field] = value;
-      }
-   }
-   return counters;
-}
-
 void Run::record(size_t frame, bool passed, DropReason reason)
 {
    const std::span<const uint8_t> bytes = list_.bytes(frame);
-   FrameVerdict &verdict = result_.frames.emplace_back();
+   FrameVerdict verdict;
    verdict.index = list_.index(frame);
    verdict.timeNs = list_.timeNs(frame) - firstTimeNs_;
    verdict.direction = list_.direction();
+   verdict.port = listPort_;
    verdict.passed = passed;
    verdict.reason = reason;
    verdict.vlan = frameVlan(bytes);
+   std::string description;
    if (!passed && options_.describeDrops) {
-      verdict.description = static_cast<uint32_t>(result_.descriptions.size());
-      result_.descriptions.push_back(describeFrame(bytes));
+      description = describeFrame(bytes);
+   }
+   if (options_.sink) {
+      options_.sink(FrameEvent{verdict, description});
+   }
+   const FrameRecords records = options_.frameRecords;
+   if (records == FrameRecords::all || (records == FrameRecords::dropped && !passed)) {
+      if (!description.empty()) {
+         verdict.description = static_cast<uint32_t>(result_.descriptions.size());
+         result_.descriptions.push_back(std::move(description));
+      }
+      result_.frames.push_back(verdict);
    }
 }
 
@@ -419,11 +432,12 @@ void Run::collectNotifications()
 {
    const auto posted = host_.portsets().takePosted();
    for (const auto &message : posted) {
-      if (message.name.rfind("portdb.entry.", 0) != 0 || message.payload.size() < kPortDbMsgPayload) {
+      if (message.name.rfind("portdb.entry.", 0) != 0 || message.payload.size() < kPortDbMsgPayload ||
+          message.portID == 0 || message.portID > ports_.size()) {
          continue;
       }
       const uint8_t *payload = message.payload.data();
-      Notification &note = result_.notifications.emplace_back();
+      Notification &note = result_.ports[message.portID - 1].notifications.emplace_back();
       note.afterFrame = lastHandedOver_;
       note.name = message.name;
       uint16_t vlan = 0;
@@ -435,44 +449,81 @@ void Run::collectNotifications()
    }
 }
 
-void Run::readPortState()
+// The host's log is taken as the run goes, so that a long run holds one
+// record per run of identical lines rather than every line.
+void Run::drainLog()
 {
-   const std::string port = "/security/" + std::to_string(kPortId);
-   host::NexoRecord summary;
-   if (host_.nexo().get(port + "/featureSummary", &summary) == ORR_OK) {
-      result_.featureSummary = summary.values();
-      result_.featureSummaryText = summary.text();
-      for (const char *field : kCounterFields) {
-         const auto found = result_.featureSummary->find(field);
-         if (found != result_.featureSummary->end() && found->second != "N/A") {
-            result_.counters[field] = std::stoull(found->second);
+   const auto records = host_.log().records();
+   host_.log().clear();
+   for (const auto &record : records) {
+      std::string text = withoutNewline(record.text);
+      if (haveLog_ && result_.log.back().severity == record.severity && result_.log.back().text == text) {
+         ++result_.log.back().repeated;
+         continue;
+      }
+      result_.log.push_back({record.severity, std::move(text), 0});
+      haveLog_ = true;
+   }
+}
+
+void Run::handle(const CaptureFrame &frame)
+{
+   if (options_.vlan && frameVlan(frame.bytes) != *options_.vlan) {
+      ++result_.otherVlan;
+      return;
+   }
+   router_->route(frame.bytes, frame.recordedDirection, route_);
+   switch (route_.kind) {
+   case Route::Kind::delivered: break;
+   case Route::Kind::noDirection:
+      throw ReplayError(options_.capturePath + ": frame " + std::to_string(frame.index) +
+                        " has no recorded direction; give the VM's MAC with --vm-mac");
+   case Route::Kind::spoofedSource:
+      warnFrame(frame.index, "sent from " + (frame.bytes.size() >= 12 ? macText(frame.bytes.data() + 6) : "?") +
+                                " by a VM, but by which is unknown; not replayed");
+      ++result_.unassigned;
+      return;
+   case Route::Kind::unassigned: ++result_.unassigned; return;
+   }
+   const bool shared = route_.first.size() + route_.onward.size() > 1;
+   if (shared) {
+      // Its earlier frames are judged first, so outputs keep capture order.
+      flush();
+      sharedFrame_ = frame.index;
+      sharedDropped_ = false;
+   }
+   for (const Delivery &delivery : route_.first) {
+      add(frame, delivery);
+   }
+   if (!route_.onward.empty()) {
+      flush();   // the sender's port judges it before it crosses the bridge
+      if (!sharedDropped_) {
+         for (const Delivery &delivery : route_.onward) {
+            add(frame, delivery);
          }
       }
    }
-   std::vector<int64_t> instances;
-   if (host_.nexo().list(port + "/vmi", &instances) != ORR_OK) {
-      return;
-   }
-   for (int64_t instance : instances) {
-      host::NexoRecord vmi;
-      if (host_.nexo().get(port + "/vmi/" + std::to_string(instance), &vmi) != ORR_OK) {
-         continue;
+   if (shared) {
+      flush();
+      std::optional<PcapWriter> &writer = sharedDropped_ ? dropped_ : passed_;
+      if (writer) {
+         writer->write(frame.timeNs, frame.bytes);
       }
-      const auto values = vmi.values();
-      auto field = [&values](const char *name) {
-         const auto found = values.find(name);
-         return found != values.end() ? found->second : std::string();
-      };
-      PortDbEntry &entry = result_.portDb.emplace_back();
-      entry.vlan = static_cast<uint16_t>(std::stoul(field("vlanId")));
-      entry.mac = field("macAddr");
-      entry.ip = field("ipAddr");
-      entry.method = field("discoveryMethod");
-      entry.timeRemaining = field("timeRemaining");
-      entry.chaddr = field("chaddr");
-      entry.clientIdLen = field("clientIdLen");
-      entry.serverIp = field("serverIp");
-      entry.leaseTime = field("leaseTime");
+      sharedFrame_ = 0;
+   }
+}
+
+void Run::warnUnseenMacs(const FrameRouter &router)
+{
+   for (size_t port = 0; port < ports_.size(); ++port) {
+      for (size_t i = 0; i < ports_[port].spec.macs.size(); ++i) {
+         if (!router.seen(port, i)) {
+            const std::string mac = macText(ports_[port].spec.macs[i].data());
+            warn(options_.capturePath + ": " + mac +
+                 (options_.ports.empty() ? " (--vm-mac)" : " (port " + ports_[port].spec.name + ")") +
+                 " is in no frame of the capture");
+         }
+      }
    }
 }
 
@@ -484,11 +535,18 @@ void Run::execute()
    if (options_.frameRecords == FrameRecords::all) {
       result_.frames.reserve(std::min(reader.fileSize() / kSmallRecordBytes, kMaxReservedRecords));
    }
-   startPort();
+   loadModule();
+   for (Port &port : ports_) {
+      startPort(port);
+   }
+   host_.clock().advance(kConfigLead);
+   clockBase_ = host_.clock().now();
+   clockReached_ = clockBase_;
 
    CaptureFrame frame;
    bool first = true;
    while (reader.next(frame)) {
+      ++result_.framesRead;
       frame.timeNs = frameTime(frame);
       if (first) {
          firstTimeNs_ = frame.timeNs;
@@ -496,10 +554,14 @@ void Run::execute()
          first = false;
       }
       haveTime_ = true;
+      lastTimeNs_ = frame.timeNs;
       latestTimeNs_ = std::max(latestTimeNs_, frame.timeNs);
-      add(frame, directionOf(frame));
-      if (options_.progress && frame.index % 4096 == 0) {
-         options_.progress(frame.index, reader.bytesRead(), reader.fileSize());
+      handle(frame);
+      if (frame.index % kFramesBetweenLooks == 0) {
+         drainLog();
+         if (options_.progress) {
+            options_.progress(frame.index, reader.bytesRead(), reader.fileSize());
+         }
       }
    }
    flush();
@@ -511,16 +573,19 @@ void Run::execute()
       advanceTo(clockBase_ + last + until);
    }
    collectNotifications();
-   readPortState();
-   for (const auto &record : host_.log().records()) {
-      result_.log.push_back({record.severity, withoutNewline(record.text)});
+   warnUnseenMacs(*router_);
+   for (Port &port : ports_) {
+      readPortState(host_, port.id, result_.ports[port.id - 1]);
    }
+   drainLog();
 
-   const host::DestroyResult destroyed = host_.sifra().destroyFilterAsHypervisor(filter_);
-   portMade_ = false;
-   if (destroyed.status != ORR_OK) {
-      result_.violations.push_back(std::string("the port could not be destroyed: ") +
-                                   orr_StatusToString(destroyed.status));
+   for (Port &port : ports_) {
+      const host::DestroyResult destroyed = host_.sifra().destroyFilterAsHypervisor(port.filter);
+      port.made = false;
+      if (destroyed.status != ORR_OK) {
+         result_.violations.push_back("port " + port.spec.name +
+                                      " could not be destroyed: " + orr_StatusToString(destroyed.status));
+      }
    }
    const orr_Status unloaded = host_.unload();
    if (unloaded != ORR_OK) {

@@ -1,19 +1,21 @@
-// What a replay shows: the readable report and the JSON document.
+// What a replay shows people: a report per port, then the module's log.
 #pragma once
 
 #include "replay_engine.h"
-
-#include <nlohmann/json.hpp>
 
 #include <ostream>
 
 namespace swsec::replay {
 
-nlohmann::json replayJson(const ReplayResult &result);
+// The -v line of a dropped frame, printed as the port drops it. The port
+// is named when the run has several.
+void printDroppedFrame(std::ostream &out, const FrameEvent &event, const std::string *port);
 
-// `verbose` adds one line per dropped frame.
-void printReplayReport(std::ostream &out, const ReplayResult &result, bool verbose);
+void printReplayReport(std::ostream &out, const ReplayResult &result);
 
 const char *directionName(uint8_t direction);
+
+// 99967 as "99,967".
+std::string groupedCount(uint64_t count);
 
 }  // namespace swsec::replay

@@ -130,14 +130,6 @@ TEST_F(SifraSlowPathsTest, RepliesWaitForTheTestAndCarryTheScriptedOutcomes)
    EXPECT_FALSE(host.sifra().filter(filter)->slowPathID);
 }
 
-TEST_F(SifraSlowPathsTest, ARefusedRequestOwesNoReply)
-{
-   host.faults().failOnce("orr_SifraSetSlowPath", ORR_NO_MEMORY);
-   EXPECT_EQ(orr_SifraSetSlowPath(spAgent.handle, 9, onReply, &cookie, 2000), ORR_NO_MEMORY);
-   EXPECT_THAT(slowPaths().pendingReplies(), IsEmpty());
-   EXPECT_EQ(slowPaths().requests().at(0).result, ORR_NO_MEMORY);
-}
-
 TEST_F(SifraSlowPathsTest, BusyWithdrawalsAreCalledAgainUntilTheyGo)
 {
    EXPECT_EQ(slowPaths().registerSlowPath("test-agent", 1), ORR_OK);

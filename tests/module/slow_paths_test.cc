@@ -329,59 +329,33 @@ TEST_F(SlowPathTest, a_pending_set_request_keeps_the_unregistration_busy_until_i
    }
 }
 
-TEST_F(SlowPathTest, a_clear_that_fails_for_good_is_logged_and_counts_as_detached)
-{
-   registerSlowPath(1);
-   const host::FilterId id = create({.name = "vm"});
-   deliver();
-   host().faults().failOnce("orr_SifraClearSlowPath", ORR_FAILURE);
-   EXPECT_EQ(slowPaths().unregisterSlowPath(1), ORR_OK);
-   EXPECT_TRUE(loggedWithPrefix(host(), "vm: Request to clear slow path failed " + statusText(ORR_FAILURE), 2));
-   EXPECT_EQ(state(id), SifraGenericAttachDetached);
-   EXPECT_EQ(record(id)->refCount, 1u);
-}
-
 // ---------------------------------------------------------------- destroying filters
 
-TEST_F(SlowPathTest, destroying_an_attached_filter_clears_its_slow_path_first)
+TEST_F(SlowPathTest, destroying_a_filter_clears_its_slow_path_first_and_waits_for_a_pending_reply)
 {
    registerSlowPath(1);
-   const host::FilterId id = create({.name = "vm"});
-   deliver();
-   slowPaths().clearRequests();
-   EXPECT_EQ(host().sifra().destroyFilter(id), ORR_OK);
-   ASSERT_EQ(slowPaths().requests().size(), 1u);
-   EXPECT_EQ(slowPaths().requests()[0].kind, SlowPathRequestKind::Clear);
-   EXPECT_EQ(slowPaths().requests()[0].filter, id);
-   EXPECT_TRUE(loggedWithPrefix(host(), "vm: Detaching from slow path #1", 1));
-   EXPECT_EQ(slowPath(1)->useCount, 1u);
-}
-
-TEST_F(SlowPathTest, destroying_an_attaching_filter_is_busy_until_its_reply)
-{
-   registerSlowPath(1);
-   const host::FilterId id = create({.name = "vm"});
+   const host::FilterId attaching = create({.name = "attaching"});
    for (int call = 0; call < 3; ++call) {
-      EXPECT_EQ(host().sifra().destroyFilter(id), ORR_BUSY);
+      EXPECT_EQ(host().sifra().destroyFilter(attaching), ORR_BUSY);
    }
    EXPECT_EQ(slowPaths().requests().size(), 1u) << "no clear for a filter still attaching";
    deliver();
-   EXPECT_EQ(host().sifra().destroyFilter(id), ORR_OK);
+   slowPaths().clearRequests();
+   EXPECT_EQ(host().sifra().destroyFilter(attaching), ORR_OK);
+   ASSERT_EQ(slowPaths().requests().size(), 1u);
+   EXPECT_EQ(slowPaths().requests()[0].kind, SlowPathRequestKind::Clear);
+   EXPECT_TRUE(loggedWithPrefix(host(), "attaching: Detaching from slow path #1", 1));
    EXPECT_EQ(slowPath(1)->useCount, 1u);
-}
 
-TEST_F(SlowPathTest, a_destroy_whose_clear_fails_for_a_while_keeps_the_filter_counted)
-{
-   registerSlowPath(1);
-   const host::FilterId id = create({.name = "vm"});
+   // A clear that fails for a while keeps the filter, still counted.
+   const host::FilterId attached = create({.name = "attached"});
    deliver();
    host().faults().failOnce("orr_SifraClearSlowPath", ORR_BUSY);
-   EXPECT_EQ(host().sifra().destroyFilter(id), ORR_BUSY);
-   EXPECT_EQ(state(id), SifraGenericAttachAttached);
+   EXPECT_EQ(host().sifra().destroyFilter(attached), ORR_BUSY);
+   EXPECT_EQ(state(attached), SifraGenericAttachAttached);
    EXPECT_EQ(slowPath(1)->useCount, 2u);
    expectConsistent();
-   EXPECT_EQ(host().sifra().destroyFilter(id), ORR_OK);
-   EXPECT_EQ(slowPath(1)->useCount, 1u);
+   EXPECT_EQ(host().sifra().destroyFilter(attached), ORR_OK);
    EXPECT_EQ(slowPaths().unregisterSlowPath(1), ORR_OK) << "nothing left counted on it";
 }
 

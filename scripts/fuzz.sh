@@ -20,7 +20,7 @@ rm -rf "$dir/seeds"
 "$dir/fuzz/seed_corpus" "$dir/seeds" tests/data/*.pcap
 # Capture files are their own seeds, with the hand-made hostile ones.
 mkdir -p "$dir/seeds/capture_fuzz"
-cp tests/data/*.pcap examples/*.pcap fuzz/capture_seeds/*.pcap* "$dir/seeds/capture_fuzz/"
+cp tests/data/*.pcap fuzz/capture_seeds/*.pcap* "$dir/seeds/capture_fuzz/"
 
 export ASAN_OPTIONS=detect_leaks=1:abort_on_error=1
 export UBSAN_OPTIONS=print_stacktrace=1:halt_on_error=1

@@ -252,7 +252,7 @@ TEST_F(FilterTest, clear_vmi_removes_the_keys_it_lists_or_with_clear_all_every_l
    put32(all, 0);
    EXPECT_EQ(host().sifra().sendIoctl(id, 4, all), ORR_OK);
    EXPECT_EQ(context(id)->numVmiEntries, 1u);
-   EXPECT_EQ(context(id)->config.numStatic, 1u);
+   EXPECT_EQ(+context(id)->config.numStatic, 1u);
    EXPECT_TRUE(host().sifra().ioctlReplies().empty());
 }
 

@@ -71,7 +71,7 @@ void SlowPathDriver::accept(SlowPathRequest &request, Delivery deliver)
          return owed.reply.filter == request.filter && owed.reply.kind == request.kind;
       });
       if (owedAlready) {
-         problem = std::string("orr_SifraSetSlowPath: a second ") + kindText(request.kind) +
+         problem = std::string("Sifra slow path: a second ") + kindText(request.kind) +
                    " request for filter " + std::to_string(request.filter) + " while its reply is owed";
       }
       Script &script = scripts_[request.kind];

@@ -130,6 +130,17 @@ TEST_F(SifraSlowPathsTest, RepliesWaitForTheTestAndCarryTheScriptedOutcomes)
    EXPECT_FALSE(host.sifra().filter(filter)->slowPathID);
 }
 
+TEST_F(SifraSlowPathsTest, AutoDeliveryRepliesAfterEachCallIntoTheModule)
+{
+   slowPaths().setAutoDeliver(true);
+   EXPECT_EQ(orr_SifraSetSlowPath(spAgent.handle, 9, onReply, &cookie, 10), ORR_OK);
+   EXPECT_EQ(slowPaths().pendingReplies().size(), 1u) << "a request outside a module call waits";
+   EXPECT_EQ(slowPaths().registerSlowPath("test-agent", 1), ORR_OK);
+   EXPECT_THAT(slowPaths().pendingReplies(), IsEmpty());
+   ASSERT_EQ(spAgent.replies.size(), 1u);
+   EXPECT_EQ(host.sifra().filter(filter)->slowPathID, 9u);
+}
+
 TEST_F(SifraSlowPathsTest, BusyWithdrawalsAreCalledAgainUntilTheyGo)
 {
    EXPECT_EQ(slowPaths().registerSlowPath("test-agent", 1), ORR_OK);

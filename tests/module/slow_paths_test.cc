@@ -123,6 +123,57 @@ TEST_F(SlowPathTest, a_registration_while_the_callback_has_its_locks_released_ma
    expectConsistent();
 }
 
+// The walks of the filter list release both locks around each request; a
+// filter after the current one may be destroyed meanwhile (its record
+// freed and poisoned), so the walk must read its successor only afterwards.
+TEST_F(SlowPathTest, a_walk_goes_on_past_a_filter_destroyed_while_its_locks_were_released)
+{
+   for (const bool unregistering : {false, true}) {
+      SCOPED_TRACE(unregistering ? "unregistration's walk" : "attach callback's walk");
+      if (unregistering) {
+         registerSlowPath(1);
+      }
+      const host::FilterId a = create({.name = "a"});
+      const host::FilterId b = create({.name = "b"});
+      const host::FilterId c = create({.name = "c"});
+      if (unregistering) {
+         deliver();
+      } else {
+         registerSlowPath(1);
+      }
+      bool destroyed = false;
+      slowPaths().onRequest([&](const host::SlowPathRequest &request) {
+         if (request.filter == a && !destroyed) {
+            destroyed = true;
+            EXPECT_EQ(host().sifra().destroyFilter(b), ORR_OK);
+         }
+      });
+      slowPaths().clearRequests();
+      if (unregistering) {
+         EXPECT_EQ(slowPaths().unregisterSlowPath(1), ORR_OK);
+      } else {
+         runAttach();
+      }
+      slowPaths().onRequest(nullptr);
+      EXPECT_TRUE(destroyed);
+      EXPECT_FALSE(host().sifra().filter(b));
+      std::vector<host::FilterId> asked;
+      for (const auto &request : slowPaths().requests()) {
+         if (request.filter != b) {
+            asked.push_back(request.filter);
+         }
+      }
+      EXPECT_THAT(asked, ElementsAre(a, c));
+      deliver();
+      expectConsistent();
+      EXPECT_EQ(host().sifra().destroyFilter(a), ORR_OK);
+      EXPECT_EQ(host().sifra().destroyFilter(c), ORR_OK);
+      if (!unregistering) {
+         EXPECT_EQ(slowPaths().unregisterSlowPath(1), ORR_OK);
+      }
+   }
+}
+
 TEST_F(SlowPathTest, a_failed_scheduling_leaves_filters_for_the_next_registration)
 {
    const host::FilterId id = create({.name = "a"});

@@ -158,12 +158,13 @@ public:
          if (frame.magic == kReleasedMagic) {
             continue;
          }
-         const std::string which = "frame " + std::to_string(index);
-         if (!frame.inList) {
-            problems.push_back(which + " was taken out of its list and never released");
+         // Text only for a frame with a problem: a list ends for every judged batch.
+         auto which = [index] { return "frame " + std::to_string(index); };
+         if (!frame.inList) [[unlikely]] {
+            problems.push_back(which() + " was taken out of its list and never released");
          }
-         if (const uint32_t outstanding = frame.outstanding(); outstanding != 0) {
-            problems.push_back(which + " returned to the host with " + std::to_string(outstanding) +
+         if (const uint32_t outstanding = frame.outstanding(); outstanding != 0) [[unlikely]] {
+            problems.push_back(which() + " returned to the host with " + std::to_string(outstanding) +
                                " header mapping(s) outstanding");
          }
       }

@@ -44,13 +44,24 @@ bool SwSecArpRateLimitExceeded(SwSecContext *ctx, uint32_t direction, bool isArp
       return over;
    }
 
+   /*
+    * A frame that is not ARP counts only in the error state, and only an
+    * ARP frame (under this lock) or the write-locked configuration and
+    * timer change that state. So a non-ARP frame that sees the state clear
+    * has nothing to count, and skips the lock pair every frame of a busy
+    * VM would otherwise take; it is ordered as if it came just before a
+    * racing ARP frame that enters the state.
+    */
+   if (!isArp && __atomic_load_n(&ctx->txRateLimitErr, __ATOMIC_RELAXED) == 0) {
+      return false;
+   }
    orr_SpinlockLock(ctx->txRateLimitLock);
    if (ctx->txRateLimitErr != 0) {
       /* In the error state every frame the VM sends counts, against errRateLimit. */
       over = SifraGenericRateLimitReached(&ctx->txRateLimit);
    } else if (isArp && SifraGenericRateLimitReached(&ctx->txRateLimit)) {
       SifraGenericRateLimitInit(&ctx->txRateLimit, ctx->config.errRateLimit);
-      ctx->txRateLimitErr = 1;
+      __atomic_store_n(&ctx->txRateLimitErr, 1, __ATOMIC_RELAXED);   /* peeked at without the lock */
       orr_TimeVal now = {};
       orr_GetUptime(&now);
       ctx->txRateLimitErrEnd = now.sec + ctx->config.errRateLimitPeriod;

@@ -41,6 +41,9 @@ public:
    virtual ~Log() = default;
    virtual std::vector<LogRecord> records() const = 0;
    virtual void clear() = 0;
+   // The records written since the last take (or clear), taken out: what a
+   // long-running caller uses so that the log does not grow without bound.
+   virtual std::vector<LogRecord> take() = 0;
    // Records whose text contains `needle`.
    virtual size_t count(std::string_view needle) const = 0;
    bool contains(std::string_view needle) const { return count(needle) != 0; }

@@ -223,6 +223,14 @@ void LogBook::clear()
    records_.clear();
 }
 
+std::vector<LogRecord> LogBook::take()
+{
+   std::vector<LogRecord> taken;
+   std::lock_guard guard(mutex_);
+   taken.swap(records_);
+   return taken;
+}
+
 size_t LogBook::count(std::string_view needle) const
 {
    std::lock_guard guard(mutex_);

@@ -35,6 +35,7 @@ public:
    // Log
    std::vector<LogRecord> records() const override;
    void clear() override;
+   std::vector<LogRecord> take() override;
    size_t count(std::string_view needle) const override;
    void setEcho(bool echo) override;
 

@@ -3,9 +3,9 @@
 # Idempotent and quick when everything is already there. Works as root on a
 # fresh Debian 12; as another user it needs sudo.
 #
-#   --capture-tools  also the real DHCP servers and clients, tcpdump and
-#                    scapy that regenerate the test captures (tests/data/);
-#                    the tests themselves replay committed captures.
+#   --capture-tools  also tcpdump and tshark, which regenerate the test
+#                    captures (tests/data/); the tests themselves replay
+#                    committed captures.
 set -euo pipefail
 
 packages=(
@@ -15,9 +15,13 @@ packages=(
   libgtest-dev libgmock-dev libbenchmark-dev
   # the swsec tool
   libcli11-dev nlohmann-json3-dev libpcap-dev
+  # swsec inline and its end-to-end test: a real DHCP server (the binary
+  # alone: no system service) and clients,
+  # scapy's attacks, ping; iperf3 for the inline benchmark
+  iproute2 dnsmasq-base isc-dhcp-client udhcpc python3-scapy iputils-ping iperf3
 )
 if [ "${1:-}" = "--capture-tools" ]; then
-  packages+=(iproute2 dnsmasq isc-dhcp-client udhcpc tcpdump tshark python3-scapy)
+  packages+=(tcpdump tshark)
 fi
 
 missing=()

@@ -53,4 +53,32 @@ struct ReplayCommandOptions {
 void addReplayOptions(CLI::App &command, ReplayCommandOptions &options);
 int runReplay(const ReplayCommandOptions &options);
 
+// Where `swsec inline` listens and `swsec ctl` connects by default.
+inline constexpr const char *kDefaultCtlSocket = "/run/swsec.sock";
+
+struct InlineCommandOptions {
+   std::string bridge;
+   std::vector<std::string> ports;         // NAME=IFACE
+   std::string config;                     // every port's, unless --port-config names one
+   std::vector<std::string> portConfigs;   // NAME=FILE
+   std::string failMode = "closed";
+   std::string ctl = kDefaultCtlSocket;
+   std::string stateDir;
+   std::string modulePath;
+   uint32_t batch = 64;
+};
+
+void addInlineOptions(CLI::App &command, InlineCommandOptions &options);
+int runInline(const InlineCommandOptions &options);
+
+struct CtlCommandOptions {
+   std::string ctl = kDefaultCtlSocket;
+   std::vector<std::string> words;         // COMMAND ARGS...
+   bool json = false;
+   bool follow = false;
+};
+
+void addCtlOptions(CLI::App &command, CtlCommandOptions &options);
+int runCtl(const CtlCommandOptions &options);
+
 }  // namespace swsec::tools

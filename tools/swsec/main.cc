@@ -21,13 +21,23 @@ int main(int argc, char **argv)
       app.add_subcommand("replay", "run every frame of a capture through one switch-security port");
    swsec::tools::addReplayOptions(*replayCommand, replay);
 
+   swsec::tools::InlineCommandOptions inlineOptions;
+   CLI::App *inlineCommand =
+      app.add_subcommand("inline", "guard live Linux bridge ports with the module until stopped");
+   swsec::tools::addInlineOptions(*inlineCommand, inlineOptions);
+
+   swsec::tools::CtlCommandOptions ctl;
+   CLI::App *ctlCommand = app.add_subcommand("ctl", "ask a running swsec inline");
+   swsec::tools::addCtlOptions(*ctlCommand, ctl);
+
    // An unknown word where the subcommand goes is named as such, before
    // the parser calls it a missing subcommand.
    const auto known = app.get_subcommands([&](const CLI::App *sub) { return argc > 1 && sub->check_name(argv[1]); });
    if (argc > 1 && argv[1][0] != '-' && known.empty()) {
-      std::fprintf(stderr, "swsec: unknown subcommand \"%s\" (known: info, replay)\n", argv[1]);
+      std::fprintf(stderr, "swsec: unknown subcommand \"%s\" (known: info, replay, inline, ctl)\n", argv[1]);
       return swsec::tools::kExitUsage;
    }
+
    try {
       app.parse(argc, argv);
    } catch (const CLI::ParseError &e) {
@@ -40,6 +50,12 @@ int main(int argc, char **argv)
       }
       if (replayCommand->parsed()) {
          return swsec::tools::runReplay(replay);
+      }
+      if (inlineCommand->parsed()) {
+         return swsec::tools::runInline(inlineOptions);
+      }
+      if (ctlCommand->parsed()) {
+         return swsec::tools::runCtl(ctl);
       }
    } catch (const std::exception &e) {
       std::fprintf(stderr, "swsec: %s\n", e.what());

@@ -1,0 +1,161 @@
+#!/usr/bin/python3
+"""Traffic for the inline end-to-end test, run inside one of its namespaces.
+
+  attack NAME IFACE VM_MAC VM_IP GATEWAY_IP   one attack frame from the guarded VM
+  unsolicited-ack IFACE VM_MAC SERVER_IP      a DHCP ACK from the network that answers no request
+  udp-listen PORT SECONDS LAST_SOURCE         prints the sources of the datagrams it gets, one a line,
+                                              until one from LAST_SOURCE or SECONDS
+  udp-send SRC_IP DST_IP DST_MAC PORT IFACE   one datagram from SRC_IP (spoofed when not ours)
+  tcp-sink PORT                               takes one connection, prints the bytes received
+  tcp-send HOST PORT BYTES                    sends BYTES bytes, exits 0 once all went
+  junk SOCKET                                 junk and a stalled request to a control socket
+"""
+import socket
+import sys
+import time
+
+
+def scapy():
+    import logging
+    logging.getLogger("scapy.runtime").setLevel(logging.ERROR)
+    import scapy.all as s
+    s.conf.verb = 0
+    return s
+
+
+def attack(name, iface, vm_mac, vm_ip, gateway_ip):
+    s = scapy()
+    if name == "ip-spoof":
+        frame = s.Ether(src=vm_mac, dst="ff:ff:ff:ff:ff:ff") / s.IP(src="192.0.2.66", dst=gateway_ip) / s.UDP(
+            sport=4000, dport=9999) / b"spoof"
+    elif name == "arp-gateway":
+        frame = s.Ether(src=vm_mac, dst="ff:ff:ff:ff:ff:ff") / s.ARP(
+            op=2, hwsrc=vm_mac, psrc=gateway_ip, hwdst="ff:ff:ff:ff:ff:ff", pdst=gateway_ip)
+    elif name == "rogue-offer":
+        frame = (s.Ether(src=vm_mac, dst="ff:ff:ff:ff:ff:ff") / s.IP(src=vm_ip, dst="255.255.255.255") /
+                 s.UDP(sport=67, dport=68) /
+                 s.BOOTP(op=2, yiaddr="192.0.2.99", siaddr=vm_ip, chaddr=bytes.fromhex("02aabbccddee"), xid=0x1234) /
+                 s.DHCP(options=[("message-type", "offer"), ("server_id", vm_ip), ("lease_time", 600), "end"]))
+    elif name == "bpdu":
+        frame = s.Dot3(src=vm_mac, dst="01:80:c2:00:00:00") / s.LLC(dsap=0x42, ssap=0x42, ctrl=3) / s.STP(
+            rootid=0, rootmac=vm_mac, bridgeid=0, bridgemac=vm_mac)
+    elif name == "vlan-spoof":
+        frame = s.Ether(src=vm_mac, dst="ff:ff:ff:ff:ff:ff") / s.Dot1Q(vlan=100) / s.IP(
+            src="192.0.2.67", dst=gateway_ip) / s.UDP(sport=4000, dport=9999) / b"tagged spoof"
+    else:
+        sys.exit("unknown attack " + name)
+    s.sendp(frame, iface=iface)
+
+
+def unsolicited_ack(iface, vm_mac, server_ip):
+    s = scapy()
+    server_mac = s.get_if_hwaddr(iface)
+    frame = (s.Ether(src=server_mac, dst=vm_mac) / s.IP(src=server_ip, dst="255.255.255.255") /
+             s.UDP(sport=67, dport=68) /
+             s.BOOTP(op=2, yiaddr="192.0.2.77", siaddr=server_ip, chaddr=bytes.fromhex(vm_mac.replace(":", "")),
+                     xid=0x0badf00d) /
+             s.DHCP(options=[("message-type", "ack"), ("server_id", server_ip), ("lease_time", 600),
+                             ("subnet_mask", "255.255.255.0"), "end"]))
+    s.sendp(frame, iface=iface)
+
+
+def udp_listen(port, seconds, last_source):
+    sock = socket.socket(socket.AF_INET, socket.SOCK_DGRAM)
+    sock.bind(("0.0.0.0", port))
+    deadline = time.monotonic() + seconds
+    print("listening", flush=True)
+    while True:
+        left = deadline - time.monotonic()
+        if left <= 0:
+            return
+        sock.settimeout(left)
+        try:
+            _, (source, _) = sock.recvfrom(2048)
+        except socket.timeout:
+            return
+        print(source, flush=True)
+        if source == last_source:
+            return
+
+
+def udp_send(src_ip, dst_ip, dst_mac, port, iface):
+    s = scapy()
+    mac = s.get_if_hwaddr(iface)
+    # Sent as a frame so that a source the VM does not own goes out as it is.
+    frame = s.Ether(src=mac, dst=dst_mac) / s.IP(src=src_ip, dst=dst_ip) / s.UDP(
+        sport=4000, dport=port) / b"hello"
+    s.sendp(frame, iface=iface)
+
+
+def tcp_sink(port):
+    server = socket.socket()
+    server.setsockopt(socket.SOL_SOCKET, socket.SO_REUSEADDR, 1)
+    server.bind(("0.0.0.0", port))
+    server.listen(1)
+    server.settimeout(60)
+    connection, _ = server.accept()
+    total = 0
+    while True:
+        chunk = connection.recv(1 << 16)
+        if not chunk:
+            break
+        total += len(chunk)
+    print(total, flush=True)
+
+
+def tcp_send(host, port, count):
+    connection = socket.create_connection((host, port), timeout=30)
+    block = b"x" * (1 << 16)
+    left = count
+    while left > 0:
+        connection.sendall(block[:min(left, len(block))])
+        left -= min(left, len(block))
+    connection.shutdown(socket.SHUT_WR)
+    connection.recv(1)
+    connection.close()
+
+
+def junk(path):
+    """Junk gets an error; a request left half way is cut off; neither stalls others."""
+    bad = socket.socket(socket.AF_UNIX)
+    bad.connect(path)
+    bad.sendall(b"this is not json\n")
+    bad.settimeout(5)
+    reply = bad.recv(4096)
+    if b'"ok":false' not in reply:
+        sys.exit("junk got: %r" % reply)
+    stalled = socket.socket(socket.AF_UNIX)
+    stalled.connect(path)
+    stalled.sendall(b'{"command": "po')
+    good = socket.socket(socket.AF_UNIX)
+    good.connect(path)
+    good.sendall(b'{"command": "ports"}\n')
+    good.settimeout(5)
+    reply = good.recv(65536)
+    if b'"ok":true' not in reply:
+        sys.exit("a good request behind a stalled one got: %r" % reply)
+    print("ok")
+
+
+def main():
+    command, args = sys.argv[1], sys.argv[2:]
+    if command == "attack":
+        attack(*args)
+    elif command == "unsolicited-ack":
+        unsolicited_ack(*args)
+    elif command == "udp-listen":
+        udp_listen(int(args[0]), float(args[1]), args[2])
+    elif command == "udp-send":
+        udp_send(args[0], args[1], args[2], int(args[3]), args[4])
+    elif command == "tcp-sink":
+        tcp_sink(int(args[0]))
+    elif command == "tcp-send":
+        tcp_send(args[0], int(args[1]), int(args[2]))
+    elif command == "junk":
+        junk(args[0])
+    else:
+        sys.exit(__doc__)
+
+
+if __name__ == "__main__":
+    main()

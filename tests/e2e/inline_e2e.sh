@@ -1,0 +1,292 @@
+#!/usr/bin/env bash
+# swsec inline end to end, in network namespaces this script makes and
+# removes: a bridge with two guarded VMs (dhclient and udhcpc) and a DHCP
+# server (dnsmasq) on it; the VMs' leases become DHCP bindings, their own
+# traffic passes, scapy attacks are dropped and counted, a port whose
+# interface goes stops alone, the fail modes hold once the daemon stops, a
+# start-up that fails half way leaves the bridge as it was, and nothing of
+# the set-up is left behind. Everything is checked through `swsec ctl --json`.
+#
+#   inline_e2e.sh SWSEC_BINARY
+#
+# Exit 0 passed, 1 failed, 77 skipped (not root, or a tool or kernel
+# feature missing; the reason is printed). Every process started is stopped
+# by its PID, every namespace removed, also on failure.
+set -uo pipefail
+
+swsec=$(realpath "${1:?usage: inline_e2e.sh SWSEC_BINARY}")
+here=$(cd "$(dirname "$0")" && pwd)
+tool="$here/e2e_tool.py"
+examples="$here/../../examples"
+python=/usr/bin/python3
+
+skip() { echo "SKIP: $*"; exit 77; }
+[ "$(id -u)" -eq 0 ] || skip "needs root for network namespaces"
+for command in ip dnsmasq dhclient udhcpc ping; do
+  command -v "$command" >/dev/null || skip "$command is not installed (scripts/setup.sh installs it)"
+done
+"$python" -c "import scapy.all" 2>/dev/null || skip "python3-scapy is not installed (scripts/setup.sh installs it)"
+
+tag="swe$$"
+sw="${tag}sw"; srv="${tag}srv"; vm1="${tag}vm1"; vm2="${tag}vm2"
+work=$(mktemp -d "/tmp/swsec-e2e.XXXXXX")
+ctl="$work/ctl.sock"
+pids=()
+
+cleanup() {
+  local pid
+  for pid in "${pids[@]}"; do
+    kill -TERM "$pid" 2>/dev/null
+  done
+  for pid in "${pids[@]}"; do
+    for _ in $(seq 50); do kill -0 "$pid" 2>/dev/null || break; sleep 0.1; done
+    kill -KILL "$pid" 2>/dev/null
+  done
+  for file in "$work"/*.pid; do
+    [ -f "$file" ] && kill -TERM "$(cat "$file")" 2>/dev/null
+  done
+  for ns in "$vm1" "$vm2" "$srv" "$sw"; do
+    ip netns del "$ns" 2>/dev/null
+  done
+  rm -rf "$work"
+}
+trap cleanup EXIT
+trap 'exit 1' INT TERM
+
+step() { echo "== $*"; }
+fail() {
+  echo "FAIL: $*"
+  echo "-- counters"; sw_ctl counters --json 2>&1 | head -40
+  echo "-- swsec inline's log"; tail -n 40 "$work/inline.log" 2>/dev/null
+  exit 1
+}
+in_ns() { local ns=$1; shift; ip netns exec "$ns" "$@"; }
+sw_ctl() { "$swsec" ctl --ctl "$ctl" "$@"; }
+json() { "$python" -c "import json,sys; d=json.load(sys.stdin); print($1)"; }
+# wait_for SECONDS COMMAND...: until the command succeeds, at most SECONDS.
+wait_for() {
+  local limit=$1; shift
+  local deadline=$((SECONDS + limit))
+  until "$@" >/dev/null 2>&1; do
+    [ $SECONDS -lt $deadline ] || return 1
+    sleep 0.2
+  done
+}
+counter() { sw_ctl counters --json | json "[p for p in d if p['port']=='$1'][0]$2"; }
+binding() { sw_ctl bindings "$1" --json | json "[b['method'] for b in d if b['ip']=='$2' and b['mac']=='$3']"; }
+# For the checks that wait_for runs in a new shell.
+export swsec ctl python
+export -f sw_ctl json counter binding
+
+# ---------------------------------------------------------------- set-up
+step "namespaces, bridge, server, VMs"
+ip netns add "$sw" || skip "cannot make network namespaces"
+ip netns add "$srv"; ip netns add "$vm1"; ip netns add "$vm2"
+ip -n "$sw" link add br0 type bridge 2>/dev/null || skip "no bridge support in this kernel"
+ip -n "$sw" link set br0 up
+ip -n "$sw" link add vm1p type veth peer name eth0 netns "$vm1" 2>/dev/null || skip "no veth support in this kernel"
+ip -n "$sw" link add vm2p type veth peer name eth0 netns "$vm2"
+ip -n "$sw" link add srvp type veth peer name eth0 netns "$srv"
+for link in vm1p vm2p srvp; do
+  ip -n "$sw" link set "$link" master br0
+  ip -n "$sw" link set "$link" up
+done
+for ns in "$srv" "$vm1" "$vm2"; do
+  ip -n "$ns" link set lo up
+  ip -n "$ns" link set eth0 up
+done
+ip -n "$srv" addr add 192.0.2.1/24 dev eth0
+vm1_mac=$(in_ns "$vm1" cat /sys/class/net/eth0/address)
+vm2_mac=$(in_ns "$vm2" cat /sys/class/net/eth0/address)
+srv_mac=$(in_ns "$srv" cat /sys/class/net/eth0/address)
+
+in_ns "$srv" dnsmasq --conf-file=/dev/null --port=0 --interface=eth0 --bind-interfaces \
+  --dhcp-range=192.0.2.100,192.0.2.150,255.255.255.0,2m --dhcp-leasefile="$work/dnsmasq.leases" \
+  --pid-file="$work/dnsmasq.pid" --log-facility="$work/dnsmasq.log" --log-dhcp \
+  || fail "dnsmasq did not start"
+
+# Client scripts that touch nothing but their namespace's interface.
+cat >"$work/dhclient-script" <<'SCRIPT'
+#!/bin/sh
+case "$reason" in
+  PREINIT) ip link set "$interface" up ;;
+  BOUND|RENEW|REBIND|REBOOT) ip addr replace "$new_ip_address/24" dev "$interface" ;;
+  EXPIRE|FAIL|RELEASE|STOP) [ -n "$old_ip_address" ] && ip addr del "$old_ip_address/24" dev "$interface" ;;
+esac
+exit 0
+SCRIPT
+cat >"$work/udhcpc-script" <<'SCRIPT'
+#!/bin/sh
+case "$1" in
+  deconfig) ip addr flush dev "$interface" ;;
+  bound|renew) ip addr replace "$ip/24" dev "$interface" ;;
+esac
+exit 0
+SCRIPT
+chmod +x "$work/dhclient-script" "$work/udhcpc-script"
+cp "$examples/enforcing.json" "$work/vm1.json"
+
+# ---------------------------------------------------------------- start
+start_inline() {
+  # Not through in_ns: the PID must be swsec's own, not a subshell's.
+  ip netns exec "$sw" "$swsec" inline --bridge br0 --port vm1=vm1p --port vm2=vm2p --ctl "$ctl" \
+    --config "$examples/enforcing.json" --port-config vm1="$work/vm1.json" "$@" >>"$work/inline.log" 2>&1 &
+  inline_pid=$!
+  pids+=("$inline_pid")
+  wait_for 10 sw_ctl ports || fail "swsec inline did not come up"
+}
+stop_inline() {
+  kill -TERM "$inline_pid"
+  local deadline=$((SECONDS + 15))
+  while kill -0 "$inline_pid" 2>/dev/null; do
+    [ $SECONDS -lt $deadline ] || fail "swsec inline did not stop on SIGTERM"
+    sleep 0.1
+  done
+  wait "$inline_pid"; inline_status=$?
+}
+links() { ip -n "$sw" -o link show | awk -F': ' '{print $2}' | cut -d@ -f1; }
+master_of() { ip -n "$sw" -j link show dev "$1" | json "d[0].get('master','')"; }
+
+step "swsec inline guards vm1 and vm2"
+start_inline
+[ "$(master_of vm1p)" = "" ] || fail "vm1p is still in the bridge"
+[ "$(stat -c %a "$ctl")" = "600" ] || fail "the control socket is not mode 0600"
+sw_ctl ports --json | json "all(p['running'] for p in d)" | grep -qx True || fail "ports not running"
+sw_ctl watch --json >"$work/watch.log" 2>&1 &
+pids+=("$!")
+
+# ---------------------------------------------------------------- leases
+step "dhclient (vm1) and udhcpc (vm2) get leases, learned as DHCP bindings"
+timeout 30 ip netns exec "$vm1" dhclient -4 -1 -pf "$work/dhclient.pid" -lf "$work/dhclient.leases" \
+  -sf "$work/dhclient-script" eth0 || fail "dhclient got no lease through swsec"
+ip netns exec "$vm2" udhcpc -f -R -i eth0 -s "$work/udhcpc-script" -t 10 -T 1 >"$work/udhcpc.log" 2>&1 &
+udhcpc_pid=$!
+pids+=("$udhcpc_pid")
+vm1_ip=$(ip -n "$vm1" -j -4 addr show dev eth0 | json "d[0]['addr_info'][0]['local']")
+wait_for 20 sh -c "ip -n $vm2 -4 addr show dev eth0 | grep -q 'inet '" || fail "udhcpc got no lease through swsec"
+vm2_ip=$(ip -n "$vm2" -j -4 addr show dev eth0 | json "d[0]['addr_info'][0]['local']")
+echo "vm1 $vm1_mac $vm1_ip, vm2 $vm2_mac $vm2_ip"
+wait_for 5 bash -c "binding vm1 $vm1_ip $vm1_mac | grep -q 'DHCP Snooping'" \
+  || fail "no DHCP binding for vm1: $(sw_ctl bindings --json)"
+binding vm2 "$vm2_ip" "$vm2_mac" | grep -q "DHCP Snooping" || fail "no DHCP binding for vm2: $(sw_ctl bindings --json)"
+sw_ctl bindings vm1 --json | json "d[0]['serverIp']" | grep -qx 192.0.2.1 || fail "binding without the server"
+
+# ---------------------------------------------------------------- own traffic
+step "the VMs' own traffic passes: ping and a TCP transfer with default offloads"
+in_ns "$vm1" ping -c 3 -i 0.2 -W 2 192.0.2.1 >/dev/null || fail "vm1 cannot ping the server"
+in_ns "$vm2" ping -c 3 -i 0.2 -W 2 192.0.2.1 >/dev/null || fail "vm2 cannot ping the server"
+ip netns exec "$srv" "$python" "$tool" tcp-sink 5001 >"$work/tcp.out" &
+sink_pid=$!; pids+=("$sink_pid")
+sleep 0.5
+bytes=$((64 * 1024 * 1024))
+timeout 60 ip netns exec "$vm1" "$python" "$tool" tcp-send 192.0.2.1 5001 $bytes || fail "TCP transfer failed"
+wait "$sink_pid"
+[ "$(cat "$work/tcp.out")" = "$bytes" ] || fail "TCP transfer lost bytes: $(cat "$work/tcp.out") of $bytes"
+
+# ---------------------------------------------------------------- attacks
+step "a spoofed source does not reach the server; the VM's own does"
+ip netns exec "$srv" "$python" "$tool" udp-listen 9999 20 "$vm1_ip" >"$work/udp.out" &
+listen_pid=$!; pids+=("$listen_pid")
+wait_for 5 grep -q listening "$work/udp.out" || fail "UDP listener did not start"
+in_ns "$vm1" "$python" "$tool" udp-send 192.0.2.66 192.0.2.1 "$srv_mac" 9999 eth0
+in_ns "$vm1" "$python" "$tool" udp-send "$vm1_ip" 192.0.2.1 "$srv_mac" 9999 eth0
+wait "$listen_pid"
+grep -qx "$vm1_ip" "$work/udp.out" || fail "the VM's own datagram did not arrive: $(cat "$work/udp.out")"
+! grep -qx 192.0.2.66 "$work/udp.out" || fail "the spoofed datagram arrived"
+
+# attack NAME COUNTER: one attack frame from vm1, dropped, counted.
+attack() {
+  local name=$1 counter=$2 dropped_before counted_before
+  dropped_before=$(counter vm1 "['frames']['from-vm']['dropped']")
+  counted_before=$([ -n "$counter" ] && counter vm1 "['drops']['$counter']" || echo 0)
+  in_ns "$vm1" "$python" "$tool" attack "$name" eth0 "$vm1_mac" "$vm1_ip" 192.0.2.1
+  wait_for 5 bash -c "[ \$(counter vm1 \"['frames']['from-vm']['dropped']\") -gt $dropped_before ]" \
+    || fail "$name was not dropped"
+  if [ -n "$counter" ]; then
+    [ "$(counter vm1 "['drops']['$counter']")" -gt "$counted_before" ] || fail "$name not counted in $counter"
+  fi
+  echo "   $name dropped${counter:+, $counter counted}"
+}
+step "attacks from the guarded VM are dropped and counted"
+attack ip-spoof ipSrcGuardDropCnt
+attack arp-gateway daiDropCnt
+attack rogue-offer ""
+attack bpdu ""
+attack vlan-spoof ipSrcGuardDropCnt
+
+step "a DHCP ACK from the network that answers no request is dropped"
+to_vm_before=$(counter vm1 "['frames']['to-vm']['dropped']")
+in_ns "$srv" "$python" "$tool" unsolicited-ack eth0 "$vm1_mac" 192.0.2.1
+wait_for 5 bash -c "[ \$(counter vm1 \"['frames']['to-vm']['dropped']\") -gt $to_vm_before ]" \
+  || fail "the unsolicited ACK was not dropped"
+sw_ctl bindings --json | grep -q 192.0.2.77 && fail "the unsolicited ACK made a binding"
+
+# ---------------------------------------------------------------- control
+step "ctl: summary, metrics, bad requests, a refused configuration, SIGHUP"
+sw_ctl summary vm1 --json | json "d['fields']['portMode']" | grep -qx Untrusted || fail "summary"
+sw_ctl metrics | grep -q '^swsec_frames_total{port="vm1",direction="from-vm",verdict="dropped"} [1-9]' \
+  || fail "metrics: $(sw_ctl metrics)"
+sw_ctl metrics | grep -q '^swsec_bindings{port="vm1",method="DHCP Snooping"} 1$' || fail "metrics bindings"
+"$python" "$tool" junk "$ctl" >/dev/null || fail "junk or a stalled client disturbed the control socket"
+out=$(sw_ctl summary nosuchport 2>&1) && fail "an unknown port was accepted"
+grep -q "no port named 'nosuchport'" <<<"$out" || fail "unknown port not named: $out"
+echo '{"portDbSize": 0}' >"$work/refused.json"
+sw_ctl config vm1 "$work/refused.json" >"$work/config.out" 2>&1 && fail "a port database of size 0 was accepted"
+grep -q "refused" "$work/config.out" || fail "refusal not shown: $(cat "$work/config.out")"
+echo '{"features": [' >"$work/vm1.json"
+kill -HUP "$inline_pid"
+wait_for 5 grep -q "vm1: .*keeps its configuration" "$work/inline.log" || fail "a bad file on SIGHUP was not reported"
+sw_ctl summary vm1 --json | json "d['fields']['portMode']" | grep -qx Untrusted || fail "SIGHUP changed the port"
+in_ns "$vm1" ping -c 1 -W 2 192.0.2.1 >/dev/null || fail "vm1 lost traffic after SIGHUP"
+sw_ctl log --json | grep -q "keeps its configuration" || fail "ctl log lacks the SIGHUP report"
+
+# ---------------------------------------------------------------- release
+step "a release removes the binding"
+in_ns "$vm1" dhclient -r -pf "$work/dhclient.pid" -lf "$work/dhclient.leases" -sf "$work/dhclient-script" eth0
+wait_for 5 sh -c "! $swsec ctl --ctl $ctl bindings vm1 --json | grep -q '\"$vm1_ip\"'" || fail "binding kept after release"
+wait_for 5 grep -q "\"event\":\"added\".*\"ip\":\"$vm1_ip\"" "$work/watch.log" || fail "watch missed the addition: $(cat "$work/watch.log")"
+wait_for 5 grep -q "\"event\":\"removed\".*\"ip\":\"$vm1_ip\"" "$work/watch.log" || fail "watch missed the removal"
+
+# ---------------------------------------------------------------- a port goes
+step "a port whose interface disappears stops alone"
+kill -TERM "$udhcpc_pid"; wait "$udhcpc_pid" 2>/dev/null
+ip netns del "$vm2"
+wait_for 5 sh -c "$swsec ctl --ctl $ctl ports --json | grep -q 'disappeared'" || fail "vm2 did not stop"
+sw_ctl ports --json | json "[p['running'] for p in d if p['name']=='vm1'][0]" | grep -qx True || fail "vm1 stopped too"
+ip -n "$sw" link show swsec"$(ip -n "$sw" -j link show dev vm1p | json "d[0]['ifindex']")"b >/dev/null || fail "vm1's pair went"
+ip -n "$vm1" addr add 192.0.2.10/24 dev eth0
+in_ns "$vm1" ping -c 1 -W 2 192.0.2.1 >/dev/null && fail "an address the VM never leased got through"
+ip -n "$vm1" addr del 192.0.2.10/24 dev eth0
+
+# ---------------------------------------------------------------- fail modes
+step "fail closed: stopped, vm1 stays cut off and nothing of swsec is left"
+stop_inline
+[ "$inline_status" -eq 0 ] || fail "swsec inline exited $inline_status"
+grep -q "0 host violation" "$work/inline.log" || fail "host violations at stop"
+[ -z "$(links | grep '^swsec')" ] || fail "links left: $(links | grep '^swsec')"
+[ "$(master_of vm1p)" = "" ] || fail "vm1p back in the bridge although closed"
+[ ! -e "$ctl" ] || fail "control socket left behind"
+ip -n "$vm1" addr add 192.0.2.11/24 dev eth0
+in_ns "$vm1" ping -c 1 -W 1 192.0.2.1 >/dev/null && fail "vm1 reaches the server after a closed stop"
+
+step "fail open: restarted on a port left closed, stopped, vm1 back on the bridge"
+ip netns exec "$sw" "$swsec" inline --bridge br0 --port vm1=vm1p --ctl "$ctl" --fail open >>"$work/inline.log" 2>&1 &
+inline_pid=$!; pids+=("$inline_pid")
+wait_for 10 sw_ctl ports || fail "swsec inline did not come up again"
+in_ns "$vm1" ping -c 1 -W 2 192.0.2.1 >/dev/null || fail "vm1 (trusted default port) cannot reach the server"
+stop_inline
+[ "$(master_of vm1p)" = "br0" ] || fail "vm1p not back in the bridge after an open stop"
+in_ns "$vm1" ping -c 1 -W 2 192.0.2.1 >/dev/null || fail "vm1 cut off after an open stop"
+[ -z "$(links | grep '^swsec')" ] || fail "links left after the open stop"
+
+step "a start-up that fails half way leaves the bridge as it was"
+in_ns "$sw" "$swsec" inline --bridge br0 --port vm1=vm1p --port bad=nosuchif --ctl "$ctl" >>"$work/inline.log" 2>&1 \
+  && fail "a start with a missing interface succeeded"
+[ "$(master_of vm1p)" = "br0" ] || fail "vm1p left out of the bridge after a failed start"
+[ -z "$(links | grep '^swsec')" ] || fail "links left after a failed start"
+[ ! -e "$ctl" ] || fail "control socket left after a failed start"
+in_ns "$sw" "$swsec" inline --bridge br0 --port vm1=vm1p --state-dir "$work" --ctl "$ctl" 2>"$work/state.err" \
+  && fail "--state-dir was accepted"
+grep -q "not implemented" "$work/state.err" || fail "--state-dir refusal unclear"
+
+echo "PASS"

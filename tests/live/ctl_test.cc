@@ -1,0 +1,194 @@
+// The control socket and the metrics as a client and a scraper meet them:
+// the socket is the owner's alone, a second daemon is refused, junk and a
+// stalled client harm no one, streams follow events; the Prometheus text
+// has every series with escaped labels.
+#include "ctl_format.h"
+#include "ctl_server.h"
+#include "live_events.h"
+
+#include <gtest/gtest.h>
+
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <cstdlib>
+#include <filesystem>
+#include <string>
+
+namespace swsec::live {
+namespace {
+
+class EchoHandler : public CtlHandler {
+public:
+   nlohmann::json handle(const nlohmann::json &request) override
+   {
+      if (request["command"] == "boom") {
+         throw CtlError("no such thing");
+      }
+      return {{"echo", request["command"]}};
+   }
+};
+
+class Client {
+public:
+   explicit Client(const std::string &path)
+   {
+      fd_ = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+      sockaddr_un address{};
+      address.sun_family = AF_UNIX;
+      std::snprintf(address.sun_path, sizeof address.sun_path, "%s", path.c_str());
+      connected_ = connect(fd_, reinterpret_cast<const sockaddr *>(&address), sizeof address) == 0;
+      timeval timeout{5, 0};
+      setsockopt(fd_, SOL_SOCKET, SO_RCVTIMEO, &timeout, sizeof timeout);
+   }
+   ~Client() { close(fd_); }
+   bool connected() const { return connected_; }
+   void send(const std::string &text) { ASSERT_EQ(::send(fd_, text.data(), text.size(), MSG_NOSIGNAL), ssize_t(text.size())); }
+   // One line, or "" on a timeout or a closed connection.
+   std::string line()
+   {
+      for (;;) {
+         const size_t newline = buffer_.find('\n');
+         if (newline != std::string::npos) {
+            std::string out = buffer_.substr(0, newline);
+            buffer_.erase(0, newline + 1);
+            return out;
+         }
+         char chunk[4096];
+         const ssize_t got = recv(fd_, chunk, sizeof chunk, 0);
+         if (got <= 0) {
+            return "";
+         }
+         buffer_.append(chunk, size_t(got));
+      }
+   }
+
+private:
+   int fd_ = -1;
+   bool connected_ = false;
+   std::string buffer_;
+};
+
+class CtlServerTest : public ::testing::Test {
+protected:
+   void SetUp() override
+   {
+      dir_ = std::filesystem::temp_directory_path() / ("swsec-ctl-test-" + std::to_string(getpid()));
+      std::filesystem::create_directories(dir_);
+      path_ = (dir_ / "ctl.sock").string();
+   }
+   void TearDown() override { std::filesystem::remove_all(dir_); }
+
+   std::filesystem::path dir_;
+   std::string path_;
+   EventHub events_;
+   EchoHandler handler_;
+};
+
+TEST_F(CtlServerTest, the_socket_is_the_owners_alone_and_goes_with_the_server)
+{
+   {
+      CtlServer server(path_, events_, handler_);
+      struct stat info{};
+      ASSERT_EQ(stat(path_.c_str(), &info), 0);
+      EXPECT_EQ(info.st_mode & 0777, 0600u);
+      // A second daemon on the same socket is refused; the first goes on.
+      EXPECT_THROW(CtlServer(path_, events_, handler_), std::runtime_error);
+      Client client(path_);
+      client.send("{\"command\": \"ports\"}\n");
+      EXPECT_EQ(nlohmann::json::parse(client.line())["result"]["echo"], "ports");
+   }
+   EXPECT_FALSE(std::filesystem::exists(path_));
+}
+
+TEST_F(CtlServerTest, a_stale_socket_is_replaced_and_any_other_file_is_left_alone)
+{
+   {
+      const int fd = socket(AF_UNIX, SOCK_STREAM, 0);
+      sockaddr_un address{};
+      address.sun_family = AF_UNIX;
+      std::snprintf(address.sun_path, sizeof address.sun_path, "%s", path_.c_str());
+      ASSERT_EQ(bind(fd, reinterpret_cast<const sockaddr *>(&address), sizeof address), 0);
+      close(fd);   // bound, never listening: what a killed daemon leaves
+   }
+   { CtlServer server(path_, events_, handler_); }
+   const std::string plain = (dir_ / "plain").string();
+   std::FILE *file = std::fopen(plain.c_str(), "w");
+   std::fclose(file);
+   EXPECT_THROW(CtlServer(plain, events_, handler_), std::runtime_error);
+   EXPECT_TRUE(std::filesystem::exists(plain));
+}
+
+TEST_F(CtlServerTest, junk_errors_and_a_stalled_client_hold_up_no_one)
+{
+   CtlServer server(path_, events_, handler_);
+   Client junk(path_);
+   junk.send("this is not json\n");
+   EXPECT_FALSE(nlohmann::json::parse(junk.line())["ok"]);
+   EXPECT_EQ(junk.line(), "");   // and it is disconnected
+
+   Client stalled(path_);
+   stalled.send("{\"command\": \"po");
+   Client good(path_);
+   good.send("{\"command\": \"boom\"}\n{\"command\": \"counters\"}\n");
+   const auto refused = nlohmann::json::parse(good.line());
+   EXPECT_FALSE(refused["ok"]);
+   EXPECT_EQ(refused["error"], "no such thing");
+   EXPECT_EQ(nlohmann::json::parse(good.line())["result"]["echo"], "counters");
+
+   Client noCommand(path_);
+   noCommand.send("{\"cmd\": \"ports\"}\n");
+   EXPECT_FALSE(nlohmann::json::parse(noCommand.line())["ok"]);
+}
+
+TEST_F(CtlServerTest, log_follow_and_watch_stream_what_comes_after_the_recent_lines)
+{
+   events_.log("info", "inline", "before");
+   CtlServer server(path_, events_, handler_);
+   Client log(path_);
+   log.send("{\"command\": \"log\", \"follow\": true}\n");
+   const auto first = nlohmann::json::parse(log.line());
+   ASSERT_TRUE(first["streaming"]);
+   ASSERT_EQ(first["result"].size(), 1u);
+   EXPECT_EQ(first["result"][0]["text"], "before");
+   Client watch(path_);
+   watch.send("{\"command\": \"watch\"}\n");
+   EXPECT_TRUE(nlohmann::json::parse(watch.line())["result"].empty());
+
+   events_.notification({{"port", "vm1"}, {"event", "added"}, {"ip", "192.0.2.5"}});
+   events_.log("error", "module", "after");
+   EXPECT_EQ(nlohmann::json::parse(watch.line())["ip"], "192.0.2.5");
+   EXPECT_EQ(nlohmann::json::parse(log.line())["text"], "after");
+}
+
+TEST(CtlMetrics, every_series_of_every_port_with_escaped_labels)
+{
+   const auto counters = nlohmann::json::parse(R"([
+      {"port": "vm1", "running": true, "truncated": 0, "sendErrors": 2,
+       "frames": {"to-vm": {"passed": 5, "dropped": 1}, "from-vm": {"passed": 7, "dropped": 3}},
+       "drops": {"daiDropCnt": 2, "ipSrcGuardDropCnt": 1},
+       "bindings": {"DHCP Snooping": 1, "Static": 0}},
+      {"port": "we\"ird", "running": false, "truncated": 0, "sendErrors": 0,
+       "frames": {"to-vm": {"passed": 0, "dropped": 0}, "from-vm": {"passed": 0, "dropped": 0}}}])");
+   const std::string text = ctl::metricsText(counters);
+   for (const char *line : {
+           "swsec_port_up{port=\"vm1\"} 1\n",
+           "swsec_port_up{port=\"we\\\"ird\"} 0\n",
+           "swsec_frames_total{port=\"vm1\",direction=\"from-vm\",verdict=\"dropped\"} 3\n",
+           "swsec_frames_total{port=\"vm1\",direction=\"to-vm\",verdict=\"passed\"} 5\n",
+           "swsec_module_drops_total{port=\"vm1\",counter=\"daiDropCnt\"} 2\n",
+           "swsec_bindings{port=\"vm1\",method=\"DHCP Snooping\"} 1\n",
+           "swsec_frames_lost_total{port=\"vm1\",reason=\"send-error\"} 2\n",
+           "# TYPE swsec_frames_total counter\n",
+           "# TYPE swsec_bindings gauge\n",
+        }) {
+      EXPECT_NE(text.find(line), std::string::npos) << line << "\nin:\n" << text;
+   }
+   EXPECT_EQ(text.find("swsec_bindings{port=\"we"), std::string::npos);
+}
+
+}  // namespace
+}  // namespace swsec::live

@@ -1,0 +1,133 @@
+// The layer every front end stands on: the module loaded once into a host,
+// switch-security ports of the built-in agent made on one virtual switch,
+// configured through the security property as the management plane would,
+// and read back through the management nodes and the port database's
+// notifications. It knows the module only through the platform contract.
+#pragma once
+
+#include "host/host.h"
+
+#include <cstdint>
+#include <map>
+#include <mutex>
+#include <optional>
+#include <stdexcept>
+#include <string>
+#include <string_view>
+#include <vector>
+
+namespace swsec::ports {
+
+inline constexpr const char *kAgent = "sifra-generic-tarlin-swsec";
+inline constexpr const char *kSecurityProperty = "sifra-generic-tarlin-swsec.security";
+inline constexpr const char *kPortset = "vs0";
+
+// The six drop counters of the feature summary, in its order.
+inline constexpr const char *kDropCounterFields[] = {"dhcpSnoopingDropCnt", "daiDropCnt",
+                                                     "ipSrcGuardDropCnt",   "txRateLimitDropCnt",
+                                                     "rxRateLimitDropCnt",  "txRateLimitErrEntryCnt"};
+
+// One port database entry as the "vmi" node renders it ("N/A" where a field
+// does not apply).
+struct PortDbEntry {
+   uint16_t vlan = 0;
+   std::string mac;
+   std::string ip;
+   std::string method;        // "DHCP Snooping", "Static", "ARP Snooping", ...
+   std::string timeRemaining; // "118 sec", "N/A"
+   std::string chaddr;
+   std::string clientIdLen;
+   std::string serverIp;
+   std::string leaseTime;
+};
+
+// What the management nodes show of one port.
+struct PortState {
+   // The "featureSummary" node's fields; none when the port has no IP
+   // discovery (the node then does not exist).
+   std::optional<std::map<std::string, std::string, std::less<>>> featureSummary;
+   std::string featureSummaryText;
+   std::map<std::string, uint64_t, std::less<>> counters;   // drop counters the port keeps
+   std::vector<PortDbEntry> portDb;
+};
+
+// A portdb.entry.added / portdb.entry.removed message, decoded.
+struct PortDbNotification {
+   uint32_t portID = 0;
+   std::string name;
+   uint16_t vlan = 0;
+   std::string mac;
+   std::string ip;
+   bool authoritative = false;
+};
+
+// The module refused something (a configuration, a clear): `what()` is the
+// module's own message, from its error log lines.
+class Refused : public std::runtime_error {
+public:
+   using std::runtime_error::runtime_error;
+};
+
+// The port database message payload: a header, then VLAN (host order) at 8,
+// MAC at 10, IPv4 at 20 and the authoritative flag at 36.
+inline constexpr size_t kPortDbMessageBytes = 40;
+std::optional<PortDbNotification> decodePortDbMessage(const host::PostedMessage &message);
+
+// The host with the module loaded and the ports made on it. Management
+// calls may come from any thread; frames go straight to the host's
+// thread-safe processPackets through `host()`.
+class ModuleSession {
+public:
+   // Loads the module from the image at `modulePath`, or, with none, the
+   // one linked into the program (`linkedModule`, null: the built image),
+   // and makes the virtual switch; throws std::runtime_error when it does
+   // not load.
+   ModuleSession(const std::string &modulePath, const orr_ModuleInfo *linkedModule,
+                 host::ViolationHandler violations);
+   // Destroys the ports still there and unloads.
+   ~ModuleSession();
+   ModuleSession(const ModuleSession &) = delete;
+   ModuleSession &operator=(const ModuleSession &) = delete;
+
+   host::Host &host() { return host_; }
+
+   // Makes a port of the built-in agent with this port ID; throws
+   // std::runtime_error with the module's status when it cannot.
+   host::FilterId addPort(uint32_t portID, const std::string &name, const std::string &vmUuid);
+   // Destroys the port as the hypervisor does (again while the module is busy).
+   orr_Status removePort(host::FilterId filter);
+
+   // Writes the security property; throws Refused with the module's words.
+   void configure(host::FilterId filter, const std::vector<uint8_t> &record);
+   // The "clearVmi" node: all entries, or one VLAN/MAC/IP. Throws Refused.
+   void clear(uint32_t portID, const std::optional<std::vector<std::string>> &key);
+   PortState readState(uint32_t portID);
+
+   // Port database notifications posted since the last call, in order.
+   std::vector<PortDbNotification> takeNotifications();
+   // The module's log lines written since the last call (severity 1 information, 2 error).
+   std::vector<host::LogRecord> takeLog();
+
+   // Destroys the ports left and unloads; every finding of the host (leaks,
+   // a port that would not go) so far comes back as text, each also given
+   // to the handler as it was found. Later calls only return the list.
+   std::vector<std::string> finish();
+
+private:
+   void drainLogLocked();
+   std::string errorsSince(size_t mark);
+   void report(const std::string &violation);
+
+   host::ViolationHandler forward_;
+   host::Host host_;
+   std::vector<host::FilterId> filters_;
+   std::mutex mutex_;                       // management calls and the log sink
+   std::vector<host::LogRecord> logTail_;   // records drained from the host, not yet taken
+   std::mutex violationsMutex_;             // violations come from any thread
+   std::vector<std::string> violations_;
+   bool finished_ = false;
+};
+
+std::string withoutNewline(std::string text);
+
+}  // namespace swsec::ports

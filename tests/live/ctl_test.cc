@@ -167,7 +167,7 @@ TEST_F(CtlServerTest, log_follow_and_watch_stream_what_comes_after_the_recent_li
 TEST(CtlMetrics, every_series_of_every_port_with_escaped_labels)
 {
    const auto counters = nlohmann::json::parse(R"([
-      {"port": "vm1", "running": true, "truncated": 0, "sendErrors": 2,
+      {"port": "vm1", "running": true, "truncated": 0, "sendErrors": 2, "overruns": 4,
        "frames": {"to-vm": {"passed": 5, "dropped": 1}, "from-vm": {"passed": 7, "dropped": 3}},
        "drops": {"daiDropCnt": 2, "ipSrcGuardDropCnt": 1},
        "bindings": {"DHCP Snooping": 1, "Static": 0}},
@@ -182,6 +182,7 @@ TEST(CtlMetrics, every_series_of_every_port_with_escaped_labels)
            "swsec_module_drops_total{port=\"vm1\",counter=\"daiDropCnt\"} 2\n",
            "swsec_bindings{port=\"vm1\",method=\"DHCP Snooping\"} 1\n",
            "swsec_frames_lost_total{port=\"vm1\",reason=\"send-error\"} 2\n",
+           "swsec_frames_lost_total{port=\"vm1\",reason=\"overrun\"} 4\n",
            "# TYPE swsec_frames_total counter\n",
            "# TYPE swsec_bindings gauge\n",
         }) {

@@ -112,7 +112,7 @@ std::string humanText(const std::string &command, const nlohmann::json &result)
    }
    if (command == "counters") {
       std::vector<std::vector<std::string>> rows{
-         {"PORT", "TO-VM PASSED", "TO-VM DROPPED", "FROM-VM PASSED", "FROM-VM DROPPED", "DROP COUNTERS"}};
+         {"PORT", "TO-VM PASSED", "TO-VM DROPPED", "FROM-VM PASSED", "FROM-VM DROPPED", "LOST", "DROP COUNTERS"}};
       for (const auto &port : result) {
          const nlohmann::json &frames = member(port, "frames");
          std::string drops;
@@ -123,6 +123,8 @@ std::string humanText(const std::string &command, const nlohmann::json &result)
                          field(member(frames, "to-vm"), "dropped"),
                          field(member(frames, "from-vm"), "passed"),
                          field(member(frames, "from-vm"), "dropped"),
+                         std::to_string(port.value("overruns", 0ULL) + port.value("truncated", 0ULL) +
+                                        port.value("sendErrors", 0ULL)),
                          drops.empty() ? "-" : drops});
       }
       return table(rows);
@@ -190,11 +192,14 @@ std::string metricsText(const nlohmann::json &counters)
              << count.get<uint64_t>() << "\n";
       }
    }
-   out << "# HELP swsec_frames_lost_total Frames lost outside the module: too long for a slot, refused on send.\n"
+   out << "# HELP swsec_frames_lost_total Frames lost outside the module: the reader fell behind (overrun), too long "
+          "for a slot (truncated), refused on send.\n"
           "# TYPE swsec_frames_lost_total counter\n";
    for (const auto &port : counters) {
       const std::string name = labelValue(field(port, "port"));
       out << "swsec_frames_lost_total{port=\"" << name << "\",reason=\"truncated\"} " << port.value("truncated", 0ULL)
+          << "\n";
+      out << "swsec_frames_lost_total{port=\"" << name << "\",reason=\"overrun\"} " << port.value("overruns", 0ULL)
           << "\n";
       out << "swsec_frames_lost_total{port=\"" << name << "\",reason=\"send-error\"} "
           << port.value("sendErrors", 0ULL) << "\n";

@@ -207,6 +207,7 @@ nlohmann::json InlineDaemon::countersJson(Port &port)
    entry["frames"] = frames;
    entry["truncated"] = counters.truncated.load();
    entry["sendErrors"] = counters.sendErrors.load();
+   entry["overruns"] = port.guarded->overruns();
    if (!port.guarded->running()) {
       return entry;
    }

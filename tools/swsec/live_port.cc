@@ -216,6 +216,19 @@ void GuardedPort::forward(PacketSocket &from, PacketSocket &to, uint32_t directi
    }
 }
 
+uint64_t GuardedPort::overruns()
+{
+   std::lock_guard guard(mutex_);
+   uint64_t more = 0;
+   if (vmSocket_) {
+      more += vmSocket_->takeOverruns();
+   }
+   if (guardSocket_) {
+      more += guardSocket_->takeOverruns();
+   }
+   return counters_.overruns.fetch_add(more, std::memory_order_relaxed) + more;
+}
+
 std::string GuardedPort::stopReason() const
 {
    std::lock_guard guard(mutex_);

@@ -45,6 +45,7 @@ struct PortCounters {
    std::array<std::atomic<uint64_t>, 3> dropped{};
    std::atomic<uint64_t> truncated{0};     // longer than a slot, never sent on
    std::atomic<uint64_t> sendErrors{0};    // refused by the outgoing interface
+   std::atomic<uint64_t> overruns{0};      // dropped by the kernel: a socket's buffer was full
 };
 
 class GuardedPort {
@@ -73,6 +74,9 @@ public:
    // Why the port stopped by itself, "" while it has not.
    std::string stopReason() const;
    const PortCounters &counters() const { return counters_; }
+   // Gathers the sockets' overruns into the counters (reading them resets
+   // the kernel's count) and returns the total.
+   uint64_t overruns();
    std::string guardEnd() const { return guardEnd_; }
    std::string bridgeEnd() const { return bridgeEnd_; }
 

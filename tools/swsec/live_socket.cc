@@ -132,6 +132,16 @@ bool PacketSocket::receive(std::vector<ReceivedFrame> &frames)
    return true;
 }
 
+uint64_t PacketSocket::takeOverruns()
+{
+   tpacket_stats stats{};
+   socklen_t length = sizeof stats;
+   if (getsockopt(fd_, SOL_PACKET, PACKET_STATISTICS, &stats, &length) != 0) {
+      return 0;
+   }
+   return stats.tp_drops;
+}
+
 size_t PacketSocket::send(std::span<const ReceivedFrame *const> frames, uint64_t *errors)
 {
    size_t sent = 0;

@@ -67,6 +67,9 @@ public:
    // Sends the frames, putting back the tags the kernel took off. Returns
    // the frames the kernel took; a frame it refused is counted and skipped.
    size_t send(std::span<const ReceivedFrame *const> frames, uint64_t *errors);
+   // Frames the kernel dropped for want of room in the receive buffer since
+   // the last call (the reader fell behind).
+   uint64_t takeOverruns();
 
 private:
    std::string ifname_;

@@ -274,6 +274,18 @@ ip netns exec "$sw" "$swsec" inline --bridge br0 --port vm1=vm1p --ctl "$ctl" --
 inline_pid=$!; pids+=("$inline_pid")
 wait_for 10 sw_ctl ports || fail "swsec inline did not come up again"
 in_ns "$vm1" ping -c 1 -W 2 192.0.2.1 >/dev/null || fail "vm1 (trusted default port) cannot reach the server"
+# The VM's own VLAN-tagged traffic passes with its tag put back, and the
+# port learns its address on that VLAN.
+if ip -n "$vm1" link add link eth0 name eth0.100 type vlan id 100 2>/dev/null; then
+  ip -n "$srv" link add link eth0 name eth0.100 type vlan id 100
+  ip -n "$vm1" addr add 198.51.100.2/24 dev eth0.100; ip -n "$vm1" link set eth0.100 up
+  ip -n "$srv" addr add 198.51.100.1/24 dev eth0.100; ip -n "$srv" link set eth0.100 up
+  in_ns "$vm1" ping -c 2 -i 0.2 -W 2 198.51.100.1 >/dev/null || fail "VLAN 100 traffic did not cross swsec"
+  wait_for 5 bash -c "sw_ctl bindings vm1 --json | json \"any(b['vlan']==100 and b['ip']=='198.51.100.2' for b in d)\" | grep -qx True" \
+    || fail "no binding on VLAN 100: $(sw_ctl bindings vm1 --json)"
+else
+  echo "   skipped the VLAN check: no 802.1Q support in this kernel"
+fi
 stop_inline
 [ "$(master_of vm1p)" = "br0" ] || fail "vm1p not back in the bridge after an open stop"
 in_ns "$vm1" ping -c 1 -W 2 192.0.2.1 >/dev/null || fail "vm1 cut off after an open stop"

@@ -247,6 +247,12 @@ wait_for 5 sh -c "! $swsec ctl --ctl $ctl bindings vm1 --json | grep -q '\"$vm1_
 wait_for 5 grep -q "\"event\":\"added\".*\"ip\":\"$vm1_ip\"" "$work/watch.log" || fail "watch missed the addition: $(cat "$work/watch.log")"
 wait_for 5 grep -q "\"event\":\"removed\".*\"ip\":\"$vm1_ip\"" "$work/watch.log" || fail "watch missed the removal"
 
+step "clear: one binding by VLAN, MAC and IP; a malformed key is refused"
+sw_ctl clear vm2 0 "$vm2_mac" "$vm2_ip" >/dev/null || fail "clearing one binding was refused"
+wait_for 5 bash -c "! sw_ctl bindings vm2 --json | grep -q '\"$vm2_ip\"'" || fail "the cleared binding is still there"
+out=$(sw_ctl clear vm2 0 not-a-mac 192.0.2.1 2>&1) && fail "a malformed MAC was accepted"
+grep -q "refused" <<<"$out" || fail "malformed clear not explained: $out"
+
 # ---------------------------------------------------------------- a port goes
 step "a port whose interface disappears stops alone"
 kill -TERM "$udhcpc_pid"; wait "$udhcpc_pid" 2>/dev/null

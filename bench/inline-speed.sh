@@ -4,9 +4,10 @@
 # (enforcing, with a static binding for the sender so that every frame gets
 # the full checks) to a receiver on the same bridge. Reports, for the plain
 # bridge and through swsec: frames per second at full speed and the loss,
-# the loss at a paced 200,000 frames/s, CPU per frame (the whole machine's,
-# and swsec's own), ping's round trip, and a TCP transfer's throughput
-# (iperf3). Not a test; needs root, iperf3 and ping (scripts/setup.sh).
+# the loss at a paced 200,000 frames/s, CPU per frame (of the sender and
+# swsec, in whose contexts the kernel's forwarding mostly runs; and swsec's
+# own, all and in user space), ping's round trip, and a TCP transfer's throughput (iperf3). Not a
+# test; needs root, iperf3 and ping (scripts/setup.sh).
 #
 #   bench/inline-speed.sh [SECONDS]     (default 5 a measurement)
 #
@@ -65,43 +66,44 @@ for _ in $(seq 20); do [ -s "$work/iperf3.pid" ] && break; sleep 0.1; done
 [ -s "$work/iperf3.pid" ] && pids+=("$(cat "$work/iperf3.pid")")
 
 rx() { ip netns exec "$dst" cat /sys/class/net/eth0/statistics/rx_packets; }
-busy() { awk '/^cpu /{print $2+$3+$4+$7+$8}' /proc/stat; }   # user, nice, system, irq, softirq jiffies
 proc_cpu() { awk '{print $14+$15}' "/proc/$1/stat"; }         # utime + stime of a process
+proc_user() { awk '{print $14}' "/proc/$1/stat"; }               # utime alone: swsec's own work, not the kernel's
 hz=$(getconf CLK_TCK)
 
-# blast RATE: prints "sent received seconds busy_jiffies swsec_jiffies"
+# blast RATE: prints "sent received seconds sender_cpu_jiffies swsec_jiffies swsec_user_jiffies"
 blast() {
-  local before_rx before_busy before_proc=0 out after_proc=0
+  local before_rx before_proc=0 out after_proc=0 before_user=0 after_user=0
   sleep 0.5
-  before_rx=$(rx); before_busy=$(busy)
-  [ -n "${inline_pid:-}" ] && before_proc=$(proc_cpu "$inline_pid")
+  before_rx=$(rx)
+  [ -n "${inline_pid:-}" ] && before_proc=$(proc_cpu "$inline_pid") && before_user=$(proc_user "$inline_pid")
   out=$(ip netns exec "$src" "$blaster" eth0 "$src_mac" "$dst_mac" 10.9.0.1 10.9.0.2 "$1" "$seconds")
   sleep 0.3   # frames still in flight
-  [ -n "${inline_pid:-}" ] && after_proc=$(proc_cpu "$inline_pid")
-  echo "$(cut -d' ' -f1 <<<"$out") $(( $(rx) - before_rx )) $(cut -d' ' -f2 <<<"$out") $(( $(busy) - before_busy )) $(( after_proc - before_proc ))"
+  [ -n "${inline_pid:-}" ] && after_proc=$(proc_cpu "$inline_pid") && after_user=$(proc_user "$inline_pid")
+  read -r sent secs _ cpu <<<"$out"
+  echo "$sent $(( $(rx) - before_rx )) $secs $(awk -v c="$cpu" -v hz="$hz" 'BEGIN{printf "%.0f", c * hz}') $(( after_proc - before_proc )) $(( after_user - before_user ))"
 }
 
 measure() {
   local name=$1
-  read -r sent got secs busy_j proc_j <<<"$(blast 0)"
-  read -r psent pgot _ _ _ <<<"$(blast $paced_rate)"
+  read -r sent got secs busy_j proc_j user_j <<<"$(blast 0)"
+  read -r psent pgot _ _ _ _ <<<"$(blast $paced_rate)"
   local rtt tcp
   rtt=$(ip netns exec "$src" ping -q -c 500 -i 0.002 10.9.0.2 | sed -n 's|.*= [0-9.]*/\([0-9.]*\)/.*|\1|p')
   tcp=$(ip netns exec "$src" iperf3 -c 10.9.0.2 -t "$seconds" -f m 2>/dev/null | awk '/receiver/{print $(NF-2)}')
-  awk -v n="$name" -v s="$sent" -v g="$got" -v t="$secs" -v b="$busy_j" -v p="$proc_j" -v hz="$hz" \
+  awk -v n="$name" -v s="$sent" -v g="$got" -v t="$secs" -v b="$busy_j" -v p="$proc_j" -v u="$user_j" -v hz="$hz" \
       -v ps="$psent" -v pg="$pgot" -v r="$rtt" -v tcp="$tcp" 'BEGIN {
     fps = g / t
     loss = 0; if (s > 0) loss = 100 * (s - g) / s
     ploss = 0; if (ps > 0) ploss = 100 * (ps - pg) / ps
-    cpu = 0; if (g > 0) cpu = 1e9 * b / hz / g
-    own = "-"; if (p > 0 && g > 0) own = sprintf("%.0f", 1e9 * p / hz / g)
+    cpu = 0; if (g > 0) cpu = 1e9 * (b + p) / hz / g
+    own = "-"; if (p > 0 && g > 0) own = sprintf("%.0f/%.0f", 1e9 * p / hz / g, 1e9 * u / hz / g)
     printf "%-12s %12.0f %8.2f%% %10.2f%% %12.0f %12s %9.1f us %10.0f\n", n, fps, loss, ploss, cpu, own, r * 1000, tcp
     print fps, loss, ploss, cpu, r, tcp > "/dev/stderr"
   }'
 }
 
 echo "inline-speed: $seconds s a measurement; 60-byte frames, lossless check at $paced_rate frames/s"
-printf "%-12s %12s %9s %11s %12s %12s %12s %10s\n" "" "frames/s" "loss" "loss@200k" "ns CPU/frame" "swsec ns/fr" "ping rtt" "TCP Mb/s"
+printf "%-12s %12s %9s %11s %12s %12s %12s %10s\n" "" "frames/s" "loss" "loss@200k" "ns CPU/frame" "swsec/user ns" "ping rtt" "TCP Mb/s"
 measure "bridge" 2>"$work/bridge.txt"
 ip netns exec "$sw" "$swsec" inline --bridge br0 --port vm=srcp --config "$work/port.json" \
   --ctl "$work/ctl.sock" >"$work/inline.log" 2>&1 &

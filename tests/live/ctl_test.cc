@@ -46,6 +46,7 @@ public:
    }
    ~Client() { close(fd_); }
    bool connected() const { return connected_; }
+   void shutdownWrite() { ::shutdown(fd_, SHUT_WR); }
    void send(const std::string &text) { ASSERT_EQ(::send(fd_, text.data(), text.size(), MSG_NOSIGNAL), ssize_t(text.size())); }
    // One line, or "" on a timeout or a closed connection.
    std::string line()
@@ -142,6 +143,15 @@ TEST_F(CtlServerTest, junk_errors_and_a_stalled_client_hold_up_no_one)
    Client noCommand(path_);
    noCommand.send("{\"cmd\": \"ports\"}\n");
    EXPECT_FALSE(nlohmann::json::parse(noCommand.line())["ok"]);
+}
+
+TEST_F(CtlServerTest, a_client_that_closes_its_side_after_the_request_still_gets_the_reply)
+{
+   CtlServer server(path_, events_, handler_);
+   Client client(path_);
+   client.send("{\"command\": \"ports\"}\n");
+   client.shutdownWrite();
+   EXPECT_EQ(nlohmann::json::parse(client.line())["result"]["echo"], "ports");
 }
 
 TEST_F(CtlServerTest, log_follow_and_watch_stream_what_comes_after_the_recent_lines)

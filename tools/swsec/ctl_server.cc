@@ -213,7 +213,11 @@ void CtlServer::serve()
          if ((revents & (POLLIN | POLLHUP | POLLERR)) != 0 && !client.closeAfterWrite) {
             char buffer[16384];
             const ssize_t got = recv(client.fd, buffer, sizeof buffer, MSG_DONTWAIT);
-            if (got == 0 || (got < 0 && errno != EAGAIN && errno != EINTR)) {
+            if (got == 0) {
+               // The client is done sending: its replies still go out.
+               client.closeAfterWrite = true;
+               client.following = false;
+            } else if (got < 0 && errno != EAGAIN && errno != EINTR) {
                client.closeAfterWrite = true;
                client.out.clear();
             } else if (got > 0 && !client.following) {

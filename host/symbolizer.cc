@@ -9,7 +9,6 @@
 #include <cstdlib>
 #include <cstring>
 #include <fstream>
-#include <iterator>
 #include <memory>
 #include <optional>
 
@@ -49,15 +48,21 @@ std::string demangled(const char *name)
    return withoutParameters(text.get());
 }
 
+// Reads `count` records of T at `offset` of the file, or nothing when they
+// do not lie wholly within its `size` bytes.
 template <typename T>
-std::optional<T> readAt(const std::vector<unsigned char> &bytes, uint64_t offset)
+std::optional<std::vector<T>> readAt(std::ifstream &file, uint64_t size, uint64_t offset, uint64_t count)
 {
-   if (offset > bytes.size() || bytes.size() - offset < sizeof(T)) {
+   if (offset > size || count > (size - offset) / sizeof(T)) {
       return std::nullopt;
    }
-   T value;
-   std::memcpy(&value, bytes.data() + offset, sizeof(T));
-   return value;
+   std::vector<T> records(count);
+   file.seekg(static_cast<std::streamoff>(offset));
+   file.read(reinterpret_cast<char *>(records.data()), static_cast<std::streamsize>(count * sizeof(T)));
+   if (!file) {
+      return std::nullopt;
+   }
+   return records;
 }
 
 std::string hex(uint64_t value)
@@ -76,47 +81,46 @@ const Symbolizer::Image &Symbolizer::image(const std::string &path)
       return found->second;
    }
    Image &result = images_[path];
-   std::ifstream file(path, std::ios::binary);
-   std::vector<unsigned char> bytes((std::istreambuf_iterator<char>(file)), std::istreambuf_iterator<char>());
-   auto header = readAt<Elf64_Ehdr>(bytes, 0);
-   if (!header || std::memcmp(header->e_ident, ELFMAG, SELFMAG) != 0 ||
-       header->e_ident[EI_CLASS] != ELFCLASS64 || header->e_shentsize != sizeof(Elf64_Shdr)) {
+   // Only the headers and the symbol table are read, not the whole image: a
+   // program with the module linked in and debug information is tens of
+   // megabytes, and names are demangled only for the addresses described.
+   std::ifstream file(path, std::ios::binary | std::ios::ate);
+   if (!file) {
       return result;
    }
-   result.absolute = header->e_type == ET_EXEC;
-   std::vector<Elf64_Shdr> sections;
-   for (uint64_t i = 0; i < header->e_shnum; ++i) {
-      auto section = readAt<Elf64_Shdr>(bytes, header->e_shoff + i * sizeof(Elf64_Shdr));
-      if (!section) {
-         return result;
-      }
-      sections.push_back(*section);
+   const uint64_t size = static_cast<uint64_t>(file.tellg());
+   auto header = readAt<Elf64_Ehdr>(file, size, 0, 1);
+   if (!header || std::memcmp((*header)[0].e_ident, ELFMAG, SELFMAG) != 0 ||
+       (*header)[0].e_ident[EI_CLASS] != ELFCLASS64 || (*header)[0].e_shentsize != sizeof(Elf64_Shdr)) {
+      return result;
+   }
+   result.absolute = (*header)[0].e_type == ET_EXEC;
+   auto sections = readAt<Elf64_Shdr>(file, size, (*header)[0].e_shoff, (*header)[0].e_shnum);
+   if (!sections) {
+      return result;
    }
    // The full table when the image has one, else the dynamic one.
    for (uint32_t wanted : {uint32_t{SHT_SYMTAB}, uint32_t{SHT_DYNSYM}}) {
-      for (const auto &table : sections) {
-         if (table.sh_type != wanted || table.sh_link >= sections.size() ||
-             table.sh_offset > bytes.size() || bytes.size() - table.sh_offset < table.sh_size) {
+      for (const auto &table : *sections) {
+         if (table.sh_type != wanted || table.sh_link >= sections->size()) {
             continue;
          }
-         const Elf64_Shdr &strings = sections[table.sh_link];
-         if (strings.sh_offset > bytes.size() || bytes.size() - strings.sh_offset < strings.sh_size) {
+         const Elf64_Shdr &strings = (*sections)[table.sh_link];
+         auto symbols = readAt<Elf64_Sym>(file, size, table.sh_offset, table.sh_size / sizeof(Elf64_Sym));
+         auto names = readAt<char>(file, size, strings.sh_offset, strings.sh_size);
+         if (!symbols || !names) {
             continue;
          }
-         const char *names = reinterpret_cast<const char *>(bytes.data() + strings.sh_offset);
-         for (uint64_t at = 0; at + sizeof(Elf64_Sym) <= table.sh_size; at += sizeof(Elf64_Sym)) {
-            auto symbol = readAt<Elf64_Sym>(bytes, table.sh_offset + at);
-            if (!symbol || ELF64_ST_TYPE(symbol->st_info) != STT_FUNC || symbol->st_shndx == SHN_UNDEF ||
-                symbol->st_value == 0 || symbol->st_name >= strings.sh_size) {
+         for (const Elf64_Sym &symbol : *symbols) {
+            if (ELF64_ST_TYPE(symbol.st_info) != STT_FUNC || symbol.st_shndx == SHN_UNDEF ||
+                symbol.st_value == 0 || symbol.st_name >= names->size() ||
+                std::memchr(names->data() + symbol.st_name, 0, names->size() - symbol.st_name) == nullptr) {
                continue;
             }
-            const char *name = names + symbol->st_name;
-            if (std::memchr(name, 0, strings.sh_size - symbol->st_name) == nullptr) {
-               continue;
-            }
-            result.functions.push_back(Function{symbol->st_value, symbol->st_size, demangled(name)});
+            result.functions.push_back(Function{symbol.st_value, symbol.st_size, symbol.st_name});
          }
          if (!result.functions.empty()) {
+            result.names.assign(names->begin(), names->end());
             break;
          }
       }
@@ -145,7 +149,7 @@ std::string Symbolizer::describe(const void *address)
    if (next != found.functions.begin()) {
       const Function &function = *std::prev(next);
       if (key - function.start < std::max<uint64_t>(function.size, 1)) {
-         return function.name + "+" + hex(key - function.start);
+         return demangled(found.names.c_str() + function.nameOffset) + "+" + hex(key - function.start);
       }
    }
    std::string file = info.dli_fname;

@@ -26,11 +26,12 @@ private:
    struct Function {
       uint64_t start = 0;
       uint64_t size = 0;
-      std::string name;
+      uint64_t nameOffset = 0;   // into the image's string table
    };
    struct Image {
       bool absolute = false;   // an executable linked at fixed addresses
       std::vector<Function> functions;   // by start address
+      std::string names;   // the symbol table's strings; demangled only when asked for
    };
 
    const Image &image(const std::string &path);

@@ -42,10 +42,18 @@ struct SifraGenericAgentOps {
    orr_Status (*destroyFilter)(SifraGenericFilter *filter);
    /* Length of the agent's part of the saved state; filter lock held. */
    uint64_t (*getSavedStateLen)(SifraGenericFilter *filter);
-   /* Writes the agent's part into zeroed bytes; filter lock held. */
-   void (*saveState)(SifraGenericFilter *filter, void *agentPart);
-   /* Rebuilds from the agent's part; a failure fails the restore; filter lock held. */
-   orr_Status (*restoreState)(SifraGenericFilter *filter, const void *agentPart);
+   /*
+    * Writes the agent's part into `agentLen` zeroed bytes, the length that
+    * getSavedStateLen announced just before; writes no byte past them
+    * even if the agent's state grew meanwhile. Filter lock held.
+    */
+   void (*saveState)(SifraGenericFilter *filter, void *agentPart, uint64_t agentLen);
+   /*
+    * Rebuilds from the agent's part, `agentLen` bytes, reading none past
+    * them; a failure fails the restore. Filter lock held.
+    */
+   orr_Status (*restoreState)(SifraGenericFilter *filter, const void *agentPart,
+                              uint64_t agentLen);
    /* Frame lists, with the host's arguments unchanged. */
    orr_Status (*processPackets)(SifraGenericFilter *filter, orr_PktList *pktList,
                                 uint32_t direction);

@@ -57,6 +57,8 @@ inline constexpr std::array kFaultPoints = {
    std::string_view{"orr_SifraGetVnicIndex"},
    std::string_view{"orr_SifraPropertyRegister"},
    std::string_view{"orr_SifraRegisterFastPath"},
+   std::string_view{"orr_SifraRestoreSlowPathState"},
+   std::string_view{"orr_SifraRetrieveSlowPathState"},
    std::string_view{"orr_SifraSendFilterIoctlReply"},
    std::string_view{"orr_SifraSetMinPktMappedLen"},
    std::string_view{"orr_SifraSetSlowPath"},

@@ -147,6 +147,11 @@ Nexo &Host::nexo()
    return state_->nexo;
 }
 
+Migration &Host::migration()
+{
+   return state_->migration;
+}
+
 Host::State &Host::state()
 {
    return *state_;

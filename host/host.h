@@ -404,6 +404,69 @@ public:
    virtual SlowPaths &slowPaths() = 0;
 };
 
+// ---------------------------------------------------------------- migration
+
+// The scripted outcome of one slow path state request (retrieve or
+// restore) that the module makes. Refused: the request returns `refusal`
+// and no reply ever comes. Accepted: the request returns ORR_OK and one
+// reply is queued, carrying `replyStatus` (and, for a retrieve, `state`),
+// delivered when the test asks.
+struct SlowPathStateOutcome {
+   std::optional<orr_Status> refusal;
+   orr_Status replyStatus = ORR_OK;
+   std::vector<uint8_t> state;              // retrieve replies only
+};
+
+// A slow path state request as the module made it.
+struct SlowPathStateRequest {
+   enum class Kind : uint8_t { retrieve, restore };
+   Kind kind = Kind::retrieve;
+   FilterId filter = 0;
+   void *cookie = nullptr;
+   uint32_t timeoutMs = 0;
+   std::vector<uint8_t> state;              // restore requests: the bytes handed over
+   bool accepted = false;
+   bool replied = false;
+};
+
+// Save and restore of filters' state as the hypervisor drives a migration.
+// Every buffer handed to the module is an exact-size allocation between
+// guard bytes: a write outside it is a violation, a read outside it is
+// caught by AddressSanitizer.
+class Migration {
+public:
+   virtual ~Migration() = default;
+
+   // ---- the module's fast path operations, one call each
+   virtual void prefetch(FilterId id) = 0;
+   // getSavedStateLen; a null `length` cancels the save.
+   virtual orr_Status length(FilterId id, uint64_t *length) = 0;
+   // saveState into a buffer of `bufferSize` bytes; on ORR_OK `blob` holds
+   // the bytes the module said it wrote. A null `blob` passes a null
+   // buffer (a cancel).
+   virtual orr_Status save(FilterId id, uint64_t bufferSize, std::vector<uint8_t> *blob) = 0;
+   // restoreState with a copy of `blob`, kept alive until the restore's
+   // slow path reply has been delivered (or no request was accepted).
+   virtual orr_Status restore(FilterId id, std::span<const uint8_t> blob) = 0;
+
+   // ---- the source side whole: prefetch, the length asked again while
+   // it answers ORR_NOT_READY (delivering the replies due meanwhile, at
+   // most `maxPolls` times), then the save in a buffer of that length.
+   virtual orr_Status saveAsHypervisor(FilterId id, std::vector<uint8_t> *blob, uint32_t maxPolls = 100) = 0;
+
+   // ---- the slow path state requests: outcomes scripted per call, in
+   // order; a request with no outcome scripted is accepted and replied to
+   // with success (and, for a retrieve, no bytes).
+   virtual void scriptRetrieve(SlowPathStateOutcome outcome) = 0;
+   virtual void scriptRestore(SlowPathStateOutcome outcome) = 0;
+   virtual std::vector<SlowPathStateRequest> requests() const = 0;
+   // Replies queued and not yet delivered.
+   virtual size_t pendingReplies() const = 0;
+   // Delivers up to `count` queued replies in order, from a context that
+   // holds no module lock; returns how many.
+   virtual size_t deliverReplies(size_t count = SIZE_MAX) = 0;
+};
+
 // ---------------------------------------------------------------- portsets
 
 struct MessageListenerInfo {
@@ -573,6 +636,7 @@ public:
    Portsets &portsets();
    Frames &frames();
    Nexo &nexo();
+   Migration &migration();
 
    struct State;
    State &state();

@@ -197,6 +197,7 @@ void Loader::purgeLeftovers(std::string_view when)
    // Timers first: nothing may fire into an image about to close.
    auto add = [&](std::vector<std::string> more) { problems.insert(problems.end(), more.begin(), more.end()); };
    add(state_.timers.purge(when));
+   add(state_.migration.purge(when));
    add(state_.sifra.purge(when));
    add(state_.plex.purge(when));
    add(state_.portsets.purge(when));

@@ -44,6 +44,17 @@ public:
    orr_Status sendFilterIoctlReply(orr_SifraFilterHandle handle, uint32_t requestId, const void *data,
                                    uint64_t length);
 
+   // For the migration calls: the live filter's operations and module
+   // record; the filter a host handle names; the host regaining control
+   // after a module call (messages posted during it go out).
+   struct ModuleFilter {
+      const orr_SifraFastPathOps *ops = nullptr;
+      orr_SifraFilter record = nullptr;
+   };
+   std::optional<ModuleFilter> moduleFilter(FilterId id) const;
+   std::optional<FilterId> filterOfHandle(orr_SifraFilterHandle handle) const;
+   void moduleCallReturned() { afterModuleCall(); }
+
    // Reports and removes registrations still present.
    std::vector<std::string> purge(std::string_view when);
 

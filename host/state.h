@@ -10,6 +10,7 @@
 #include "host/loader.h"
 #include "host/locks.h"
 #include "host/log.h"
+#include "host/migration.h"
 #include "host/nexo.h"
 #include "host/plex.h"
 #include "host/portsets.h"
@@ -37,6 +38,7 @@ struct Host::State {
    PortsetService portsets{violations, faults, locks};
    FrameStore frames{violations, faults};
    SifraRegistry sifra{violations, faults, locks, portsets, frames, timers};
+   MigrationService migration{violations, faults, locks, sifra};
    HashTables hashTables{violations, faults, heaps};
    NexoRegistry nexo{violations, faults};
    Loader loader{*this};

@@ -109,3 +109,26 @@ typedef struct orr_SifraPropertyOps {
 ORR_API orr_Status orr_SifraPropertyRegister(orr_SifraPropertyHandle *handle, const char *name,
                                              const orr_SifraPropertyOps *ops);
 ORR_API void orr_SifraPropertyUnregister(orr_SifraPropertyHandle handle);
+
+/*
+ * A filter's slow path state across a migration. Both requests are
+ * asynchronous: ORR_OK means accepted, and exactly one call of `reply`
+ * follows, with the filter's module record and `cookie`, from a context
+ * that holds no module lock; any other status means no reply will come.
+ * The retrieve reply's bytes belong to the host and live only during the
+ * reply. The restore request reads `length` bytes at `state`, which the
+ * caller keeps valid until the reply.
+ */
+typedef void (*orr_SifraRetrieveSlowPathStateReply)(orr_SifraFilter filter, void *cookie,
+                                                    const void *state, uint64_t length,
+                                                    orr_Status status);
+typedef void (*orr_SifraRestoreSlowPathStateReply)(orr_SifraFilter filter, void *cookie,
+                                                   orr_Status status);
+
+ORR_API orr_Status orr_SifraRetrieveSlowPathState(orr_SifraFilterHandle handle,
+                                                  orr_SifraRetrieveSlowPathStateReply reply,
+                                                  void *cookie, uint32_t timeoutMs);
+ORR_API orr_Status orr_SifraRestoreSlowPathState(orr_SifraFilterHandle handle, const void *state,
+                                                 uint64_t length,
+                                                 orr_SifraRestoreSlowPathStateReply reply,
+                                                 void *cookie, uint32_t timeoutMs);

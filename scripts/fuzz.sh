@@ -8,11 +8,11 @@ cd "$(dirname "$0")/.."
 
 seconds=${1:-30}
 dir=build/fuzz
-targets=(dhcp_parse_fuzz frame_fuzz control_fuzz capture_fuzz)
+targets=(dhcp_parse_fuzz frame_fuzz control_fuzz capture_fuzz restore_state_fuzz)
 
 cmake -S . -B "$dir" -G Ninja -DSWSEC_WERROR=ON -DSWSEC_FUZZ=ON \
   -DCMAKE_CXX_COMPILER=clang++ -DCMAKE_C_COMPILER=clang -DCMAKE_BUILD_TYPE=RelWithDebInfo >/dev/null
-ninja -C "$dir" -j "$(nproc)" "${targets[@]}" seed_corpus swsec_module
+ninja -C "$dir" -j "$(nproc)" "${targets[@]}" seed_corpus state_seeds swsec_module
 
 # Seeds are regenerated each run; what a run discovers goes to a separate
 # corpus directory that later local runs keep using.
@@ -21,6 +21,7 @@ rm -rf "$dir/seeds"
 # Capture files are their own seeds, with the hand-made hostile ones.
 mkdir -p "$dir/seeds/capture_fuzz"
 cp tests/data/*.pcap fuzz/capture_seeds/*.pcap* "$dir/seeds/capture_fuzz/"
+"$dir/fuzz/state_seeds" "$dir/seeds" tests/data/manifest.json examples/enforcing.json >/dev/null
 
 export ASAN_OPTIONS=detect_leaks=1:abort_on_error=1
 export UBSAN_OPTIONS=print_stacktrace=1:halt_on_error=1

@@ -2,18 +2,18 @@
 #include "swsec/swsec_agent.h"
 
 #include "swsec/swsec_filter.h"
+#include "swsec/swsec_saved_state.h"
 
 /*
  * Slow path frames, slow path ioctls, configuration changes and attach
- * state changes are not the agent's business: those slots stay empty. The
- * saved-state slots stay empty until the port database can be saved.
+ * state changes are not the agent's business: those slots stay empty.
  */
 constinit const SifraGenericAgentOps sifraGenericFwFastPathOps = {
    .createFilter = SwSecCreateFilter,
    .destroyFilter = SwSecDestroyFilter,
-   .getSavedStateLen = nullptr,
-   .saveState = nullptr,
-   .restoreState = nullptr,
+   .getSavedStateLen = SwSecGetSavedStateLen,
+   .saveState = SwSecSaveState,
+   .restoreState = SwSecRestoreState,
    .processPackets = SwSecProcessPackets,
    .processSlowPathPackets = nullptr,
    .filterIoctlRequest = SwSecFilterIoctlRequest,

@@ -7,8 +7,7 @@
 #include "swsec/swsec_policy.h"
 #include "swsec/swsec_port_db.h"
 
-/* Checks the feature combination and the ARP rate limits; logs a refusal. */
-static bool SwSecConfigIsValid(const SwSecContext *ctx, const SwSecConfig *config)
+bool SwSecConfigIsValid(const SwSecContext *ctx, const SwSecConfig *config)
 {
    const uint32_t features = config->featuresEnabled;
    /*

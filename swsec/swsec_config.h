@@ -7,6 +7,12 @@
 #include "swsec/swsec_context.h"
 
 /*
+ * Checks a header's feature combination and ARP rate limits; logs a
+ * refusal. Reads nothing but the header.
+ */
+bool SwSecConfigIsValid(const SwSecContext *ctx, const SwSecConfig *config);
+
+/*
  * Validates and applies a configuration record (header and its numStatic
  * static entries, all readable). ORR_BAD_PARAM for an invalid combination
  * or range, or the port database's refusal; on any failure the active

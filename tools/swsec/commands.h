@@ -48,6 +48,8 @@ struct ReplayCommandOptions {
    std::string writePassed;
    std::string writeDropped;
    std::string modulePath;               // "" the module linked into swsec
+   std::string saveState;
+   std::string restoreState;
 };
 
 void addReplayOptions(CLI::App &command, ReplayCommandOptions &options);
@@ -80,5 +82,14 @@ struct CtlCommandOptions {
 
 void addCtlOptions(CLI::App &command, CtlCommandOptions &options);
 int runCtl(const CtlCommandOptions &options);
+
+struct StateShowOptions {
+   std::string file;
+   bool json = false;
+};
+
+// `swsec state show FILE`: the subcommand `state` with its one verb.
+void addStateOptions(CLI::App &command, StateShowOptions &options);
+int runStateShow(const StateShowOptions &options);
 
 }  // namespace swsec::tools

@@ -30,11 +30,15 @@ int main(int argc, char **argv)
    CLI::App *ctlCommand = app.add_subcommand("ctl", "ask a running swsec inline");
    swsec::tools::addCtlOptions(*ctlCommand, ctl);
 
+   swsec::tools::StateShowOptions stateShow;
+   CLI::App *stateCommand = app.add_subcommand("state", "saved port states");
+   swsec::tools::addStateOptions(*stateCommand, stateShow);
+
    // An unknown word where the subcommand goes is named as such, before
    // the parser calls it a missing subcommand.
    const auto known = app.get_subcommands([&](const CLI::App *sub) { return argc > 1 && sub->check_name(argv[1]); });
    if (argc > 1 && argv[1][0] != '-' && known.empty()) {
-      std::fprintf(stderr, "swsec: unknown subcommand \"%s\" (known: info, replay, inline, ctl)\n", argv[1]);
+      std::fprintf(stderr, "swsec: unknown subcommand \"%s\" (known: info, replay, inline, ctl, state)\n", argv[1]);
       return swsec::tools::kExitUsage;
    }
 
@@ -56,6 +60,9 @@ int main(int argc, char **argv)
       }
       if (ctlCommand->parsed()) {
          return swsec::tools::runCtl(ctl);
+      }
+      if (stateCommand->parsed()) {
+         return swsec::tools::runStateShow(stateShow);
       }
    } catch (const std::exception &e) {
       std::fprintf(stderr, "swsec: %s\n", e.what());

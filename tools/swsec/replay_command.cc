@@ -44,6 +44,9 @@ void addReplayOptions(CLI::App &command, ReplayCommandOptions &options)
    command.add_option("--write-passed", options.writePassed, "write the frames that passed to this pcap file");
    command.add_option("--write-dropped", options.writeDropped, "write the dropped frames to this pcap file");
    command.add_option("--module", options.modulePath, "open this module image instead of the module linked into swsec");
+   command.add_option("--save-state", options.saveState, "write the port's saved state at the end to this file");
+   command.add_option("--restore-state", options.restoreState,
+                      "restore the port from this saved state before the first frame");
 }
 
 namespace {
@@ -226,6 +229,8 @@ int runReplay(const ReplayCommandOptions &options)
             }
          };
       }
+      run.saveStatePath = options.saveState;
+      run.restoreStatePath = options.restoreState;
       ProgressLine progress;
       run.progress = [&progress](uint64_t frames, uint64_t bytesRead, uint64_t fileSize) {
          progress.update(frames, bytesRead, fileSize);

@@ -13,6 +13,8 @@
 #include "replay_routing.h"
 
 #include "host/host.h"
+#include "port_state.h"
+#include "state_file.h"
 
 #include <algorithm>
 #include <array>
@@ -115,11 +117,14 @@ private:
    void collectNotifications();
    void drainLog();
    void warnUnseenMacs(const FrameRouter &router);
+   void readRestoreState();
 
    const ReplayOptions &options_;
    ReplayResult &result_;
    host::Host host_;
    std::vector<Port> ports_;
+   std::vector<uint8_t> restoreState_;   // the state file's bytes, read before the port is made
+   std::vector<uint8_t> savedState_;     // the port's state at the end, to write
    std::optional<FrameRouter> router_;
    Route route_;
    std::optional<PcapWriter> passed_;
@@ -204,6 +209,13 @@ void Run::startPort(Port &port)
       throw std::runtime_error("port " + port.spec.name + " could not be made: " + orr_StatusToString(status));
    }
    port.made = true;
+   if (!options_.restoreStatePath.empty()) {
+      try {
+         common::restorePortState(host_, port.filter, restoreState_);
+      } catch (const common::StateRefused &e) {
+         throw ReplayError(options_.restoreStatePath + ": saved state refused: " + e.what());
+      }
+   }
    const std::optional<PortSecurityConfig> &config = port.spec.config ? port.spec.config : options_.config;
    if (config) {
       const size_t logBefore = host_.log().records().size();
@@ -527,11 +539,28 @@ void Run::warnUnseenMacs(const FrameRouter &router)
    }
 }
 
+void Run::readRestoreState()
+{
+   if (options_.restoreStatePath.empty()) {
+      return;
+   }
+   try {
+      restoreState_ = common::readStateFile(options_.restoreStatePath);
+   } catch (const common::StateFileError &e) {
+      throw ReplayError(e.what());
+   }
+   // An empty blob would be taken as "nothing to restore"; a state file has one.
+   if (restoreState_.empty()) {
+      throw ReplayError(options_.restoreStatePath + ": empty file, no saved state");
+   }
+}
+
 void Run::execute()
 {
    host_.setViolationHandler([this](const std::string &v) { result_.violations.push_back(v); });
    CaptureReader reader(options_.capturePath);
    openOutputs(reader);
+   readRestoreState();
    if (options_.frameRecords == FrameRecords::all) {
       result_.frames.reserve(std::min(reader.fileSize() / kSmallRecordBytes, kMaxReservedRecords));
    }
@@ -578,6 +607,11 @@ void Run::execute()
       readPortState(host_, port.id, result_.ports[port.id - 1]);
    }
    drainLog();
+   if (!options_.saveStatePath.empty()) {
+      // Saving only reads the port; it comes after the report's reads so
+      // that the report is the same with or without it.
+      savedState_ = common::savePortState(host_, ports_.front().filter);
+   }
 
    for (Port &port : ports_) {
       const host::DestroyResult destroyed = host_.sifra().destroyFilterAsHypervisor(port.filter);
@@ -598,6 +632,13 @@ void Run::execute()
    if (dropped_) {
       dropped_->commit();
    }
+   if (!options_.saveStatePath.empty()) {
+      try {
+         common::writeStateFile(options_.saveStatePath, savedState_);
+      } catch (const common::StateFileError &e) {
+         throw ReplayError(e.what());
+      }
+   }
 }
 
 }  // namespace
@@ -609,6 +650,10 @@ ReplayResult runReplay(const ReplayOptions &options)
    }
    if (!(options.untilSeconds >= 0 && options.untilSeconds <= kMaxUntilSeconds)) {
       throw ReplayError("--until must be a number of seconds from 0 to 10000000000");
+   }
+   // A saved state is one port's.
+   if ((!options.saveStatePath.empty() || !options.restoreStatePath.empty()) && options.ports.size() > 1) {
+      throw ReplayError("--save-state and --restore-state take a replay of one port");
    }
    ReplayResult result;
    Run run(options, result);

@@ -96,6 +96,11 @@ struct ReplayOptions {
    bool skipIdleTime = true;
    // Each verdict as it is made, in the order frames are handed over.
    std::function<void(const FrameEvent &)> sink;
+   // The port's saved state: restored before the first frame (before the
+   // configuration, which then applies on top), and saved at the end,
+   // after --until, written whole or not at all ("" none).
+   std::string restoreStatePath;
+   std::string saveStatePath;
    // Called now and then with frames done and bytes read of the file's size
    // (0: unknown), and while the clock runs on after the last frame.
    std::function<void(uint64_t frames, uint64_t bytesRead, uint64_t fileSize)> progress;
@@ -180,7 +185,8 @@ public:
    using std::runtime_error::runtime_error;
 };
 
-// Throws ReplayError on bad input (before any output file is left behind),
+// Throws ReplayError on bad input (before any output file is left behind;
+// a state file the module refuses is bad input, with the module's message),
 // ConfigRefused when a port refuses its configuration, std::runtime_error
 // when the module does not load.
 ReplayResult runReplay(const ReplayOptions &options);

@@ -1,0 +1,59 @@
+// The readers of a saved-state blob: the module's restore (header checks,
+// then the agent's part) into a fresh port, and the tool's decoder of the
+// same bytes. The input is the blob whole. A blob the module takes must
+// decode too: the decoder is never stricter than the module about shape.
+#include "loaded_module.h"
+#include "saved_state_format.h"
+
+#include <cstdint>
+#include <cstdio>
+#include <cstdlib>
+#include <span>
+
+namespace {
+
+constexpr uint32_t kRestoredPort = 9;
+
+}  // namespace
+
+extern "C" int LLVMFuzzerInitialize(int *, char ***)
+{
+   swsec::fuzz::LoadedModule &module = swsec::fuzz::loadedModule();
+   module.host.portsets().addPort("vs0", kRestoredPort);
+   return 0;
+}
+
+extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size)
+{
+   swsec::fuzz::LoadedModule &module = swsec::fuzz::loadedModule();
+   const std::span<const uint8_t> blob(data, size);
+
+   bool decoded = true;
+   try {
+      (void)swsec::common::decodeSavedState(blob);
+   } catch (const swsec::common::BadSavedState &) {
+      decoded = false;
+   }
+
+   // A destination as a migration makes it; policy 1 restores the agent's
+   // part even when the blob carries a slow path part.
+   swsec::host::FilterConfig config;
+   config.name = "restored.eth0";
+   config.failurePolicy = 1;
+   swsec::host::FilterId port = 0;
+   if (module.host.sifra().createFilter(swsec::fuzz::kAgent, kRestoredPort, config, &port) != ORR_OK) {
+      std::fprintf(stderr, "restore_state_fuzz: createFilter failed\n");
+      std::abort();
+   }
+   const orr_Status restored = module.host.migration().restore(port, blob);
+   if (restored == ORR_OK && size != 0 && !decoded) {
+      std::fprintf(stderr, "restore_state_fuzz: the module restored a blob the decoder refused\n");
+      std::abort();
+   }
+   if (module.host.sifra().destroyFilterAsHypervisor(port).status != ORR_OK) {
+      std::fprintf(stderr, "restore_state_fuzz: the restored port would not go\n");
+      std::abort();
+   }
+   module.forgetRecords();
+   return 0;
+}

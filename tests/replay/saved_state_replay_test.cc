@@ -1,0 +1,233 @@
+// A port carried across a cut in a capture: the first part replayed and
+// its state saved, the second part replayed into a port restored from that
+// state, against one replay of the whole capture. And the state files as
+// the tool writes, shows and refuses them.
+#include "replay_support.h"
+
+#include "replay_engine.h"
+#include "saved_state_format.h"
+#include "state_file.h"
+
+#include <gtest/gtest.h>
+#include <nlohmann/json.hpp>
+
+#include <fstream>
+#include <optional>
+#include <string>
+
+namespace swsec::testing {
+namespace {
+
+using nlohmann::json;
+
+const json &manifest()
+{
+   static const json doc = [] {
+      std::ifstream in(sourceDir() / "tests/data/manifest.json");
+      return json::parse(in);
+   }();
+   return doc;
+}
+
+// The cut after frame k (1-based) where no DHCP request waits for its
+// answer, with the longest pause before the next frame; none when every
+// gap has a request pending.
+std::optional<size_t> cutOf(const json &frames)
+{
+   std::optional<size_t> best;
+   double bestGap = -1;
+   bool pending = false;
+   for (size_t k = 1; k < frames.size(); ++k) {
+      const std::string kind = frames[k - 1]["kind"];
+      if (kind == "DHCPREQUEST") {
+         pending = true;
+      } else if (kind == "DHCPACK" || kind == "DHCPNAK") {
+         pending = false;
+      }
+      const double gap = frames[k]["time"].get<double>() - frames[k - 1]["time"].get<double>();
+      if (!pending && gap > bestGap) {
+         best = k;
+         bestGap = gap;
+      }
+   }
+   return best;
+}
+
+// "118 sec" -> 118; texts without a number (N/A) compare as they are.
+std::optional<long> seconds(const std::string &text)
+{
+   try {
+      return std::stol(text);
+   } catch (const std::exception &) {
+      return std::nullopt;
+   }
+}
+
+class SplitReplay : public ::testing::TestWithParam<std::string> {
+protected:
+   replay::ReplayResult run(const std::vector<CapturedFrame> &frames, const std::string &name, bool enforcing,
+                            double until, const std::string &save, const std::string &restore)
+   {
+      const auto capture = dir_.path() / (name + ".pcapng");
+      writePcapng(capture, frames);
+      replay::ReplayOptions options;
+      options.capturePath = capture.string();
+      if (enforcing) {
+         options.config = replay::loadConfigFile((sourceDir() / "examples/enforcing.json").string());
+      }
+      options.untilSeconds = until;
+      options.saveStatePath = save;
+      options.restoreStatePath = restore;
+      return replay::runReplay(options);
+   }
+
+   TempDir dir_;
+};
+
+TEST_P(SplitReplay, a_capture_cut_in_two_decides_as_one_run)
+{
+   size_t cutCaptures = 0;
+   for (const auto &entry : manifest()) {
+      const std::string file = entry["file"];
+      const json &meta = entry["frames"];
+      const auto cut = cutOf(meta);
+      if (!cut) {
+         continue;
+      }
+      ++cutCaptures;
+      SCOPED_TRACE(file + " cut after frame " + std::to_string(*cut));
+      auto frames = readCapture(sourceDir() / "tests/data" / file);
+      ASSERT_EQ(frames.size(), meta.size());
+      for (size_t i = 0; i < frames.size(); ++i) {
+         frames[i].direction = meta[i]["fromVm"].get<bool>() ? replay::kDirFromVm : replay::kDirToVm;
+      }
+      const std::vector<CapturedFrame> first(frames.begin(), frames.begin() + static_cast<std::ptrdiff_t>(*cut));
+      const std::vector<CapturedFrame> second(frames.begin() + static_cast<std::ptrdiff_t>(*cut), frames.end());
+      // The first part's clock runs on to half a second before the second
+      // part: the restored port is made that long before its first frame.
+      const double gap = static_cast<double>(second.front().timeNs - first.back().timeNs) / 1e9;
+      const bool enforcing = GetParam() == "enforcing";
+      const std::string state = (dir_.path() / "state").string();
+
+      const replay::ReplayResult whole = run(frames, "whole", enforcing, 0, "", "");
+      const replay::ReplayResult before = run(first, "first", enforcing, std::max(0.0, gap - 0.5), state, "");
+      const replay::ReplayResult after = run(second, "second", false, 0, "", state);
+      EXPECT_TRUE(before.violations.empty() && after.violations.empty());
+
+      ASSERT_EQ(after.frames.size(), whole.frames.size() - *cut);
+      for (size_t i = 0; i < after.frames.size(); ++i) {
+         EXPECT_EQ(after.frames[i].passed, whole.frames[*cut + i].passed) << "frame " << whole.frames[*cut + i].index;
+      }
+      ASSERT_EQ(after.ports.size(), 1u);
+      ASSERT_EQ(whole.ports.size(), 1u);
+      const replay::PortResult &afterPort = after.ports[0];
+      const replay::PortResult &wholePort = whole.ports[0];
+      EXPECT_EQ(afterPort.counters, wholePort.counters);
+      EXPECT_EQ(afterPort.featureSummary.has_value(), wholePort.featureSummary.has_value());
+      ASSERT_EQ(afterPort.portDb.size(), wholePort.portDb.size());
+      for (size_t i = 0; i < afterPort.portDb.size(); ++i) {
+         const replay::PortDbEntry &a = afterPort.portDb[i];
+         const replay::PortDbEntry &w = wholePort.portDb[i];
+         EXPECT_EQ(std::tie(a.vlan, a.mac, a.ip, a.method, a.chaddr, a.clientIdLen, a.serverIp, a.leaseTime),
+                   std::tie(w.vlan, w.mac, w.ip, w.method, w.chaddr, w.clientIdLen, w.serverIp, w.leaseTime));
+         // Whole seconds of two clocks that started at different fractions.
+         const auto left = seconds(a.timeRemaining);
+         const auto wholeLeft = seconds(w.timeRemaining);
+         if (left && wholeLeft) {
+            EXPECT_LE(std::abs(*left - *wholeLeft), 1) << a.timeRemaining << " vs " << w.timeRemaining;
+         } else {
+            EXPECT_EQ(a.timeRemaining, w.timeRemaining);
+         }
+      }
+   }
+   EXPECT_GE(cutCaptures, 10u);
+}
+
+INSTANTIATE_TEST_SUITE_P(Settings, SplitReplay, ::testing::Values("learning", "enforcing"),
+                         [](const auto &testInfo) { return testInfo.param; });
+
+// ---------------------------------------------------------------- the tool
+
+class StateTool : public ::testing::Test {
+protected:
+   std::string example() const { return (sourceDir() / "examples/example-dhcp-then-spoof.pcap").string(); }
+   std::string enforcing() const { return (sourceDir() / "examples/enforcing.json").string(); }
+   TempDir dir_;
+};
+
+TEST_F(StateTool, a_saved_state_is_shown_and_restored_by_the_tool)
+{
+   const std::string state = (dir_.path() / "port.state").string();
+   const ToolRun saved = runTool({"replay", "--vm-mac", "02:00:5e:c0:00:01", "--config", enforcing(), "--save-state",
+                                  state, example()});
+   ASSERT_EQ(saved.status, 0) << saved.err;
+
+   const ToolRun shown = runTool({"state", "show", "--json", state});
+   ASSERT_EQ(shown.status, 0) << shown.err;
+   const json doc = json::parse(shown.out);
+   EXPECT_EQ(doc["header"]["agentOffset"], 48);
+   EXPECT_EQ(doc["config"]["features"], "bpdu-filter,block-dhcp-server,ip-discovery,dai,ip-source-guard");
+   ASSERT_EQ(doc["bindings"].size(), 1u);
+   EXPECT_EQ(doc["bindings"][0]["method"], "DHCP Snooping");
+   EXPECT_EQ(doc["bindings"][0]["ip"], "192.0.2.101");
+   EXPECT_EQ(doc["counters"]["ipSrcGuardDropCnt"], 2);
+
+   const ToolRun text = runTool({"state", "show", state});
+   EXPECT_EQ(text.status, 0);
+   EXPECT_NE(text.out.find("192.0.2.101  DHCP Snooping"), std::string::npos) << text.out;
+
+   // The restored binding is reported like a learned one, before the first frame.
+   const ToolRun restored =
+      runTool({"replay", "--json", "--vm-mac", "02:00:5e:c0:00:01", "--restore-state", state, example()});
+   ASSERT_EQ(restored.status, 0) << restored.err;
+   const json result = json::parse(restored.out);
+   ASSERT_FALSE(result["ports"][0]["notifications"].empty());
+   EXPECT_EQ(result["ports"][0]["notifications"][0]["afterFrame"], 0);
+   EXPECT_EQ(result["ports"][0]["notifications"][0]["name"], "portdb.entry.added");
+   EXPECT_EQ(result["ports"][0]["notifications"][0]["ip"], "192.0.2.101");
+}
+
+TEST_F(StateTool, bad_state_files_are_refused_with_one_line_and_nothing_written)
+{
+   const std::string good = (dir_.path() / "good.state").string();
+   ASSERT_EQ(runTool({"replay", "--vm-mac", "02:00:5e:c0:00:01", "--save-state", good, example()}).status, 0);
+   const std::vector<uint8_t> blob = common::readStateFile(good);
+
+   struct Bad {
+      const char *name;
+      std::string bytes;
+      const char *replayMessage;
+      const char *showMessage;
+   };
+   std::string shortBlob(blob.begin(), blob.begin() + 47);
+   std::string foreign(blob.begin(), blob.end());
+   foreign[0] = 'x';
+   std::string truncated(blob.begin(), blob.end() - 1);
+   const Bad cases[] = {
+      {"empty", "", "empty file, no saved state", "too short for the 48-byte header (0 bytes)"},
+      {"short", shortBlob, "Buffer too short for header (47 bytes)", "too short for the 48-byte header (47 bytes)"},
+      {"foreign", foreign, "Bad state header magic (got 0x65766173676669", "not a saved state (magic"},
+      {"truncated", truncated, "Buffer not large enough", "runs past the"},
+   };
+   for (const Bad &bad : cases) {
+      SCOPED_TRACE(bad.name);
+      const auto path = dir_.path() / (std::string(bad.name) + ".state");
+      writeFile(path, bad.bytes);
+      const auto written = (dir_.path() / "passed.pcap").string();
+      const ToolRun replayed = runTool({"replay", "--vm-mac", "02:00:5e:c0:00:01", "--restore-state", path.string(),
+                                        "--write-passed", written, example()});
+      EXPECT_EQ(replayed.status, 2);
+      EXPECT_NE(replayed.err.find(bad.replayMessage), std::string::npos) << replayed.err;
+      EXPECT_EQ(std::count(replayed.err.begin(), replayed.err.end(), '\n'), 1) << replayed.err;
+      EXPECT_TRUE(replayed.out.empty());
+      EXPECT_FALSE(std::filesystem::exists(written));
+
+      const ToolRun shown = runTool({"state", "show", path.string()});
+      EXPECT_EQ(shown.status, 2);
+      EXPECT_NE(shown.err.find(bad.showMessage), std::string::npos) << shown.err;
+   }
+   EXPECT_EQ(runTool({"state", "show", (dir_.path() / "missing").string()}).status, 2);
+}
+
+}  // namespace
+}  // namespace swsec::testing

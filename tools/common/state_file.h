@@ -1,0 +1,32 @@
+// Saved-state files: a module's saved-state blob, stored as the bytes the
+// framework produced, read back bounded and written whole or not at all.
+#pragma once
+
+#include <cstdint>
+#include <span>
+#include <stdexcept>
+#include <string>
+#include <vector>
+
+namespace swsec::common {
+
+// A state file that cannot be read or written: `what()` names the file
+// and the problem on one line.
+class StateFileError : public std::runtime_error {
+public:
+   using std::runtime_error::runtime_error;
+};
+
+// The largest file taken as a saved state: the agent's part is under 10 KiB;
+// the rest leaves room for a slow path's part.
+inline constexpr uint64_t kMaxStateFileBytes = uint64_t{16} << 20;
+
+// Reads the whole file; refuses one larger than kMaxStateFileBytes before
+// reading it.
+std::vector<uint8_t> readStateFile(const std::string &path);
+
+// Writes `bytes` to a temporary file beside `path` (with the umask's
+// permissions) and renames it over `path`; on any failure no file is left.
+void writeStateFile(const std::string &path, std::span<const uint8_t> bytes);
+
+}  // namespace swsec::common

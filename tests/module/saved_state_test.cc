@@ -11,10 +11,12 @@
 
 #include <gmock/gmock.h>
 
+#include <atomic>
 #include <chrono>
 #include <cstring>
 #include <functional>
 #include <string>
+#include <thread>
 #include <vector>
 
 using namespace std::chrono_literals;
@@ -324,6 +326,45 @@ TEST_F(SavedStateTest, the_error_rate_limit_state_keeps_its_remaining_seconds)
    // The state ends at the first timer tick after its seconds ran out.
    host().clock().advance(std::chrono::seconds(left + 11));
    EXPECT_EQ(context(destination)->txRateLimitErr, 0);
+}
+
+// Saves taken while another thread's ARP floods raise the counters and move
+// the port in and out of the error-rate-limit state: each save reads what
+// the frames wrote, whole (run under ThreadSanitizer in CI).
+TEST_F(SavedStateTest, saves_read_counters_and_the_error_state_while_frames_change_them)
+{
+   const host::FilterId id = create();
+   ASSERT_EQ(writeConfig(id, {.features = SwSecFeatureIpDiscovery | SwSecFeatureDai,
+                              .trusted = 0,
+                              .arpRateLimit = 4,
+                              .errRateLimit = 1,
+                              .errRateLimitPeriod = 10}),
+             ORR_OK);
+   constexpr size_t kCounters = 48 + 48;   // the counters' offset in a blob
+   std::atomic<bool> done{false};
+   std::thread flood([&] {
+      for (int round = 0; round < 60; ++round) {
+         (void)send(id, kTx, std::vector<Bytes>(6, arpRequest(macOf(1), ipOf(5))));
+         (void)send(id, kRx, std::vector<Bytes>(6, arpRequest(macOf(2), ipOf(6))));
+      }
+      done = true;
+   });
+   std::array<uint64_t, 6> last{};
+   // Saves until the floods are over, and one more after.
+   for (bool over = false; !over;) {
+      over = done.load();
+      Bytes blob;
+      ASSERT_EQ(host().migration().saveAsHypervisor(id, &blob), ORR_OK);
+      ASSERT_EQ(blob.size(), 48u + 96u);
+      for (size_t i = 0; i < last.size(); ++i) {
+         const uint64_t value = getLe(blob, kCounters + 8 * i);
+         EXPECT_GE(value, last[i]) << "counter " << i << " went back";
+         last[i] = value;
+      }
+      EXPECT_LE(blob[48 + 32], 1) << "the error flag is 0 or 1";
+   }
+   flood.join();
+   EXPECT_GT(last[1] + last[2] + last[4], 0u) << "the floods were dropped and counted";
 }
 
 // ---------------------------------------------------------------- the source's phases

@@ -371,16 +371,6 @@ void LockRegistry::requireNoSpinlockHeld(const char *op)
    }
 }
 
-std::optional<std::string> LockRegistry::heldSpinlock()
-{
-   for (const Hold &hold : threadHolds()) {
-      if (isSpinning(hold.kind)) {
-         return std::string(hold.name);
-      }
-   }
-   return std::nullopt;
-}
-
 void LockRegistry::lockMutex(orr_Mutex *mutex)
 {
    if (mutex == nullptr) {

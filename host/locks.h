@@ -68,9 +68,6 @@ public:
    // Aborts when the calling thread holds a spinlock (or runs a timer
    // callback, which counts as one): `op` is about to sleep.
    void requireNoSpinlockHeld(const char *op);
-   // The name of a spinlock the calling thread holds, if any: a request
-   // that must be made with no module lock held checks it.
-   std::optional<std::string> heldSpinlock();
 
    // While alive, the calling thread runs a callback outside its caller's
    // context: it starts with no lock, may not sleep, and must have released

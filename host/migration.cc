@@ -196,8 +196,8 @@ std::optional<FilterId> MigrationService::beginRequest(const char *op, orr_Sifra
 {
    // The module releases its locks around a request: one held here would
    // be held across a call that may wait on another host's answer.
-   if (auto held = locks_.heldSpinlock()) {
-      violations_.report(std::string(op) + ": made while holding spinlock \"" + *held + "\"");
+   if (const std::string held = locks_.heldSpinlock(); !held.empty()) {
+      violations_.report(std::string(op) + ": made while holding spinlock \"" + held + "\"");
    }
    const auto id = sifra_.filterOfHandle(handle);
    if (!id) {

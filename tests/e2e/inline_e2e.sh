@@ -133,7 +133,7 @@ start_inline() {
     --config "$examples/enforcing.json" --port-config vm1="$work/vm1.json" "$@" >>"$work/inline.log" 2>&1 &
   inline_pid=$!
   pids+=("$inline_pid")
-  wait_for 10 sw_ctl ports || fail "swsec inline did not come up"
+  wait_for 30 sw_ctl ports || fail "swsec inline did not come up"
 }
 stop_inline() {
   kill -TERM "$inline_pid"
@@ -278,7 +278,7 @@ in_ns "$vm1" ping -c 1 -W 1 192.0.2.1 >/dev/null && fail "vm1 reaches the server
 step "killed outright: the VM stays cut off, and the next start replaces the pair left behind"
 ip netns exec "$sw" "$swsec" inline --bridge br0 --port vm1=vm1p --ctl "$ctl" >>"$work/inline.log" 2>&1 &
 inline_pid=$!; pids+=("$inline_pid")
-wait_for 10 sw_ctl ports || fail "swsec inline did not come up on a port left closed"
+wait_for 30 sw_ctl ports || fail "swsec inline did not come up on a port left closed"
 kill -KILL "$inline_pid"; wait "$inline_pid" 2>/dev/null
 [ -n "$(links | grep '^swsec')" ] || fail "a killed run took its pair away"
 in_ns "$vm1" ping -c 1 -W 1 192.0.2.1 >/dev/null && fail "vm1 reaches the server after a kill"
@@ -286,7 +286,7 @@ in_ns "$vm1" ping -c 1 -W 1 192.0.2.1 >/dev/null && fail "vm1 reaches the server
 step "fail open: restarted on a port left closed, stopped, vm1 back on the bridge"
 ip netns exec "$sw" "$swsec" inline --bridge br0 --port vm1=vm1p --ctl "$ctl" --fail open >>"$work/inline.log" 2>&1 &
 inline_pid=$!; pids+=("$inline_pid")
-wait_for 10 sw_ctl ports || fail "swsec inline did not come up again"
+wait_for 30 sw_ctl ports || fail "swsec inline did not come up again"
 grep -q "left by an earlier run" "$work/inline.log" || fail "the killed run's pair was not replaced"
 # The failed pings above left the server's address unresolved (FAILED),
 # which the kernel does not probe again for a while.

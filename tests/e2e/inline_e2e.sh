@@ -152,7 +152,8 @@ start_inline
 [ "$(master_of vm1p)" = "" ] || fail "vm1p is still in the bridge"
 [ "$(stat -c %a "$ctl")" = "600" ] || fail "the control socket is not mode 0600"
 sw_ctl ports --json | json "all(p['running'] for p in d)" | grep -qx True || fail "ports not running"
-sw_ctl watch --json >"$work/watch.log" 2>&1 &
+# Started directly, not through sw_ctl, so that $! is the client itself.
+"$swsec" ctl --ctl "$ctl" watch --json >"$work/watch.log" 2>&1 &
 pids+=("$!")
 
 # ---------------------------------------------------------------- leases

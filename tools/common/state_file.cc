@@ -88,7 +88,7 @@ std::vector<uint8_t> readStateFile(const std::string &path)
    return bytes;
 }
 
-void writeStateFile(const std::string &path, std::span<const uint8_t> bytes)
+void writeStateFile(const std::string &path, std::span<const uint8_t> bytes, mode_t mode)
 {
    std::vector<char> name(path.begin(), path.end());
    static constexpr char kSuffix[] = ".partial-XXXXXX";
@@ -98,10 +98,11 @@ void writeStateFile(const std::string &path, std::span<const uint8_t> bytes)
       throw StateFileError(path + ": cannot write: " + systemError());
    }
    TempFile file(fd, name.data());
-   // mkstemp makes the file owner-only; a state file gets what the umask allows.
+   // mkstemp makes the file owner-only; a state file gets what the caller
+   // asks for and the umask allows.
    const mode_t mask = ::umask(0);
    ::umask(mask);
-   if (::fchmod(fd, 0666 & ~mask) != 0) {
+   if (::fchmod(fd, mode & ~mask) != 0) {
       throw StateFileError(path + ": cannot write: " + systemError());
    }
    size_t done = 0;

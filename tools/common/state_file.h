@@ -2,6 +2,8 @@
 // framework produced, read back bounded and written whole or not at all.
 #pragma once
 
+#include <sys/types.h>
+
 #include <cstdint>
 #include <span>
 #include <stdexcept>
@@ -25,8 +27,8 @@ inline constexpr uint64_t kMaxStateFileBytes = uint64_t{16} << 20;
 // reading it.
 std::vector<uint8_t> readStateFile(const std::string &path);
 
-// Writes `bytes` to a temporary file beside `path` (with the umask's
-// permissions) and renames it over `path`; on any failure no file is left.
-void writeStateFile(const std::string &path, std::span<const uint8_t> bytes);
+// Writes `bytes` to a temporary file beside `path` (with `mode` less the
+// umask), syncs it and renames it over `path`; on any failure no file is left.
+void writeStateFile(const std::string &path, std::span<const uint8_t> bytes, mode_t mode = 0666);
 
 }  // namespace swsec::common

@@ -9,6 +9,7 @@
 #include <CLI/CLI.hpp>
 
 #include <signal.h>
+#include <sys/stat.h>
 
 #include <cerrno>
 #include <cstdio>
@@ -29,7 +30,7 @@ void addInlineOptions(CLI::App &command, InlineCommandOptions &options)
                                                   "open (back on the bridge, unguarded)")
       ->check(CLI::IsMember({"closed", "open"}));
    command.add_option("--ctl", options.ctl, "control socket path");
-   command.add_option("--state-dir", options.stateDir, "keep each port's state here across restarts (not available)");
+   command.add_option("--state-dir", options.stateDir, "keep each port's saved state (bindings) in DIR/NAME.state across restarts");
    command.add_option("--batch", options.batch, "most frames in one system call and one list")
       ->check(CLI::Range(1u, 1024u));
    command.add_option("--module", options.modulePath, "module image (default: the built one)");
@@ -53,13 +54,15 @@ std::pair<std::string, std::string> splitPair(const std::string &text, const cha
 
 live::InlineOptions parseOptions(const InlineCommandOptions &command)
 {
-   if (!command.stateDir.empty()) {
-      // Saving the module's port state needs the saved-state blob's reader
-      // and writer, which the tool does not have yet; refusing is better
-      // than pretending to keep the bindings.
-      throw UsageError("--state-dir: keeping port state across restarts is not implemented yet");
-   }
    live::InlineOptions options;
+   if (!command.stateDir.empty()) {
+      // Checked now: a directory found missing at stop would lose the state.
+      struct stat info {};
+      if (::stat(command.stateDir.c_str(), &info) != 0 || !S_ISDIR(info.st_mode)) {
+         throw UsageError("--state-dir " + command.stateDir + ": not a directory");
+      }
+      options.stateDir = command.stateDir;
+   }
    options.bridge = command.bridge;
    options.failMode = command.failMode == "open" ? live::FailMode::open : live::FailMode::closed;
    options.ctlPath = command.ctl;
@@ -70,6 +73,10 @@ live::InlineOptions parseOptions(const InlineCommandOptions &command)
    std::set<std::string> interfaces;
    for (const auto &text : command.ports) {
       auto [name, iface] = splitPair(text, "--port");
+      // The name becomes a file name in the state directory.
+      if (!command.stateDir.empty() && (name.find('/') != std::string::npos || name == "." || name == "..")) {
+         throw UsageError("--port " + text + ": with --state-dir a port name cannot be a path");
+      }
       if (!names.insert(name).second) {
          throw UsageError("--port " + text + ": port " + name + " named twice");
       }

@@ -2,8 +2,13 @@
 // the module's own management nodes and notifications.
 #include "live_inline.h"
 
+#include "port_state.h"
 #include "replay_error.h"
+#include "state_file.h"
 
+#include <sys/stat.h>
+
+#include <cerrno>
 #include <fstream>
 #include <sstream>
 
@@ -45,6 +50,52 @@ std::vector<uint8_t> InlineDaemon::recordFor(const PortSpec &spec)
                                                        : replay::loadConfigFile(spec.configPath));
 }
 
+std::string InlineDaemon::statePath(const PortSpec &spec) const
+{
+   return options_.stateDir + "/" + spec.name + ".state";
+}
+
+// A state file that is missing, damaged or refused costs the port its
+// bindings, not its start: the VMs renew their leases and are learned
+// again, while a port that did not start would leave its VM cut off.
+void InlineDaemon::restoreState(const PortSpec &spec, host::FilterId filter)
+{
+   const std::string path = statePath(spec);
+   struct stat info {};
+   if (::stat(path.c_str(), &info) != 0 && errno == ENOENT) {
+      events_.log("info", "inline", spec.name + ": no saved state in " + path + "; the port starts empty");
+      return;
+   }
+   try {
+      const std::vector<uint8_t> blob = common::readStateFile(path);
+      // An empty blob would be taken as "nothing to restore"; a state file has one.
+      if (blob.empty()) {
+         throw common::StateFileError(path + ": empty file, no saved state");
+      }
+      common::restorePortState(session_.host(), filter, blob);
+      events_.log("info", "inline", spec.name + ": state restored from " + path);
+   } catch (const common::StateFileError &e) {
+      events_.log("error", "inline", spec.name + ": " + e.what() + "; the port starts empty");
+   } catch (const common::StateRefused &e) {
+      events_.log("error", "inline", spec.name + ": " + path + ": saved state refused: " + e.what() +
+                                         "; the port starts empty");
+   }
+}
+
+// Only owner-readable: the bindings name the VMs' addresses and leases.
+void InlineDaemon::saveState(const PortSpec &spec, host::FilterId filter)
+{
+   const std::string path = statePath(spec);
+   try {
+      common::writeStateFile(path, common::savePortState(session_.host(), filter), 0600);
+      events_.log("info", "inline", spec.name + ": state saved to " + path);
+   } catch (const common::StateFileError &e) {
+      events_.log("error", "inline", spec.name + ": state not saved: " + e.what());
+   } catch (const common::StateRefused &e) {
+      events_.log("error", "inline", spec.name + ": state not saved: " + e.what());
+   }
+}
+
 void InlineDaemon::start()
 {
    std::lock_guard guard(mutex_);
@@ -60,7 +111,11 @@ void InlineDaemon::start()
       port.guarded = std::make_unique<GuardedPort>(
          session_, options, [this](const std::string &line) { events_.log("info", "inline", line); }, nullptr);
       try {
-         port.guarded->start(recordFor(port.spec));
+         std::function<void(host::FilterId)> restore;
+         if (!options_.stateDir.empty()) {
+            restore = [this, &port](host::FilterId filter) { restoreState(port.spec, filter); };
+         }
+         port.guarded->start(recordFor(port.spec), restore);
       } catch (...) {
          port.guarded.reset();
          for (auto it = ports_.rbegin(); it != ports_.rend(); ++it) {
@@ -121,7 +176,11 @@ std::vector<std::string> InlineDaemon::stop()
    std::lock_guard guard(mutex_);
    for (auto it = ports_.rbegin(); it != ports_.rend(); ++it) {
       if (it->guarded) {
-         it->guarded->stop();
+         std::function<void(host::FilterId)> save;
+         if (!options_.stateDir.empty()) {
+            save = [this, &spec = it->spec](host::FilterId filter) { saveState(spec, filter); };
+         }
+         it->guarded->stop(false, save);
       }
    }
    std::vector<std::string> violations = session_.finish();

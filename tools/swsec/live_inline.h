@@ -30,6 +30,7 @@ struct InlineOptions {
    std::string modulePath;
    const orr_ModuleInfo *linkedModule = nullptr;   // the program's own, unless modulePath names an image
    size_t batch = 64;
+   std::string stateDir;   // "" keeps no state; else DIR/<port name>.state across restarts
 };
 
 // The ports and the control handler over them; the daemon's main loop
@@ -66,6 +67,9 @@ private:
    nlohmann::json bindingsJson(const Port &port);
    nlohmann::json countersJson(Port &port);
    std::vector<uint8_t> recordFor(const PortSpec &spec);
+   std::string statePath(const PortSpec &spec) const;
+   void restoreState(const PortSpec &spec, host::FilterId filter);
+   void saveState(const PortSpec &spec, host::FilterId filter);
 
    InlineOptions options_;
    EventHub &events_;

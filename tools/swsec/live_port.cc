@@ -38,7 +38,7 @@ GuardedPort::~GuardedPort()
    stop();
 }
 
-void GuardedPort::start(const std::vector<uint8_t> &record)
+void GuardedPort::start(const std::vector<uint8_t> &record, const std::function<void(host::FilterId)> &restore)
 {
    const std::string &name = options_.name;
    // Everything that can be refused is checked before anything changes.
@@ -89,6 +89,9 @@ void GuardedPort::start(const std::vector<uint8_t> &record)
 
       filter_ = session_.addPort(options_.portID, name, "inline:" + name);
       portMade_ = true;
+      if (restore) {
+         restore(filter_);
+      }
       session_.configure(filter_, record);
 
       stopEvent_ = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
@@ -235,7 +238,7 @@ std::string GuardedPort::stopReason() const
    return stopReason_;
 }
 
-void GuardedPort::stop(bool restoreAsFound)
+void GuardedPort::stop(bool restoreAsFound, const std::function<void(host::FilterId)> &save)
 {
    std::lock_guard guard(mutex_);
    if (stopping_ || !running_.load(std::memory_order_acquire)) {
@@ -251,6 +254,9 @@ void GuardedPort::stop(bool restoreAsFound)
    }
    threads_.clear();
    running_.store(false, std::memory_order_release);
+   if (save && portMade_) {
+      save(filter_);
+   }
    takeDown(restoreAsFound);
 }
 

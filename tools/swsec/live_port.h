@@ -58,13 +58,16 @@ public:
    GuardedPort(const GuardedPort &) = delete;
    GuardedPort &operator=(const GuardedPort &) = delete;
 
-   // Sets the port up and configures it with `record`; throws (ports::Refused,
-   // NetdevError, std::system_error) after putting back what it changed.
-   void start(const std::vector<uint8_t> &record);
+   // Sets the port up and configures it with `record`; `restore`, if given,
+   // is called with the new module port before it is configured and before
+   // any frame flows. Throws (ports::Refused, NetdevError, std::system_error)
+   // after putting back what it changed.
+   void start(const std::vector<uint8_t> &record, const std::function<void(host::FilterId)> &restore = {});
    // Stops forwarding and takes the set-up down as the fail mode says, or,
    // for a start-up that fails after this port started, as it was found.
-   // Idempotent.
-   void stop(bool restoreAsFound = false);
+   // `save`, if given, is called with the module port once the last frame
+   // is through and before the port goes. Idempotent.
+   void stop(bool restoreAsFound = false, const std::function<void(host::FilterId)> &save = {});
    // Stopped by itself (its interface gone) and not yet taken down.
    bool vanished() const { return vanished_.load(std::memory_order_acquire); }
 

@@ -235,7 +235,7 @@ TEST_F(SavedStateTest, a_port_without_ip_discovery_saves_a_bare_fixed_part_and_e
    host().portsets().clearPosted();
    ASSERT_EQ(restore(destination, blob), ORR_OK);
    EXPECT_TRUE(snapshot(destination).vmis.empty());
-   EXPECT_EQ(context(destination)->config.featuresEnabled, SwSecFeatureBpduFilter);
+   EXPECT_EQ(+context(destination)->config.featuresEnabled, SwSecFeatureBpduFilter);
    EXPECT_THAT(postedNames(kOtherPort), ::testing::ElementsAre("portdb.entry.removed"));
    EXPECT_TRUE(logged("filter: Finished restoring state"));
 }

@@ -34,8 +34,8 @@ InlineDaemon::InlineDaemon(InlineOptions options, EventHub &events)
 {
    // Ports' timers fire on real time from here on, on the host's timer thread.
    session_.host().clock().useRealTime();
-   for (const PortSpec &spec : options_.ports) {
-      ports_.push_back(Port{spec, nullptr, spec.configPath});
+   for (const PortSpec &portSpec : options_.ports) {
+      ports_.push_back(Port{portSpec, nullptr, portSpec.configPath});
    }
 }
 
@@ -44,26 +44,26 @@ InlineDaemon::~InlineDaemon()
    (void)stop();
 }
 
-std::vector<uint8_t> InlineDaemon::recordFor(const PortSpec &spec)
+std::vector<uint8_t> InlineDaemon::recordFor(const PortSpec &portSpec)
 {
-   return replay::configRecord(spec.configPath.empty() ? replay::PortSecurityConfig{}
-                                                       : replay::loadConfigFile(spec.configPath));
+   return replay::configRecord(portSpec.configPath.empty() ? replay::PortSecurityConfig{}
+                                                       : replay::loadConfigFile(portSpec.configPath));
 }
 
-std::string InlineDaemon::statePath(const PortSpec &spec) const
+std::string InlineDaemon::statePath(const PortSpec &portSpec) const
 {
-   return options_.stateDir + "/" + spec.name + ".state";
+   return options_.stateDir + "/" + portSpec.name + ".state";
 }
 
 // A state file that is missing, damaged or refused costs the port its
 // bindings, not its start: the VMs renew their leases and are learned
 // again, while a port that did not start would leave its VM cut off.
-void InlineDaemon::restoreState(const PortSpec &spec, host::FilterId filter)
+void InlineDaemon::restoreState(const PortSpec &portSpec, host::FilterId filter)
 {
-   const std::string path = statePath(spec);
+   const std::string path = statePath(portSpec);
    struct stat info {};
    if (::stat(path.c_str(), &info) != 0 && errno == ENOENT) {
-      events_.log("info", "inline", spec.name + ": no saved state in " + path + "; the port starts empty");
+      events_.log("info", "inline", portSpec.name + ": no saved state in " + path + "; the port starts empty");
       return;
    }
    try {
@@ -73,26 +73,26 @@ void InlineDaemon::restoreState(const PortSpec &spec, host::FilterId filter)
          throw common::StateFileError(path + ": empty file, no saved state");
       }
       common::restorePortState(session_.host(), filter, blob);
-      events_.log("info", "inline", spec.name + ": state restored from " + path);
+      events_.log("info", "inline", portSpec.name + ": state restored from " + path);
    } catch (const common::StateFileError &e) {
-      events_.log("error", "inline", spec.name + ": " + e.what() + "; the port starts empty");
+      events_.log("error", "inline", portSpec.name + ": " + e.what() + "; the port starts empty");
    } catch (const common::StateRefused &e) {
-      events_.log("error", "inline", spec.name + ": " + path + ": saved state refused: " + e.what() +
+      events_.log("error", "inline", portSpec.name + ": " + path + ": saved state refused: " + e.what() +
                                          "; the port starts empty");
    }
 }
 
 // Only owner-readable: the bindings name the VMs' addresses and leases.
-void InlineDaemon::saveState(const PortSpec &spec, host::FilterId filter)
+void InlineDaemon::saveState(const PortSpec &portSpec, host::FilterId filter)
 {
-   const std::string path = statePath(spec);
+   const std::string path = statePath(portSpec);
    try {
       common::writeStateFile(path, common::savePortState(session_.host(), filter), 0600);
-      events_.log("info", "inline", spec.name + ": state saved to " + path);
+      events_.log("info", "inline", portSpec.name + ": state saved to " + path);
    } catch (const common::StateFileError &e) {
-      events_.log("error", "inline", spec.name + ": state not saved: " + e.what());
+      events_.log("error", "inline", portSpec.name + ": state not saved: " + e.what());
    } catch (const common::StateRefused &e) {
-      events_.log("error", "inline", spec.name + ": state not saved: " + e.what());
+      events_.log("error", "inline", portSpec.name + ": state not saved: " + e.what());
    }
 }
 
@@ -102,8 +102,8 @@ void InlineDaemon::start()
    uint32_t portID = 1;
    for (Port &port : ports_) {
       PortOptions options;
-      options.name = port.spec.name;
-      options.vmIface = port.spec.vmIface;
+      options.name = port.portSpec.name;
+      options.vmIface = port.portSpec.vmIface;
       options.bridge = options_.bridge;
       options.portID = portID++;
       options.failMode = options_.failMode;
@@ -113,9 +113,9 @@ void InlineDaemon::start()
       try {
          std::function<void(host::FilterId)> restore;
          if (!options_.stateDir.empty()) {
-            restore = [this, &port](host::FilterId filter) { restoreState(port.spec, filter); };
+            restore = [this, &port](host::FilterId filter) { restoreState(port.portSpec, filter); };
          }
-         port.guarded->start(recordFor(port.spec), restore);
+         port.guarded->start(recordFor(port.portSpec), restore);
       } catch (...) {
          port.guarded.reset();
          for (auto it = ports_.rbegin(); it != ports_.rend(); ++it) {
@@ -137,7 +137,7 @@ void InlineDaemon::pump()
    }
    for (const auto &note : session_.takeNotifications()) {
       const size_t index = note.portID - 1;
-      const std::string name = index < ports_.size() ? ports_[index].spec.name : std::to_string(note.portID);
+      const std::string name = index < ports_.size() ? ports_[index].portSpec.name : std::to_string(note.portID);
       const std::string event = note.name.substr(note.name.rfind('.') + 1);
       events_.notification({{"time", wallClock()}, {"port", name},          {"event", event},
                             {"vlan", note.vlan},   {"mac", note.mac},        {"ip", note.ip},
@@ -154,18 +154,18 @@ void InlineDaemon::reload()
 {
    std::lock_guard guard(mutex_);
    for (Port &port : ports_) {
-      if (!port.guarded || !port.guarded->running() || port.spec.configPath.empty()) {
+      if (!port.guarded || !port.guarded->running() || port.portSpec.configPath.empty()) {
          continue;
       }
-      const std::string &name = port.spec.name;
+      const std::string &name = port.portSpec.name;
       try {
-         session_.configure(port.guarded->filter(), recordFor(port.spec));
-         port.configSource = port.spec.configPath;
-         events_.log("info", "inline", name + ": configuration re-read from " + port.spec.configPath);
+         session_.configure(port.guarded->filter(), recordFor(port.portSpec));
+         port.configSource = port.portSpec.configPath;
+         events_.log("info", "inline", name + ": configuration re-read from " + port.portSpec.configPath);
       } catch (const replay::ReplayError &e) {
          events_.log("error", "inline", name + ": " + e.what() + "; the port keeps its configuration");
       } catch (const std::exception &e) {
-         events_.log("error", "inline", name + ": " + port.spec.configPath + ": " + e.what() +
+         events_.log("error", "inline", name + ": " + port.portSpec.configPath + ": " + e.what() +
                                             "; the port keeps its configuration");
       }
    }
@@ -178,7 +178,7 @@ std::vector<std::string> InlineDaemon::stop()
       if (it->guarded) {
          std::function<void(host::FilterId)> save;
          if (!options_.stateDir.empty()) {
-            save = [this, &spec = it->spec](host::FilterId filter) { saveState(spec, filter); };
+            save = [this, &portSpec = it->portSpec](host::FilterId filter) { saveState(portSpec, filter); };
          }
          it->guarded->stop(false, save);
       }
@@ -192,7 +192,7 @@ InlineDaemon::Port &InlineDaemon::port(const nlohmann::json &request)
 {
    const std::string name = requiredString(request, "port");
    for (Port &port : ports_) {
-      if (port.spec.name == name) {
+      if (port.portSpec.name == name) {
          return port;
       }
    }
@@ -204,7 +204,7 @@ InlineDaemon::Port &InlineDaemon::runningPort(const nlohmann::json &request)
    Port &found = port(request);
    if (!found.guarded || !found.guarded->running()) {
       const std::string reason = found.guarded ? found.guarded->stopReason() : std::string();
-      throw CtlError("port '" + found.spec.name + "' is stopped" + (reason.empty() ? "" : ": " + reason));
+      throw CtlError("port '" + found.portSpec.name + "' is stopped" + (reason.empty() ? "" : ": " + reason));
    }
    return found;
 }
@@ -213,8 +213,8 @@ nlohmann::json InlineDaemon::portsJson()
 {
    nlohmann::json list = nlohmann::json::array();
    for (Port &port : ports_) {
-      nlohmann::json entry = {{"name", port.spec.name},
-                              {"interface", port.spec.vmIface},
+      nlohmann::json entry = {{"name", port.portSpec.name},
+                              {"interface", port.portSpec.vmIface},
                               {"bridge", options_.bridge},
                               {"failMode", options_.failMode == FailMode::open ? "open" : "closed"},
                               {"config", port.configSource}};
@@ -237,7 +237,7 @@ nlohmann::json InlineDaemon::bindingsJson(const Port &port)
    nlohmann::json list = nlohmann::json::array();
    const ports::PortState state = session_.readState(port.guarded->options().portID);
    for (const auto &entry : state.portDb) {
-      list.push_back({{"port", port.spec.name},
+      list.push_back({{"port", port.portSpec.name},
                       {"vlan", entry.vlan},
                       {"mac", entry.mac},
                       {"ip", entry.ip},
@@ -253,7 +253,7 @@ nlohmann::json InlineDaemon::bindingsJson(const Port &port)
 
 nlohmann::json InlineDaemon::countersJson(Port &port)
 {
-   nlohmann::json entry = {{"port", port.spec.name}, {"running", port.guarded && port.guarded->running()}};
+   nlohmann::json entry = {{"port", port.portSpec.name}, {"running", port.guarded && port.guarded->running()}};
    if (!port.guarded) {
       return entry;
    }
@@ -308,9 +308,9 @@ nlohmann::json InlineDaemon::handle(const nlohmann::json &request)
       Port &port = runningPort(request);
       const ports::PortState state = session_.readState(port.guarded->options().portID);
       if (!state.featureSummary) {
-         return {{"port", port.spec.name}, {"fields", nullptr}, {"text", "(the port has no IP discovery)\n"}};
+         return {{"port", port.portSpec.name}, {"fields", nullptr}, {"text", "(the port has no IP discovery)\n"}};
       }
-      return {{"port", port.spec.name}, {"fields", *state.featureSummary}, {"text", state.featureSummaryText}};
+      return {{"port", port.portSpec.name}, {"fields", *state.featureSummary}, {"text", state.featureSummaryText}};
    }
    if (command == "counters") {
       nlohmann::json list = nlohmann::json::array();
@@ -339,7 +339,7 @@ nlohmann::json InlineDaemon::handle(const nlohmann::json &request)
       } catch (const ports::Refused &e) {
          throw CtlError(e.what());
       }
-      return {{"port", port.spec.name}, {"cleared", key ? "one" : "all"}};
+      return {{"port", port.portSpec.name}, {"cleared", key ? "one" : "all"}};
    }
    if (command == "config") {
       Port &port = runningPort(request);
@@ -353,8 +353,8 @@ nlohmann::json InlineDaemon::handle(const nlohmann::json &request)
          throw CtlError(origin + ": " + e.what());
       }
       port.configSource = origin;
-      events_.log("info", "inline", port.spec.name + ": configuration written from " + origin);
-      return {{"port", port.spec.name}, {"configured", true}};
+      events_.log("info", "inline", port.portSpec.name + ": configuration written from " + origin);
+      return {{"port", port.portSpec.name}, {"configured", true}};
    }
    throw CtlError("unknown command '" + command +
                   "' (ports, bindings, summary, counters, clear, config, watch, log, metrics)");

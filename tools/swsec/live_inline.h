@@ -56,7 +56,7 @@ public:
 
 private:
    struct Port {
-      PortSpec spec;
+      PortSpec portSpec;
       std::unique_ptr<GuardedPort> guarded;
       std::string configSource;   // where its configuration came from last
    };
@@ -66,10 +66,10 @@ private:
    nlohmann::json portsJson();
    nlohmann::json bindingsJson(const Port &port);
    nlohmann::json countersJson(Port &port);
-   std::vector<uint8_t> recordFor(const PortSpec &spec);
-   std::string statePath(const PortSpec &spec) const;
-   void restoreState(const PortSpec &spec, host::FilterId filter);
-   void saveState(const PortSpec &spec, host::FilterId filter);
+   std::vector<uint8_t> recordFor(const PortSpec &portSpec);
+   std::string statePath(const PortSpec &portSpec) const;
+   void restoreState(const PortSpec &portSpec, host::FilterId filter);
+   void saveState(const PortSpec &portSpec, host::FilterId filter);
 
    InlineOptions options_;
    EventHub &events_;

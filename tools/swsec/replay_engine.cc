@@ -69,7 +69,7 @@ std::string withoutNewline(std::string text)
 }
 
 struct Port {
-   PortSpec spec;
+   PortSpec portSpec;
    uint32_t id = 0;   // the switch port number, index + 1
    host::FilterId filter = 0;
    bool made = false;
@@ -163,12 +163,12 @@ Run::Run(const ReplayOptions &options, ReplayResult &result)
    std::vector<std::vector<Mac>> macs;
    for (size_t i = 0; i < specs.size(); ++i) {
       Port &port = ports_.emplace_back();
-      port.spec = specs[i];
+      port.portSpec = specs[i];
       port.id = static_cast<uint32_t>(i + 1);
-      macs.push_back(port.spec.macs);
+      macs.push_back(port.portSpec.macs);
       PortResult &shown = result_.ports.emplace_back();
-      shown.name = port.spec.name;
-      for (const Mac &mac : port.spec.macs) {
+      shown.name = port.portSpec.name;
+      for (const Mac &mac : port.portSpec.macs) {
          shown.macs.push_back(macText(mac.data()));
       }
    }
@@ -202,11 +202,11 @@ void Run::startPort(Port &port)
 {
    host_.portsets().addPort(kPortset, port.id);
    host::FilterConfig filterConfig;
-   filterConfig.name = port.spec.name;
-   filterConfig.vmUuid = "replay-" + port.spec.name;
+   filterConfig.name = port.portSpec.name;
+   filterConfig.vmUuid = "replay-" + port.portSpec.name;
    const orr_Status status = host_.sifra().createFilter(kAgent, port.id, filterConfig, &port.filter);
    if (status != ORR_OK) {
-      throw std::runtime_error("port " + port.spec.name + " could not be made: " + orr_StatusToString(status));
+      throw std::runtime_error("port " + port.portSpec.name + " could not be made: " + orr_StatusToString(status));
    }
    port.made = true;
    if (!options_.restoreStatePath.empty()) {
@@ -216,7 +216,7 @@ void Run::startPort(Port &port)
          throw ReplayError(options_.restoreStatePath + ": saved state refused: " + e.what());
       }
    }
-   const std::optional<PortSecurityConfig> &config = port.spec.config ? port.spec.config : options_.config;
+   const std::optional<PortSecurityConfig> &config = port.portSpec.config ? port.portSpec.config : options_.config;
    if (config) {
       const size_t logBefore = host_.log().records().size();
       const orr_Status written = host_.sifra().writeProperty(kSecurityProperty, port.filter, configRecord(*config));
@@ -232,7 +232,7 @@ void Run::startPort(Port &port)
          if (message.empty()) {
             message = orr_StatusToString(written);
          }
-         throw ConfigRefused((config->origin.empty() ? "port " + port.spec.name : config->origin) +
+         throw ConfigRefused((config->origin.empty() ? "port " + port.portSpec.name : config->origin) +
                              ": configuration refused: " + message);
       }
    }
@@ -528,11 +528,11 @@ void Run::handle(const CaptureFrame &frame)
 void Run::warnUnseenMacs(const FrameRouter &router)
 {
    for (size_t port = 0; port < ports_.size(); ++port) {
-      for (size_t i = 0; i < ports_[port].spec.macs.size(); ++i) {
+      for (size_t i = 0; i < ports_[port].portSpec.macs.size(); ++i) {
          if (!router.seen(port, i)) {
-            const std::string mac = macText(ports_[port].spec.macs[i].data());
+            const std::string mac = macText(ports_[port].portSpec.macs[i].data());
             warn(options_.capturePath + ": " + mac +
-                 (options_.ports.empty() ? " (--vm-mac)" : " (port " + ports_[port].spec.name + ")") +
+                 (options_.ports.empty() ? " (--vm-mac)" : " (port " + ports_[port].portSpec.name + ")") +
                  " is in no frame of the capture");
          }
       }
@@ -617,7 +617,7 @@ void Run::execute()
       const host::DestroyResult destroyed = host_.sifra().destroyFilterAsHypervisor(port.filter);
       port.made = false;
       if (destroyed.status != ORR_OK) {
-         result_.violations.push_back("port " + port.spec.name +
+         result_.violations.push_back("port " + port.portSpec.name +
                                       " could not be destroyed: " + orr_StatusToString(destroyed.status));
       }
    }

@@ -4,9 +4,9 @@
 // pieces whose sizes the input's first byte picks. Every length the file
 // states is bounded by what remains of it; the run's RSS limit catches an
 // allocation sized by a length that was not.
-#include "replay_capture.h"
-#include "replay_error.h"
-#include "replay_pcapng_scan.h"
+#include "replay/capture.h"
+#include "session/error.h"
+#include "replay/pcapng_scan.h"
 
 #include <sys/mman.h>
 #include <unistd.h>

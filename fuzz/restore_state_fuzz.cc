@@ -3,7 +3,7 @@
 // same bytes. The input is the blob whole. A blob the module takes must
 // decode too: the decoder is never stricter than the module about shape.
 #include "loaded_module.h"
-#include "saved_state_format.h"
+#include "session/saved_state_format.h"
 
 #include <cstdint>
 #include <cstdio>

@@ -3,8 +3,8 @@
 //
 //   state_seeds OUT_DIR MANIFEST ENFORCING_CONFIG
 // makes OUT_DIR/restore_state_fuzz/<capture>-<setting>.
-#include "replay_config.h"
-#include "replay_engine.h"
+#include "session/config_file.h"
+#include "replay/engine.h"
 
 #include <nlohmann/json.hpp>
 

@@ -2,9 +2,9 @@
 // the socket is the owner's alone, a second daemon is refused, junk and a
 // stalled client harm no one, streams follow events; the Prometheus text
 // has every series with escaped labels.
-#include "ctl_format.h"
-#include "ctl_server.h"
-#include "live_events.h"
+#include "cli/ctl_format.h"
+#include "live/ctl_server.h"
+#include "live/events.h"
 
 #include <gtest/gtest.h>
 

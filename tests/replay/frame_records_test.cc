@@ -3,9 +3,9 @@
 // the port decides or the clock does.
 #include "replay_support.h"
 
-#include "replay_config.h"
-#include "replay_engine.h"
-#include "replay_frame_batch.h"
+#include "replay/engine.h"
+#include "replay/frame_batch.h"
+#include "session/config_file.h"
 
 #include <gtest/gtest.h>
 

@@ -5,11 +5,11 @@
 // nothing written) or is replayed with a warning naming the frame.
 #include "replay_support.h"
 
-#include "replay_config.h"
-#include "replay_describe.h"
-#include "replay_engine.h"
-#include "replay_error.h"
-#include "replay_json.h"
+#include "replay/describe.h"
+#include "replay/engine.h"
+#include "replay/json.h"
+#include "session/config_file.h"
+#include "session/error.h"
 
 #include <gtest/gtest.h>
 #include <nlohmann/json.hpp>

@@ -6,7 +6,7 @@
 // host's checks), byte for byte but for addresses in log lines.
 #include "replay_support.h"
 
-#include "replay_capture.h"
+#include "replay/capture.h"
 
 #include <gtest/gtest.h>
 #include <nlohmann/json.hpp>

@@ -5,7 +5,7 @@
 // database and the drop counters.
 #include "replay_support.h"
 
-#include "replay_engine.h"
+#include "replay/engine.h"
 
 #include <gtest/gtest.h>
 #include <nlohmann/json.hpp>

@@ -5,11 +5,11 @@
 // as they are judged, one object a line, the folded module log.
 #include "replay_support.h"
 
-#include "replay_config.h"
-#include "replay_describe.h"
-#include "replay_engine.h"
-#include "replay_json.h"
-#include "replay_report.h"
+#include "replay/describe.h"
+#include "replay/engine.h"
+#include "replay/json.h"
+#include "replay/report.h"
+#include "session/config_file.h"
 
 #include <gtest/gtest.h>
 #include <nlohmann/json.hpp>

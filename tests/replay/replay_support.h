@@ -2,7 +2,7 @@
 // directories, and captures written with per-packet directions.
 #pragma once
 
-#include "replay_capture.h"
+#include "replay/capture.h"
 
 #include <cstdint>
 #include <filesystem>

@@ -3,10 +3,10 @@
 // line on stderr naming the file, exit status 2, no output file left).
 #include "replay_support.h"
 
-#include "replay_config.h"
-#include "replay_describe.h"
-#include "replay_engine.h"
-#include "replay_error.h"
+#include "replay/describe.h"
+#include "replay/engine.h"
+#include "session/config_file.h"
+#include "session/error.h"
 
 #include <gtest/gtest.h>
 #include <nlohmann/json.hpp>

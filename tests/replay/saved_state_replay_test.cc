@@ -4,9 +4,9 @@
 // the tool writes, shows and refuses them.
 #include "replay_support.h"
 
-#include "replay_engine.h"
-#include "saved_state_format.h"
-#include "state_file.h"
+#include "replay/engine.h"
+#include "session/saved_state_format.h"
+#include "session/state_file.h"
 
 #include <gtest/gtest.h>
 #include <nlohmann/json.hpp>

@@ -1,0 +1,228 @@
+// swsec ctl: one request to a running swsec inline, its reply shown for a
+// person (default) or as JSON (--json, the reply's "result" as the daemon
+// sent it). "metrics" shows the counters in the Prometheus text format.
+#include "cli/commands.h"
+
+#include "cli/ctl_format.h"
+
+#include <CLI/CLI.hpp>
+#include <nlohmann/json.hpp>
+
+#include <poll.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstdio>
+#include <cstring>
+#include <fstream>
+#include <iostream>
+#include <sstream>
+
+namespace swsec::tools {
+
+void addCtlOptions(CLI::App &command, CtlCommandOptions &options)
+{
+   command.add_option("--ctl", options.ctl, "control socket path");
+   command.add_flag("--json", options.json, "print the reply as JSON (streams: one object a line)");
+   command.add_flag("-f,--follow", options.follow, "log: go on showing lines as they come");
+   command.add_option("COMMAND", options.words,
+                      "ports | bindings [PORT] | summary PORT | counters | metrics | clear PORT [VLAN MAC IP] | "
+                      "config PORT FILE | watch | log [-f]")
+      ->required();
+}
+
+namespace {
+
+constexpr int kReplyTimeoutMs = 15'000;
+
+class UsageError : public std::runtime_error {
+public:
+   using std::runtime_error::runtime_error;
+};
+
+nlohmann::json buildRequest(const CtlCommandOptions &options)
+{
+   const auto &words = options.words;
+   const std::string &command = words[0];
+   auto expect = [&](size_t least, size_t most) {
+      if (words.size() - 1 < least || words.size() - 1 > most) {
+         throw UsageError(command + ": wrong number of arguments");
+      }
+   };
+   nlohmann::json request = {{"command", command}};
+   if (command == "ports" || command == "counters" || command == "watch") {
+      expect(0, 0);
+   } else if (command == "metrics") {
+      expect(0, 0);
+      request["command"] = "counters";
+   } else if (command == "log") {
+      expect(0, 0);
+      request["follow"] = options.follow;
+   } else if (command == "bindings") {
+      expect(0, 1);
+      if (words.size() == 2) {
+         request["port"] = words[1];
+      }
+   } else if (command == "summary") {
+      expect(1, 1);
+      request["port"] = words[1];
+   } else if (command == "clear") {
+      if (words.size() != 2 && words.size() != 5) {
+         throw UsageError("clear: PORT, or PORT VLAN MAC IP");
+      }
+      request["port"] = words[1];
+      if (words.size() == 5) {
+         request["key"] = {words[2], words[3], words[4]};
+      }
+   } else if (command == "config") {
+      expect(2, 2);
+      request["port"] = words[1];
+      // Read here, with the caller's own rights; the daemon gets the text.
+      std::ifstream file(words[2], std::ios::binary);
+      if (!file) {
+         throw UsageError(words[2] + ": " + std::strerror(errno));
+      }
+      std::ostringstream text;
+      text << file.rdbuf();
+      request["text"] = text.str();
+      request["origin"] = words[2];
+   } else {
+      throw UsageError("unknown command '" + command + "'");
+   }
+   return request;
+}
+
+int connectTo(const std::string &path)
+{
+   sockaddr_un address{};
+   address.sun_family = AF_UNIX;
+   if (path.size() >= sizeof address.sun_path) {
+      throw UsageError(path + ": socket path too long");
+   }
+   std::memcpy(address.sun_path, path.c_str(), path.size() + 1);
+   const int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+   if (fd < 0 || connect(fd, reinterpret_cast<const sockaddr *>(&address), sizeof address) != 0) {
+      const std::string error = std::strerror(errno);
+      if (fd >= 0) {
+         close(fd);
+      }
+      throw std::runtime_error(path + ": " + error + " (is swsec inline running?)");
+   }
+   return fd;
+}
+
+// Lines from the socket; `timeoutMs` < 0 waits for ever (streams).
+class LineReader {
+public:
+   explicit LineReader(int fd) : fd_(fd) {}
+   bool next(std::string &line, int timeoutMs)
+   {
+      for (;;) {
+         const size_t newline = buffer_.find('\n');
+         if (newline != std::string::npos) {
+            line = buffer_.substr(0, newline);
+            buffer_.erase(0, newline + 1);
+            return true;
+         }
+         pollfd fd{fd_, POLLIN, 0};
+         const int ready = poll(&fd, 1, timeoutMs);
+         if (ready == 0) {
+            throw std::runtime_error("no reply from swsec inline");
+         }
+         if (ready < 0) {
+            if (errno == EINTR) {
+               continue;
+            }
+            throw std::runtime_error(std::string("poll: ") + std::strerror(errno));
+         }
+         char chunk[16384];
+         const ssize_t got = recv(fd_, chunk, sizeof chunk, 0);
+         if (got <= 0) {
+            return false;
+         }
+         buffer_.append(chunk, static_cast<size_t>(got));
+      }
+   }
+
+private:
+   int fd_;
+   std::string buffer_;
+};
+
+}  // namespace
+
+int runCtl(const CtlCommandOptions &options)
+{
+   nlohmann::json request;
+   try {
+      request = buildRequest(options);
+   } catch (const UsageError &e) {
+      std::fprintf(stderr, "swsec ctl: %s\n", e.what());
+      return kExitUsage;
+   }
+   const std::string &command = options.words[0];
+   int fd = -1;
+   try {
+      fd = connectTo(options.ctl);
+   } catch (const std::exception &e) {
+      std::fprintf(stderr, "swsec ctl: %s\n", e.what());
+      return kExitFailure;
+   }
+   const std::string line = request.dump() + "\n";
+   if (send(fd, line.data(), line.size(), MSG_NOSIGNAL) != static_cast<ssize_t>(line.size())) {
+      std::fprintf(stderr, "swsec ctl: %s: %s\n", options.ctl.c_str(), std::strerror(errno));
+      close(fd);
+      return kExitFailure;
+   }
+   LineReader reader(fd);
+   std::string text;
+   int status = kExitOk;
+   try {
+      if (!reader.next(text, kReplyTimeoutMs)) {
+         throw std::runtime_error("swsec inline closed the connection");
+      }
+      const auto reply = nlohmann::json::parse(text, nullptr, false);
+      if (reply.is_discarded() || !reply.is_object()) {
+         throw std::runtime_error("unreadable reply from swsec inline");
+      }
+      if (!reply.value("ok", false)) {
+         std::fprintf(stderr, "swsec ctl: %s: %s\n", command.c_str(), reply.value("error", "failed").c_str());
+         close(fd);
+         return kExitFailure;
+      }
+      const nlohmann::json &result = reply["result"];
+      if (command == "metrics") {
+         std::cout << ctl::metricsText(result);
+      } else if (options.json) {
+         std::cout << (reply.value("streaming", false) ? "" : result.dump(1) + "\n");
+         if (reply.value("streaming", false)) {
+            for (const auto &entry : result) {
+               std::cout << entry.dump() << "\n";
+            }
+         }
+      } else {
+         std::cout << ctl::humanText(command, result);
+      }
+      std::cout.flush();
+      if (reply.value("streaming", false)) {
+         while (reader.next(text, -1)) {
+            const auto event = nlohmann::json::parse(text, nullptr, false);
+            if (event.is_discarded()) {
+               continue;
+            }
+            std::cout << (options.json ? event.dump() + "\n" : ctl::eventText(command, event)) << std::flush;
+         }
+         std::fprintf(stderr, "swsec ctl: swsec inline closed the connection\n");
+         status = kExitFailure;
+      }
+   } catch (const std::exception &e) {
+      std::fprintf(stderr, "swsec ctl: %s\n", e.what());
+      status = kExitFailure;
+   }
+   close(fd);
+   return status;
+}
+
+}  // namespace swsec::tools

@@ -1,0 +1,210 @@
+// Text forms of the control replies.
+#include "cli/ctl_format.h"
+
+#include <cstdio>
+#include <ctime>
+#include <sstream>
+
+namespace swsec::ctl {
+
+namespace {
+
+// A member object, or an empty one: iterated in place, never copied.
+const nlohmann::json &member(const nlohmann::json &object, const char *key)
+{
+   static const nlohmann::json empty = nlohmann::json::object();
+   return object.is_object() && object.contains(key) && object[key].is_object() ? object[key] : empty;
+}
+
+std::string field(const nlohmann::json &object, const char *key)
+{
+   if (!object.is_object() || !object.contains(key)) {
+      return "-";
+   }
+   const auto &value = object[key];
+   return value.is_string() ? value.get<std::string>() : value.dump();
+}
+
+std::string timeText(const nlohmann::json &object)
+{
+   const double seconds = object.value("time", 0.0);
+   const std::time_t whole = static_cast<std::time_t>(seconds);
+   std::tm local{};
+   localtime_r(&whole, &local);
+   char text[32];
+   std::strftime(text, sizeof text, "%H:%M:%S", &local);
+   char fraction[8];
+   std::snprintf(fraction, sizeof fraction, ".%03d", static_cast<int>((seconds - static_cast<double>(whole)) * 1000));
+   return std::string(text) + fraction;
+}
+
+// Columns as wide as their widest cell.
+std::string table(const std::vector<std::vector<std::string>> &rows)
+{
+   std::vector<size_t> widths;
+   for (const auto &row : rows) {
+      widths.resize(std::max(widths.size(), row.size()));
+      for (size_t i = 0; i < row.size(); ++i) {
+         widths[i] = std::max(widths[i], row[i].size());
+      }
+   }
+   std::string text;
+   for (const auto &row : rows) {
+      std::string line;
+      for (size_t i = 0; i < row.size(); ++i) {
+         line += row[i];
+         if (i + 1 < row.size()) {
+            line += std::string(widths[i] - row[i].size() + 2, ' ');
+         }
+      }
+      text += line + "\n";
+   }
+   return text;
+}
+
+// A label value with backslash, quote and newline escaped as the format says.
+std::string labelValue(const std::string &value)
+{
+   std::string escaped;
+   for (char c : value) {
+      if (c == '\\' || c == '"') {
+         escaped += '\\';
+         escaped += c;
+      } else if (c == '\n') {
+         escaped += "\\n";
+      } else {
+         escaped += c;
+      }
+   }
+   return escaped;
+}
+
+}  // namespace
+
+std::string humanText(const std::string &command, const nlohmann::json &result)
+{
+   if (command == "ports") {
+      std::vector<std::vector<std::string>> rows{{"PORT", "INTERFACE", "BRIDGE", "ID", "STATE", "FAIL", "CONFIG"}};
+      for (const auto &port : result) {
+         std::string state = port.value("running", false) ? "guarding" : "stopped";
+         const std::string reason = port.value("stopReason", "");
+         if (!reason.empty()) {
+            state += " (" + reason + ")";
+         }
+         const std::string config = port.value("config", "");
+         rows.push_back({field(port, "name"), field(port, "interface"), field(port, "bridge"), field(port, "portId"),
+                         state, field(port, "failMode"), config.empty() ? "(defaults)" : config});
+      }
+      return table(rows);
+   }
+   if (command == "bindings") {
+      std::vector<std::vector<std::string>> rows{
+         {"PORT", "VLAN", "MAC", "IP", "METHOD", "REMAINING", "SERVER", "LEASE"}};
+      for (const auto &entry : result) {
+         rows.push_back({field(entry, "port"), field(entry, "vlan"), field(entry, "mac"), field(entry, "ip"),
+                         field(entry, "method"), field(entry, "timeRemaining"), field(entry, "serverIp"),
+                         field(entry, "leaseTime")});
+      }
+      return table(rows) + std::to_string(result.size()) + " binding(s)\n";
+   }
+   if (command == "summary") {
+      return result.value("text", "");
+   }
+   if (command == "counters") {
+      std::vector<std::vector<std::string>> rows{
+         {"PORT", "TO-VM PASSED", "TO-VM DROPPED", "FROM-VM PASSED", "FROM-VM DROPPED", "LOST", "DROP COUNTERS"}};
+      for (const auto &port : result) {
+         const nlohmann::json &frames = member(port, "frames");
+         std::string drops;
+         for (const auto &[name, count] : member(port, "drops").items()) {
+            drops += (drops.empty() ? "" : " ") + name + "=" + count.dump();
+         }
+         rows.push_back({field(port, "port"), field(member(frames, "to-vm"), "passed"),
+                         field(member(frames, "to-vm"), "dropped"),
+                         field(member(frames, "from-vm"), "passed"),
+                         field(member(frames, "from-vm"), "dropped"),
+                         std::to_string(port.value("overruns", 0ULL) + port.value("truncated", 0ULL) +
+                                        port.value("sendErrors", 0ULL)),
+                         drops.empty() ? "-" : drops});
+      }
+      return table(rows);
+   }
+   if (command == "clear") {
+      return "cleared " + std::string(result.value("cleared", "") == "one" ? "the binding" : "every binding") +
+             " of " + field(result, "port") + "\n";
+   }
+   if (command == "config") {
+      return field(result, "port") + " configured\n";
+   }
+   if (command == "log" || command == "watch") {
+      std::string text;
+      for (const auto &entry : result) {
+         text += eventText(command, entry);
+      }
+      return text;
+   }
+   return result.dump(1) + "\n";
+}
+
+std::string eventText(const std::string &command, const nlohmann::json &event)
+{
+   if (command == "watch") {
+      return timeText(event) + " " + field(event, "port") + " " + field(event, "event") + " vlan " +
+             field(event, "vlan") + " " + field(event, "mac") + " " + field(event, "ip") +
+             (event.value("authoritative", false) ? " (authoritative)" : "") + "\n";
+   }
+   return timeText(event) + " " + field(event, "severity") + " " + field(event, "source") + ": " +
+          field(event, "text") + "\n";
+}
+
+std::string metricsText(const nlohmann::json &counters)
+{
+   std::ostringstream out;
+   out << "# HELP swsec_port_up 1 while the port is guarded.\n# TYPE swsec_port_up gauge\n";
+   for (const auto &port : counters) {
+      out << "swsec_port_up{port=\"" << labelValue(field(port, "port")) << "\"} "
+          << (port.value("running", false) ? 1 : 0) << "\n";
+   }
+   out << "# HELP swsec_frames_total Frames the port judged, by direction and verdict.\n"
+          "# TYPE swsec_frames_total counter\n";
+   for (const auto &port : counters) {
+      const std::string name = labelValue(field(port, "port"));
+      for (const auto &[direction, verdicts] : member(port, "frames").items()) {
+         for (const char *verdict : {"passed", "dropped"}) {
+            out << "swsec_frames_total{port=\"" << name << "\",direction=\"" << direction << "\",verdict=\""
+                << verdict << "\"} " << verdicts.value(verdict, 0ULL) << "\n";
+         }
+      }
+   }
+   out << "# HELP swsec_module_drops_total The module's drop counters.\n# TYPE swsec_module_drops_total counter\n";
+   for (const auto &port : counters) {
+      const std::string name = labelValue(field(port, "port"));
+      for (const auto &[counter, count] : member(port, "drops").items()) {
+         out << "swsec_module_drops_total{port=\"" << name << "\",counter=\"" << labelValue(counter) << "\"} "
+             << count.get<uint64_t>() << "\n";
+      }
+   }
+   out << "# HELP swsec_bindings Port database entries by discovery method.\n# TYPE swsec_bindings gauge\n";
+   for (const auto &port : counters) {
+      const std::string name = labelValue(field(port, "port"));
+      for (const auto &[method, count] : member(port, "bindings").items()) {
+         out << "swsec_bindings{port=\"" << name << "\",method=\"" << labelValue(method) << "\"} "
+             << count.get<uint64_t>() << "\n";
+      }
+   }
+   out << "# HELP swsec_frames_lost_total Frames lost outside the module: the reader fell behind (overrun), too long "
+          "for a slot (truncated), refused on send.\n"
+          "# TYPE swsec_frames_lost_total counter\n";
+   for (const auto &port : counters) {
+      const std::string name = labelValue(field(port, "port"));
+      out << "swsec_frames_lost_total{port=\"" << name << "\",reason=\"truncated\"} " << port.value("truncated", 0ULL)
+          << "\n";
+      out << "swsec_frames_lost_total{port=\"" << name << "\",reason=\"overrun\"} " << port.value("overruns", 0ULL)
+          << "\n";
+      out << "swsec_frames_lost_total{port=\"" << name << "\",reason=\"send-error\"} "
+          << port.value("sendErrors", 0ULL) << "\n";
+   }
+   return out.str();
+}
+
+}  // namespace swsec::ctl

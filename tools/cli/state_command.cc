@@ -1,0 +1,43 @@
+// swsec state show: a saved-state file decoded for a person (or, with
+// --json, a program) without loading a port.
+#include "cli/commands.h"
+
+#include "session/saved_state_format.h"
+#include "session/state_file.h"
+
+#include <CLI/CLI.hpp>
+
+#include <cstdio>
+#include <iostream>
+
+namespace swsec::tools {
+
+void addStateOptions(CLI::App &command, StateShowOptions &options)
+{
+   command.require_subcommand(1);
+   CLI::App *show = command.add_subcommand("show", "decode a saved state: header, configuration, counters, bindings");
+   show->add_option("FILE", options.file, "saved-state file (swsec replay --save-state)")->required();
+   show->add_flag("--json", options.json, "print one JSON document");
+}
+
+int runStateShow(const StateShowOptions &options)
+{
+   try {
+      const std::vector<uint8_t> blob = common::readStateFile(options.file);
+      const common::SavedPortState state = common::decodeSavedState(blob);
+      if (options.json) {
+         std::cout << common::savedStateJson(state).dump(1) << "\n";
+      } else {
+         common::printSavedState(std::cout, state);
+      }
+      return kExitOk;
+   } catch (const common::StateFileError &e) {
+      std::fprintf(stderr, "swsec state: %s\n", e.what());
+      return kExitUsage;
+   } catch (const common::BadSavedState &e) {
+      std::fprintf(stderr, "swsec state: %s: %s\n", options.file.c_str(), e.what());
+      return kExitUsage;
+   }
+}
+
+}  // namespace swsec::tools

@@ -1,0 +1,195 @@
+// Frame descriptions for the verbose report. Every read is checked against
+// the frame's length; a frame too short for a layer says so.
+#include "replay/describe.h"
+
+#include <algorithm>
+#include <array>
+#include <cstdio>
+
+namespace swsec::replay {
+
+namespace {
+
+constexpr uint16_t kEtherVlan = 0x8100;
+constexpr uint16_t kEtherIpv4 = 0x0800;
+constexpr uint16_t kEtherArp = 0x0806;
+constexpr uint16_t kEtherIpv6 = 0x86dd;
+
+uint16_t be16(std::span<const uint8_t> b, size_t at)
+{
+   return static_cast<uint16_t>(b[at] << 8 | b[at + 1]);
+}
+
+const char *dhcpTypeName(uint8_t type)
+{
+   static constexpr std::array<const char *, 9> kNames = {
+      "DHCP", "DHCPDISCOVER", "DHCPOFFER", "DHCPREQUEST", "DHCPDECLINE",
+      "DHCPACK", "DHCPNAK", "DHCPRELEASE", "DHCPINFORM"};
+   return type < kNames.size() ? kNames[type] : "DHCP";
+}
+
+// The DHCP message type (option 53) of a BOOTP payload, 0 when it has none.
+uint8_t dhcpMessageType(std::span<const uint8_t> bootp)
+{
+   constexpr size_t kOptions = 240;
+   if (bootp.size() < kOptions || be16(bootp, 236) != 0x6382 || be16(bootp, 238) != 0x5363) {
+      return 0;
+   }
+   size_t at = kOptions;
+   while (at < bootp.size()) {
+      const uint8_t code = bootp[at];
+      if (code == 255) {
+         break;
+      }
+      if (code == 0) {
+         ++at;
+         continue;
+      }
+      if (at + 1 >= bootp.size() || at + 2 + bootp[at + 1] > bootp.size()) {
+         break;
+      }
+      if (code == 53 && bootp[at + 1] == 1) {
+         return bootp[at + 2];
+      }
+      at += 2u + bootp[at + 1];
+   }
+   return 0;
+}
+
+std::string describeIpv4(std::span<const uint8_t> ip)
+{
+   if (ip.size() < 20 || (ip[0] >> 4) != 4) {
+      return "IPv4 (truncated)";
+   }
+   const size_t headerLength = size_t{ip[0] & 0x0fu} * 4;
+   const uint8_t protocol = ip[9];
+   const std::string addresses = ipText(&ip[12]) + " > " + ipText(&ip[16]);
+   const bool fragment = (be16(ip, 6) & 0x3fffu) != 0;
+   if (fragment) {
+      return "IPv4 fragment " + addresses + " proto " + std::to_string(protocol);
+   }
+   if (protocol == 1) {
+      return "ICMP " + addresses;
+   }
+   if (protocol == 17 && headerLength >= 20 && ip.size() >= headerLength + 8) {
+      const uint16_t src = be16(ip, headerLength);
+      const uint16_t dst = be16(ip, headerLength + 2);
+      if ((src == 67 || src == 68) && (dst == 67 || dst == 68)) {
+         const auto bootp = ip.subspan(headerLength + 8);
+         return std::string(dhcpTypeName(dhcpMessageType(bootp))) + " " + addresses;
+      }
+      return "UDP " + addresses + " " + std::to_string(src) + " > " + std::to_string(dst);
+   }
+   if (protocol == 6) {
+      return "TCP " + addresses;
+   }
+   return "IPv4 " + addresses + " proto " + std::to_string(protocol);
+}
+
+std::string describeArp(std::span<const uint8_t> arp)
+{
+   if (arp.size() < 28) {
+      return "ARP (truncated)";
+   }
+   const uint16_t op = be16(arp, 6);
+   const std::string senderIp = ipText(&arp[14]);
+   const std::string targetIp = ipText(&arp[24]);
+   if (op == 1) {
+      return "ARP request who has " + targetIp + " tell " + senderIp + " (" + macText(&arp[8]) + ")";
+   }
+   if (op == 2) {
+      return "ARP reply " + senderIp + " is at " + macText(&arp[8]);
+   }
+   return "ARP op " + std::to_string(op);
+}
+
+}  // namespace
+
+std::string macText(const uint8_t *mac)
+{
+   std::array<char, 18> text{};
+   std::snprintf(text.data(), text.size(), "%02x:%02x:%02x:%02x:%02x:%02x", mac[0], mac[1], mac[2], mac[3],
+                 mac[4], mac[5]);
+   return text.data();
+}
+
+std::string ipText(const uint8_t *ip)
+{
+   return std::to_string(ip[0]) + "." + std::to_string(ip[1]) + "." + std::to_string(ip[2]) + "." +
+          std::to_string(ip[3]);
+}
+
+uint16_t frameVlan(std::span<const uint8_t> bytes)
+{
+   if (bytes.size() >= 18 && be16(bytes, 12) == kEtherVlan) {
+      return be16(bytes, 14) & 0x0fffu;
+   }
+   return 0;
+}
+
+FrameFacts frameFacts(std::span<const uint8_t> bytes)
+{
+   FrameFacts facts;
+   if (bytes.size() < 14) {
+      return facts;
+   }
+   static constexpr uint8_t kBpdu[6] = {0x01, 0x80, 0xc2, 0, 0, 0};
+   static constexpr uint8_t kPvst[6] = {0x01, 0x00, 0x0c, 0xcc, 0xcc, 0xcd};
+   facts.bpduDestination = std::equal(kBpdu, kBpdu + 6, bytes.begin()) || std::equal(kPvst, kPvst + 6, bytes.begin());
+   size_t at = 12;
+   uint16_t type = be16(bytes, at);
+   if (type == kEtherVlan && bytes.size() >= 18) {
+      at = 16;
+      type = be16(bytes, at);
+   }
+   const auto payload = bytes.subspan(at + 2);
+   std::span<const uint8_t> udp;
+   if (type == kEtherIpv4 && payload.size() >= 20 && (payload[0] >> 4) == 4 && payload[9] == 17 &&
+       (be16(payload, 6) & 0x1fffu) == 0) {
+      const size_t headerLength = size_t{payload[0] & 0x0fu} * 4;
+      if (headerLength >= 20 && payload.size() >= headerLength + 8) {
+         udp = payload.subspan(headerLength);
+      }
+   } else if (type == kEtherIpv6 && payload.size() >= 48 && payload[6] == 17) {
+      udp = payload.subspan(40);
+   }
+   if (!udp.empty()) {
+      facts.udpSourcePort = be16(udp, 0);
+      const uint16_t destination = be16(udp, 2);
+      if ((facts.udpSourcePort == 67 || facts.udpSourcePort == 68) && (destination == 67 || destination == 68)) {
+         facts.dhcpMessageType = dhcpMessageType(udp.subspan(8));
+      }
+   }
+   return facts;
+}
+
+std::string describeFrame(std::span<const uint8_t> bytes)
+{
+   if (bytes.size() < 14) {
+      return "runt frame (" + std::to_string(bytes.size()) + " bytes)";
+   }
+   std::string prefix = macText(&bytes[6]) + " > " + macText(&bytes[0]) + " ";
+   size_t at = 12;
+   uint16_t type = be16(bytes, at);
+   if (type == kEtherVlan && bytes.size() >= 18) {
+      prefix += "vlan " + std::to_string(be16(bytes, 14) & 0x0fffu) + " ";
+      at = 16;
+      type = be16(bytes, at);
+   }
+   const auto payload = bytes.subspan(at + 2);
+   if (bytes[0] == 0x01 && bytes[1] == 0x80 && bytes[2] == 0xc2 && bytes[3] == 0 && bytes[4] == 0 &&
+       bytes[5] == 0) {
+      return prefix + "BPDU";
+   }
+   switch (type) {
+   case kEtherIpv4: return prefix + describeIpv4(payload);
+   case kEtherArp: return prefix + describeArp(payload);
+   case kEtherIpv6: return prefix + "IPv6";
+   default: break;
+   }
+   std::array<char, 24> text{};
+   std::snprintf(text.data(), text.size(), "ethertype 0x%04x", type);
+   return prefix + text.data();
+}
+
+}  // namespace swsec::replay

@@ -1,0 +1,70 @@
+// Counters first, in the order the port runs its checks; then the kind of
+// frame, for the three checks without a counter.
+#include "replay/drop_reason.h"
+
+#include "replay/capture.h"
+#include "replay/describe.h"
+
+namespace swsec::replay {
+
+const char *dropReasonName(DropReason reason)
+{
+   switch (reason) {
+   case DropReason::none: return "";
+   case DropReason::unexplained: return "unexplained (no drop counter moved)";
+   case DropReason::dai: return "DAI";
+   case DropReason::arpRateLimit: return "ARP rate limit";
+   case DropReason::arpRateLimitErrorState: return "ARP rate limit: error state";
+   case DropReason::ipSourceGuard: return "IP source guard";
+   case DropReason::dhcpChaddrMismatch: return "DHCP snooping: chaddr mismatch";
+   case DropReason::bpduFilter: return "BPDU filter";
+   case DropReason::dhcpServerBlock: return "DHCP server block";
+   case DropReason::dhcpUnansweredAck: return "DHCP snooping: unanswered ACK";
+   }
+   return "";
+}
+
+namespace {
+
+bool moved(const DropCounters &before, const DropCounters &after, std::string_view name)
+{
+   const auto was = before.find(name);
+   const auto is = after.find(name);
+   return is != after.end() && is->second != (was != before.end() ? was->second : 0);
+}
+
+}  // namespace
+
+DropReason explainDrop(const DropCounters &before, const DropCounters &after, std::span<const uint8_t> frame,
+                       uint8_t direction)
+{
+   if (moved(before, after, "txRateLimitDropCnt")) {
+      return moved(before, after, "txRateLimitErrEntryCnt") ? DropReason::arpRateLimit
+                                                             : DropReason::arpRateLimitErrorState;
+   }
+   if (moved(before, after, "rxRateLimitDropCnt")) {
+      return DropReason::arpRateLimit;
+   }
+   if (moved(before, after, "daiDropCnt")) {
+      return DropReason::dai;
+   }
+   if (moved(before, after, "dhcpSnoopingDropCnt")) {
+      return DropReason::dhcpChaddrMismatch;
+   }
+   if (moved(before, after, "ipSrcGuardDropCnt")) {
+      return DropReason::ipSourceGuard;
+   }
+   const FrameFacts facts = frameFacts(frame);
+   if (facts.bpduDestination) {
+      return DropReason::bpduFilter;
+   }
+   if (direction == kDirFromVm && (facts.udpSourcePort == 67 || facts.udpSourcePort == 547)) {
+      return DropReason::dhcpServerBlock;
+   }
+   if (direction == kDirToVm && facts.dhcpMessageType == kDhcpAck) {
+      return DropReason::dhcpUnansweredAck;
+   }
+   return DropReason::unexplained;
+}
+
+}  // namespace swsec::replay

@@ -1,0 +1,196 @@
+// The configuration document: strict, so that a typo is an error rather
+// than a silently different port.
+#include "session/config_file.h"
+
+#include "session/error.h"
+#include "swsec/config_record.h"
+#include "swsec/swsec_vmi.h"
+
+#include <arpa/inet.h>
+#include <nlohmann/json.hpp>
+
+#include <charconv>
+#include <cstring>
+#include <fstream>
+#include <limits>
+#include <sstream>
+
+namespace swsec::replay {
+
+namespace {
+
+using nlohmann::json;
+
+struct FeatureName {
+   std::string_view name;
+   uint32_t bit;
+};
+
+constexpr FeatureName kFeatureNames[] = {
+   {"bpdu-filter", SwSecFeatureBpduFilter},
+   {"block-dhcp-server", SwSecFeatureBlockDhcpServer},
+   {"ip-discovery", SwSecFeatureIpDiscovery},
+   {"dai", SwSecFeatureDai},
+   {"ip-source-guard", SwSecFeatureIpSrcGuard},
+};
+
+uint32_t unsignedField(const json &doc, const char *key, const std::string &origin)
+{
+   const json &value = doc.at(key);
+   if (!value.is_number_unsigned() || value.get<uint64_t>() > std::numeric_limits<uint32_t>::max()) {
+      throw ReplayError(origin + ": \"" + key + "\" must be an unsigned 32-bit integer");
+   }
+   return value.get<uint32_t>();
+}
+
+std::array<uint8_t, 4> parseIp(const json &value, const std::string &what)
+{
+   std::array<uint8_t, 4> ip{};
+   if (!value.is_string() || inet_pton(AF_INET, value.get<std::string>().c_str(), ip.data()) != 1) {
+      throw ReplayError(what + ": malformed IPv4 address " + value.dump());
+   }
+   return ip;
+}
+
+StaticBinding parseStatic(const json &entry, const std::string &what)
+{
+   if (!entry.is_object()) {
+      throw ReplayError(what + ": expected an object {vlan, mac, ip}");
+   }
+   for (const auto &[key, value] : entry.items()) {
+      if (key != "vlan" && key != "mac" && key != "ip") {
+         throw ReplayError(what + ": unknown key \"" + key + "\"");
+      }
+   }
+   if (!entry.contains("vlan") || !entry.contains("mac") || !entry.contains("ip")) {
+      throw ReplayError(what + ": needs vlan, mac and ip");
+   }
+   StaticBinding binding;
+   const json &vlan = entry["vlan"];
+   if (!vlan.is_number_unsigned() || vlan.get<uint64_t>() > 4095) {
+      throw ReplayError(what + ": \"vlan\" must be 0 to 4095");
+   }
+   binding.vlan = vlan.get<uint16_t>();
+   if (!entry["mac"].is_string()) {
+      throw ReplayError(what + ": \"mac\" must be a string");
+   }
+   binding.mac = parseMac(entry["mac"].get<std::string>(), what);
+   binding.ip = parseIp(entry["ip"], what);
+   return binding;
+}
+
+}  // namespace
+
+std::array<uint8_t, 6> parseMac(std::string_view text, const std::string &what)
+{
+   std::array<uint8_t, 6> mac{};
+   bool ok = text.size() == 17;
+   for (size_t i = 0; ok && i < 6; ++i) {
+      const char *first = text.data() + i * 3;
+      auto [end, error] = std::from_chars(first, first + 2, mac[i], 16);
+      ok = error == std::errc{} && end == first + 2 && (i == 5 || text[i * 3 + 2] == ':');
+   }
+   if (!ok) {
+      throw ReplayError(what + ": malformed MAC address \"" + std::string(text) + "\"");
+   }
+   return mac;
+}
+
+PortSecurityConfig parseConfig(std::string_view text, const std::string &origin)
+{
+   json doc;
+   try {
+      doc = json::parse(text);
+   } catch (const json::parse_error &e) {
+      throw ReplayError(origin + ": bad JSON: " + e.what());
+   }
+   if (!doc.is_object()) {
+      throw ReplayError(origin + ": expected a JSON object");
+   }
+   PortSecurityConfig config;
+   config.origin = origin;
+   for (const auto &[key, value] : doc.items()) {
+      if (key == "features") {
+         if (!value.is_array()) {
+            throw ReplayError(origin + ": \"features\" must be a list of feature names");
+         }
+         config.features = 0;
+         for (const auto &name : value) {
+            const FeatureName *found = nullptr;
+            for (const auto &feature : kFeatureNames) {
+               if (name.is_string() && name.get<std::string>() == feature.name) {
+                  found = &feature;
+               }
+            }
+            if (found == nullptr) {
+               throw ReplayError(origin + ": unknown feature " + name.dump() +
+                                 " (known: ip-discovery, dai, ip-source-guard, bpdu-filter, block-dhcp-server)");
+            }
+            config.features |= found->bit;
+         }
+      } else if (key == "trusted") {
+         if (!value.is_boolean()) {
+            throw ReplayError(origin + ": \"trusted\" must be true or false");
+         }
+         config.trusted = value.get<bool>();
+      } else if (key == "portDbSize") {
+         config.portDbSize = unsignedField(doc, "portDbSize", origin);
+      } else if (key == "arpRateLimit") {
+         config.arpRateLimit = unsignedField(doc, "arpRateLimit", origin);
+      } else if (key == "errRateLimit") {
+         config.errRateLimit = unsignedField(doc, "errRateLimit", origin);
+      } else if (key == "errRateLimitPeriod") {
+         config.errRateLimitPeriod = unsignedField(doc, "errRateLimitPeriod", origin);
+      } else if (key == "static") {
+         if (!value.is_array()) {
+            throw ReplayError(origin + ": \"static\" must be a list of {vlan, mac, ip}");
+         }
+         for (size_t i = 0; i < value.size(); ++i) {
+            config.statics.push_back(parseStatic(value[i], origin + ": static[" + std::to_string(i) + "]"));
+         }
+      } else {
+         throw ReplayError(origin + ": unknown key \"" + key + "\"");
+      }
+   }
+   return config;
+}
+
+PortSecurityConfig loadConfigFile(const std::string &path)
+{
+   std::ifstream in(path, std::ios::binary);
+   if (!in) {
+      throw ReplayError(path + ": cannot open: " + std::strerror(errno));
+   }
+   std::ostringstream text;
+   text << in.rdbuf();
+   return parseConfig(text.str(), path);
+}
+
+std::vector<uint8_t> configRecord(const PortSecurityConfig &config)
+{
+   SwSecConfig header{};
+   header.version = SWSEC_CONFIG_VERSION;
+   header.featuresEnabled = config.features;
+   header.trusted = config.trusted ? 1 : 0;
+   header.portDbSize = config.portDbSize;
+   header.numStatic = static_cast<uint32_t>(config.statics.size());
+   header.arpRateLimit = config.arpRateLimit;
+   header.errRateLimit = config.errRateLimit;
+   header.errRateLimitPeriod = config.errRateLimitPeriod;
+   std::vector<uint8_t> bytes(SwSecConfigLength(header.numStatic));
+   std::memcpy(bytes.data(), &header, sizeof header);
+   size_t offset = sizeof header;
+   for (const auto &binding : config.statics) {
+      SwSecVmiKey key{};
+      key.vlanId = binding.vlan;
+      std::memcpy(key.macAddr, binding.mac.data(), sizeof key.macAddr);
+      uint32_t ip = 0;   // network order, as the bytes stand
+      std::memcpy(&ip, binding.ip.data(), sizeof ip);
+      key.ipAddr = ip;
+      std::memcpy(bytes.data() + offset, &key, sizeof key);
+      offset += sizeof key;
+   }
+   return bytes;
+}
+
+}  // namespace swsec::replay

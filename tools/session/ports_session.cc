@@ -1,0 +1,252 @@
+// The module session: load, ports, configuration, management nodes and
+// notifications, shared by replay and inline.
+#include "session/ports_session.h"
+
+#include <arpa/inet.h>
+
+#include <cstdio>
+#include <cstring>
+
+namespace swsec::ports {
+
+namespace {
+
+std::string macText(const uint8_t *mac)
+{
+   char text[18];
+   std::snprintf(text, sizeof text, "%02x:%02x:%02x:%02x:%02x:%02x", mac[0], mac[1], mac[2], mac[3], mac[4], mac[5]);
+   return text;
+}
+
+std::string ipText(const uint8_t *ip)
+{
+   char text[INET_ADDRSTRLEN];
+   return inet_ntop(AF_INET, ip, text, sizeof text) != nullptr ? std::string(text) : std::string();
+}
+
+std::string portPath(uint32_t portID)
+{
+   return "/security/" + std::to_string(portID);
+}
+
+}  // namespace
+
+std::string withoutNewline(std::string text)
+{
+   while (!text.empty() && text.back() == '\n') {
+      text.pop_back();
+   }
+   return text;
+}
+
+std::optional<PortDbNotification> decodePortDbMessage(const host::PostedMessage &message)
+{
+   if (message.name.rfind("portdb.entry.", 0) != 0 || message.payload.size() < kPortDbMessageBytes) {
+      return std::nullopt;
+   }
+   const uint8_t *payload = message.payload.data();
+   PortDbNotification note;
+   note.portID = message.portID;
+   note.name = message.name;
+   std::memcpy(&note.vlan, payload + 8, sizeof note.vlan);
+   note.mac = macText(payload + 10);
+   note.ip = ipText(payload + 20);
+   note.authoritative = payload[36] != 0;
+   return note;
+}
+
+ModuleSession::ModuleSession(const std::string &modulePath, const orr_ModuleInfo *linkedModule,
+                             host::ViolationHandler violations)
+   : forward_(std::move(violations))
+{
+   host_.setViolationHandler([this](const std::string &v) { report(v); });
+   host::LoadOptions load;
+   load.modulePath = modulePath;
+   if (modulePath.empty()) {
+      load.linkedModule = linkedModule;
+   }
+   if (host_.load(load) != 0) {
+      throw std::runtime_error("the module failed to load");
+   }
+   host_.portsets().addPortset(kPortset);
+}
+
+ModuleSession::~ModuleSession()
+{
+   (void)finish();
+}
+
+host::FilterId ModuleSession::addPort(uint32_t portID, const std::string &name, const std::string &vmUuid)
+{
+   std::lock_guard guard(mutex_);
+   host_.portsets().addPort(kPortset, portID);
+   host::FilterConfig config;
+   config.name = name;
+   config.vmUuid = vmUuid;
+   host::FilterId filter = 0;
+   const orr_Status status = host_.sifra().createFilter(kAgent, portID, config, &filter);
+   if (status != ORR_OK) {
+      throw std::runtime_error(std::string("the port could not be made: ") + orr_StatusToString(status));
+   }
+   filters_.push_back(filter);
+   return filter;
+}
+
+orr_Status ModuleSession::removePort(host::FilterId filter)
+{
+   std::lock_guard guard(mutex_);
+   const host::DestroyResult destroyed = host_.sifra().destroyFilterAsHypervisor(filter);
+   if (destroyed.status == ORR_OK) {
+      std::erase(filters_, filter);
+   }
+   return destroyed.status;
+}
+
+void ModuleSession::drainLogLocked()
+{
+   for (auto &record : host_.log().take()) {
+      logTail_.push_back(std::move(record));
+   }
+}
+
+// The module says why it refused in its log; its error lines written since
+// `mark` are the message.
+std::string ModuleSession::errorsSince(size_t mark)
+{
+   drainLogLocked();
+   std::string message;
+   for (size_t i = mark; i < logTail_.size(); ++i) {
+      if (logTail_[i].severity >= 2) {
+         message += (message.empty() ? "" : "; ") + withoutNewline(logTail_[i].text);
+      }
+   }
+   return message;
+}
+
+void ModuleSession::configure(host::FilterId filter, const std::vector<uint8_t> &record)
+{
+   std::lock_guard guard(mutex_);
+   drainLogLocked();
+   const size_t mark = logTail_.size();
+   const orr_Status written = host_.sifra().writeProperty(kSecurityProperty, filter, record);
+   if (written != ORR_OK) {
+      std::string message = errorsSince(mark);
+      throw Refused("configuration refused: " + (message.empty() ? orr_StatusToString(written) : message));
+   }
+}
+
+void ModuleSession::clear(uint32_t portID, const std::optional<std::vector<std::string>> &key)
+{
+   std::lock_guard guard(mutex_);
+   drainLogLocked();
+   const size_t mark = logTail_.size();
+   std::vector<std::string> args{key ? "one" : "all"};
+   if (key) {
+      args.insert(args.end(), key->begin(), key->end());
+   }
+   const orr_Status status = host_.nexo().set(portPath(portID) + "/clearVmi", args);
+   if (status != ORR_OK) {
+      std::string message = errorsSince(mark);
+      throw Refused("clear refused: " + (message.empty() ? orr_StatusToString(status) : message));
+   }
+}
+
+PortState ModuleSession::readState(uint32_t portID)
+{
+   PortState state;
+   const std::string port = portPath(portID);
+   host::NexoRecord summary;
+   if (host_.nexo().get(port + "/featureSummary", &summary) == ORR_OK) {
+      state.featureSummary = summary.values();
+      state.featureSummaryText = summary.text();
+      for (const char *field : kDropCounterFields) {
+         const auto found = state.featureSummary->find(field);
+         if (found != state.featureSummary->end() && found->second != "N/A") {
+            state.counters[field] = std::stoull(found->second);
+         }
+      }
+   }
+   std::vector<int64_t> instances;
+   if (host_.nexo().list(port + "/vmi", &instances) != ORR_OK) {
+      return state;
+   }
+   for (int64_t instance : instances) {
+      host::NexoRecord vmi;
+      // An entry removed since the list was taken is simply not shown.
+      if (host_.nexo().get(port + "/vmi/" + std::to_string(instance), &vmi) != ORR_OK) {
+         continue;
+      }
+      const auto values = vmi.values();
+      auto field = [&values](const char *name) {
+         const auto found = values.find(name);
+         return found != values.end() ? found->second : std::string();
+      };
+      PortDbEntry &entry = state.portDb.emplace_back();
+      entry.vlan = static_cast<uint16_t>(std::stoul(field("vlanId")));
+      entry.mac = field("macAddr");
+      entry.ip = field("ipAddr");
+      entry.method = field("discoveryMethod");
+      entry.timeRemaining = field("timeRemaining");
+      entry.chaddr = field("chaddr");
+      entry.clientIdLen = field("clientIdLen");
+      entry.serverIp = field("serverIp");
+      entry.leaseTime = field("leaseTime");
+   }
+   return state;
+}
+
+std::vector<PortDbNotification> ModuleSession::takeNotifications()
+{
+   std::vector<PortDbNotification> notes;
+   for (const auto &message : host_.portsets().takePosted()) {
+      if (auto note = decodePortDbMessage(message)) {
+         notes.push_back(std::move(*note));
+      }
+   }
+   return notes;
+}
+
+std::vector<host::LogRecord> ModuleSession::takeLog()
+{
+   std::lock_guard guard(mutex_);
+   drainLogLocked();
+   std::vector<host::LogRecord> taken;
+   taken.swap(logTail_);
+   return taken;
+}
+
+void ModuleSession::report(const std::string &violation)
+{
+   std::lock_guard guard(violationsMutex_);
+   violations_.push_back(violation);
+   if (forward_) {
+      forward_(violation);
+   }
+}
+
+std::vector<std::string> ModuleSession::finish()
+{
+   std::lock_guard guard(mutex_);
+   if (finished_ || !host_.loaded()) {
+      finished_ = true;
+      std::lock_guard violations(violationsMutex_);
+      return violations_;
+   }
+   finished_ = true;
+   for (host::FilterId filter : filters_) {
+      const host::DestroyResult destroyed = host_.sifra().destroyFilterAsHypervisor(filter);
+      if (destroyed.status != ORR_OK) {
+         report(std::string("the port could not be destroyed: ") + orr_StatusToString(destroyed.status));
+      }
+   }
+   filters_.clear();
+   const orr_Status unloaded = host_.unload();
+   if (unloaded != ORR_OK) {
+      report(std::string("the module did not unload: ") + orr_StatusToString(unloaded));
+   }
+   drainLogLocked();
+   std::lock_guard violations(violationsMutex_);
+   return violations_;
+}
+
+}  // namespace swsec::ports

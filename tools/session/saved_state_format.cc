@@ -1,0 +1,292 @@
+// Decoding a saved-state blob field by field from its bytes, each read
+// checked against the blob's length first.
+#include "session/saved_state_format.h"
+
+#include <cinttypes>
+#include <cstdio>
+#include <cstring>
+
+namespace swsec::common {
+
+namespace {
+
+constexpr uint64_t kHeaderLen = 48;
+constexpr uint64_t kFixedLen = 96;
+constexpr uint64_t kEntryLen = 48;
+constexpr uint8_t kDhcpSnooping = 1;
+constexpr uint8_t kStatic = 2;
+constexpr char kMagic[] = "sifgsave";
+
+// Little-endian reads from a range already checked to hold them.
+uint64_t le(const uint8_t *bytes, size_t size)
+{
+   uint64_t value = 0;
+   for (size_t i = 0; i < size; ++i) {
+      value |= static_cast<uint64_t>(bytes[i]) << (8 * i);
+   }
+   return value;
+}
+
+std::string number(uint64_t value)
+{
+   return std::to_string(value);
+}
+
+template <size_t N>
+std::array<uint8_t, N> bytesAt(const uint8_t *bytes)
+{
+   std::array<uint8_t, N> out{};
+   std::memcpy(out.data(), bytes, N);
+   return out;
+}
+
+std::string macText(const std::array<uint8_t, 6> &mac)
+{
+   char text[18];
+   std::snprintf(text, sizeof text, "%02x:%02x:%02x:%02x:%02x:%02x", mac[0], mac[1], mac[2], mac[3], mac[4], mac[5]);
+   return text;
+}
+
+std::string ipText(const std::array<uint8_t, 4> &ip)
+{
+   return number(ip[0]) + "." + number(ip[1]) + "." + number(ip[2]) + "." + number(ip[3]);
+}
+
+std::string hexText(const std::vector<uint8_t> &bytes)
+{
+   std::string text;
+   for (uint8_t byte : bytes) {
+      char pair[3];
+      std::snprintf(pair, sizeof pair, "%02x", byte);
+      text += pair;
+   }
+   return text;
+}
+
+void decodeHeader(std::span<const uint8_t> blob, SavedPortState &state)
+{
+   if (blob.size() < kHeaderLen) {
+      throw BadSavedState("too short for the 48-byte header (" + number(blob.size()) + " bytes)");
+   }
+   if (std::memcmp(blob.data(), kMagic, 8) != 0) {
+      char text[19];
+      std::snprintf(text, sizeof text, "0x%016" PRIx64, le(blob.data(), 8));
+      throw BadSavedState(std::string("not a saved state (magic ") + text + ", expected \"sifgsave\")");
+   }
+   state.version = le(blob.data() + 8, 8);
+   state.agentOffset = le(blob.data() + 16, 8);
+   state.agentLen = le(blob.data() + 24, 8);
+   state.slowPathOffset = le(blob.data() + 32, 8);
+   state.slowPathLen = le(blob.data() + 40, 8);
+   if (state.version != 1) {
+      throw BadSavedState("version " + number(state.version) + " (this tool reads version 1)");
+   }
+   uint64_t slowPathEnd = 0;
+   if (__builtin_add_overflow(state.slowPathOffset, state.slowPathLen, &slowPathEnd) || slowPathEnd > blob.size()) {
+      throw BadSavedState("the slow path's part (offset " + number(state.slowPathOffset) + ", " +
+                          number(state.slowPathLen) + " bytes) runs past the " + number(blob.size()) +
+                          "-byte blob");
+   }
+   uint64_t agentEnd = 0;
+   if (state.agentOffset < kHeaderLen || __builtin_add_overflow(state.agentOffset, state.agentLen, &agentEnd) ||
+       state.slowPathOffset < agentEnd) {
+      throw BadSavedState("bad part offsets (agent at " + number(state.agentOffset) + ", " + number(state.agentLen) +
+                          " bytes; slow path at " + number(state.slowPathOffset) + ")");
+   }
+}
+
+SavedBinding decodeBinding(const uint8_t *entry)
+{
+   SavedBinding binding;
+   binding.vlan = static_cast<uint16_t>(le(entry, 2));
+   binding.mac = bytesAt<6>(entry + 2);
+   binding.ip = bytesAt<4>(entry + 8);
+   binding.method = entry[12];
+   binding.timeRemaining = static_cast<int64_t>(le(entry + 16, 8));
+   if (binding.method == kDhcpSnooping) {
+      binding.chaddr = bytesAt<6>(entry + 24);
+      binding.serverIp = bytesAt<4>(entry + 40);
+      binding.leaseTime = static_cast<uint32_t>(le(entry + 44, 4));
+   }
+   return binding;
+}
+
+void decodeAgentPart(std::span<const uint8_t> part, SavedPortState &state)
+{
+   if (part.size() < kFixedLen) {
+      throw BadSavedState("the agent's part has " + number(part.size()) + " bytes, fewer than its fixed 96");
+   }
+   const uint8_t *fixed = part.data();
+   state.configVersion = fixed[0];
+   state.featuresEnabled = static_cast<uint32_t>(le(fixed + 1, 4));
+   state.trusted = fixed[5];
+   state.portDbSize = static_cast<uint32_t>(le(fixed + 6, 4));
+   state.numStatic = static_cast<uint32_t>(le(fixed + 10, 4));
+   state.arpRateLimit = static_cast<uint32_t>(le(fixed + 14, 4));
+   state.errRateLimit = static_cast<uint32_t>(le(fixed + 18, 4));
+   state.errRateLimitPeriod = static_cast<uint32_t>(le(fixed + 22, 4));
+   const auto numSaved = static_cast<uint32_t>(le(fixed + 28, 4));
+   state.txRateLimitErr = fixed[32] != 0;
+   state.txRateLimitErrRemaining = static_cast<int64_t>(le(fixed + 40, 8));
+   for (size_t i = 0; i < state.counters.size(); ++i) {
+      state.counters[i] = le(fixed + 48 + 8 * i, 8);
+   }
+   if (numSaved != 0 && (state.featuresEnabled & 0x4u) == 0) {
+      throw BadSavedState(number(numSaved) + " bindings saved with IP discovery off");
+   }
+
+   uint64_t position = kFixedLen;
+   for (uint32_t i = 0; i < numSaved; ++i) {
+      if (kEntryLen > part.size() - position) {
+         throw BadSavedState("binding " + number(i + 1) + " of " + number(numSaved) + " runs past the agent's " +
+                             number(part.size()) + "-byte part");
+      }
+      SavedBinding binding = decodeBinding(part.data() + position);
+      const uint8_t clientIdLen = binding.method == kDhcpSnooping ? part[position + 30] : 0;
+      if (kEntryLen + clientIdLen > part.size() - position) {
+         throw BadSavedState("binding " + number(i + 1) + " of " + number(numSaved) + " runs past the agent's " +
+                             number(part.size()) + "-byte part");
+      }
+      const uint8_t *clientId = part.data() + position + kEntryLen;
+      binding.clientId.assign(clientId, clientId + clientIdLen);
+      state.bindings.push_back(std::move(binding));
+      position += kEntryLen + clientIdLen;
+   }
+}
+
+}  // namespace
+
+SavedPortState decodeSavedState(std::span<const uint8_t> blob)
+{
+   SavedPortState state;
+   decodeHeader(blob, state);
+   if (state.agentLen != 0) {
+      decodeAgentPart(blob.subspan(static_cast<size_t>(state.agentOffset), static_cast<size_t>(state.agentLen)), state);
+   }
+   return state;
+}
+
+std::string methodName(uint8_t method)
+{
+   switch (method) {
+   case 1:
+      return "DHCP Snooping";
+   case 2:
+      return "Static";
+   case 4:
+      return "TOFU";
+   case 8:
+      return "ARP Snooping";
+   default:
+      return "unknown (" + number(method) + ")";
+   }
+}
+
+std::string featureNames(uint32_t features)
+{
+   static constexpr std::pair<uint32_t, const char *> kNames[] = {
+      {0x01, "bpdu-filter"}, {0x02, "block-dhcp-server"}, {0x04, "ip-discovery"}, {0x08, "dai"}, {0x10, "ip-source-guard"}};
+   std::string text;
+   for (const auto &[bit, name] : kNames) {
+      if ((features & bit) != 0) {
+         text += (text.empty() ? "" : ",") + std::string(name);
+      }
+   }
+   if ((features & ~0x1fu) != 0) {
+      char rest[16];
+      std::snprintf(rest, sizeof rest, "0x%x", features & ~0x1fu);
+      text += (text.empty() ? "" : ",") + std::string(rest);
+   }
+   return text.empty() ? "none" : text;
+}
+
+nlohmann::json savedStateJson(const SavedPortState &state)
+{
+   using nlohmann::json;
+   json doc;
+   doc["header"] = {{"version", state.version},
+                    {"agentOffset", state.agentOffset},
+                    {"agentLen", state.agentLen},
+                    {"slowPathOffset", state.slowPathOffset},
+                    {"slowPathLen", state.slowPathLen}};
+   if (state.agentLen == 0) {
+      doc["config"] = nullptr;
+      doc["errorRateLimit"] = nullptr;
+      doc["counters"] = nullptr;
+      doc["bindings"] = json::array();
+      return doc;
+   }
+   doc["config"] = {{"version", state.configVersion},
+                    {"featuresEnabled", state.featuresEnabled},
+                    {"features", featureNames(state.featuresEnabled)},
+                    {"trusted", state.trusted != 0},
+                    {"portDbSize", state.portDbSize},
+                    {"numStatic", state.numStatic},
+                    {"arpRateLimit", state.arpRateLimit},
+                    {"errRateLimit", state.errRateLimit},
+                    {"errRateLimitPeriod", state.errRateLimitPeriod}};
+   doc["errorRateLimit"] = {{"active", state.txRateLimitErr}, {"remainingSeconds", state.txRateLimitErrRemaining}};
+   json counters = json::object();
+   for (size_t i = 0; i < state.counters.size(); ++i) {
+      counters[kSavedCounterNames[i]] = state.counters[i];
+   }
+   doc["counters"] = std::move(counters);
+   json bindings = json::array();
+   for (const SavedBinding &b : state.bindings) {
+      json entry = {{"vlan", b.vlan},
+                    {"mac", macText(b.mac)},
+                    {"ip", ipText(b.ip)},
+                    {"method", methodName(b.method)},
+                    {"timeRemaining", b.method == kStatic ? json(nullptr) : json(b.timeRemaining)}};
+      if (b.method == kDhcpSnooping) {
+         entry["chaddr"] = macText(b.chaddr);
+         entry["clientId"] = hexText(b.clientId);
+         entry["serverIp"] = ipText(b.serverIp);
+         entry["leaseTime"] = b.leaseTime;
+      }
+      bindings.push_back(std::move(entry));
+   }
+   doc["bindings"] = std::move(bindings);
+   return doc;
+}
+
+void printSavedState(std::ostream &out, const SavedPortState &state)
+{
+   out << "Saved state, version " << state.version << ": agent part " << state.agentLen << " bytes at "
+       << state.agentOffset << ", slow path part " << state.slowPathLen << " bytes at " << state.slowPathOffset
+       << "\n";
+   if (state.agentLen == 0) {
+      out << "No agent part.\n";
+      return;
+   }
+   out << "\nConfiguration\n"
+       << "   features:            " << featureNames(state.featuresEnabled) << "\n"
+       << "   port mode:           " << (state.trusted != 0 ? "trusted" : "untrusted") << "\n"
+       << "   port database size:  " << state.portDbSize << " (" << state.numStatic << " static)\n"
+       << "   ARP rate limit:      " << state.arpRateLimit << "/s, " << state.errRateLimit << "/s for "
+       << state.errRateLimitPeriod << " s after a burst\n";
+   out << "   error rate limit:    ";
+   if (state.txRateLimitErr) {
+      out << "active, " << state.txRateLimitErrRemaining << " s left\n";
+   } else {
+      out << "not active\n";
+   }
+   out << "\nCounters\n";
+   for (size_t i = 0; i < state.counters.size(); ++i) {
+      out << "   " << kSavedCounterNames[i] << ": " << state.counters[i] << "\n";
+   }
+   out << "\nBindings (" << state.bindings.size() << ")\n";
+   for (const SavedBinding &b : state.bindings) {
+      out << "   vlan " << b.vlan << "  " << macText(b.mac) << "  " << ipText(b.ip) << "  " << methodName(b.method);
+      if (b.method != kStatic) {
+         out << "  " << b.timeRemaining << " s left";
+      }
+      if (b.method == kDhcpSnooping) {
+         out << "  chaddr " << macText(b.chaddr) << "  server " << ipText(b.serverIp) << "  lease " << b.leaseTime
+             << " s  client id " << (b.clientId.empty() ? std::string("none") : hexText(b.clientId));
+      }
+      out << "\n";
+   }
+}
+
+}  // namespace swsec::common

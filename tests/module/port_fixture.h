@@ -11,6 +11,7 @@
 #include "swsec/swsec_context.h"
 #include "support/frames.h"
 #include "support/host_fixture.h"
+#include "support/scene.h"
 #include "support/security_config.h"
 
 #include <cstring>

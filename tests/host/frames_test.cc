@@ -308,14 +308,6 @@ TEST_F(FramesDeathTest, MisusedFramesAbortWithAMessage)
    EXPECT_DEATH(releaseUnknownMapping(single({.bytes = sampleUdp()})), "is not a mapping of header");
 }
 
-#if defined(__SANITIZE_ADDRESS__)
-#define SWSEC_TEST_ASAN 1
-#elif defined(__has_feature)
-#if __has_feature(address_sanitizer)
-#define SWSEC_TEST_ASAN 1
-#endif
-#endif
-
 #ifdef SWSEC_TEST_ASAN
 uint8_t readAt(const uint8_t *base, std::ptrdiff_t offset)
 {

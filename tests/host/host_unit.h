@@ -12,6 +12,14 @@
 #include <utility>
 #include <vector>
 
+#if defined(__SANITIZE_ADDRESS__)
+#define SWSEC_TEST_ASAN 1
+#elif defined(__has_feature)
+#if __has_feature(address_sanitizer)
+#define SWSEC_TEST_ASAN 1
+#endif
+#endif
+
 namespace swsec::testing {
 
 // Members are public so that table-driven cases (lambdas) can use them.

@@ -15,6 +15,8 @@ packages=(
   libgtest-dev libgmock-dev libbenchmark-dev
   # the swsec tool
   libcli11-dev nlohmann-json3-dev libpcap-dev
+  # the kernel fast path: libbpf (its BPF program is built by clang)
+  libbpf-dev
   # swsec inline and its end-to-end test: a real DHCP server (the binary
   # alone: no system service) and clients,
   # scapy's attacks, ping; iperf3 for the inline benchmark

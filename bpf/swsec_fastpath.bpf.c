@@ -1,0 +1,247 @@
+/*
+ * The kernel fast path of a guarded VM port: a tc program (clsact, direct
+ * action) on the VM interface's ingress (frames from the VM) and egress
+ * (frames to it). It decides the frames whose verdict the maps fix exactly
+ * as the module would give it, with nothing in the module to change; every
+ * other frame is punted to user space, where the module judges it:
+ *
+ *   passed   TC_ACT_OK      the module would pass it and change nothing
+ *   dropped  TC_ACT_SHOT    IP source guard: an IPv4 source not bound
+ *   punted   TC_ACT_STOLEN  copied to the ring buffer for the module
+ *
+ * Punted: every frame while the port is not ready; ARP; DHCP (UDP port 67
+ * or 68 either side; DHCPv6 server replies where they are blocked); BPDU
+ * destinations where they are filtered; an inner tag; IPv4 fragments,
+ * options or short headers; every frame from the VM in the error-rate-limit
+ * state; and, on a trusted port, IPv4 from a binding the module refreshes.
+ *
+ * The outer VLAN tag is metadata on tc (vlan_present, vlan_tci); a frame
+ * that carries it in its bytes (BPF_PROG_TEST_RUN, a device without
+ * offload) is read the same way.
+ */
+#include <linux/bpf.h>
+#include <linux/if_ether.h>
+#include <linux/pkt_cls.h>
+#include <bpf/bpf_helpers.h>
+#include <bpf/bpf_endian.h>
+
+#include "swsec_fastpath.h"
+
+struct {
+   __uint(type, BPF_MAP_TYPE_ARRAY);
+   __uint(max_entries, 1);
+   __type(key, __u32);
+   __type(value, struct swsec_fp_port);
+} swsec_port SEC(".maps");
+
+struct {
+   __uint(type, BPF_MAP_TYPE_HASH);
+   __uint(max_entries, SWSEC_FP_MAX_BINDINGS);
+   __type(key, struct swsec_fp_binding_key);
+   __type(value, struct swsec_fp_binding);
+} swsec_bindings SEC(".maps");
+
+struct {
+   __uint(type, BPF_MAP_TYPE_PERCPU_ARRAY);
+   __uint(max_entries, SWSEC_FP_REASON_COUNT);
+   __type(key, __u32);
+   __type(value, __u64);
+} swsec_counters SEC(".maps");
+
+struct {
+   __uint(type, BPF_MAP_TYPE_RINGBUF);
+   __uint(max_entries, SWSEC_FP_PUNT_RING_BYTES);
+} swsec_punts SEC(".maps");
+
+/* A punt record is built here, then copied into the ring at its own size. */
+struct swsec_fp_punt_slot {
+   struct swsec_fp_punt head;
+   __u8 bytes[SWSEC_FP_PUNT_MAX_BYTES];
+};
+
+struct {
+   __uint(type, BPF_MAP_TYPE_PERCPU_ARRAY);
+   __uint(max_entries, 1);
+   __type(key, __u32);
+   __type(value, struct swsec_fp_punt_slot);
+} swsec_punt_slot SEC(".maps");
+
+#define ETH_P_8021AD_ 0x88a8
+#define ETH_P_QINQ_ 0x9100
+#define DHCP_SERVER_PORT 67
+#define DHCP_CLIENT_PORT 68
+#define DHCPV6_SERVER_PORT 547
+#define IPPROTO_UDP_ 17
+
+static __always_inline void swsec_count(__u32 reason)
+{
+   __u64 *count = bpf_map_lookup_elem(&swsec_counters, &reason);
+   if (count)
+      *count += 1; /* per CPU: no other writer */
+}
+
+static __always_inline __u16 swsec_load_be16(const __u8 *p)
+{
+   return (__u16)((p[0] << 8) | p[1]);
+}
+
+static __always_inline int swsec_is_mac(const __u8 *p, __u8 a, __u8 b, __u8 c, __u8 d, __u8 e, __u8 f)
+{
+   return p[0] == a && p[1] == b && p[2] == c && p[3] == d && p[4] == e && p[5] == f;
+}
+
+struct swsec_fp_frame {
+   __u32 direction;
+   __u16 vlan;
+   __u8 tag_in_bytes;
+};
+
+static __always_inline int swsec_punt(struct __sk_buff *skb, const struct swsec_fp_port *port,
+                                      const struct swsec_fp_frame *frame, __u32 reason)
+{
+   __u32 zero = 0;
+   struct swsec_fp_punt_slot *slot = bpf_map_lookup_elem(&swsec_punt_slot, &zero);
+   if (!slot) {
+      swsec_count(SWSEC_FP_PUNT_LOST);
+      return TC_ACT_SHOT;
+   }
+   __u32 len = skb->len;
+   if (len > SWSEC_FP_PUNT_MAX_BYTES)
+      len = SWSEC_FP_PUNT_MAX_BYTES;
+   if (len == 0 || bpf_skb_load_bytes(skb, 0, slot->bytes, len) != 0) {
+      swsec_count(SWSEC_FP_PUNT_LOST);
+      return TC_ACT_SHOT;
+   }
+   slot->head.port_id = port ? port->port_id : 0;
+   slot->head.frame_len = skb->len;
+   slot->head.captured = len;
+   slot->head.vlan = frame->vlan;
+   slot->head.direction = (__u8)frame->direction;
+   slot->head.flags = frame->tag_in_bytes ? SWSEC_FP_PUNT_TAG_IN_BYTES : 0;
+   slot->head.reason = (__u8)reason;
+   slot->head.reserved[0] = slot->head.reserved[1] = slot->head.reserved[2] = 0;
+   if (bpf_ringbuf_output(&swsec_punts, slot, sizeof(slot->head) + len, 0) != 0) {
+      swsec_count(SWSEC_FP_PUNT_LOST);
+      return TC_ACT_SHOT;
+   }
+   swsec_count(reason);
+   return TC_ACT_STOLEN;
+}
+
+static __always_inline int swsec_pass(void)
+{
+   swsec_count(SWSEC_FP_PASSED);
+   return TC_ACT_OK;
+}
+
+static __always_inline int swsec_judge(struct __sk_buff *skb, __u32 direction)
+{
+   struct swsec_fp_frame frame = {.direction = direction};
+   __u32 zero = 0;
+   const struct swsec_fp_port *port = bpf_map_lookup_elem(&swsec_port, &zero);
+   if (!port || !(port->flags & SWSEC_FP_PORT_READY))
+      return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_NOT_READY);
+   const __u32 features = port->features;
+   /* A port with every feature off passes every frame untouched. */
+   if (features == 0)
+      return swsec_pass();
+
+   const __u8 *data = (const __u8 *)(long)skb->data;
+   const __u8 *end = (const __u8 *)(long)skb->data_end;
+   /* A frame without an Ethernet header passes unexamined, as in the module. */
+   if (data + ETH_HLEN > end)
+      return swsec_pass();
+   __u32 l2 = 12; /* where the ethertype after the outer tag is */
+   if (skb->vlan_present) {
+      frame.vlan = skb->vlan_tci & 0x0fff;
+   } else {
+      const __u16 tpid = swsec_load_be16(data + 12);
+      if (tpid == ETH_P_8021Q || tpid == ETH_P_8021AD_) {
+         if (data + 18 > end)
+            return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_UNPARSED);
+         frame.vlan = swsec_load_be16(data + 14) & 0x0fff;
+         frame.tag_in_bytes = 1;
+         l2 = 16;
+      }
+   }
+   const __u8 *type = data + l2;
+   if (type + 2 > end)
+      return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_UNPARSED);
+   const __u16 ethertype = swsec_load_be16(type);
+   const __u8 *l3 = type + 2;
+
+   if (direction == SWSEC_FP_DIR_FROM_VM && (port->flags & SWSEC_FP_PORT_ERR_STATE))
+      return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_ERR_STATE);
+   if ((features & SWSEC_FP_FEATURE_BPDU_FILTER) &&
+       (swsec_is_mac(data, 0x01, 0x80, 0xc2, 0x00, 0x00, 0x00) ||
+        swsec_is_mac(data, 0x01, 0x00, 0x0c, 0xcc, 0xcc, 0xcd)))
+      return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_BPDU);
+   if (ethertype == ETH_P_8021Q || ethertype == ETH_P_8021AD_ || ethertype == ETH_P_QINQ_)
+      return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_TAGGED);
+   if (ethertype == ETH_P_ARP)
+      return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_ARP);
+
+   if (ethertype == ETH_P_IPV6) {
+      if (direction != SWSEC_FP_DIR_FROM_VM || !(features & SWSEC_FP_FEATURE_BLOCK_DHCP_SERVER))
+         return swsec_pass();
+      if (l3 + 40 > end)
+         return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_UNPARSED);
+      if (l3[6] != IPPROTO_UDP_)
+         return swsec_pass(); /* the module looks at a UDP header right after IPv6 only */
+      if (l3 + 48 > end)
+         return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_UNPARSED);
+      if (swsec_load_be16(l3 + 40) == DHCPV6_SERVER_PORT)
+         return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_DHCP);
+      return swsec_pass();
+   }
+   if (ethertype != ETH_P_IP)
+      return swsec_pass();
+
+   /* IPv4: a plain 20-byte header, not a fragment, else the module decides. */
+   if (l3 + 20 > end || l3[0] != 0x45)
+      return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_UNPARSED);
+   if ((swsec_load_be16(l3 + 6) & 0x3fff) != 0)
+      return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_FRAGMENT);
+   if (l3[9] == IPPROTO_UDP_) {
+      if (l3 + 28 > end)
+         return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_UNPARSED);
+      const __u16 sport = swsec_load_be16(l3 + 20);
+      const __u16 dport = swsec_load_be16(l3 + 22);
+      if (sport == DHCP_SERVER_PORT || sport == DHCP_CLIENT_PORT || dport == DHCP_SERVER_PORT ||
+          dport == DHCP_CLIENT_PORT)
+         return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_DHCP);
+   }
+   if (direction != SWSEC_FP_DIR_FROM_VM)
+      return swsec_pass();
+
+   const int guard = (features & SWSEC_FP_FEATURE_IP_SOURCE_GUARD) != 0;
+   const int refresh = (features & SWSEC_FP_FEATURE_IP_DISCOVERY) && (port->flags & SWSEC_FP_PORT_TRUSTED);
+   if (!guard && !refresh)
+      return swsec_pass();
+   struct swsec_fp_binding_key key = {.vlan = frame.vlan};
+   __builtin_memcpy(key.mac, data + 6, 6);
+   __builtin_memcpy(&key.ip, l3 + 12, 4);
+   const struct swsec_fp_binding *binding = bpf_map_lookup_elem(&swsec_bindings, &key);
+   /* A trusted port's module renews a learned binding's lifetime on its traffic. */
+   if (refresh && binding && !binding->authoritative)
+      return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_REFRESH);
+   if (guard && !binding) {
+      swsec_count(SWSEC_FP_DROP_IP_SOURCE_GUARD);
+      return TC_ACT_SHOT;
+   }
+   return swsec_pass();
+}
+
+SEC("tc")
+int swsec_from_vm(struct __sk_buff *skb)
+{
+   return swsec_judge(skb, SWSEC_FP_DIR_FROM_VM);
+}
+
+SEC("tc")
+int swsec_to_vm(struct __sk_buff *skb)
+{
+   return swsec_judge(skb, SWSEC_FP_DIR_TO_VM);
+}
+
+char LICENSE[] SEC("license") = "GPL";

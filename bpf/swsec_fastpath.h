@@ -1,0 +1,122 @@
+/*
+ * The kernel fast path's maps: the layouts of their keys, values and ring
+ * buffer records, shared by the tc program and the user space that fills
+ * and reads them. One copy, included by both sides.
+ *
+ * Map                 kind          key                    value
+ * swsec_port          array (1)     u32 0                  struct swsec_fp_port
+ * swsec_bindings      hash          struct swsec_fp_binding_key  struct swsec_fp_binding
+ * swsec_counters      per-CPU array u32 reason             u64 frames
+ * swsec_punts         ring buffer   -                      struct swsec_fp_punt + frame bytes
+ *
+ * User space owns every value: the program only reads the port and the
+ * bindings, and writes counters and punt records.
+ */
+#ifndef SWSEC_FASTPATH_H
+#define SWSEC_FASTPATH_H
+
+#include <linux/types.h>
+
+#ifdef __cplusplus
+#include <cstddef>
+#define SWSEC_FP_STATIC_ASSERT static_assert
+#else
+#include <stddef.h>
+#define SWSEC_FP_STATIC_ASSERT _Static_assert
+#endif
+
+/* Directions, as the module numbers them. */
+#define SWSEC_FP_DIR_TO_VM 1u
+#define SWSEC_FP_DIR_FROM_VM 2u
+
+/* swsec_fp_port.flags */
+#define SWSEC_FP_PORT_READY 0x1u     /* the maps mirror the module: decide; else punt every frame */
+#define SWSEC_FP_PORT_TRUSTED 0x2u   /* the port's IP discovery is in trusted mode */
+#define SWSEC_FP_PORT_ERR_STATE 0x4u /* the port is in the error-rate-limit state */
+
+/* The port's configuration and error state, as the module has them. */
+struct swsec_fp_port {
+   __u32 features; /* the module's featuresEnabled bits */
+   __u32 flags;    /* SWSEC_FP_PORT_* */
+   __u32 port_id;  /* the switch port ID, copied into punt records */
+   __u32 reserved;
+};
+SWSEC_FP_STATIC_ASSERT(sizeof(struct swsec_fp_port) == 16, "swsec_fp_port layout");
+SWSEC_FP_STATIC_ASSERT(offsetof(struct swsec_fp_port, flags) == 4, "swsec_fp_port layout");
+SWSEC_FP_STATIC_ASSERT(offsetof(struct swsec_fp_port, port_id) == 8, "swsec_fp_port layout");
+
+/* Feature bits of `features` that the program reads (the module's values). */
+#define SWSEC_FP_FEATURE_BPDU_FILTER 0x01u
+#define SWSEC_FP_FEATURE_BLOCK_DHCP_SERVER 0x02u
+#define SWSEC_FP_FEATURE_IP_DISCOVERY 0x04u
+#define SWSEC_FP_FEATURE_DAI 0x08u
+#define SWSEC_FP_FEATURE_IP_SOURCE_GUARD 0x10u
+
+/* A binding's key: the module's VMI key (VLAN, MAC, IPv4 in network order). */
+struct swsec_fp_binding_key {
+   __u16 vlan;
+   __u8 mac[6];
+   __u32 ip;
+};
+SWSEC_FP_STATIC_ASSERT(sizeof(struct swsec_fp_binding_key) == 12, "swsec_fp_binding_key layout");
+SWSEC_FP_STATIC_ASSERT(offsetof(struct swsec_fp_binding_key, mac) == 2, "swsec_fp_binding_key layout");
+SWSEC_FP_STATIC_ASSERT(offsetof(struct swsec_fp_binding_key, ip) == 8, "swsec_fp_binding_key layout");
+
+struct swsec_fp_binding {
+   __u8 authoritative; /* learned by DHCP or static: its lifetime is not refreshed by traffic */
+   __u8 reserved[3];
+};
+SWSEC_FP_STATIC_ASSERT(sizeof(struct swsec_fp_binding) == 4, "swsec_fp_binding layout");
+
+/* The most bindings a port's map holds: the module's 32, and room for changes in flight. */
+#define SWSEC_FP_MAX_BINDINGS 64
+
+/*
+ * What the program did with a frame, one per-CPU counter each. A frame is
+ * passed, dropped with its reason, or punted to user space (with why) for
+ * the module to judge.
+ */
+#define SWSEC_FP_REASON_LIST(X)                                               \
+   X(SWSEC_FP_PASSED, "passed")                                               \
+   X(SWSEC_FP_DROP_IP_SOURCE_GUARD, "IP source guard")                        \
+   X(SWSEC_FP_PUNT_NOT_READY, "punted: not ready")                            \
+   X(SWSEC_FP_PUNT_ARP, "punted: ARP")                                        \
+   X(SWSEC_FP_PUNT_DHCP, "punted: DHCP")                                      \
+   X(SWSEC_FP_PUNT_BPDU, "punted: BPDU")                                      \
+   X(SWSEC_FP_PUNT_TAGGED, "punted: inner tag")                               \
+   X(SWSEC_FP_PUNT_FRAGMENT, "punted: fragment")                              \
+   X(SWSEC_FP_PUNT_UNPARSED, "punted: header not parsed")                     \
+   X(SWSEC_FP_PUNT_ERR_STATE, "punted: error-rate-limit state")               \
+   X(SWSEC_FP_PUNT_REFRESH, "punted: binding refresh")                        \
+   X(SWSEC_FP_PUNT_LOST, "lost: punt ring full")
+
+#define SWSEC_FP_REASON_ENUM(name, text) name,
+enum swsec_fp_reason { SWSEC_FP_REASON_LIST(SWSEC_FP_REASON_ENUM) SWSEC_FP_REASON_COUNT };
+#undef SWSEC_FP_REASON_ENUM
+
+/* swsec_fp_punt.flags */
+#define SWSEC_FP_PUNT_TAG_IN_BYTES 0x1u /* the outer tag (the VLAN below) is still in the bytes */
+
+/* A punted frame in the ring buffer: this header, then `captured` bytes of the frame. */
+struct swsec_fp_punt {
+   __u32 port_id;
+   __u32 frame_len; /* the frame's length as the program saw it */
+   __u32 captured;  /* bytes that follow: the frame's first, at most SWSEC_FP_PUNT_MAX_BYTES */
+   __u16 vlan;      /* VLAN ID of the outer tag; 0 untagged */
+   __u8 direction;  /* SWSEC_FP_DIR_* */
+   __u8 flags;      /* SWSEC_FP_PUNT_* */
+   __u8 reason;     /* enum swsec_fp_reason */
+   __u8 reserved[3];
+};
+SWSEC_FP_STATIC_ASSERT(sizeof(struct swsec_fp_punt) == 20, "swsec_fp_punt layout");
+SWSEC_FP_STATIC_ASSERT(offsetof(struct swsec_fp_punt, frame_len) == 4, "swsec_fp_punt layout");
+SWSEC_FP_STATIC_ASSERT(offsetof(struct swsec_fp_punt, captured) == 8, "swsec_fp_punt layout");
+SWSEC_FP_STATIC_ASSERT(offsetof(struct swsec_fp_punt, vlan) == 12, "swsec_fp_punt layout");
+SWSEC_FP_STATIC_ASSERT(offsetof(struct swsec_fp_punt, direction) == 14, "swsec_fp_punt layout");
+SWSEC_FP_STATIC_ASSERT(offsetof(struct swsec_fp_punt, reason) == 16, "swsec_fp_punt layout");
+
+/* Frame bytes a punt record carries at most (a jumbo frame and its tag). */
+#define SWSEC_FP_PUNT_MAX_BYTES 9220u
+#define SWSEC_FP_PUNT_RING_BYTES (1u << 20)
+
+#endif /* SWSEC_FASTPATH_H */

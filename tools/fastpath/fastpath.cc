@@ -1,0 +1,405 @@
+#include "fastpath.h"
+
+#include <bpf/bpf.h>
+#include <bpf/libbpf.h>
+#include <linux/pkt_cls.h>
+#include <sys/stat.h>
+#include <sys/statfs.h>
+
+#include <cerrno>
+#include <cstring>
+#include <filesystem>
+#include <utility>
+
+namespace swsec::fastpath {
+namespace {
+
+constexpr long kBpfFsMagic = 0xcafe4a11;
+constexpr const char *kPinnedMaps[] = {"swsec_port", "swsec_bindings", "swsec_counters", "swsec_punts"};
+
+#define SWSEC_FP_REASON_NAME(name, text) text,
+constexpr std::string_view kReasonNames[] = {SWSEC_FP_REASON_LIST(SWSEC_FP_REASON_NAME)};
+#undef SWSEC_FP_REASON_NAME
+static_assert(std::size(kReasonNames) == SWSEC_FP_REASON_COUNT);
+
+// libbpf answers with a negative errno, or null and errno set.
+int check(int result, const std::string &what)
+{
+   if (result < 0) {
+      throw Error(what, -result);
+   }
+   return result;
+}
+
+swsec_fp_binding_key keyOf(const Binding &binding)
+{
+   swsec_fp_binding_key key{};
+   key.vlan = binding.vlan;
+   std::memcpy(key.mac, binding.mac.data(), sizeof key.mac);
+   key.ip = binding.ip;
+   return key;
+}
+
+void makePinDir(const std::string &dir)
+{
+   std::error_code error;
+   std::filesystem::create_directories(dir, error);
+   if (error) {
+      throw Error("cannot make " + dir, error.value());
+   }
+   struct statfs fs {};
+   if (statfs(dir.c_str(), &fs) != 0) {
+      throw Error("cannot read " + dir, errno);
+   }
+   if (fs.f_type != kBpfFsMagic) {
+      throw Error(dir + " is not on a BPF file system (mount -t bpf bpf /sys/fs/bpf)", ENOTSUP);
+   }
+}
+
+// A ring buffer record, read only within `size`.
+int takePunt(void *context, void *data, size_t size)
+{
+   auto *sink = static_cast<std::function<void(Punt &&)> *>(context);
+   swsec_fp_punt head{};
+   if (size < sizeof head) {
+      return 0;
+   }
+   std::memcpy(&head, data, sizeof head);
+   if (head.captured > size - sizeof head) {
+      return 0;
+   }
+   const auto *bytes = static_cast<const uint8_t *>(data) + sizeof head;
+   Punt punt;
+   punt.portId = head.port_id;
+   punt.direction = head.direction;
+   punt.vlan = head.vlan;
+   punt.reason = head.reason;
+   punt.frameLen = head.frame_len;
+   punt.truncated = head.captured < head.frame_len;
+   if ((head.flags & SWSEC_FP_PUNT_TAG_IN_BYTES) != 0 && head.captured >= 18) {
+      punt.bytes.assign(bytes, bytes + 12);
+      punt.bytes.insert(punt.bytes.end(), bytes + 16, bytes + head.captured);
+   } else {
+      punt.bytes.assign(bytes, bytes + head.captured);
+   }
+   if (*sink) {
+      (*sink)(std::move(punt));
+   }
+   return 0;
+}
+
+}  // namespace
+
+Error::Error(const std::string &what, int error)
+   : std::runtime_error(what + ": " + std::strerror(error)), error_(error)
+{
+}
+
+uint64_t Counters::punted() const
+{
+   uint64_t sum = 0;
+   for (uint32_t reason = SWSEC_FP_PUNT_NOT_READY; reason < SWSEC_FP_PUNT_LOST; ++reason) {
+      sum += frames[reason];
+   }
+   return sum;
+}
+
+std::string_view reasonName(uint32_t reason)
+{
+   return reason < SWSEC_FP_REASON_COUNT ? kReasonNames[reason] : "unknown";
+}
+
+Untagged takeOuterTag(std::span<const uint8_t> frame)
+{
+   Untagged out;
+   if (frame.size() >= 18) {
+      const uint16_t tpid = static_cast<uint16_t>(frame[12] << 8 | frame[13]);
+      if (tpid == 0x8100 || tpid == 0x88a8) {
+         out.vlan = static_cast<uint16_t>((frame[14] << 8 | frame[15]) & 0x0fff);
+         out.bytes.assign(frame.begin(), frame.begin() + 12);
+         out.bytes.insert(out.bytes.end(), frame.begin() + 16, frame.end());
+         return out;
+      }
+   }
+   out.bytes.assign(frame.begin(), frame.end());
+   return out;
+}
+
+Program::Program(const Options &options) : pinDir_(options.pinDir)
+{
+   const auto object = embeddedObject();
+   LIBBPF_OPTS(bpf_object_open_opts, openOptions, .object_name = "swsec_fastpath");
+   object_ = bpf_object__open_mem(object.data(), object.size(), &openOptions);
+   if (object_ == nullptr) {
+      throw Error("cannot open the fast path program", errno);
+   }
+   try {
+      if (!pinDir_.empty()) {
+         makePinDir(pinDir_);
+         for (const char *name : kPinnedMaps) {
+            bpf_map *map = bpf_object__find_map_by_name(object_, name);
+            const std::string path = pinDir_ + "/" + name;
+            check(map != nullptr ? bpf_map__set_pin_path(map, path.c_str()) : -ENOENT, "cannot pin " + path);
+         }
+      }
+      check(bpf_object__load(object_), "cannot load the fast path program");
+      sink_ = new std::function<void(Punt &&)>;
+      ring_ = ring_buffer__new(mapFd("swsec_punts"), takePunt, sink_, nullptr);
+      if (ring_ == nullptr) {
+         throw Error("cannot read the punt ring", errno);
+      }
+   } catch (...) {
+      close();
+      throw;
+   }
+}
+
+Program::~Program()
+{
+   close();
+}
+
+Program::Program(Program &&other) noexcept
+   : object_(std::exchange(other.object_, nullptr)), ring_(std::exchange(other.ring_, nullptr)),
+     sink_(std::exchange(other.sink_, nullptr)), pinDir_(std::move(other.pinDir_))
+{
+}
+
+Program &Program::operator=(Program &&other) noexcept
+{
+   if (this != &other) {
+      close();
+      object_ = std::exchange(other.object_, nullptr);
+      ring_ = std::exchange(other.ring_, nullptr);
+      sink_ = std::exchange(other.sink_, nullptr);
+      pinDir_ = std::move(other.pinDir_);
+   }
+   return *this;
+}
+
+void Program::close() noexcept
+{
+   if (ring_ != nullptr) {
+      ring_buffer__free(ring_);
+      ring_ = nullptr;
+   }
+   delete sink_;
+   sink_ = nullptr;
+   if (object_ != nullptr) {
+      bpf_object__close(object_);
+      object_ = nullptr;
+   }
+}
+
+int Program::mapFd(const char *name) const
+{
+   const bpf_map *map = bpf_object__find_map_by_name(object_, name);
+   return check(map != nullptr ? bpf_map__fd(map) : -ENOENT, std::string("no map ") + name);
+}
+
+int Program::programFd(uint32_t direction) const
+{
+   const char *name = direction == SWSEC_FP_DIR_FROM_VM ? "swsec_from_vm" : "swsec_to_vm";
+   const bpf_program *program = bpf_object__find_program_by_name(object_, name);
+   return check(program != nullptr ? bpf_program__fd(program) : -ENOENT, std::string("no program ") + name);
+}
+
+swsec_fp_port Program::port() const
+{
+   const uint32_t zero = 0;
+   swsec_fp_port value{};
+   check(bpf_map_lookup_elem(mapFd("swsec_port"), &zero, &value), "cannot read the port map");
+   return value;
+}
+
+void Program::describe(const PortDescription &description)
+{
+   // Not ready while the bindings change, so that no frame is judged on a half-filled map.
+   setNotReady();
+   const int fd = mapFd("swsec_bindings");
+   for (const Binding &binding : bindings()) {
+      const swsec_fp_binding_key key = keyOf(binding);
+      check(bpf_map_delete_elem(fd, &key), "cannot remove a binding");
+   }
+   for (const Binding &binding : description.bindings) {
+      apply({.added = true, .binding = binding});
+   }
+   swsec_fp_port value{};
+   value.features = description.features;
+   value.port_id = description.portId;
+   value.flags = SWSEC_FP_PORT_READY | (description.trusted ? SWSEC_FP_PORT_TRUSTED : 0u) |
+                 (description.errorState ? SWSEC_FP_PORT_ERR_STATE : 0u);
+   const uint32_t zero = 0;
+   check(bpf_map_update_elem(mapFd("swsec_port"), &zero, &value, BPF_ANY), "cannot write the port map");
+}
+
+void Program::setNotReady()
+{
+   swsec_fp_port value = port();
+   value.flags &= ~SWSEC_FP_PORT_READY;
+   const uint32_t zero = 0;
+   check(bpf_map_update_elem(mapFd("swsec_port"), &zero, &value, BPF_ANY), "cannot write the port map");
+}
+
+void Program::setErrorState(bool on)
+{
+   swsec_fp_port value = port();
+   value.flags = on ? (value.flags | SWSEC_FP_PORT_ERR_STATE) : (value.flags & ~SWSEC_FP_PORT_ERR_STATE);
+   const uint32_t zero = 0;
+   check(bpf_map_update_elem(mapFd("swsec_port"), &zero, &value, BPF_ANY), "cannot write the port map");
+}
+
+void Program::apply(const BindingChange &change)
+{
+   const swsec_fp_binding_key key = keyOf(change.binding);
+   const int fd = mapFd("swsec_bindings");
+   if (change.added) {
+      swsec_fp_binding value{};
+      value.authoritative = change.binding.authoritative ? 1 : 0;
+      check(bpf_map_update_elem(fd, &key, &value, BPF_ANY), "cannot add a binding");
+      return;
+   }
+   const int result = bpf_map_delete_elem(fd, &key);
+   if (result != -ENOENT) {
+      check(result, "cannot remove a binding");
+   }
+}
+
+std::vector<Binding> Program::bindings() const
+{
+   const int fd = mapFd("swsec_bindings");
+   std::vector<Binding> out;
+   swsec_fp_binding_key key{};
+   swsec_fp_binding_key next{};
+   const void *previous = nullptr;
+   // The map holds at most SWSEC_FP_MAX_BINDINGS keys.
+   for (int guard = 0; guard <= SWSEC_FP_MAX_BINDINGS && bpf_map_get_next_key(fd, previous, &next) == 0; ++guard) {
+      swsec_fp_binding value{};
+      if (bpf_map_lookup_elem(fd, &next, &value) == 0) {
+         Binding binding;
+         binding.vlan = next.vlan;
+         std::memcpy(binding.mac.data(), next.mac, sizeof next.mac);
+         binding.ip = next.ip;
+         binding.authoritative = value.authoritative != 0;
+         out.push_back(binding);
+      }
+      key = next;
+      previous = &key;
+   }
+   return out;
+}
+
+Counters Program::counters() const
+{
+   const int cpus = check(libbpf_num_possible_cpus(), "cannot count the CPUs");
+   const int fd = mapFd("swsec_counters");
+   Counters out;
+   std::vector<uint64_t> perCpu(static_cast<size_t>(cpus));
+   for (uint32_t reason = 0; reason < SWSEC_FP_REASON_COUNT; ++reason) {
+      check(bpf_map_lookup_elem(fd, &reason, perCpu.data()), "cannot read the counters");
+      for (uint64_t count : perCpu) {
+         out.frames[reason] += count;
+      }
+   }
+   return out;
+}
+
+Program::Run Program::testRun(std::span<const uint8_t> frame, uint32_t direction, uint32_t repeat) const
+{
+   LIBBPF_OPTS(bpf_test_run_opts, options, .data_in = frame.data(),
+               .data_size_in = static_cast<uint32_t>(frame.size()), .repeat = static_cast<int>(repeat));
+   check(bpf_prog_test_run_opts(programFd(direction), &options), "cannot run the fast path program");
+   return Run{.action = static_cast<int>(options.retval), .nanoseconds = options.duration};
+}
+
+size_t Program::drainPunts(const std::function<void(Punt &&)> &sink)
+{
+   *sink_ = sink;
+   const int consumed = ring_buffer__consume(ring_);
+   *sink_ = nullptr;
+   return static_cast<size_t>(check(consumed, "cannot read the punt ring"));
+}
+
+void Program::unpin()
+{
+   if (pinDir_.empty()) {
+      return;
+   }
+   for (const char *name : kPinnedMaps) {
+      bpf_map *map = bpf_object__find_map_by_name(object_, name);
+      if (map != nullptr && bpf_map__is_pinned(map)) {
+         check(bpf_map__unpin(map, nullptr), std::string("cannot unpin ") + name);
+      }
+   }
+   std::error_code ignored;
+   std::filesystem::remove(pinDir_, ignored);
+}
+
+Attachment::Attachment(const Program &program, int ifindex, bool ingress, bool egress) : ifindex_(ifindex)
+{
+   LIBBPF_OPTS(bpf_tc_hook, hook, .ifindex = ifindex, .attach_point = BPF_TC_INGRESS);
+   const int made = bpf_tc_hook_create(&hook);
+   if (made != -EEXIST) {
+      check(made, "cannot add a clsact qdisc to interface " + std::to_string(ifindex));
+      madeQdisc_ = true;
+   }
+   try {
+      const auto attach = [&](Hook &state, bpf_tc_attach_point point, uint32_t direction) {
+         hook.attach_point = point;
+         LIBBPF_OPTS(bpf_tc_opts, options, .prog_fd = program.programFd(direction));
+         check(bpf_tc_attach(&hook, &options), "cannot attach to interface " + std::to_string(ifindex));
+         state = Hook{.attached = true, .handle = options.handle, .priority = options.priority};
+      };
+      if (ingress) {
+         attach(ingress_, BPF_TC_INGRESS, SWSEC_FP_DIR_FROM_VM);
+      }
+      if (egress) {
+         attach(egress_, BPF_TC_EGRESS, SWSEC_FP_DIR_TO_VM);
+      }
+   } catch (...) {
+      try {
+         detach();
+      } catch (const Error &) {
+         // The attach error is the one to report.
+      }
+      throw;
+   }
+}
+
+Attachment::~Attachment()
+{
+   try {
+      detach();
+   } catch (const Error &) {
+      // An interface that went takes its hooks with it.
+   }
+}
+
+void Attachment::detach()
+{
+   LIBBPF_OPTS(bpf_tc_hook, hook, .ifindex = ifindex_, .attach_point = BPF_TC_INGRESS);
+   int failed = 0;
+   for (auto [state, point] : {std::pair{&ingress_, BPF_TC_INGRESS}, std::pair{&egress_, BPF_TC_EGRESS}}) {
+      if (!state->attached) {
+         continue;
+      }
+      hook.attach_point = point;
+      LIBBPF_OPTS(bpf_tc_opts, options, .handle = state->handle, .priority = state->priority);
+      const int result = bpf_tc_detach(&hook, &options);
+      if (result < 0 && result != -ENOENT && result != -ENODEV) {
+         failed = result;
+      }
+      state->attached = false;
+   }
+   if (madeQdisc_) {
+      madeQdisc_ = false;
+      hook.attach_point = static_cast<bpf_tc_attach_point>(BPF_TC_INGRESS | BPF_TC_EGRESS);
+      const int result = bpf_tc_hook_destroy(&hook);
+      if (result < 0 && result != -ENOENT && result != -ENODEV && result != -EINVAL) {
+         failed = result;
+      }
+   }
+   check(failed, "cannot detach from interface " + std::to_string(ifindex_));
+}
+
+}  // namespace swsec::fastpath

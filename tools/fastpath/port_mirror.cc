@@ -1,0 +1,137 @@
+#include "port_mirror.h"
+
+#include <charconv>
+#include <cstring>
+#include <string>
+
+namespace swsec::fastpath {
+namespace {
+
+constexpr std::string_view kSecurityProperty = "sifra-generic-tarlin-swsec.security";
+constexpr std::string_view kAdded = "portdb.entry.added";
+constexpr std::string_view kRemoved = "portdb.entry.removed";
+
+// The security configuration record's header: features at 1 (u32, host
+// order), trusted at 5.
+constexpr size_t kConfigHeaderLen = 26;
+constexpr size_t kConfigFeaturesOffset = 1;
+constexpr size_t kConfigTrustedOffset = 5;
+
+// A notification's 40-byte payload: op, count, then one entry record
+// (VLAN at 8, MAC at 10, IPv4 at 20 in network order, authoritative at 36).
+constexpr size_t kNotificationLen = 40;
+constexpr size_t kEntryVlanOffset = 8;
+constexpr size_t kEntryMacOffset = 10;
+constexpr size_t kEntryIpOffset = 20;
+constexpr size_t kEntryAuthoritativeOffset = 36;
+
+std::string portPath(uint32_t portId)
+{
+   return "/security/" + std::to_string(portId);
+}
+
+std::string field(const host::NexoRecord &record, std::string_view name)
+{
+   const auto values = record.values();
+   const auto found = values.find(name);
+   if (found == values.end()) {
+      throw std::runtime_error("no field " + std::string(name) + " in " + record.name);
+   }
+   return found->second;
+}
+
+// "a:b:c:d:e:f" in hex, "a.b.c.d" in decimal: exactly that, or an error.
+template <size_t N>
+std::array<uint8_t, N> parseParts(std::string_view text, char separator, int base)
+{
+   std::array<uint8_t, N> out{};
+   const char *at = text.data();
+   const char *end = text.data() + text.size();
+   for (size_t i = 0; i < N; ++i) {
+      if (i != 0) {
+         if (at == end || *at != separator) {
+            throw std::runtime_error("malformed address " + std::string(text));
+         }
+         ++at;
+      }
+      const auto [next, error] = std::from_chars(at, end, out[i], base);
+      if (error != std::errc()) {
+         throw std::runtime_error("malformed address " + std::string(text));
+      }
+      at = next;
+   }
+   if (at != end) {
+      throw std::runtime_error("malformed address " + std::string(text));
+   }
+   return out;
+}
+
+}  // namespace
+
+bool readErrorState(host::Host &host, uint32_t portId)
+{
+   host::NexoRecord summary;
+   if (host.nexo().get(portPath(portId) + "/featureSummary", &summary) != ORR_OK) {
+      throw std::runtime_error("cannot read the feature summary of port " + std::to_string(portId));
+   }
+   return field(summary, "txRateLimitErr") == "Yes";
+}
+
+PortDescription readPort(host::Host &host, host::FilterId filter, uint32_t portId)
+{
+   PortDescription port;
+   port.portId = portId;
+   const std::optional<uint32_t> length = host.sifra().pollProperty(kSecurityProperty, filter);
+   std::vector<uint8_t> config(length.value_or(0));
+   if (config.size() < kConfigHeaderLen || host.sifra().readProperty(kSecurityProperty, filter, config) != ORR_OK) {
+      throw std::runtime_error("cannot read the configuration of port " + std::to_string(portId));
+   }
+   std::memcpy(&port.features, config.data() + kConfigFeaturesOffset, sizeof port.features);
+   port.trusted = config[kConfigTrustedOffset] != 0;
+   port.errorState = readErrorState(host, portId);
+
+   std::vector<int64_t> instances;
+   const std::string vmiPath = portPath(portId) + "/vmi";
+   if ((port.features & SWSEC_FP_FEATURE_IP_DISCOVERY) == 0) {
+      return port;   // no port database
+   }
+   if (host.nexo().list(vmiPath, &instances) != ORR_OK) {
+      throw std::runtime_error("cannot list the bindings of port " + std::to_string(portId));
+   }
+   for (const int64_t instance : instances) {
+      host::NexoRecord vmi;
+      if (host.nexo().get(vmiPath + "/" + std::to_string(instance), &vmi) != ORR_OK) {
+         throw std::runtime_error("cannot read binding " + std::to_string(instance) + " of port " +
+                                  std::to_string(portId));
+      }
+      Binding binding;
+      const std::string vlan = field(vmi, "vlanId");
+      if (std::from_chars(vlan.data(), vlan.data() + vlan.size(), binding.vlan).ec != std::errc()) {
+         throw std::runtime_error("malformed VLAN " + vlan);
+      }
+      binding.mac = parseParts<6>(field(vmi, "macAddr"), ':', 16);
+      const auto ip = parseParts<4>(field(vmi, "ipAddr"), '.', 10);
+      std::memcpy(&binding.ip, ip.data(), sizeof binding.ip);
+      const std::string method = field(vmi, "discoveryMethod");
+      binding.authoritative = method == "DHCP Snooping" || method == "Static";
+      port.bindings.push_back(binding);
+   }
+   return port;
+}
+
+std::optional<BindingChange> bindingChange(const host::PostedMessage &message)
+{
+   if ((message.name != kAdded && message.name != kRemoved) || message.payload.size() < kNotificationLen) {
+      return std::nullopt;
+   }
+   const uint8_t *payload = message.payload.data();
+   BindingChange change;
+   change.added = message.name == kAdded;
+   std::memcpy(&change.binding.vlan, payload + kEntryVlanOffset, sizeof change.binding.vlan);
+   std::memcpy(change.binding.mac.data(), payload + kEntryMacOffset, change.binding.mac.size());
+   std::memcpy(&change.binding.ip, payload + kEntryIpOffset, sizeof change.binding.ip);
+   change.binding.authoritative = payload[kEntryAuthoritativeOffset] != 0;
+   return change;
+}
+
+}  // namespace swsec::fastpath

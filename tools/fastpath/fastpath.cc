@@ -22,6 +22,15 @@ constexpr std::string_view kReasonNames[] = {SWSEC_FP_REASON_LIST(SWSEC_FP_REASO
 #undef SWSEC_FP_REASON_NAME
 static_assert(std::size(kReasonNames) == SWSEC_FP_REASON_COUNT);
 
+// A libbpf options record (LIBBPF_OPTS is a C macro): zeroed, its size set.
+template <class Options>
+Options optionsOf()
+{
+   Options options{};
+   options.sz = sizeof(Options);
+   return options;
+}
+
 // libbpf answers with a negative errno, or null and errno set.
 int check(int result, const std::string &what)
 {
@@ -128,7 +137,8 @@ Untagged takeOuterTag(std::span<const uint8_t> frame)
 Program::Program(const Options &options) : pinDir_(options.pinDir)
 {
    const auto object = embeddedObject();
-   LIBBPF_OPTS(bpf_object_open_opts, openOptions, .object_name = "swsec_fastpath");
+   auto openOptions = optionsOf<bpf_object_open_opts>();
+   openOptions.object_name = "swsec_fastpath";
    object_ = bpf_object__open_mem(object.data(), object.size(), &openOptions);
    if (object_ == nullptr) {
       throw Error("cannot open the fast path program", errno);
@@ -306,8 +316,10 @@ Counters Program::counters() const
 
 Program::Run Program::testRun(std::span<const uint8_t> frame, uint32_t direction, uint32_t repeat) const
 {
-   LIBBPF_OPTS(bpf_test_run_opts, options, .data_in = frame.data(),
-               .data_size_in = static_cast<uint32_t>(frame.size()), .repeat = static_cast<int>(repeat));
+   auto options = optionsOf<bpf_test_run_opts>();
+   options.data_in = frame.data();
+   options.data_size_in = static_cast<uint32_t>(frame.size());
+   options.repeat = static_cast<int>(repeat);
    check(bpf_prog_test_run_opts(programFd(direction), &options), "cannot run the fast path program");
    return Run{.action = static_cast<int>(options.retval), .nanoseconds = options.duration};
 }
@@ -337,7 +349,9 @@ void Program::unpin()
 
 Attachment::Attachment(const Program &program, int ifindex, bool ingress, bool egress) : ifindex_(ifindex)
 {
-   LIBBPF_OPTS(bpf_tc_hook, hook, .ifindex = ifindex, .attach_point = BPF_TC_INGRESS);
+   auto hook = optionsOf<bpf_tc_hook>();
+   hook.ifindex = ifindex;
+   hook.attach_point = BPF_TC_INGRESS;
    const int made = bpf_tc_hook_create(&hook);
    if (made != -EEXIST) {
       check(made, "cannot add a clsact qdisc to interface " + std::to_string(ifindex));
@@ -346,7 +360,8 @@ Attachment::Attachment(const Program &program, int ifindex, bool ingress, bool e
    try {
       const auto attach = [&](Hook &state, bpf_tc_attach_point point, uint32_t direction) {
          hook.attach_point = point;
-         LIBBPF_OPTS(bpf_tc_opts, options, .prog_fd = program.programFd(direction));
+         auto options = optionsOf<bpf_tc_opts>();
+         options.prog_fd = program.programFd(direction);
          check(bpf_tc_attach(&hook, &options), "cannot attach to interface " + std::to_string(ifindex));
          state = Hook{.attached = true, .handle = options.handle, .priority = options.priority};
       };
@@ -377,14 +392,18 @@ Attachment::~Attachment()
 
 void Attachment::detach()
 {
-   LIBBPF_OPTS(bpf_tc_hook, hook, .ifindex = ifindex_, .attach_point = BPF_TC_INGRESS);
+   auto hook = optionsOf<bpf_tc_hook>();
+   hook.ifindex = ifindex_;
+   hook.attach_point = BPF_TC_INGRESS;
    int failed = 0;
    for (auto [state, point] : {std::pair{&ingress_, BPF_TC_INGRESS}, std::pair{&egress_, BPF_TC_EGRESS}}) {
       if (!state->attached) {
          continue;
       }
       hook.attach_point = point;
-      LIBBPF_OPTS(bpf_tc_opts, options, .handle = state->handle, .priority = state->priority);
+      auto options = optionsOf<bpf_tc_opts>();
+      options.handle = state->handle;
+      options.priority = state->priority;
       const int result = bpf_tc_detach(&hook, &options);
       if (result < 0 && result != -ENOENT && result != -ENODEV) {
          failed = result;

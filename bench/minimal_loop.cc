@@ -1,7 +1,7 @@
 #include "minimal_loop.h"
 
-#include "swsec/config_record.h"
-#include "swsec/swsec_vmi_hash.h"
+#include "contract/config_record.h"
+#include "contract/vmi_key.h"
 
 #include <algorithm>
 #include <cstring>

@@ -18,8 +18,8 @@
 
 #include "frame_mix.h"
 
+#include "contract/vmi_key.h"
 #include "platform/platform.h"
-#include "swsec/swsec_vmi.h"
 
 #include <array>
 #include <cstdint>

@@ -5,6 +5,8 @@
  */
 #pragma once
 
+#include "contract/state_blob.h"
+
 #include <cstdint>
 
 static_assert(__BYTE_ORDER__ == __ORDER_LITTLE_ENDIAN__,
@@ -22,9 +24,8 @@ constexpr uint64_t SifraGenericMagic(const char (&text)[9])
 constexpr uint64_t SIFRAGENERIC_AGENT_MAGIC = SifraGenericMagic("sifgfast");
 constexpr uint64_t SIFRAGENERIC_FILTER_MAGIC = SifraGenericMagic("sifgfilt");
 constexpr uint64_t SIFRAGENERIC_SLOWPATH_MAGIC = SifraGenericMagic("sifgslow");
-constexpr uint64_t SIFRAGENERIC_STATE_MAGIC = SifraGenericMagic("sifgsave");
 
 static_assert(SIFRAGENERIC_AGENT_MAGIC == 0x7473616667666973ull);
 static_assert(SIFRAGENERIC_FILTER_MAGIC == 0x746c696667666973ull);
 static_assert(SIFRAGENERIC_SLOWPATH_MAGIC == 0x776f6c7367666973ull);
-static_assert(SIFRAGENERIC_STATE_MAGIC == 0x6576617367666973ull);
+static_assert(SifraGenericMagic("sifgsave") == SIFRAGENERIC_STATE_MAGIC);

@@ -16,7 +16,8 @@
  */
 #pragma once
 
-#include "swsec/config_record.h"
+#include "contract/config_record.h"
+#include "contract/saved_state_layout.h"
 #include "swsec/swsec_vmi.h"
 
 #include "platform/orr_hash.h"
@@ -36,20 +37,6 @@ struct SifraGenericRateLimit {
    uint64_t intervalEnd;     /* host timer cycles */
    uint32_t count;           /* events in the current interval */
 };
-
-/*
- * The drop counters: one block, cleared and saved whole. Raised by frames
- * judged in parallel under the shared configLock, so with atomic adds.
- */
-struct SwSecDropCounters {
-   uint64_t dhcpSnoopingDropCnt;
-   uint64_t daiDropCnt;
-   uint64_t txRateLimitDropCnt;
-   uint64_t txRateLimitErrEntryCnt;
-   uint64_t rxRateLimitDropCnt;
-   uint64_t ipSrcGuardDropCnt;
-};
-static_assert(sizeof(SwSecDropCounters) == 48);
 
 struct SwSecContext {
    SifraGenericFilter *filter;         /* owner; its agentData points back here */
@@ -75,6 +62,7 @@ struct SwSecContext {
    SifraGenericRateLimit rxRateLimit;  /* frames to the VM */
    orr_Spinlock rxRateLimitLock;       /* "sifg.sec.rxratelimit", rank 6 */
 
+   /* Cleared and saved whole; raised by frames judged in parallel, so with atomic adds. */
    SwSecDropCounters counters;
 
    orr_Timer portDbTimer;              /* periodic 10 s, SwSecTimerCb; 0 when none */

@@ -11,35 +11,16 @@
 
 #include <cstddef>
 
-#define SWSEC_PORTDB_MSG_ADDED "portdb.entry.added"
-#define SWSEC_PORTDB_MSG_REMOVED "portdb.entry.removed"
-
-/* The payload: an operation and a count, then one exported entry record. */
-struct __attribute__((packed)) SwSecPortDbMsgPayload {
-   uint32_t op;              /* SwSecPortDbOp */
-   uint32_t numEntries;      /* always 1 */
-   SwSecPortDbEntry entry;
-};
-static_assert(sizeof(SwSecPortDbMsgPayload) == 40);
-static_assert(offsetof(SwSecPortDbMsgPayload, op) == 0);
-static_assert(offsetof(SwSecPortDbMsgPayload, numEntries) == 4);
-static_assert(offsetof(SwSecPortDbMsgPayload, entry) == 8);
-static_assert(offsetof(SwSecPortDbMsgPayload, entry) + offsetof(SwSecPortDbEntry, vlanId) == 8);
-static_assert(offsetof(SwSecPortDbMsgPayload, entry) + offsetof(SwSecPortDbEntry, macAddr) == 10);
-static_assert(offsetof(SwSecPortDbMsgPayload, entry) + offsetof(SwSecPortDbEntry, ipAddrType) == 16);
-static_assert(offsetof(SwSecPortDbMsgPayload, entry) + offsetof(SwSecPortDbEntry, ipAddr) == 20);
-static_assert(offsetof(SwSecPortDbMsgPayload, entry) + offsetof(SwSecPortDbEntry, authoritative) ==
-              36);
-
 struct SwSecPortDbMsg {
    orr_PortsetMessageHeader header;
    SwSecPortDbMsgPayload payload;
 };
-static_assert(sizeof(SwSecPortDbMsg) == 80);
+static_assert(sizeof(SwSecPortDbMsg) == SWSEC_PORTDB_MSG_LEN);
 static_assert(offsetof(SwSecPortDbMsg, header) == 0);
 static_assert(offsetof(SwSecPortDbMsg, header.name) == 0);
-static_assert(offsetof(SwSecPortDbMsg, header.payloadLength) == 32);
-static_assert(offsetof(SwSecPortDbMsg, payload) == 40);
+static_assert(sizeof(orr_PortsetMessageHeader::name) == SWSEC_PORTDB_MSG_NAME_LEN);
+static_assert(offsetof(SwSecPortDbMsg, header.payloadLength) == SWSEC_PORTDB_MSG_LENGTH_OFFSET);
+static_assert(offsetof(SwSecPortDbMsg, payload) == SWSEC_PORTDB_MSG_PAYLOAD_OFFSET);
 
 /* Lets go of a hold taken for a post, in the mode the CPU holds it now. */
 static void SwSecPortsetUnlock(orr_Portset *portset)

@@ -4,8 +4,8 @@
  */
 #pragma once
 
+#include "contract/vmi_key.h"
 #include "swsec/swsec_vmi.h"
-#include "swsec/swsec_vmi_hash.h"
 
 #include <cstddef>
 #include <cstdint>

@@ -1,10 +1,10 @@
 /* The security property of the built-in agent. */
 #include "swsec/swsec_security_property.h"
 
+#include "contract/config_record.h"
 #include "framework/sifra_generic_filter.h"
 #include "framework/sifra_generic_log.h"
 #include "platform/orr_text.h"
-#include "swsec/config_record.h"
 #include "swsec/swsec_config.h"
 #include "swsec/swsec_context.h"
 #include "swsec/swsec_port_db.h"

@@ -1,37 +1,14 @@
 /*
- * The records of a port database: the identity of a virtual machine
- * interface (VMI: VLAN, MAC, IPv4 address), a database entry with how it was
- * learned, and a pending DHCP request.
+ * The records of a port database: a database entry (a VMI with how it was
+ * learned; its key is contract/vmi_key.h) and a pending DHCP request.
  */
 #pragma once
 
+#include "contract/vmi_key.h"
 #include "platform/orr_hash.h"
 
 #include <cstddef>
 #include <cstdint>
-
-/* How a VMI was learned; bits, so that classes test by mask. */
-enum SwSecDiscMethod : uint8_t {
-   SwSecDiscDhcpSnooping = 1,
-   SwSecDiscStatic = 2,
-   SwSecDiscTofu = 4,
-   SwSecDiscApSnooping = 8,
-};
-
-constexpr uint8_t SwSecDiscAuthoritativeMask = SwSecDiscDhcpSnooping | SwSecDiscStatic;
-constexpr uint8_t SwSecDiscNonAuthoritativeMask = SwSecDiscTofu | SwSecDiscApSnooping;
-constexpr uint8_t SwSecDiscAllMask = SwSecDiscAuthoritativeMask | SwSecDiscNonAuthoritativeMask;
-
-/* The identity of a VMI: hash key, static entry and clear request layout. */
-struct __attribute__((packed)) SwSecVmiKey {
-   uint16_t vlanId;          /* host order */
-   uint8_t macAddr[6];
-   uint32_t ipAddr;          /* network order */
-};
-static_assert(sizeof(SwSecVmiKey) == 12);
-static_assert(offsetof(SwSecVmiKey, vlanId) == 0);
-static_assert(offsetof(SwSecVmiKey, macAddr) == 2);
-static_assert(offsetof(SwSecVmiKey, ipAddr) == 8);
 
 /*
  * A port database entry, a zeroed heap record.
@@ -94,7 +71,4 @@ static_assert(offsetof(SwSecVmi, clientIdLen) - offsetof(SwSecVmi, chaddr) ==
 static_assert(offsetof(SwSecVmi, clientIdStr) - offsetof(SwSecVmi, chaddr) ==
               offsetof(SwSecDhcpReq, clientIdStr) - offsetof(SwSecDhcpReq, chaddr));
 
-/* The most VMIs a port database may hold. */
-constexpr uint32_t SWSEC_PORT_DB_SIZE_MIN = 1;
-constexpr uint32_t SWSEC_PORT_DB_SIZE_MAX = 32;
 constexpr uint32_t SWSEC_PORT_DB_HASH_BUCKETS = 16;

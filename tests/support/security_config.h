@@ -4,8 +4,8 @@
 // the fuzz targets and the benchmark.
 #pragma once
 
-#include "swsec/config_record.h"
-#include "swsec/swsec_vmi.h"
+#include "contract/config_record.h"
+#include "contract/vmi_key.h"
 
 #include <array>
 #include <cstdint>

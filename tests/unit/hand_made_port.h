@@ -7,11 +7,11 @@
 
 #include "support/host_fixture.h"
 
+#include "contract/config_record.h"
 #include "framework/sifra_generic.h"
 #include "framework/sifra_generic_filter.h"
 #include "framework/sifra_generic_list.h"
 #include "framework/sifra_generic_lock.h"
-#include "swsec/config_record.h"
 #include "swsec/swsec_context.h"
 
 #include <chrono>

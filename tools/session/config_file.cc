@@ -2,9 +2,9 @@
 // than a silently different port.
 #include "session/config_file.h"
 
+#include "contract/config_record.h"
+#include "contract/vmi_key.h"
 #include "session/error.h"
-#include "swsec/config_record.h"
-#include "swsec/swsec_vmi.h"
 
 #include <arpa/inet.h>
 #include <nlohmann/json.hpp>

@@ -3,9 +3,13 @@
  * security property, the set-features ioctl and the saved state.
  *
  * A packed record in the host's byte order: a 26-byte header followed by
- * `numStatic` 12-byte static entries (SwSecVmiKey).
+ * `numStatic` 12-byte static entries (SwSecVmiKey, vmi_key.h).
+ *
+ * Wire contract: freestanding, shared by the module and the tools.
  */
 #pragma once
+
+#include "contract/vmi_key.h"
 
 #include <cstddef>
 #include <cstdint>
@@ -32,6 +36,10 @@ constexpr uint32_t SWSEC_ARP_RATE_LIMIT_MAX = 2048;
 constexpr uint32_t SWSEC_ERR_RATE_LIMIT_MAX = 32;
 constexpr uint32_t SWSEC_ERR_RATE_LIMIT_PERIOD_MIN = 10;
 
+/* The most VMIs a port database may hold (`portDbSize`). */
+constexpr uint32_t SWSEC_PORT_DB_SIZE_MIN = 1;
+constexpr uint32_t SWSEC_PORT_DB_SIZE_MAX = 32;
+
 struct __attribute__((packed)) SwSecConfig {
    uint8_t version;
    uint32_t featuresEnabled;
@@ -56,5 +64,5 @@ static_assert(offsetof(SwSecConfig, errRateLimitPeriod) == 22);
 /* Bytes of a record with `numStatic` entries; 64-bit so that no count overflows it. */
 constexpr uint64_t SwSecConfigLength(uint32_t numStatic)
 {
-   return sizeof(SwSecConfig) + 12ull * numStatic;
+   return sizeof(SwSecConfig) + sizeof(SwSecVmiKey) * static_cast<uint64_t>(numStatic);
 }

@@ -156,14 +156,21 @@ TEST_F(CtlServerTest, a_client_that_closes_its_side_after_the_request_still_gets
 
 TEST_F(CtlServerTest, log_follow_and_watch_stream_what_comes_after_the_recent_lines)
 {
-   events_.log("info", "inline", "before");
+   for (int i = 0; i <= 200; ++i) {
+      events_.log("info", "inline", "before " + std::to_string(i));
+   }
    CtlServer server(path_, events_, handler_);
+   // Plain or followed, a log starts with the 200 most recent lines.
+   Client plain(path_);
+   plain.send("{\"command\": \"log\"}\n");
+   const auto recent = nlohmann::json::parse(plain.line())["result"];
+   ASSERT_EQ(recent.size(), 200u);
+   EXPECT_EQ(recent[0]["text"], "before 1");
    Client log(path_);
    log.send("{\"command\": \"log\", \"follow\": true}\n");
    const auto first = nlohmann::json::parse(log.line());
    ASSERT_TRUE(first["streaming"]);
-   ASSERT_EQ(first["result"].size(), 1u);
-   EXPECT_EQ(first["result"][0]["text"], "before");
+   EXPECT_EQ(first["result"], recent);
    Client watch(path_);
    watch.send("{\"command\": \"watch\"}\n");
    EXPECT_TRUE(nlohmann::json::parse(watch.line())["result"].empty());

@@ -131,6 +131,16 @@ void CtlServer::serve()
       reply(client, {{"ok", false}, {"error", message}});
    };
 
+   auto recentLog = [&] {
+      nlohmann::json lines = nlohmann::json::array();
+      const auto recent = events_.since(EventKind::log, 0);
+      const size_t skip = recent.size() > kDefaultLogLines ? recent.size() - kDefaultLogLines : 0;
+      for (size_t i = skip; i < recent.size(); ++i) {
+         lines.push_back(recent[i].body);
+      }
+      return lines;
+   };
+
    auto handleLine = [&](Client &client, const std::string &line) {
       const auto request = nlohmann::json::parse(line, nullptr, false);
       if (request.is_discarded() || !request.is_object() || !request.contains("command") ||
@@ -145,23 +155,13 @@ void CtlServer::serve()
          client.followKind = command == "watch" ? EventKind::notification : EventKind::log;
          // A followed log starts with the recent lines; a watch with what comes next.
          client.lastSeq = events_.lastSeq();
-         nlohmann::json result = nlohmann::json::array();
-         if (command == "log") {
-            const auto recent = events_.since(EventKind::log, 0);
-            const size_t skip = recent.size() > kDefaultLogLines ? recent.size() - kDefaultLogLines : 0;
-            for (size_t i = skip; i < recent.size(); ++i) {
-               result.push_back(recent[i].body);
-            }
-         }
-         reply(client, {{"ok", true}, {"result", result}, {"streaming", true}});
+         reply(client, {{"ok", true},
+                        {"result", command == "log" ? recentLog() : nlohmann::json::array()},
+                        {"streaming", true}});
          return;
       }
       if (command == "log") {
-         nlohmann::json result = nlohmann::json::array();
-         for (const auto &event : events_.since(EventKind::log, 0)) {
-            result.push_back(event.body);
-         }
-         reply(client, {{"ok", true}, {"result", result}});
+         reply(client, {{"ok", true}, {"result", recentLog()}});
          return;
       }
       try {

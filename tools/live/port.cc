@@ -19,6 +19,7 @@ namespace swsec::live {
 namespace {
 
 constexpr uint16_t kEtherTypeVlan = 0x8100;
+constexpr size_t kAddressBytes = 12;
 
 bool carriesTag(std::span<const uint8_t> bytes)
 {
@@ -26,6 +27,29 @@ bool carriesTag(std::span<const uint8_t> bytes)
 }
 
 }  // namespace
+
+host::FrameView portView(const ReceivedFrame &frame, std::vector<uint8_t> &scratch)
+{
+   host::FrameView view;
+   view.bytes = frame.bytes;
+   if (!frame.tagged) {
+      // A tag the kernel left in the bytes becomes metadata as the virtual
+      // switch hands frames over.
+      view.untag = carriesTag(frame.bytes);
+   } else if (frame.tpid == kEtherTypeVlan) {
+      view.vlanId = frame.tci & 0x0fff;
+   } else if (frame.bytes.size() >= kAddressBytes) {
+      // Another tag (an 802.1ad service tag) is no 802.1Q VLAN: the port
+      // sees it in the bytes, where it was on the wire.
+      const uint8_t tag[] = {static_cast<uint8_t>(frame.tpid >> 8), static_cast<uint8_t>(frame.tpid),
+                             static_cast<uint8_t>(frame.tci >> 8), static_cast<uint8_t>(frame.tci)};
+      scratch.assign(frame.bytes.begin(), frame.bytes.begin() + kAddressBytes);
+      scratch.insert(scratch.end(), std::begin(tag), std::end(tag));
+      scratch.insert(scratch.end(), frame.bytes.begin() + kAddressBytes, frame.bytes.end());
+      view.bytes = scratch;
+   }
+   return view;
+}
 
 GuardedPort::GuardedPort(ports::ModuleSession &session, PortOptions options,
                          std::function<void(const std::string &)> log, std::function<void()> stopped)
@@ -147,6 +171,7 @@ void GuardedPort::forward(PacketSocket &from, PacketSocket &to, uint32_t directi
    passed.reserve(options_.batch);
    std::vector<size_t> judged;   // index in `frames` of each view
    judged.reserve(options_.batch);
+   std::vector<std::vector<uint8_t>> retagged(options_.batch);   // frames whose tag goes back in
    host::Sifra &sifra = session_.host().sifra();
    uint64_t sendErrors = 0;
 
@@ -176,21 +201,16 @@ void GuardedPort::forward(PacketSocket &from, PacketSocket &to, uint32_t directi
       }
       views.clear();
       judged.clear();
+      if (retagged.size() < frames.size()) {
+         retagged.resize(frames.size());
+      }
       for (size_t i = 0; i < frames.size(); ++i) {
          const ReceivedFrame &frame = frames[i];
          if (frame.truncated) {
             counters_.truncated.fetch_add(1, std::memory_order_relaxed);
             continue;
          }
-         host::FrameView &view = views.emplace_back();
-         view.bytes = frame.bytes;
-         if (frame.tagged) {
-            view.vlanId = frame.tci & 0x0fff;
-         } else {
-            // A tag the kernel left in the bytes becomes metadata as the
-            // virtual switch hands frames over.
-            view.untag = carriesTag(frame.bytes);
-         }
+         views.push_back(portView(frame, retagged[i]));
          judged.push_back(i);
       }
       if (views.empty()) {
@@ -240,7 +260,9 @@ std::string GuardedPort::stopReason() const
 
 void GuardedPort::stop(bool restoreAsFound, const std::function<void(host::FilterId)> &save)
 {
-   std::lock_guard guard(mutex_);
+   // Not mutex_: a forwarding thread that is vanishing takes it to record
+   // why, and is joined here.
+   std::lock_guard guard(stopMutex_);
    if (stopping_ || !running_.load(std::memory_order_acquire)) {
       return;
    }
@@ -293,8 +315,11 @@ void GuardedPort::takeDown(bool restoreAsFound)
       }
       portMade_ = false;
    }
-   guardSocket_.reset();
-   vmSocket_.reset();
+   {
+      std::lock_guard guard(mutex_);
+      guardSocket_.reset();
+      vmSocket_.reset();
+   }
    if (pairMade_ && findLink(bridgeEnd_)) {
       attempt({"link", "del", bridgeEnd_});
    }

@@ -48,6 +48,12 @@ struct PortCounters {
    std::atomic<uint64_t> overruns{0};      // dropped by the kernel: a socket's buffer was full
 };
 
+// The frame as the virtual switch hands it to the port: an 802.1Q tag
+// (taken off by the kernel or left in the bytes) becomes VLAN metadata; any
+// other tag the kernel took off goes back into the bytes, copied into
+// `scratch`, which the view then refers to.
+host::FrameView portView(const ReceivedFrame &frame, std::vector<uint8_t> &scratch);
+
 class GuardedPort {
 public:
    // `log` takes a line for the administrator; `stopped` is called (from a
@@ -109,9 +115,12 @@ private:
    std::vector<std::thread> threads_;
    std::atomic<bool> running_{false};
    std::atomic<bool> vanished_{false};
-   mutable std::mutex mutex_;                 // stopReason_, and stop against stop
-   std::string stopReason_;
+   // stop against stop; held while the forwarding threads are joined, so
+   // nothing they take may wait for it.
+   std::mutex stopMutex_;
    bool stopping_ = false;
+   mutable std::mutex mutex_;                 // stopReason_ and the sockets' lifetime
+   std::string stopReason_;
 };
 
 }  // namespace swsec::live

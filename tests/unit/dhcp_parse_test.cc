@@ -1,6 +1,6 @@
 // Recognising DHCP messages: what is refused (each with its message), what
 // is found, and how the bytes are reached when the frame is in pieces.
-#include "unit/discovery_port.h"
+#include "unit/hand_made_port.h"
 
 #include "swsec/swsec_dhcp_parse.h"
 
@@ -48,7 +48,7 @@ std::string cookieText(std::array<uint8_t, 4> cookie)
    return text;
 }
 
-class DhcpParseTest : public DiscoveryTest {
+class DhcpParseTest : public HandMadePortTest {
 protected:
    // Parses the frame: 0 or -1.
    int parse(WrappedFrame &frame) { return SwSecDhcpParse(&ctx_, frame.pkt, &frame.info); }

@@ -3,7 +3,7 @@
 // xids, with and without identifiers, repeats that change the xid, ageing)
 // must leave the same requests in the same order, and the same answer
 // verdicts, as first-match walks of the arrival-ordered list give.
-#include "unit/discovery_port.h"
+#include "unit/hand_made_port.h"
 
 #include "swsec/swsec_dhcp_req_index.h"
 
@@ -15,8 +15,6 @@
 namespace swsec::testing {
 namespace {
 
-const Mac kServerMac = Mac::parse("02:00:00:00:00:fe");
-const Ip4 kServerIp = Ip4::parse("10.0.0.254");
 
 struct ModelRequest {
    uint16_t vlan;
@@ -35,7 +33,7 @@ struct ModelRequest {
    }
 };
 
-class DhcpReqIndexTest : public DiscoveryTest {
+class DhcpReqIndexTest : public HandMadePortTest {
 protected:
    Outcome fromVm(uint16_t vlan, uint8_t type, uint32_t xid, const Mac &mac,
                   const std::optional<Bytes> &clientId)

@@ -1,27 +1,23 @@
 // IP discovery as a port sees it: DHCP exchanges between a VM and a server
 // and ARP from the VM, judged first under the shared lock and again under
 // the exclusive one when discovery asks for it, as the frame loop does.
-#include "unit/discovery_port.h"
+#include "unit/hand_made_port.h"
 
 #include "swsec/swsec_ip_discovery.h"
 
+#include <optional>
 #include <string>
 
 namespace swsec::testing {
 namespace {
 
-const Mac kVmMac = Mac::parse("02:00:00:00:00:01");
 const Mac kOtherMac = Mac::parse("02:00:00:00:00:09");
-const Mac kServerMac = Mac::parse("02:00:00:00:00:fe");
-const Ip4 kServerIp = Ip4::parse("10.0.0.254");
 const Ip4 kLeased = Ip4::parse("10.0.0.10");
 const Ip4 kRenumbered = Ip4::parse("10.0.0.20");
-const Ip4 kVmIp = Ip4::parse("10.0.0.5");
-const Ip4 kPeerIp = Ip4::parse("10.0.0.6");
 const Ip4 kBroadcastIp{{255, 255, 255, 255}};
 constexpr uint32_t kInfiniteLease = 0xffffffffu;
 
-class IpDiscoveryTest : public DiscoveryTest {
+class IpDiscoveryTest : public HandMadePortTest {
 protected:
    Outcome fromVm(const Dhcp &dhcp, const Mac &src = kVmMac, Ip4 ipDst = kBroadcastIp, uint16_t vlanId = 0)
    {
@@ -125,65 +121,62 @@ TEST_F(IpDiscoveryTest, full_exchange_creates_one_dhcp_binding_with_the_lease_co
    EXPECT_EQ(vmis().size(), 1u);
 }
 
-TEST_F(IpDiscoveryTest, renewal_keeping_the_address_only_extends_the_lease)
+struct RenewalCase {
+   const char *name;
+   std::optional<uint8_t> atNewAddress;   // the method of an entry the new address already has
+   Ip4 address;                           // the renewal's ACK
+   Entries after;                         // beside the ARP entry of 10.0.0.99
+   std::vector<std::string> posts;
+   const char *message;
+};
+
+class RenewalTest : public IpDiscoveryTest, public ::testing::WithParamInterface<RenewalCase> {};
+
+TEST_P(RenewalTest, the_ack_of_a_renewal_refiles_or_retires_the_binding)
 {
+   const RenewalCase &c = GetParam();
+   addNonDhcp(Ip4::parse("10.0.0.99"), kArp);   // so that the hash table is in use
    bind(kLeased, 0x100, 600);
+   if (c.atNewAddress) {
+      addNonDhcp(kRenumbered, *c.atNewAddress);
+   }
    host().portsets().clearPosted();
    advanceSeconds(300);
-   ASSERT_EQ(renew(0x101).status, ORR_OK);
-   ASSERT_EQ(vmis().size(), 1u) << "a renewing request keeps the binding";
-   ASSERT_EQ(fromServer(serverMsg(kDhcpAck, 0x101, kLeased, kInfiniteLease)).verdict, SwSecVerdictPass);
-
-   ASSERT_EQ(vmis().size(), 1u);
-   EXPECT_EQ(vmis()[0]->leaseTime, kInfiniteLease);
-   EXPECT_EQ(vmis()[0]->expiryTime, uptime() + int64_t{kInfiniteLease});
-   EXPECT_TRUE(posts().empty());
-}
-
-TEST_F(IpDiscoveryTest, renewal_changing_the_address_refiles_the_entry_under_the_new_one)
-{
-   addNonDhcp(Ip4::parse("10.0.0.99"), SwSecDiscApSnooping);   // so that the hash table is in use
-   bind(kLeased);
-   host().portsets().clearPosted();
-   host().log().clear();
-
    ASSERT_EQ(renew(0x200).status, ORR_OK);
-   ASSERT_EQ(fromServer(serverMsg(kDhcpAck, 0x200, kRenumbered)).status, ORR_OK);
+   ASSERT_EQ(vmis().size(), c.atNewAddress ? 3u : 2u) << "a renewing request keeps the binding";
+   ASSERT_EQ(fromServer(serverMsg(kDhcpAck, 0x200, c.address, kInfiniteLease)).verdict, SwSecVerdictPass);
 
-   EXPECT_EQ(posts(), (std::vector<std::string>{"portdb.entry.removed", "portdb.entry.added"}));
-   EXPECT_EQ(find(kLeased), nullptr);
-   ASSERT_NE(find(kRenumbered), nullptr);
-   EXPECT_EQ(find(kRenumbered)->discoveryMethod, SwSecDiscDhcpSnooping);
-   EXPECT_EQ(vmis().size(), 2u);
-   EXPECT_TRUE(logged("port-7: IP address change on renewal: 0 02:00:00:00:00:01 "
-                      "10.0.0.10->10.0.0.20"));
-}
-
-TEST_F(IpDiscoveryTest, renewal_onto_an_arp_learned_address_replaces_that_entry)
-{
-   bind(kLeased);
-   addNonDhcp(kRenumbered, SwSecDiscApSnooping);
-   ASSERT_EQ(renew(0x300).status, ORR_OK);
-   ASSERT_EQ(fromServer(serverMsg(kDhcpAck, 0x300, kRenumbered)).status, ORR_OK);
-
-   ASSERT_EQ(vmis().size(), 1u) << "one key, one entry";
-   EXPECT_EQ(vmis()[0]->discoveryMethod, SwSecDiscDhcpSnooping);
-   EXPECT_EQ(find(kRenumbered), vmis()[0]);
-   EXPECT_EQ(ctx_.numNonAuthVmiEntries, 0u);
-}
-
-TEST_F(IpDiscoveryTest, renewal_onto_a_static_address_retires_the_dhcp_entry)
-{
-   bind(kLeased);
-   addNonDhcp(kRenumbered, SwSecDiscStatic);
-   ASSERT_EQ(renew(0x300).status, ORR_OK);
-   ASSERT_EQ(fromServer(serverMsg(kDhcpAck, 0x300, kRenumbered)).status, ORR_OK);
-
-   ASSERT_EQ(vmis().size(), 1u);
-   EXPECT_EQ(vmis()[0]->discoveryMethod, SwSecDiscStatic);
-   EXPECT_EQ(find(kLeased), nullptr);
+   Entries expected{{{0, 1, 99}, kArp}};
+   expected.insert(expected.end(), c.after.begin(), c.after.end());
+   EXPECT_EQ(entries(), expected);
+   EXPECT_EQ(posts(), c.posts);
    EXPECT_EQ(ctx_.numDhcpReqs, 0u);
+   expectCountersAgree();
+   if (const SwSecVmi *vmi = find(c.address); vmi != nullptr && vmi->discoveryMethod == kDhcp) {
+      EXPECT_EQ(vmi->leaseTime, kInfiniteLease);
+      EXPECT_EQ(vmi->expiryTime, uptime() + int64_t{kInfiniteLease});
+   }
+   if (c.message != nullptr) {
+      EXPECT_TRUE(logged(c.message));
+   }
 }
+
+const std::string kAdded = "portdb.entry.added";
+const std::string kRemoved = "portdb.entry.removed";
+
+INSTANTIATE_TEST_SUITE_P(
+   Renewals, RenewalTest,
+   ::testing::Values(
+      RenewalCase{"keeping_the_address_only_extends_the_lease", std::nullopt, kLeased, {{{0, 1, 10}, kDhcp}}, {},
+                  nullptr},
+      RenewalCase{"a_new_address_refiles_the_entry", std::nullopt, kRenumbered, {{{0, 1, 20}, kDhcp}},
+                  {kRemoved, kAdded},
+                  "port-7: IP address change on renewal: 0 02:00:00:00:00:01 10.0.0.10->10.0.0.20"},
+      RenewalCase{"onto_an_arp_learned_address_replaces_that_entry", kArp, kRenumbered, {{{0, 1, 20}, kDhcp}},
+                  {kRemoved, kRemoved, kAdded}, nullptr},
+      RenewalCase{"onto_a_static_address_retires_the_dhcp_entry", kStatic, kRenumbered, {{{0, 1, 20}, kStatic}},
+                  {kRemoved}, nullptr}),
+   [](const auto &test) { return std::string(test.param.name); });
 
 struct RemovalCase {
    const char *name;
@@ -348,33 +341,52 @@ TEST_F(IpDiscoveryTest, dhcp_under_the_shared_lock_asks_for_the_write_lock_befor
    EXPECT_TRUE(logged("port-7: Invalid htype/hlen: [6 6]"));
 }
 
-TEST_F(IpDiscoveryTest, fragments_are_never_taken_for_dhcp)
+struct QuietCase {
+   const char *name;
+   Bytes frame;
+   uint32_t direction;
+};
+
+class QuietFrameTest : public IpDiscoveryTest, public ::testing::WithParamInterface<QuietCase> {};
+
+TEST_P(QuietFrameTest, frames_that_are_no_dhcp_or_arp_to_learn_from_pass_and_ask_for_nothing)
 {
-   for (const uint8_t fragmentByte : {uint8_t{0x20}, uint8_t{0x00}}) {
-      Bytes bytes = dhcpFrame({.src = kVmMac, .dhcp = clientMsg(kDhcpRequest, 0xb00)});
-      bytes[14 + 6] = fragmentByte;
-      bytes[14 + 7] = fragmentByte == 0 ? 0x10 : 0x00;   // more fragments, or offset 16
-      const Outcome out = judge(bytes, SwSecDirectionTx);
-      EXPECT_FALSE(out.askedForWriteLock);
-      EXPECT_EQ(out.verdict, SwSecVerdictPass);
-   }
+   const Outcome out = judge(GetParam().frame, GetParam().direction);
+   EXPECT_FALSE(out.askedForWriteLock);
+   EXPECT_EQ(out.verdict, SwSecVerdictPass);
+   EXPECT_TRUE(vmis().empty());
    EXPECT_EQ(ctx_.numDhcpReqs, 0u);
    EXPECT_FALSE(logged("DHCP"));
 }
 
-TEST_F(IpDiscoveryTest, dhcp_to_the_wrong_port_or_direction_is_not_examined)
+Bytes fragmentOf(Bytes bytes, uint8_t flags, uint8_t offset)
 {
-   // A client message arriving at the VM, and a server message leaving it.
-   const Outcome toVm = judge(dhcpFrame({.src = kVmMac, .dhcp = clientMsg(kDhcpRequest, 1)}),
-                              SwSecDirectionRx);
-   const Outcome fromVmToClientPort = judge(
-      dhcpFrame({.src = kVmMac, .fromServer = true, .dhcp = serverMsg(kDhcpAck, 1, kLeased)}),
-      SwSecDirectionTx);
-   EXPECT_FALSE(toVm.askedForWriteLock);
-   EXPECT_FALSE(fromVmToClientPort.askedForWriteLock);
-   EXPECT_EQ(fromVmToClientPort.verdict, SwSecVerdictPass);
-   EXPECT_EQ(ctx_.numDhcpReqs, 0u);
+   bytes[14 + 6] = flags;
+   bytes[14 + 7] = offset;
+   return bytes;
 }
+
+const Bytes kRequestFrame = dhcpFrame({.src = kVmMac, .dhcp = {.xid = 1, .chaddr = kVmMac, .type = kDhcpRequest}});
+const Bytes kArpRequest =
+   arpFrame(kVmMac, kBroadcastMac, {.op = 1, .senderMac = kVmMac, .senderIp = kVmIp, .targetIp = kPeerIp});
+
+INSTANTIATE_TEST_SUITE_P(
+   Frames, QuietFrameTest,
+   ::testing::Values(
+      QuietCase{"first_fragment", fragmentOf(kRequestFrame, 0x20, 0), SwSecDirectionTx},
+      QuietCase{"later_fragment", fragmentOf(kRequestFrame, 0, 0x10), SwSecDirectionTx},
+      QuietCase{"client_message_to_the_vm", kRequestFrame, SwSecDirectionRx},
+      QuietCase{"server_message_from_the_vm",
+                dhcpFrame({.src = kVmMac, .fromServer = true,
+                           .dhcp = {.op = 2, .xid = 1, .chaddr = kVmMac, .type = kDhcpAck, .leaseTime = 60}}),
+                SwSecDirectionTx},
+      QuietCase{"arp_of_another_protocol",
+                arpFrame(kVmMac, kBroadcastMac,
+                         {.op = 1, .senderMac = kVmMac, .senderIp = kVmIp, .protocolType = 0x8137}),
+                SwSecDirectionTx},
+      QuietCase{"arp_cut_short", Bytes(kArpRequest.begin(), kArpRequest.begin() + 14 + 27), SwSecDirectionTx},
+      QuietCase{"arp_to_the_vm", kArpRequest, SwSecDirectionRx}),
+   [](const auto &test) { return std::string(test.param.name); });
 
 TEST_F(IpDiscoveryTest, failed_allocations_leave_nothing_half_made)
 {
@@ -449,18 +461,6 @@ INSTANTIATE_TEST_SUITE_P(
                      ArpCase{"probe_from_0_0_0_0", 1, kZero, kVmIp, false},
                      ArpCase{"unknown_operation", 3, kVmIp, kVmIp, false}),
    [](const auto &test) { return std::string(test.param.name); });
-
-TEST_F(IpDiscoveryTest, arp_for_another_protocol_a_short_packet_or_towards_the_vm_teaches_nothing)
-{
-   Bytes ipx = arpFrame(kVmMac, kBroadcastMac,
-                        {.op = 1, .senderMac = kVmMac, .senderIp = kVmIp, .protocolType = 0x8137});
-   Bytes shortArp = arp(1, kVmIp, kPeerIp);
-   shortArp.resize(14 + 27);
-   EXPECT_FALSE(judge(ipx, SwSecDirectionTx).askedForWriteLock);
-   EXPECT_FALSE(judge(shortArp, SwSecDirectionTx).askedForWriteLock);
-   EXPECT_FALSE(judge(arp(1, kVmIp, kPeerIp), SwSecDirectionRx).askedForWriteLock);
-   EXPECT_TRUE(vmis().empty());
-}
 
 TEST_F(IpDiscoveryTest, traffic_refreshes_non_authoritative_entries_under_the_shared_lock)
 {

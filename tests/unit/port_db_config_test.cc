@@ -1,12 +1,12 @@
 // Configuring a port database: the size checks, the port mode change, the
 // static entries, the port filter map entry and the timer, each failure
 // leaving the old configuration in force.
-#include "port_db_fixture.h"
+#include "unit/hand_made_port.h"
 
 namespace swsec::testing {
 namespace {
 
-class PortDbConfigTest : public PortDbTest {
+class PortDbConfigTest : public HandMadePortTest {
 protected:
    bool mapped()
    {

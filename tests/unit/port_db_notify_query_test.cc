@@ -1,6 +1,6 @@
 // Port database messages on the portset, and reading a database out: the
 // query formats and the exported functions' paths that need no loaded module.
-#include "port_db_fixture.h"
+#include "unit/hand_made_port.h"
 
 namespace swsec::testing {
 namespace {
@@ -15,11 +15,11 @@ void collect(uint32_t portID, uint64_t msgClass, const orr_PortsetMessageHeader 
    delivered->push_back(decodeNotice(message->name, reinterpret_cast<const uint8_t *>(message + 1)));
 }
 
-class PortDbNotifyTest : public PortDbTest {
+class PortDbNotifyTest : public HandMadePortTest {
 protected:
    void SetUp() override
    {
-      PortDbTest::SetUp();
+      HandMadePortTest::SetUp();
       delivered = &delivered_;
       ASSERT_EQ(orr_PortsetRegisterMessageCB(ctx_.portset, kPortId, SWSEC_PORTSET_MSG_PORTDB, collect,
                                              nullptr, &listener_),
@@ -28,7 +28,7 @@ protected:
    void TearDown() override
    {
       orr_PortsetUnregisterMessageCB(listener_);
-      PortDbTest::TearDown();
+      HandMadePortTest::TearDown();
       delivered = nullptr;
    }
 
@@ -87,7 +87,7 @@ TEST_F(PortDbNotifyTest, a_hold_turned_exclusive_by_the_post_is_released_as_excl
    EXPECT_EQ(delivered_, (std::vector<Notice>{added({1, 1, 1}, 0)}));
 }
 
-class PortDbQueryTest : public PortDbTest {
+class PortDbQueryTest : public HandMadePortTest {
 protected:
    // Two statics and three ARP entries, interleaved in list order: even MACs are static.
    void fillFive()

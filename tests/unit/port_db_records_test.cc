@@ -1,7 +1,7 @@
 // The port database's records: replacement on add, the size limit, the
 // hash table's life, ageing, pending requests and clearing, with the
 // messages each change posts.
-#include "port_db_fixture.h"
+#include "unit/hand_made_port.h"
 
 namespace swsec::testing {
 namespace {
@@ -11,7 +11,7 @@ uint8_t authOf(uint8_t method)
    return (method & SwSecDiscAuthoritativeMask) != 0 ? 1 : 0;
 }
 
-using PortDbRecordsTest = PortDbTest;
+using PortDbRecordsTest = HandMadePortTest;
 
 struct ReplacementRow {
    uint8_t existing;
@@ -59,7 +59,7 @@ TEST_F(PortDbRecordsTest, add_of_a_known_key_follows_the_replacement_table)
          }
 
          while (!SifraGenericListIsEmpty(&ctx_.portDbList)) {
-            SwSecDelVmi(&ctx_, vmiAt(ctx_.portDbList.next));
+            SwSecDelVmi(&ctx_, SwSecVmiFromListLinks(ctx_.portDbList.next));
          }
          notices();
       }

@@ -1,7 +1,6 @@
 // The frame loop's upgrade from the shared to the exclusive configLock,
 // judged by a test double of the per-packet policy (a link seam: this
 // program defines SwSecProcessPkt, so the module's policy is not linked).
-#include "support/frames.h"
 #include "unit/hand_made_port.h"
 
 #include "swsec/swsec_filter.h"
@@ -54,18 +53,10 @@ class FrameLoopTest : public HandMadePortTest {
 protected:
    void SetUp() override
    {
-      HostTest::SetUp();
+      HandMadePortTest::SetUp();
       policy = {};
-      makePort("frameloop");
-      makeConfigLock();
       filter_.agentData = &ctx_;
       ctx_.config.featuresEnabled = SwSecFeatureBpduFilter;
-   }
-
-   void TearDown() override
-   {
-      releasePort();
-      HostTest::TearDown();
    }
 
    // Frames tagged by the last byte of their source MAC.

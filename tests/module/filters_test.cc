@@ -223,28 +223,6 @@ TEST_F(FilterTest, get_vmi_lists_entries_of_every_method_and_an_empty_database_a
                     0, 0, 0x02, 0, 0, 0, 0, 0x02, 10, 0, 0, 9}));   // ARP
 }
 
-TEST_F(FilterTest, clear_vmi_removes_the_keys_it_lists_or_with_clear_all_every_learned_entry)
-{
-   const host::FilterId id = port({.statics = {binding(5, kVmMac, kVmIp)}});
-   (void)send(id, kTx, {arpFrom(kPeerMac, kPeerIp, 1), arpFrom(kVmMac, kPeerIp, 1)});
-   ASSERT_EQ(context(id)->numVmiEntries, 3u);
-   host().sifra().clearIoctlReplies();
-   Bytes one = typeOnly(11);
-   one.push_back(0);
-   put32(one, 1);
-   one.insert(one.end(), {0, 0, 0x02, 0, 0, 0, 0, 0x02, 10, 0, 0, 9});
-   EXPECT_EQ(host().sifra().sendIoctl(id, 4, one), ORR_OK);
-   EXPECT_EQ(context(id)->numVmiEntries, 2u);
-
-   Bytes all = typeOnly(11);
-   all.push_back(1);
-   put32(all, 0);
-   EXPECT_EQ(host().sifra().sendIoctl(id, 4, all), ORR_OK);
-   EXPECT_EQ(context(id)->numVmiEntries, 1u);
-   EXPECT_EQ(+context(id)->config.numStatic, 1u);
-   EXPECT_TRUE(host().sifra().ioctlReplies().empty());
-}
-
 TEST_F(FilterTest, the_security_property_reads_back_the_header_and_the_static_keys_alone)
 {
    const PortConfig config{.statics = {binding(1, kVmMac, kVmIp), binding(2, kPeerMac, kPeerIp),

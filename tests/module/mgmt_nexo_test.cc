@@ -12,10 +12,6 @@
 namespace swsec::testing {
 namespace {
 
-const Mac kVmMac = Mac::parse("02:00:00:01:02:03");
-const Ip4 kVmIp = Ip4::parse("10.0.0.5");
-const Mac kPeerMac = Mac::parse("02:00:00:00:00:fe");
-const Ip4 kPeerIp = Ip4::parse("10.0.0.254");
 
 std::string portPath(uint32_t port, std::string_view node)
 {
@@ -141,30 +137,31 @@ TEST_F(NexoTest, feature_summary_text_shows_the_padded_labels)
 
 // ---------------------------------------------------------------- VMIs
 
-TEST_F(NexoTest, a_static_vmi_shows_na_for_its_lifetime_and_dhcp_fields)
+TEST_F(NexoTest, each_vmi_shows_its_method_and_only_a_dhcp_binding_shows_lease_details)
 {
    const host::FilterId id = create();
    configure(id, {.statics = {binding(100, Mac::parse("02:00:00:0a:Bc:0d"), Ip4::parse("192.168.1.20"))}});
-   EXPECT_EQ(list(portPath(kPort, "vmi")), (std::vector<int64_t>{0}));
-   const std::map<std::string, std::string, std::less<>> expected = {
-      {"portID", "7"}, {"vlanId", "100"}, {"macAddr", "02:00:00:0a:bc:0d"}, {"ipAddr", "192.168.1.20"},
-      {"discoveryMethod", "Static"}, {"timeRemaining", "N/A"}, {"chaddr", "N/A"}, {"clientIdLen", "N/A"},
-      {"serverIp", "N/A"}, {"leaseTime", "N/A"}};
-   EXPECT_EQ(get(portPath(kPort, "vmi/0")).values(), expected);
-}
-
-TEST_F(NexoTest, a_dhcp_vmi_shows_the_details_of_its_lease_not_its_mac_or_address)
-{
-   const host::FilterId id = create();
-   bindByDhcp(id, {.mac = kVmMac, .ip = kVmIp, .server = kPeerIp, .lease = 600, .clientId = Bytes{1, 2, 3}});
-   ASSERT_EQ(context(id)->numVmiEntries, 1u);
+   bindByDhcp(id, {.mac = kVmMac, .ip = kVmIp, .server = kServerIp, .lease = 600, .clientId = Bytes{1, 2, 3}});
    // The client hardware address is kept apart from the MAC: tell them apart.
-   SwSecVmiFromListLinks(context(id)->portDbList.next)->chaddr[5] = 0x33;
-   const std::map<std::string, std::string, std::less<>> expected = {
-      {"portID", "7"}, {"vlanId", "0"}, {"macAddr", "02:00:00:01:02:03"}, {"ipAddr", "10.0.0.5"},
-      {"discoveryMethod", "DHCP Snooping"}, {"timeRemaining", "600 sec"}, {"chaddr", "02:00:00:01:02:33"},
-      {"clientIdLen", "3"}, {"serverIp", "10.0.0.254"}, {"leaseTime", "600"}};
-   EXPECT_EQ(get(portPath(kPort, "vmi/0")).values(), expected);
+   SwSecVmiFromListLinks(context(id)->portDbList.prev)->chaddr[5] = 0x33;
+   sendFromVm(id, arpRequest(kPeerMac, kPeerIp));
+   EXPECT_EQ(list(portPath(kPort, "vmi")), (std::vector<int64_t>{0, 1, 2}));
+   using Fields = std::map<std::string, std::string, std::less<>>;
+   const Fields na = {{"chaddr", "N/A"}, {"clientIdLen", "N/A"}, {"serverIp", "N/A"}, {"leaseTime", "N/A"}};
+   auto with = [](Fields fields, const Fields &more) {
+      fields.insert(more.begin(), more.end());
+      return fields;
+   };
+   EXPECT_EQ(get(portPath(kPort, "vmi/0")).values(),
+             with(na, {{"portID", "7"}, {"vlanId", "100"}, {"macAddr", "02:00:00:0a:bc:0d"}, {"ipAddr", "192.168.1.20"},
+                       {"discoveryMethod", "Static"}, {"timeRemaining", "N/A"}}));
+   EXPECT_EQ(get(portPath(kPort, "vmi/1")).values(),
+             (Fields{{"portID", "7"}, {"vlanId", "0"}, {"macAddr", "02:00:00:00:00:01"}, {"ipAddr", "10.0.0.5"},
+                     {"discoveryMethod", "DHCP Snooping"}, {"timeRemaining", "600 sec"}, {"chaddr", "02:00:00:00:00:33"},
+                     {"clientIdLen", "3"}, {"serverIp", "10.0.0.254"}, {"leaseTime", "600"}}));
+   EXPECT_EQ(get(portPath(kPort, "vmi/2")).values(),
+             with(na, {{"portID", "7"}, {"vlanId", "0"}, {"macAddr", "02:00:00:00:00:02"}, {"ipAddr", "10.0.0.9"},
+                       {"discoveryMethod", "ARP Snooping"}, {"timeRemaining", "180 sec"}}));
 }
 
 TEST_F(NexoTest, an_arp_snooped_vmi_counts_down_to_zero_once_expired_but_not_yet_aged)
@@ -172,20 +169,10 @@ TEST_F(NexoTest, an_arp_snooped_vmi_counts_down_to_zero_once_expired_but_not_yet
    const host::FilterId id = create();
    host().clock().advance(std::chrono::seconds(5));
    sendFromVm(id, arpRequest(kVmMac, kVmIp));
-   ASSERT_EQ(list(portPath(kPort, "vmi")), (std::vector<int64_t>{0}));
-
-   auto record = get(portPath(kPort, "vmi/0"));
-   EXPECT_EQ(record.value("discoveryMethod"), "ARP Snooping");
-   EXPECT_EQ(record.value("timeRemaining"), "180 sec");
-   EXPECT_EQ(record.value("chaddr"), "N/A");
-   EXPECT_EQ(record.value("leaseTime"), "N/A");
-
    host().clock().advance(std::chrono::seconds(60));
    EXPECT_EQ(get(portPath(kPort, "vmi/0")).value("timeRemaining"), "120 sec");
-
    // Expired one second ago; the next ageing pass is still to come.
    host().clock().advance(std::chrono::seconds(121));
-   ASSERT_EQ(list(portPath(kPort, "vmi")), (std::vector<int64_t>{0}));
    EXPECT_EQ(get(portPath(kPort, "vmi/0")).value("timeRemaining"), "0 sec");
 }
 
@@ -233,34 +220,58 @@ TEST_F(NexoTest, clear_with_other_than_one_or_four_arguments_is_refused_before_t
    }
 }
 
-TEST_F(NexoTest, clear_all_removes_learned_vmis_and_keeps_static_ones)
-{
-   const host::FilterId id = create();
-   configure(id, {.statics = {binding(1, kPeerMac, kPeerIp)}});
-   sendFromVm(id, arpRequest(kVmMac, kVmIp));
-   ASSERT_EQ(list(portPath(kPort, "vmi")).size(), 2u);
+// A static binding, and two learned ones (the VM's and the peer's), cleared
+// through the management node and through the clear ioctl.
+struct ClearCase {
+   const char *name;
+   bool ioctl;
+   std::vector<std::string> args;   // "all", or VLAN, MAC and address
+   std::vector<std::string> left;   // the addresses left, in order
+};
 
-   EXPECT_EQ(host().nexo().set(portPath(kPort, "clearVmi"), {"all"}), ORR_OK);
-   ASSERT_EQ(list(portPath(kPort, "vmi")).size(), 1u);
-   EXPECT_EQ(get(portPath(kPort, "vmi/0")).value("discoveryMethod"), "Static");
-}
+class ClearTest : public NexoTest, public ::testing::WithParamInterface<ClearCase> {};
 
-TEST_F(NexoTest, clear_by_vlan_mac_and_ip_removes_that_vmi_and_succeeds_when_absent)
+TEST_P(ClearTest, clears_what_it_names_and_never_a_static_binding)
 {
+   const ClearCase &c = GetParam();
    const host::FilterId id = create();
+   configure(id, {.statics = {binding(0, kServerMac, kServerIp)}});
    sendFromVm(id, arpRequest(kVmMac, kVmIp));
    sendFromVm(id, arpRequest(kPeerMac, kPeerIp));
-   ASSERT_EQ(list(portPath(kPort, "vmi")).size(), 2u);
-   const std::string clear = portPath(kPort, "clearVmi");
-
-   // VLAN 0 (the frames are untagged), the VM's MAC and IP.
-   EXPECT_EQ(host().nexo().set(clear, {"one", "0", "02:00:00:01:02:03", "10.0.0.5"}), ORR_OK);
-   ASSERT_EQ(list(portPath(kPort, "vmi")).size(), 1u);
-   EXPECT_EQ(get(portPath(kPort, "vmi/0")).value("ipAddr"), "10.0.0.254");
-
-   EXPECT_EQ(host().nexo().set(clear, {"one", "100", "02:00:00:01:02:03", "10.0.0.5"}), ORR_OK);
-   EXPECT_EQ(list(portPath(kPort, "vmi")).size(), 1u);
+   if (!c.ioctl) {
+      EXPECT_EQ(host().nexo().set(portPath(kPort, "clearVmi"), c.args), ORR_OK);
+   } else {
+      Bytes clear = typeOnly(11);
+      clear.push_back(c.args.size() == 1);
+      put32(clear, c.args.size() == 1 ? 0 : 1);
+      if (c.args.size() != 1) {
+         const StaticBinding key = binding(static_cast<uint16_t>(std::stoi(c.args[1])), Mac::parse(c.args[2]),
+                                           Ip4::parse(c.args[3]));
+         const Bytes record = configBytes({.statics = {key}});
+         clear.insert(clear.end(), record.end() - 12, record.end());
+      }
+      EXPECT_EQ(host().sifra().sendIoctl(id, 4, clear), ORR_OK);
+      EXPECT_TRUE(host().sifra().ioctlReplies().empty());
+   }
+   std::vector<std::string> left;
+   for (const int64_t index : list(portPath(kPort, "vmi"))) {
+      left.push_back(get(portPath(kPort, "vmi/" + std::to_string(index))).value("ipAddr"));
+   }
+   EXPECT_EQ(left, c.left);
 }
+
+INSTANTIATE_TEST_SUITE_P(
+   EntryPoints, ClearTest,
+   ::testing::Values(
+      ClearCase{"node_all", false, {"all"}, {"10.0.0.254"}},
+      ClearCase{"ioctl_all", true, {"all"}, {"10.0.0.254"}},
+      ClearCase{"node_one", false, {"one", "0", "02:00:00:00:00:01", "10.0.0.5"}, {"10.0.0.254", "10.0.0.9"}},
+      ClearCase{"ioctl_one", true, {"one", "0", "02:00:00:00:00:01", "10.0.0.5"}, {"10.0.0.254", "10.0.0.9"}},
+      ClearCase{"node_absent_key", false, {"one", "100", "02:00:00:00:00:01", "10.0.0.5"},
+                {"10.0.0.254", "10.0.0.5", "10.0.0.9"}},
+      ClearCase{"node_static_key", false, {"one", "0", "02:00:00:00:00:fe", "10.0.0.254"},
+                {"10.0.0.254", "10.0.0.5", "10.0.0.9"}}),
+   [](const auto &test) { return std::string(test.param.name); });
 
 TEST_F(NexoTest, clear_texts_that_do_not_parse_are_refused_and_change_nothing)
 {
@@ -279,7 +290,7 @@ TEST_F(NexoTest, clear_texts_that_do_not_parse_are_refused_and_change_nothing)
    }
    EXPECT_EQ(list(portPath(kPort, "vmi")).size(), 1u);
    // The parsers take the C library's forms: "0" "10.5" is 10.0.0.5 in inet_aton's short form.
-   EXPECT_EQ(host().nexo().set(clear, {"one", " 0", "2:0:0:1:2:3", "10.5"}), ORR_OK);
+   EXPECT_EQ(host().nexo().set(clear, {"one", " 0", "2:0:0:0:0:1", "10.5"}), ORR_OK);
    EXPECT_TRUE(list(portPath(kPort, "vmi")).empty());
 }
 

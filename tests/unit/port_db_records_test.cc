@@ -215,23 +215,6 @@ TEST_F(PortDbRecordsTest, ageing_keeps_an_entry_until_the_pass_after_its_expiry)
    expectCountersAgree();
 }
 
-TEST_F(PortDbRecordsTest, clear_all_leaves_exactly_the_static_entries)
-{
-   ASSERT_EQ(add({1, 1, 1}, kDhcp), 0);
-   ASSERT_EQ(add({1, 2, 2}, kStatic), 0);
-   ASSERT_EQ(add({1, 3, 3}, kArp), 0);
-   ASSERT_EQ(add({1, 4, 4}, kStatic), 0);
-   ASSERT_EQ(add({1, 5, 5}, kTofu), 0);
-   notices();
-
-   EXPECT_EQ(SwSecClearVmi(&ctx_, true, 0, nullptr), ORR_OK);
-
-   EXPECT_EQ(entries(), (Entries{{{1, 2, 2}, kStatic}, {{1, 4, 4}, kStatic}}));
-   EXPECT_EQ(notices(), (std::vector<Notice>{removed({1, 1, 1}, 1), removed({1, 3, 3}, 0),
-                                             removed({1, 5, 5}, 0)}));
-   expectCountersAgree();
-}
-
 TEST_F(PortDbRecordsTest, clear_by_key_skips_absent_keys_and_keeps_static_ones)
 {
    ASSERT_EQ(add({1, 1, 1}, kDhcp), 0);

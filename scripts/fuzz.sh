@@ -9,6 +9,12 @@ cd "$(dirname "$0")/.."
 seconds=${1:-30}
 dir=build/fuzz
 targets=(dhcp_parse_fuzz frame_fuzz control_fuzz capture_fuzz restore_state_fuzz)
+# The kernel fast path's target loads a BPF program: root only.
+if [ "$(id -u)" -eq 0 ]; then
+  targets+=(fastpath_fuzz)
+else
+  echo "fuzz: fastpath_fuzz skipped: loading its BPF program needs root"
+fi
 
 cmake -S . -B "$dir" -G Ninja -DSWSEC_WERROR=ON -DSWSEC_FUZZ=ON \
   -DCMAKE_CXX_COMPILER=clang++ -DCMAKE_C_COMPILER=clang -DCMAKE_BUILD_TYPE=RelWithDebInfo >/dev/null
@@ -28,7 +34,7 @@ export UBSAN_OPTIONS=print_stacktrace=1:halt_on_error=1
 failed=()
 for target in "${targets[@]}"; do
   echo "== fuzz $target (${seconds}s)"
-  mkdir -p "$dir/corpus/$target" "$dir/findings/$target"
+  mkdir -p "$dir/corpus/$target" "$dir/findings/$target" "$dir/seeds/$target"
   # A capture file is larger than a frame. Its reader runs with a tighter
   # memory limit: an allocation sized by a length read from the file (4 GiB
   # for a block that claims it) fails the run.

@@ -1,11 +1,8 @@
 #include "twin.h"
 
-#include "port_mirror.h"
-
 #include <linux/pkt_cls.h>
 
 #include <map>
-#include <sstream>
 #include <utility>
 
 namespace swsec::testing {
@@ -13,102 +10,88 @@ namespace {
 
 constexpr std::string_view kAgent = "sifra-generic-tarlin-swsec";
 constexpr std::string_view kProperty = "sifra-generic-tarlin-swsec.security";
-constexpr const char *kDropCounters[] = {"dhcpSnoopingDropCnt", "daiDropCnt",          "ipSrcGuardDropCnt",
-                                         "txRateLimitDropCnt",  "txRateLimitErrEntryCnt", "rxRateLimitDropCnt"};
 
-std::map<std::string, std::string, std::less<>> node(host::Host &host, const std::string &path)
+auto node(host::Host &host, const std::string &path)
 {
    host::NexoRecord record;
    return host.nexo().get(path, &record) == ORR_OK ? record.values() : decltype(record.values()){};
 }
 
+// Each binding as its "vmi" node shows it, the port's ID left out.
 std::vector<std::map<std::string, std::string, std::less<>>> vmis(host::Host &host, uint32_t port)
 {
    const std::string path = "/security/" + std::to_string(port) + "/vmi";
    std::vector<int64_t> instances;
    std::vector<std::map<std::string, std::string, std::less<>>> out;
-   if (host.nexo().list(path, &instances) == ORR_OK) {
-      for (int64_t instance : instances) {
-         auto values = node(host, path + "/" + std::to_string(instance));
-         values.erase("portID");
-         out.push_back(std::move(values));
-      }
+   (void)host.nexo().list(path, &instances);
+   for (int64_t instance : instances) {
+      out.push_back(node(host, path + "/" + std::to_string(instance)));
+      out.back().erase("portID");
    }
    return out;
 }
 
 }  // namespace
 
-Twin::Ports::Ports(host::Host &hostRef, uint32_t first) : host(hostRef), alonePort(first), kernelPort(first + 1)
+Twin::Twin(host::Host &host, uint32_t firstPort)
+   : host_(host), alonePort_(firstPort), kernelPort_(firstPort + 1), program_(fastpath::Program::Options{})
 {
-   const std::string portset = "twin" + std::to_string(first);
-   host.portsets().addPortset(portset);
-   for (auto [port, filter, name] : {std::tuple{alonePort, &alone, "alone"}, std::tuple{kernelPort, &kernel, "kernel"}}) {
-      host.portsets().addPort(portset, port);
-      if (host.sifra().createFilter(kAgent, port, host::FilterConfig{.name = name}, filter) != ORR_OK) {
-         release();
+   const std::string portset = "twin" + std::to_string(firstPort);
+   host_.portsets().addPortset(portset);
+   for (auto [port, filter, name] : {std::tuple{alonePort_, &alone_, "alone"}, std::tuple{kernelPort_, &kernel_, "kernel"}}) {
+      host_.portsets().addPort(portset, port);
+      if (host_.sifra().createFilter(kAgent, port, host::FilterConfig{.name = name}, filter) != ORR_OK) {
+         dropFilters();
          throw std::runtime_error("cannot create a filter");
       }
    }
+   mirror_.emplace(program_, host_, kernel_, kernelPort_);
+   (void)host_.portsets().takePosted();
+   mirror_->start();
 }
 
-Twin::Ports::~Ports()
+Twin::~Twin()
 {
-   release();
+   dropFilters();
 }
 
-void Twin::Ports::release()
+void Twin::dropFilters()
 {
-   for (host::FilterId *filter : {&alone, &kernel}) {
-      if (*filter != 0) {
-         (void)host.sifra().destroyFilterAsHypervisor(std::exchange(*filter, 0));
+   for (host::FilterId filter : {alone_, kernel_}) {
+      if (filter != 0) {
+         (void)host_.sifra().destroyFilterAsHypervisor(filter);
       }
    }
-}
-
-Twin::Twin(host::Host &host, uint32_t firstPort)
-   : host_(host), ports_(host, firstPort), alonePort_(firstPort), kernelPort_(firstPort + 1),
-     alone_(ports_.alone), kernel_(ports_.kernel), program_(fastpath::Program::Options{})
-{
-   (void)host_.portsets().takePosted();
-   program_.describe(fastpath::readPort(host_, kernel_, kernelPort_));
 }
 
 bool Twin::configure(std::span<const uint8_t> record)
 {
    const std::vector<uint8_t> bytes(record.begin(), record.end());
-   const orr_Status alone = host_.sifra().writeProperty(kProperty, alone_, bytes);
-   const orr_Status kernel = host_.sifra().writeProperty(kProperty, kernel_, bytes);
-   if (alone != kernel) {
+   const bool taken = host_.sifra().writeProperty(kProperty, alone_, bytes) == ORR_OK;
+   if (taken != (host_.sifra().writeProperty(kProperty, kernel_, bytes) == ORR_OK)) {
       throw std::runtime_error("the two ports took one configuration differently");
    }
    // As the daemon does on a new configuration: start the mirror over.
    (void)host_.portsets().takePosted();
-   program_.describe(fastpath::readPort(host_, kernel_, kernelPort_));
+   mirror_->start();
    kernelGuardDrops_ = 0;
-   return alone == ORR_OK;
-}
-
-void Twin::follow()
-{
-   for (const host::PostedMessage &message : host_.portsets().takePosted()) {
-      if (message.portID == kernelPort_) {
-         if (const auto change = fastpath::bindingChange(message)) {
-            program_.apply(*change);
-         }
-      }
-   }
-   program_.setErrorState(fastpath::readErrorState(host_, kernelPort_));
+   return taken;
 }
 
 void Twin::advance(std::chrono::microseconds by)
 {
    host_.clock().advance(by);
-   follow();
+   mirror_->follow(host_.portsets().takePosted());
 }
 
 std::string Twin::judge(std::span<const uint8_t> frame, uint32_t direction)
 {
+   // BPF_PROG_TEST_RUN refuses an untagged IPv4 frame shorter than its
+   // header (34 bytes) and IPv6 shorter than 54: neither port sees those.
+   const uint16_t type = frame.size() >= 14 ? static_cast<uint16_t>(frame[12] << 8 | frame[13]) : 0;
+   if ((type == 0x0800 && frame.size() < 34) || (type == 0x86dd && frame.size() < 54)) {
+      return {};
+   }
    const fastpath::Untagged untagged = fastpath::takeOuterTag(frame);
    const host::FrameSpec asSwitched{.bytes = untagged.bytes, .vlanId = untagged.vlan.value_or(0)};
    const bool passedAlone = host_.sifra().processPackets(alone_, direction, {asSwitched}).kept.size() == 1;
@@ -118,31 +101,30 @@ std::string Twin::judge(std::span<const uint8_t> frame, uint32_t direction)
    std::vector<fastpath::Punt> punts;
    program_.drainPunts([&punts](fastpath::Punt &&punt) { punts.push_back(std::move(punt)); });
    bool passedKernel = action == TC_ACT_OK;
-   std::ostringstream how;
+   std::string how = "decided in the kernel (action " + std::to_string(action) + ")";
    if (action == TC_ACT_STOLEN) {
       if (punts.size() != 1 || punts[0].bytes != untagged.bytes || punts[0].vlan != asSwitched.vlanId ||
           punts[0].direction != direction || punts[0].portId != kernelPort_) {
          return "punted, but " + std::to_string(punts.size()) + " records do not carry the frame as switched";
       }
-      how << "punted (" << fastpath::reasonName(punts[0].reason) << ")";
+      how = "punted (" + std::string(fastpath::reasonName(punts[0].reason)) + ")";
       const host::FrameSpec punted{.bytes = punts[0].bytes, .vlanId = punts[0].vlan};
       passedKernel = host_.sifra().processPackets(kernel_, direction, {punted}).kept.size() == 1;
-      follow();
+      mirror_->follow(host_.portsets().takePosted());
    } else {
-      ++decided_;
       kernelGuardDrops_ += program_.counters()[SWSEC_FP_DROP_IP_SOURCE_GUARD] - guardBefore;
-      how << "decided in the kernel (action " << action << ")";
       if (!punts.empty()) {
-         return "decided in the kernel, and punted too";
+         return how + ", and punted too";
       }
    }
    if (passedAlone != passedKernel) {
       return std::string("the module alone ") + (passedAlone ? "passed" : "dropped") + " it, the fast path " +
-             (passedKernel ? "passed" : "dropped") + " it: " + how.str();
+             (passedKernel ? "passed" : "dropped") + " it: " + how;
    }
    return counters();
 }
 
+// The feature summaries, drop counters included, with the kernel's drops added.
 std::string Twin::counters()
 {
    const auto alone = node(host_, "/security/" + std::to_string(alonePort_) + "/featureSummary");
@@ -150,9 +132,9 @@ std::string Twin::counters()
    if (kernelGuardDrops_ != 0) {
       kernel["ipSrcGuardDropCnt"] = std::to_string(std::stoull(kernel["ipSrcGuardDropCnt"]) + kernelGuardDrops_);
    }
-   for (const char *name : kDropCounters) {
-      if (alone.at(name) != kernel.at(name)) {
-         return std::string(name) + ": " + alone.at(name) + " alone, " + kernel.at(name) + " with the fast path";
+   for (const auto &[name, value] : alone) {
+      if (kernel[name] != value) {
+         return name + ": " + value + " alone, " + kernel[name] + " with the fast path";
       }
    }
    return {};

@@ -68,8 +68,11 @@ std::array<uint8_t, N> parseParts(std::string_view text, char separator, int bas
 
 }  // namespace
 
-bool readErrorState(host::Host &host, uint32_t portId)
+bool readErrorState(host::Host &host, uint32_t portId, uint32_t features)
 {
+   if ((features & SWSEC_FP_FEATURE_DAI) == 0) {
+      return false;
+   }
    host::NexoRecord summary;
    if (host.nexo().get(portPath(portId) + "/featureSummary", &summary) != ORR_OK) {
       throw std::runtime_error("cannot read the feature summary of port " + std::to_string(portId));
@@ -88,7 +91,7 @@ PortDescription readPort(host::Host &host, host::FilterId filter, uint32_t portI
    }
    std::memcpy(&port.features, config.data() + kConfigFeaturesOffset, sizeof port.features);
    port.trusted = config[kConfigTrustedOffset] != 0;
-   port.errorState = readErrorState(host, portId);
+   port.errorState = readErrorState(host, portId, port.features);
 
    std::vector<int64_t> instances;
    const std::string vmiPath = portPath(portId) + "/vmi";
@@ -132,6 +135,30 @@ std::optional<BindingChange> bindingChange(const host::PostedMessage &message)
    std::memcpy(&change.binding.ip, payload + kEntryIpOffset, sizeof change.binding.ip);
    change.binding.authoritative = payload[kEntryAuthoritativeOffset] != 0;
    return change;
+}
+
+Mirror::Mirror(Program &program, host::Host &host, host::FilterId filter, uint32_t portId)
+   : program_(program), host_(host), filter_(filter), portId_(portId)
+{
+}
+
+void Mirror::start()
+{
+   const PortDescription port = readPort(host_, filter_, portId_);
+   features_ = port.features;
+   program_.describe(port);
+}
+
+void Mirror::follow(std::span<const host::PostedMessage> messages)
+{
+   for (const host::PostedMessage &message : messages) {
+      if (message.portID == portId_) {
+         if (const auto change = bindingChange(message)) {
+            program_.apply(*change);
+         }
+      }
+   }
+   program_.setErrorState(readErrorState(host_, portId_, features_));
 }
 
 }  // namespace swsec::fastpath

@@ -8,6 +8,7 @@
 #include "host/host.h"
 
 #include <optional>
+#include <span>
 
 namespace swsec::fastpath {
 
@@ -15,11 +16,33 @@ namespace swsec::fastpath {
 // Throws std::runtime_error when a node or the property cannot be read.
 PortDescription readPort(host::Host &host, host::FilterId filter, uint32_t portId);
 
-// Whether the port is in the error-rate-limit state now.
-bool readErrorState(host::Host &host, uint32_t portId);
+// Whether the port, whose features are `features`, is in the
+// error-rate-limit state now (only DAI enters it; a port without IP
+// discovery has no summary to read).
+bool readErrorState(host::Host &host, uint32_t portId, uint32_t features);
 
 // A port database notification as a binding change; none for any other
 // message or one whose payload is not a whole entry.
 std::optional<BindingChange> bindingChange(const host::PostedMessage &message);
+
+// Keeps a program's maps the mirror of one port: started from the port as
+// it is (at start and after a new configuration), then kept by the port's
+// notifications and its error state after each list of frames the module
+// judged and each timer tick.
+class Mirror {
+public:
+   Mirror(Program &program, host::Host &host, host::FilterId filter, uint32_t portId);
+   void start();
+   // Applies the binding changes of this port among `messages`, in order,
+   // then the port's error state.
+   void follow(std::span<const host::PostedMessage> messages);
+
+private:
+   Program &program_;
+   host::Host &host_;
+   host::FilterId filter_;
+   uint32_t portId_;
+   uint32_t features_ = 0;
+};
 
 }  // namespace swsec::fastpath

@@ -9,6 +9,7 @@
 #include <gtest/gtest.h>
 
 #include <sys/socket.h>
+#include <sys/wait.h>
 #include <sys/stat.h>
 #include <sys/un.h>
 #include <unistd.h>
@@ -28,6 +29,9 @@ public:
       if (request["command"] == "boom") {
          throw CtlError("no such thing");
       }
+      if (request["command"] == "latin1") {
+         throw CtlError("caf\xe9 \xe2\x80");   // a message quoting bytes that are not UTF-8
+      }
       return {{"echo", request["command"]}};
    }
 };
@@ -46,6 +50,9 @@ public:
    }
    ~Client() { close(fd_); }
    bool connected() const { return connected_; }
+   int fd() const { return fd_; }
+   // The last line() found the connection closed (not a timeout).
+   bool closedByServer() const { return closedByServer_; }
    void shutdownWrite() { ::shutdown(fd_, SHUT_WR); }
    void send(const std::string &text) { ASSERT_EQ(::send(fd_, text.data(), text.size(), MSG_NOSIGNAL), ssize_t(text.size())); }
    // One line, or "" on a timeout or a closed connection.
@@ -60,6 +67,7 @@ public:
          }
          char chunk[4096];
          const ssize_t got = recv(fd_, chunk, sizeof chunk, 0);
+         closedByServer_ = got == 0;
          if (got <= 0) {
             return "";
          }
@@ -70,6 +78,7 @@ public:
 private:
    int fd_ = -1;
    bool connected_ = false;
+   bool closedByServer_ = false;
    std::string buffer_;
 };
 
@@ -179,6 +188,82 @@ TEST_F(CtlServerTest, log_follow_and_watch_stream_what_comes_after_the_recent_li
    events_.log("error", "module", "after");
    EXPECT_EQ(nlohmann::json::parse(watch.line())["ip"], "192.0.2.5");
    EXPECT_EQ(nlohmann::json::parse(log.line())["text"], "after");
+}
+
+TEST_F(CtlServerTest, hostile_requests_get_an_error_reply_and_never_a_crash)
+{
+   struct Case {
+      std::string line;
+      const char *error;   // part of the reply's error
+      bool closes;
+   };
+   const Case cases[] = {
+      {R"({"command": "log", "follow": "yes"})", "\"follow\" must be true or false", false},
+      {R"({"command": "log", "follow": null})", "\"follow\" must be true or false", false},
+      {R"({"command": "latin1"})", "caf", false},
+      {std::string(100'000, '[') + std::string(100'000, ']'), "not a request", true},
+      {"{\"command\": \"x\", \"a\": " + std::string(100'000, '{'), "not a request", true},
+   };
+   for (const Case &c : cases) {
+      const CtlAnswer answer = answerRequest(c.line, events_, handler_);
+      const auto reply = nlohmann::json::parse(answer.reply);
+      EXPECT_FALSE(reply["ok"]) << c.error;
+      EXPECT_NE(reply["error"].get<std::string>().find(c.error), std::string::npos) << reply;
+      EXPECT_EQ(answer.close, c.closes) << c.error;
+      EXPECT_FALSE(answer.follow) << c.error;
+   }
+}
+
+TEST_F(CtlServerTest, idle_connections_are_closed_and_make_room_for_a_newcomer)
+{
+   CtlLimits limits;
+   limits.idleTimeoutMs = 400;
+   limits.maxClients = 3;
+   CtlServer server(path_, events_, handler_, limits);
+   std::vector<std::unique_ptr<Client>> idle;
+   for (size_t i = 0; i < limits.maxClients; ++i) {
+      idle.push_back(std::make_unique<Client>(path_));
+      usleep(50'000);
+   }
+   usleep(100'000);
+   // Every place taken by a connection that asks nothing: the newcomer is served.
+   Client newcomer(path_);
+   newcomer.send("{\"command\": \"ports\"}\n");
+   EXPECT_EQ(nlohmann::json::parse(newcomer.line())["result"]["echo"], "ports");
+   // The oldest made room, and the rest time out.
+   for (const auto &client : {idle[0].get(), idle[2].get()}) {
+      EXPECT_EQ(client->line(), "");
+      EXPECT_TRUE(client->closedByServer());
+   }
+}
+
+TEST_F(CtlServerTest, another_user_is_refused_even_where_the_socket_lets_it_connect)
+{
+   if (geteuid() != 0) {
+      GTEST_SKIP() << "needs root to connect as another user";
+   }
+   CtlServer server(path_, events_, handler_);
+   ASSERT_EQ(chmod(path_.c_str(), 0666), 0);
+   ASSERT_EQ(chmod(dir_.c_str(), 0755), 0);
+   const pid_t child = fork();
+   ASSERT_GE(child, 0);
+   if (child == 0) {
+      if (setresgid(65534, 65534, 65534) != 0 || setresuid(65534, 65534, 65534) != 0) {
+         _exit(3);
+      }
+      Client other(path_);
+      if (!other.connected()) {
+         _exit(4);
+      }
+      const std::string request = "{\"command\": \"ports\"}\n";
+      (void)!::send(other.fd(), request.data(), request.size(), MSG_NOSIGNAL);   // refused: may find it closed
+      const std::string line = other.line();
+      _exit(line.find("not allowed") != std::string::npos && line.find("echo") == std::string::npos ? 0 : 5);
+   }
+   int status = 0;
+   ASSERT_EQ(waitpid(child, &status, 0), child);
+   EXPECT_TRUE(WIFEXITED(status));
+   EXPECT_EQ(WEXITSTATUS(status), 0) << "3: no other user, 4: could not connect, 5: served";
 }
 
 TEST(CtlMetrics, every_series_of_every_port_with_escaped_labels)

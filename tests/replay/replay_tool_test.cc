@@ -130,7 +130,7 @@ TEST(ReplayConfig, a_static_binding_lets_its_owner_pass_inspection_without_dhcp)
 
 struct BadConfig {
    const char *name;
-   const char *text;
+   std::string text;
    const char *message;
 };
 
@@ -164,6 +164,9 @@ INSTANTIATE_TEST_SUITE_P(
       BadConfig{"vlan_out_of_range", R"({"static": [{"vlan": 4096, "mac": "02:00:5e:c0:00:01", "ip": "10.0.0.1"}]})",
                 "0 to 4095"},
       BadConfig{"negative_limit", R"({"arpRateLimit": -1})", "unsigned 32-bit"},
+      BadConfig{"number_out_of_range", R"({"portDbSize": 1e400})", "number overflow"},
+      BadConfig{"nested_too_deep", R"({"features": )" + std::string(100'000, '[') + "\"dai\"" +
+                                      std::string(100'000, ']') + "}", "nested deeper than 64 levels"},
       // The module's own rule: inspection on a trusted port is refused, in its words.
       BadConfig{"refused_by_the_module", R"({"features": ["dai", "ip-discovery"], "trusted": true})",
                 "Invalid config: featuresEnabled = 0xc trusted = 1"}),

@@ -4,6 +4,7 @@
 #include "cli/commands.h"
 
 #include "cli/ctl_format.h"
+#include "session/json_text.h"
 
 #include <CLI/CLI.hpp>
 #include <nlohmann/json.hpp>
@@ -170,7 +171,7 @@ int runCtl(const CtlCommandOptions &options)
       std::fprintf(stderr, "swsec ctl: %s\n", e.what());
       return kExitFailure;
    }
-   const std::string line = request.dump() + "\n";
+   const std::string line = common::jsonText(request) + "\n";
    if (send(fd, line.data(), line.size(), MSG_NOSIGNAL) != static_cast<ssize_t>(line.size())) {
       std::fprintf(stderr, "swsec ctl: %s: %s\n", options.ctl.c_str(), std::strerror(errno));
       close(fd);
@@ -196,10 +197,10 @@ int runCtl(const CtlCommandOptions &options)
       if (command == "metrics") {
          std::cout << ctl::metricsText(result);
       } else if (options.json) {
-         std::cout << (reply.value("streaming", false) ? "" : result.dump(1) + "\n");
+         std::cout << (reply.value("streaming", false) ? "" : common::jsonText(result, 1) + "\n");
          if (reply.value("streaming", false)) {
             for (const auto &entry : result) {
-               std::cout << entry.dump() << "\n";
+               std::cout << common::jsonText(entry) << "\n";
             }
          }
       } else {
@@ -212,7 +213,7 @@ int runCtl(const CtlCommandOptions &options)
             if (event.is_discarded()) {
                continue;
             }
-            std::cout << (options.json ? event.dump() + "\n" : ctl::eventText(command, event)) << std::flush;
+            std::cout << (options.json ? common::jsonText(event) + "\n" : ctl::eventText(command, event)) << std::flush;
          }
          std::fprintf(stderr, "swsec ctl: swsec inline closed the connection\n");
          status = kExitFailure;

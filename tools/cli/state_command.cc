@@ -3,6 +3,7 @@
 #include "cli/commands.h"
 
 #include "session/saved_state_format.h"
+#include "session/json_text.h"
 #include "session/state_file.h"
 
 #include <CLI/CLI.hpp>
@@ -26,7 +27,7 @@ int runStateShow(const StateShowOptions &options)
       const std::vector<uint8_t> blob = common::readStateFile(options.file);
       const common::SavedPortState state = common::decodeSavedState(blob);
       if (options.json) {
-         std::cout << common::savedStateJson(state).dump(1) << "\n";
+         std::cout << common::jsonText(common::savedStateJson(state), 1) << "\n";
       } else {
          common::printSavedState(std::cout, state);
       }

@@ -1,6 +1,8 @@
 // The control socket's server thread.
 #include "live/ctl_server.h"
 
+#include "session/json_text.h"
+
 #include <fcntl.h>
 #include <poll.h>
 #include <sys/eventfd.h>
@@ -9,6 +11,7 @@
 #include <sys/un.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <chrono>
 #include <cstring>
@@ -57,9 +60,13 @@ void clearStaleSocket(const std::string &path, const sockaddr_un &address)
       throw systemError("socket");
    }
    const bool live = connect(probe, reinterpret_cast<const sockaddr *>(&address), sizeof address) == 0;
+   ucred owner{};
+   socklen_t length = sizeof owner;
+   const bool known = live && getsockopt(probe, SOL_SOCKET, SO_PEERCRED, &owner, &length) == 0 && owner.pid > 0;
    close(probe);
    if (live) {
-      throw std::runtime_error(path + ": another swsec inline is listening there");
+      throw std::runtime_error(path + ": another swsec inline is listening there" +
+                               (known ? " (PID " + std::to_string(owner.pid) + ")" : std::string()));
    }
    if (unlink(path.c_str()) != 0) {
       throw systemError(path);
@@ -77,10 +84,64 @@ struct CtlServer::Client {
    EventKind followKind = EventKind::log;
    uint64_t lastSeq = 0;
    Clock::time_point requestStarted{};
+   Clock::time_point lastActive{};
 };
 
-CtlServer::CtlServer(std::string path, EventHub &events, CtlHandler &handler)
-   : path_(std::move(path)), events_(events), handler_(handler)
+CtlAnswer answerRequest(std::string_view line, EventHub &events, CtlHandler &handler)
+{
+   CtlAnswer answer;
+   auto fail = [&answer](const std::string &message) {
+      answer.reply = common::jsonText({{"ok", false}, {"error", message}}) + "\n";
+   };
+   nlohmann::json request;
+   if (common::jsonDepth(line) <= common::kMaxJsonDepth) {
+      request = nlohmann::json::parse(line, nullptr, false);
+   } else {
+      request = nlohmann::json::value_t::discarded;
+   }
+   if (request.is_discarded() || !request.is_object() || !request.contains("command") ||
+       !request["command"].is_string()) {
+      fail("not a request: one JSON object with a \"command\" a line");
+      answer.close = true;
+      return answer;
+   }
+   const std::string command = request["command"];
+   const auto follow = request.find("follow");
+   if (follow != request.end() && !follow->is_boolean()) {
+      fail("\"follow\" must be true or false");
+      return answer;
+   }
+   if (command == "watch" || command == "log") {
+      // A followed log starts with the recent lines; a watch with what comes next.
+      nlohmann::json result = nlohmann::json::array();
+      if (command == "log") {
+         const auto recent = events.since(EventKind::log, 0);
+         const size_t skip = recent.size() > kDefaultLogLines ? recent.size() - kDefaultLogLines : 0;
+         for (size_t i = skip; i < recent.size(); ++i) {
+            result.push_back(recent[i].body);
+         }
+      }
+      answer.follow = command == "watch" || (follow != request.end() && follow->get<bool>());
+      answer.followKind = command == "watch" ? EventKind::notification : EventKind::log;
+      nlohmann::json reply = {{"ok", true}, {"result", std::move(result)}};
+      if (answer.follow) {
+         reply["streaming"] = true;
+      }
+      answer.reply = common::jsonText(reply) + "\n";
+      return answer;
+   }
+   try {
+      answer.reply = common::jsonText({{"ok", true}, {"result", handler.handle(request)}}) + "\n";
+   } catch (const CtlError &e) {
+      fail(e.what());
+   } catch (const std::exception &e) {
+      fail(std::string("failed: ") + e.what());
+   }
+   return answer;
+}
+
+CtlServer::CtlServer(std::string path, EventHub &events, CtlHandler &handler, CtlLimits limits)
+   : path_(std::move(path)), events_(events), handler_(handler), limits_(limits)
 {
    const sockaddr_un address = socketAddress(path_);
    clearStaleSocket(path_, address);
@@ -126,50 +187,23 @@ void CtlServer::serve()
    std::list<Client> clients;
    std::vector<pollfd> fds;
    std::vector<Client *> order;
-   auto reply = [](Client &client, const nlohmann::json &message) { client.out += message.dump() + "\n"; };
-   auto fail = [&](Client &client, const std::string &message) {
-      reply(client, {{"ok", false}, {"error", message}});
-   };
-
-   auto recentLog = [&] {
-      nlohmann::json lines = nlohmann::json::array();
-      const auto recent = events_.since(EventKind::log, 0);
-      const size_t skip = recent.size() > kDefaultLogLines ? recent.size() - kDefaultLogLines : 0;
-      for (size_t i = skip; i < recent.size(); ++i) {
-         lines.push_back(recent[i].body);
-      }
-      return lines;
-   };
-
    auto handleLine = [&](Client &client, const std::string &line) {
-      const auto request = nlohmann::json::parse(line, nullptr, false);
-      if (request.is_discarded() || !request.is_object() || !request.contains("command") ||
-          !request["command"].is_string()) {
-         fail(client, "not a request: one JSON object with a \"command\" a line");
-         client.closeAfterWrite = true;
-         return;
-      }
-      const std::string command = request["command"];
-      if (command == "watch" || (command == "log" && request.value("follow", false))) {
+      const CtlAnswer answer = answerRequest(line, events_, handler_);
+      client.out += answer.reply;
+      client.closeAfterWrite = answer.close;
+      if (answer.follow) {
+         const size_t followers = static_cast<size_t>(
+            std::count_if(clients.begin(), clients.end(), [](const Client &c) { return c.following; }));
+         if (followers >= limits_.maxFollowers) {
+            client.out = common::jsonText({{"ok", false},
+                                           {"error", "too many streams (" + std::to_string(followers) + ")"}}) +
+                         "\n";
+            client.closeAfterWrite = true;
+            return;
+         }
          client.following = true;
-         client.followKind = command == "watch" ? EventKind::notification : EventKind::log;
-         // A followed log starts with the recent lines; a watch with what comes next.
+         client.followKind = answer.followKind;
          client.lastSeq = events_.lastSeq();
-         reply(client, {{"ok", true},
-                        {"result", command == "log" ? recentLog() : nlohmann::json::array()},
-                        {"streaming", true}});
-         return;
-      }
-      if (command == "log") {
-         reply(client, {{"ok", true}, {"result", recentLog()}});
-         return;
-      }
-      try {
-         reply(client, {{"ok", true}, {"result", handler_.handle(request)}});
-      } catch (const CtlError &e) {
-         fail(client, e.what());
-      } catch (const std::exception &e) {
-         fail(client, std::string("failed: ") + e.what());
       }
    };
 
@@ -202,7 +236,7 @@ void CtlServer::serve()
             continue;
          }
          for (const auto &event : events_.since(client.followKind, client.lastSeq)) {
-            client.out += event.body.dump() + "\n";
+            client.out += common::jsonText(event.body) + "\n";
             client.lastSeq = event.seq;
          }
          client.lastSeq = std::max(client.lastSeq, events_.lastSeq());
@@ -221,6 +255,7 @@ void CtlServer::serve()
                client.closeAfterWrite = true;
                client.out.clear();
             } else if (got > 0 && !client.following) {
+               client.lastActive = Clock::now();
                if (client.in.empty()) {
                   client.requestStarted = Clock::now();
                }
@@ -234,7 +269,10 @@ void CtlServer::serve()
                   handleLine(client, line);
                }
                if (client.in.size() > kMaxRequestBytes) {
-                  fail(client, "request longer than " + std::to_string(kMaxRequestBytes) + " bytes");
+                  client.out += common::jsonText({{"ok", false},
+                                                  {"error", "request longer than " +
+                                                               std::to_string(kMaxRequestBytes) + " bytes"}}) +
+                                "\n";
                   client.in.clear();
                   client.closeAfterWrite = true;
                }
@@ -244,18 +282,25 @@ void CtlServer::serve()
             const ssize_t sent = send(client.fd, client.out.data(), client.out.size(), MSG_DONTWAIT | MSG_NOSIGNAL);
             if (sent > 0) {
                client.out.erase(0, static_cast<size_t>(sent));
+               client.lastActive = Clock::now();
             } else if (sent < 0 && errno != EAGAIN && errno != EINTR) {
                client.out.clear();
                client.closeAfterWrite = true;
             }
          }
       }
-      // Cut off: done, stalled mid-request, or too far behind a stream.
+      // Cut off: done, stalled mid-request, idle, or too far behind a stream.
       const auto now = Clock::now();
+      const auto idle = [&now](const Client &client) {
+         return client.following || !client.in.empty() || !client.out.empty() ? Clock::duration::zero()
+                                                                             : now - client.lastActive;
+      };
       for (auto it = clients.begin(); it != clients.end();) {
-         const bool stalled = !it->in.empty() && now - it->requestStarted > std::chrono::milliseconds(kRequestTimeoutMs);
+         const bool stalled =
+            !it->in.empty() && now - it->requestStarted > std::chrono::milliseconds(limits_.requestTimeoutMs);
          const bool lagging = it->out.size() > kMaxQueuedBytes;
-         if ((it->closeAfterWrite && it->out.empty()) || stalled || lagging) {
+         const bool idled = idle(*it) > std::chrono::milliseconds(limits_.idleTimeoutMs);
+         if ((it->closeAfterWrite && it->out.empty()) || stalled || lagging || idled) {
             close(it->fd);
             it = clients.erase(it);
          } else {
@@ -272,15 +317,26 @@ void CtlServer::serve()
             socklen_t length = sizeof peer;
             const bool allowed = getsockopt(fd, SOL_SOCKET, SO_PEERCRED, &peer, &length) == 0 &&
                                  (peer.uid == 0 || peer.uid == geteuid());
-            if (!allowed || clients.size() >= kMaxClients) {
+            if (allowed && clients.size() >= limits_.maxClients) {
+               // Full: the connection idle the longest makes room.
+               auto oldest = std::max_element(clients.begin(), clients.end(), [&idle](const Client &a, const Client &b) {
+                  return idle(a) < idle(b);
+               });
+               if (oldest != clients.end() && idle(*oldest) > Clock::duration::zero()) {
+                  close(oldest->fd);
+                  clients.erase(oldest);
+               }
+            }
+            if (!allowed || clients.size() >= limits_.maxClients) {
                const std::string message =
-                  nlohmann::json{{"ok", false}, {"error", allowed ? "too many clients" : "not allowed"}}.dump() + "\n";
+                  common::jsonText({{"ok", false}, {"error", allowed ? "too many clients" : "not allowed"}}) + "\n";
                (void)!send(fd, message.data(), message.size(), MSG_DONTWAIT | MSG_NOSIGNAL);
                close(fd);
                continue;
             }
             Client &client = clients.emplace_back();
             client.fd = fd;
+            client.lastActive = Clock::now();
          }
       }
    }

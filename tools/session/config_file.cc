@@ -5,6 +5,7 @@
 #include "contract/config_record.h"
 #include "contract/vmi_key.h"
 #include "session/error.h"
+#include "session/json_text.h"
 
 #include <arpa/inet.h>
 #include <nlohmann/json.hpp>
@@ -47,7 +48,7 @@ std::array<uint8_t, 4> parseIp(const json &value, const std::string &what)
 {
    std::array<uint8_t, 4> ip{};
    if (!value.is_string() || inet_pton(AF_INET, value.get<std::string>().c_str(), ip.data()) != 1) {
-      throw ReplayError(what + ": malformed IPv4 address " + value.dump());
+      throw ReplayError(what + ": malformed IPv4 address " + common::jsonText(value));
    }
    return ip;
 }
@@ -98,11 +99,20 @@ std::array<uint8_t, 6> parseMac(std::string_view text, const std::string &what)
 
 PortSecurityConfig parseConfig(std::string_view text, const std::string &origin)
 {
+   if (common::jsonDepth(text) > common::kMaxJsonDepth) {
+      throw ReplayError(origin + ": nested deeper than " + std::to_string(common::kMaxJsonDepth) + " levels");
+   }
    json doc;
    try {
       doc = json::parse(text);
    } catch (const json::parse_error &e) {
       throw ReplayError(origin + ": bad JSON: " + e.what());
+   } catch (const json::exception &e) {
+      // A number too large for any type (1e400): the library's message
+      // without its exception tag.
+      const std::string what = e.what();
+      const size_t tag = what.find("] ");
+      throw ReplayError(origin + ": bad JSON: " + (tag == std::string::npos ? what : what.substr(tag + 2)));
    }
    if (!doc.is_object()) {
       throw ReplayError(origin + ": expected a JSON object");
@@ -123,7 +133,7 @@ PortSecurityConfig parseConfig(std::string_view text, const std::string &origin)
                }
             }
             if (found == nullptr) {
-               throw ReplayError(origin + ": unknown feature " + name.dump() +
+               throw ReplayError(origin + ": unknown feature " + common::jsonText(name) +
                                  " (known: ip-discovery, dai, ip-source-guard, bpdu-filter, block-dhcp-server)");
             }
             config.features |= found->bit;

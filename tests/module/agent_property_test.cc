@@ -123,6 +123,8 @@ INSTANTIATE_TEST_SUITE_P(
                      TextCase{"single_space_names_nothing_twice", " ", {}, 2, 0},
                      TextCase{"two_spaces_name_nothing_between", "a  b", {"a", "b"}, 1, 0},
                      TextCase{"colon_first_names_nothing", ":args", {}, 0, 0},
+                     TextCase{"a_tab_is_part_of_a_name", "a\tb", {"a\tb"}, 0, 0},
+                     TextCase{"a_name_given_twice_is_made_once", "x x", {"x"}, 0, 1},
                      TextCase{"builtin_name_exists", kAgent, {}, 0, 1},
                      TextCase{"text_ends_at_the_first_zero_byte", std::string("x\0y", 3), {"x"}, 0, 0}),
    [](const auto &test) { return std::string(test.param.name); });

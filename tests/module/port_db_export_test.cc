@@ -23,13 +23,13 @@ protected:
    GetNumEntriesFn *getNumEntries = nullptr;
    GetEntriesFn *getEntries = nullptr;
    ReleaseBufFn *releaseBuf = nullptr;
+   uint32_t count = 7;
+   void *entries = &count;
+   void *buffer = &count;
 };
 
 TEST_F(PortDbExportTest, ports_without_a_database_are_not_found_and_null_outputs_refused)
 {
-   uint32_t count = 0;
-   void *entries = nullptr;
-   void *buffer = nullptr;
    for (uint32_t selector : {0u, 1u, 2u, 3u}) {
       EXPECT_EQ(getNumEntries(5, selector, &count), ORR_NOT_FOUND);
       EXPECT_EQ(getEntries(5, selector, &entries, &count, &buffer), ORR_NOT_FOUND);
@@ -42,27 +42,28 @@ TEST_F(PortDbExportTest, ports_without_a_database_are_not_found_and_null_outputs
    EXPECT_EQ(host().useCount(), 0u);
 }
 
-// Two static entries, set through the set-features ioctl as the slow path would.
-TEST_F(PortDbExportTest, a_held_buffer_keeps_the_module_loaded_until_released)
+// Two static entries and a learned one: selectors 0 (authoritative), 1
+// (learned), 2 (all) and an unknown one, which selects nothing.
+TEST_F(PortDbExportTest, each_selector_counts_its_entries_and_a_held_buffer_keeps_the_module_loaded)
 {
    const host::FilterId filter = create();
-   uint32_t count = 7;
-   void *entries = &count;
-   void *buffer = &count;
-   ASSERT_EQ(getEntries(kPort, 2, &entries, &count, &buffer), ORR_OK);
+   ASSERT_EQ(setFeatures(filter, {.statics = {binding(5, kVmMac, Ip4{{10, 0, 0, 1}}),
+                                              binding(6, kPeerMac, Ip4{{10, 0, 0, 2}})}}),
+             1u);
+   ASSERT_TRUE(passes(filter, kTx, arpRequest(kServerMac, kServerIp)));
+   const uint32_t counts[] = {2, 1, 3, 0};
+   for (uint32_t selector = 0; selector <= 3; selector++) {
+      ASSERT_EQ(getNumEntries(kPort, selector, &count), ORR_OK);
+      EXPECT_EQ(count, counts[selector]) << selector;
+   }
+   ASSERT_EQ(getEntries(kPort, 3, &entries, &count, &buffer), ORR_OK);
    EXPECT_EQ(count, 0u);
    EXPECT_EQ(entries, nullptr);
    EXPECT_EQ(buffer, nullptr);
    EXPECT_EQ(host().useCount(), 0u);
 
-   ASSERT_EQ(setFeatures(filter, {.statics = {{5, {2, 0, 0, 0, 0, 1}, {10, 0, 0, 1}},
-                                              {6, {2, 0, 0, 0, 0, 2}, {10, 0, 0, 2}}}}),
-             1u);
-   ASSERT_EQ(getNumEntries(kPort, 0, &count), ORR_OK);
-   EXPECT_EQ(count, 2u);
    ASSERT_EQ(getEntries(kPort, 0, &entries, &count, &buffer), ORR_OK);
    ASSERT_EQ(count, 2u);
-   ASSERT_NE(buffer, nullptr);
    EXPECT_EQ(entries, buffer);
    const auto *bytes = static_cast<const uint8_t *>(entries);
    EXPECT_EQ(bytes[0], 5u);
@@ -72,14 +73,27 @@ TEST_F(PortDbExportTest, a_held_buffer_keeps_the_module_loaded_until_released)
    EXPECT_EQ(bytes[32 + 0], 6u);
    EXPECT_EQ(bytes[32 + 15], 2u);
    EXPECT_EQ(host().useCount(), 1u);
-
    EXPECT_EQ(host().unload(), ORR_BUSY);
-   EXPECT_TRUE(host().loaded());
-
    EXPECT_EQ(releaseBuf(buffer), ORR_OK);
    EXPECT_EQ(host().useCount(), 0u);
-   EXPECT_EQ(host().sifra().destroyFilterAsHypervisor(filter).status, ORR_OK);
-   EXPECT_EQ(getNumEntries(kPort, 0, &count), ORR_NOT_FOUND);
+}
+
+TEST_F(PortDbExportTest, failed_reads_free_the_buffer_and_drop_the_reference)
+{
+   const host::FilterId filter = create();
+   ASSERT_EQ(setFeatures(filter, {.statics = {binding(5, kVmMac, kVmIp)}}), 1u);
+   const uint64_t blocks = host().heap().liveBlocks();
+   host().faults().failOnce("orr_HeapAllocWithRA", ORR_NO_MEMORY);
+   EXPECT_EQ(getEntries(kPort, 0, &entries, &count, &buffer), ORR_NO_MEMORY);
+   EXPECT_TRUE(logged("filter: Dbentry alloc failed"));
+   host().faults().failOnce("orr_ModuleIncUseCount", ORR_FAILURE);
+   buffer = nullptr;
+   EXPECT_EQ(getEntries(kPort, 0, &entries, &count, &buffer), ORR_FAILURE);
+   EXPECT_TRUE(logged("filter: portId= 7: ModIncUseCnt() failed: Failure"));
+   EXPECT_EQ(buffer, nullptr);
+   EXPECT_EQ(host().heap().liveBlocks(), blocks);
+   // No reference is left behind: the disable goes through.
+   EXPECT_EQ(writeConfig(filter, {.features = 0}), ORR_OK);
 }
 
 }  // namespace

@@ -1,5 +1,5 @@
-// Port database messages on the portset, and reading a database out: the
-// query formats and the exported functions' paths that need no loaded module.
+// Port database messages on the portset, and the formats a database is
+// read out in.
 #include "unit/hand_made_port.h"
 
 namespace swsec::testing {
@@ -143,49 +143,6 @@ TEST_F(PortDbQueryTest, each_format_writes_the_selected_entries_in_list_order)
       EXPECT_EQ(entries[32 * n], 0xee);
       EXPECT_EQ(keys[12 * n], 0xee);
    }
-}
-
-// Unknown ports, null outputs and the empty database are checked through
-// the loaded module (tests/module/port_db_export_test.cc).
-TEST_F(PortDbQueryTest, exported_queries_count_each_selector_and_answer_an_empty_one_with_nothing)
-{
-   ASSERT_EQ(configure(config(kOn, 1, 32)), ORR_OK);
-   fillFive();
-   uint32_t count = 99;
-   const uint32_t want[] = {2, 3, 5, 0};
-   for (uint32_t selector = 0; selector <= 3; selector++) {
-      EXPECT_EQ(SwSec_PortDBGetNumEntries(kPortId, selector, &count), ORR_OK);
-      EXPECT_EQ(count, want[selector]) << selector;
-   }
-   void *entries = &count;
-   void *buffer = &count;
-   EXPECT_EQ(SwSec_PortDBGetEntries(kPortId, 3, &entries, &count, &buffer), ORR_OK);
-   EXPECT_EQ(count, 0u);
-   EXPECT_EQ(entries, nullptr);
-   EXPECT_EQ(buffer, nullptr);
-}
-
-TEST_F(PortDbQueryTest, failed_reads_free_the_buffer_and_drop_the_reference)
-{
-   ASSERT_EQ(configure(config(kOn, 1, 32, {{1, 1, 1}})), ORR_OK);
-   uint32_t count = 0;
-   void *entries = nullptr;
-   void *buffer = nullptr;
-   const uint64_t blocks = host().heap().liveBlocks();
-
-   host().faults().failOnce("orr_HeapAllocWithRA", ORR_NO_MEMORY);
-   EXPECT_EQ(SwSec_PortDBGetEntries(kPortId, 0, &entries, &count, &buffer), ORR_NO_MEMORY);
-   EXPECT_TRUE(logged("port-7: Dbentry alloc failed"));
-
-   // No module is loaded here, so the use count cannot be raised.
-   host().faults().failOnce("orr_ModuleIncUseCount", ORR_FAILURE);
-   EXPECT_EQ(SwSec_PortDBGetEntries(kPortId, 0, &entries, &count, &buffer), ORR_FAILURE);
-   EXPECT_TRUE(logged("port-7: portId= 7: ModIncUseCnt() failed: Failure"));
-   EXPECT_EQ(buffer, nullptr);
-
-   EXPECT_EQ(host().heap().liveBlocks(), blocks);
-   // No reference is left behind: the disable goes through.
-   EXPECT_EQ(configure(config(0, 0, 0)), ORR_OK);
 }
 
 }  // namespace

@@ -9,7 +9,6 @@
 #include <gmock/gmock.h>
 
 #include <cstring>
-#include <functional>
 
 using ::testing::ElementsAre;
 using ::testing::IsEmpty;
@@ -336,11 +335,8 @@ TEST_F(SlowPathTest, unloading_with_the_attach_callback_still_scheduled_cancels_
 const Bytes kSlowState = {0xde, 0xad, 0xbe, 0xef, 0x01};
 
 class SavedSlowPathTest : public SlowPathTest {
-public:
-   host::Host &hostOf() { return host(); }
-   uint32_t phase(host::FilterId id) { return record(id)->migrationState; }
-
 protected:
+   uint32_t phase(host::FilterId id) { return record(id)->migrationState; }
    host::Migration &migration() { return host().migration(); }
 
    host::FilterId attachedPort(const char *name = "vm")
@@ -388,69 +384,55 @@ TEST_F(SavedSlowPathTest, a_prefetch_while_the_filter_is_still_attaching_asks_no
    deliver();
 }
 
-// How a fetch ends, and what the filter is left with.
+// How a fetch ends, and what the filter is left with. Before the reply:
+// 'a' the copy's allocation fails, 'c' the save is cancelled, 'u' the slow
+// path is withdrawn.
 struct FetchCase {
    const char *name;
-   std::function<void(SavedSlowPathTest &, host::FilterId)> act;
+   host::SlowPathStateOutcome outcome;
+   char before;
    uint32_t phase;            // after the reply, if any, was delivered
-   const char *message;
+   const char *message;       // null: none
 };
 
 class FetchOutcomeTest : public SavedSlowPathTest, public ::testing::WithParamInterface<FetchCase> {};
 
 TEST_P(FetchOutcomeTest, each_fetch_outcome_leaves_its_phase_and_no_reference)
 {
+   const FetchCase &c = GetParam();
    const host::FilterId id = attachedPort();
-   GetParam().act(*this, id);
+   migration().scriptRetrieve(c.outcome);
+   migration().prefetch(id);
+   if (c.before == 'a') {
+      host().faults().failOnce("orr_HeapAllocWithRA", ORR_NO_MEMORY);
+   } else if (c.before == 'c') {
+      EXPECT_EQ(migration().length(id, nullptr), ORR_OK);
+   } else if (c.before == 'u') {
+      EXPECT_EQ(slowPaths().unregisterSlowPath(1), ORR_OK);
+      EXPECT_EQ(phase(id), SifraGenericMigrationReady) << "at once, without the part";
+   }
    (void)migration().deliverReplies();
-   EXPECT_EQ(phase(id), GetParam().phase);
-   if (GetParam().message != nullptr) {
-      EXPECT_TRUE(logged(GetParam().message)) << ::testing::PrintToString(logTexts());
+   EXPECT_EQ(phase(id), c.phase);
+   if (c.message != nullptr) {
+      EXPECT_TRUE(logged(c.message)) << ::testing::PrintToString(logTexts());
    }
    EXPECT_EQ(record(id)->refCount, 1u);
    expectConsistent();
 }
 
-void prefetchScripted(SavedSlowPathTest &port, host::FilterId id, host::SlowPathStateOutcome outcome)
-{
-   port.hostOf().migration().scriptRetrieve(outcome);
-   port.hostOf().migration().prefetch(id);
-}
-
 INSTANTIATE_TEST_SUITE_P(
    Outcomes, FetchOutcomeTest,
    ::testing::Values(
-      FetchCase{"an_empty_state_makes_the_save_ready_without_a_part",
-                [](SavedSlowPathTest &port, host::FilterId id) { prefetchScripted(port, id, {}); },
-                SifraGenericMigrationReady, nullptr},
-      FetchCase{"a_failed_reply_returns_to_idle",
-                [](SavedSlowPathTest &port, host::FilterId id) {
-                   prefetchScripted(port, id, {.replyStatus = ORR_TRY_AGAIN});
-                },
-                SifraGenericMigrationIdle, "vm: Failed to retrieve slow path state (0xbad0006): "},
-      FetchCase{"a_refused_request_returns_to_idle",
-                [](SavedSlowPathTest &port, host::FilterId id) {
-                   prefetchScripted(port, id, {.refusal = ORR_NO_MEMORY});
-                },
-                SifraGenericMigrationIdle, "vm: Requesting slow path state failed (0xbad0014): "},
-      FetchCase{"no_memory_for_the_copy_returns_to_idle",
-                [](SavedSlowPathTest &port, host::FilterId id) {
-                   prefetchScripted(port, id, {.state = kSlowState});
-                   port.hostOf().faults().failOnce("orr_HeapAllocWithRA", ORR_NO_MEMORY);
-                },
-                SifraGenericMigrationIdle, "vm: Failed to alloc 5 bytes for state buffer"},
-      FetchCase{"a_reply_after_a_cancel_is_ignored",
-                [](SavedSlowPathTest &port, host::FilterId id) {
-                   prefetchScripted(port, id, {.state = kSlowState});
-                   EXPECT_EQ(port.hostOf().migration().length(id, nullptr), ORR_OK);
-                },
-                SifraGenericMigrationIdle, "vm: Ignoring slow path state reply; wrong state (1)"},
-      FetchCase{"a_detach_makes_the_save_ready_and_the_late_reply_is_ignored",
-                [](SavedSlowPathTest &port, host::FilterId id) {
-                   prefetchScripted(port, id, {.state = kSlowState});
-                   EXPECT_EQ(port.hostOf().sifra().slowPaths().unregisterSlowPath(1), ORR_OK);
-                   EXPECT_EQ(port.phase(id), SifraGenericMigrationReady);
-                },
+      FetchCase{"an_empty_state_makes_the_save_ready_without_a_part", {}, 0, SifraGenericMigrationReady, nullptr},
+      FetchCase{"a_failed_reply_returns_to_idle", {.replyStatus = ORR_TRY_AGAIN}, 0, SifraGenericMigrationIdle,
+                "vm: Failed to retrieve slow path state (0xbad0006): "},
+      FetchCase{"a_refused_request_returns_to_idle", {.refusal = ORR_NO_MEMORY}, 0, SifraGenericMigrationIdle,
+                "vm: Requesting slow path state failed (0xbad0014): "},
+      FetchCase{"no_memory_for_the_copy_returns_to_idle", {.state = kSlowState}, 'a', SifraGenericMigrationIdle,
+                "vm: Failed to alloc 5 bytes for state buffer"},
+      FetchCase{"a_reply_after_a_cancel_is_ignored", {.state = kSlowState}, 'c', SifraGenericMigrationIdle,
+                "vm: Ignoring slow path state reply; wrong state (1)"},
+      FetchCase{"a_detach_makes_the_save_ready_and_the_late_reply_is_ignored", {.state = kSlowState}, 'u',
                 SifraGenericMigrationReady, "vm: Ignoring slow path state reply; wrong state (3)"}),
    [](const auto &testInfo) { return std::string(testInfo.param.name); });
 

@@ -172,7 +172,7 @@ TEST_F(FramesTest, CopyOutAndMachineAddressesAreBoundedByTheFrameAndOneLiveEleme
    }
    EXPECT_EQ(orr_PktCopyBytesOut(pkt, 0, 8, out.data()), ORR_NO_MEMORY);
    EXPECT_EQ(orr_MA2VA(second.addr, 1, &va), ORR_NO_MEMORY);
-   list.reset();
+   orr_PktRelease(takeOut(*list));
    EXPECT_EQ(orr_MA2VA(second.addr, 1, &va), ORR_BAD_PARAM) << "the frame went back to the host";
 }
 
@@ -187,7 +187,10 @@ TEST_F(FramesTest, HeaderLookupByFrameKind)
    const Bytes fragment = ethernet({.dst = kPeer, .src = kVm},
                                    ipv4({.protocol = 17, .fragmentOffset = 4}, udp({}, Bytes(8, 0))));
    const Bytes whole = sampleUdp();
-   const Bytes tcp = ethernet({.dst = kPeer, .src = kVm}, ipv4({.protocol = 6}, Bytes(20, 0x50)));
+   const Bytes tcp = ethernet({.dst = kPeer, .src = kVm}, ipv4({.protocol = 6}, Bytes(24, 0x60)));
+   Bytes options = tcp;   // four bytes of IPv4 options
+   options[14] = 0x46;
+   options.insert(options.begin() + 34, 4, 0x01);
    struct Case {
       const char *what;
       Bytes bytes;
@@ -201,7 +204,8 @@ TEST_F(FramesTest, HeaderLookupByFrameKind)
        E{54, 8, 0, 62}},
       {"802.3 BPDU", bpduFrame(kVm), E{0, 14, htons(38), 14}, {}, {}},
       {"non-first IPv4 fragment", fragment, E{0, 14, htons(0x0800), 14}, E{14, 20, 17, 34}, {}},
-      {"TCP over IPv4", tcp, E{0, 14, htons(0x0800), 14}, E{14, 20, 6, 34}, E{34, 20, 0, 54}},
+      {"TCP over IPv4", tcp, E{0, 14, htons(0x0800), 14}, E{14, 20, 6, 34}, E{34, 24, 0, 58}},
+      {"IPv4 options", options, E{0, 14, htons(0x0800), 14}, E{14, 24, 6, 38}, E{38, 24, 0, 62}},
       {"truncated IPv4", Bytes(whole.begin(), whole.begin() + 30), E{0, 14, htons(0x0800), 14}, {}, {}},
       {"runt", Bytes(13, 0), {}, {}, {}},
    };

@@ -167,7 +167,7 @@ TEST(HashBytes, SpreadsSequentialKeysAndEveryByteCounts)
    }
    EXPECT_GT(*std::min_element(std::begin(counts), std::end(counts)), 50u);
    EXPECT_LT(*std::max_element(std::begin(counts), std::end(counts)), 150u);
-   unsigned char key[16] = {1, 2, 3, 4, 5, 6, 7, 8, 9, 10, 11, 12, 13, 14, 15, 16};
+   unsigned char key[15] = {1, 2, 3, 4, 5, 6, 7, 8, 9, 10, 11, 12, 13, 14, 15};   // a word, a half and 3 bytes
    const uint32_t base = HashFunc_HashBytes(key, sizeof key);
    for (size_t i = 0; i < sizeof key; ++i) {
       key[i] ^= 0x01;

@@ -2,7 +2,8 @@
 # Configures and builds one flavour of the tree into build/<flavour>.
 #   gcc      g++, warnings as errors (the default)
 #   clang    clang++, warnings as errors
-#   asan     clang++ with AddressSanitizer and UndefinedBehaviorSanitizer
+#   asan     clang++ with AddressSanitizer and UndefinedBehaviorSanitizer, and
+#            coverage for libFuzzer: the tests and the fuzz targets in one build
 #   tsan     clang++ with ThreadSanitizer
 #   release  g++ optimised with link-time optimisation, for the tools and
 #            benchmarks (their host without the test-only checks)
@@ -18,8 +19,8 @@ args=(-G Ninja -DSWSEC_WERROR=ON)
 case "$flavour" in
   gcc)     args+=(-DCMAKE_CXX_COMPILER=g++ -DCMAKE_C_COMPILER=gcc -DCMAKE_BUILD_TYPE=RelWithDebInfo) ;;
   clang)   args+=(-DCMAKE_CXX_COMPILER=clang++ -DCMAKE_C_COMPILER=clang -DCMAKE_BUILD_TYPE=RelWithDebInfo) ;;
-  asan)    args+=(-DCMAKE_CXX_COMPILER=clang++ -DCMAKE_C_COMPILER=clang -DCMAKE_BUILD_TYPE=Debug
-                  "-DSWSEC_SANITIZE=address;undefined") ;;
+  asan)    args+=(-DCMAKE_CXX_COMPILER=clang++ -DCMAKE_C_COMPILER=clang -DCMAKE_BUILD_TYPE=RelWithDebInfo
+                  -DSWSEC_FUZZ=ON) ;;
   tsan)    args+=(-DCMAKE_CXX_COMPILER=clang++ -DCMAKE_C_COMPILER=clang -DCMAKE_BUILD_TYPE=RelWithDebInfo
                   -DSWSEC_SANITIZE=thread) ;;
   release) args+=(-DCMAKE_CXX_COMPILER=g++ -DCMAKE_C_COMPILER=gcc -DCMAKE_BUILD_TYPE=Release -DSWSEC_LTO=ON -DSWSEC_LEAN_HOST=ON) ;;

@@ -1,13 +1,14 @@
 #!/usr/bin/env bash
-# Builds the fuzz targets into build/fuzz and runs each for SECONDS (default
-# 30) from the seed corpus made of the test captures. A crash leaves its input
-# in build/fuzz/findings/<target>/ and fails the script.
+# Builds the fuzz targets in the sanitizer build (build/asan, which the tests
+# share) and runs each for SECONDS (default 30) from the seed corpus made of
+# the test captures. A crash leaves its input in build/asan/findings/<target>/
+# and fails the script.
 #   scripts/fuzz.sh [SECONDS]
 set -euo pipefail
 cd "$(dirname "$0")/.."
 
 seconds=${1:-30}
-dir=build/fuzz
+dir=build/asan
 targets=(dhcp_parse_fuzz frame_fuzz control_fuzz capture_fuzz restore_state_fuzz)
 # The kernel fast path's target loads a BPF program: root only.
 if [ "$(id -u)" -eq 0 ]; then
@@ -16,9 +17,7 @@ else
   echo "fuzz: fastpath_fuzz skipped: loading its BPF program needs root"
 fi
 
-cmake -S . -B "$dir" -G Ninja -DSWSEC_WERROR=ON -DSWSEC_FUZZ=ON \
-  -DCMAKE_CXX_COMPILER=clang++ -DCMAKE_C_COMPILER=clang -DCMAKE_BUILD_TYPE=RelWithDebInfo >/dev/null
-ninja -C "$dir" -j "$(nproc)" "${targets[@]}" seed_corpus state_seeds swsec_module
+bash scripts/build.sh asan "${targets[@]}" seed_corpus state_seeds swsec_module
 
 # Seeds are regenerated each run; what a run discovers goes to a separate
 # corpus directory that later local runs keep using.

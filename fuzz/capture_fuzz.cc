@@ -31,7 +31,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size)
             }
          }
          (void)bytes;
-      } catch (const swsec::replay::ReplayError &) {
+      } catch (const swsec::session::InputError &) {
          // Refused with a message: what a hostile file should get.
       }
    }

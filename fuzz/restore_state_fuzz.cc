@@ -30,8 +30,8 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size)
 
    bool decoded = true;
    try {
-      (void)swsec::common::decodeSavedState(blob);
-   } catch (const swsec::common::BadSavedState &) {
+      (void)swsec::session::decodeSavedState(blob);
+   } catch (const swsec::session::BadSavedState &) {
       decoded = false;
    }
 

@@ -27,13 +27,13 @@ int main(int argc, char **argv)
    try {
       std::ifstream in(manifest);
       const nlohmann::json entries = nlohmann::json::parse(in);
-      const auto enforcing = swsec::replay::loadConfigFile(argv[3]);
+      const auto enforcing = swsec::session::loadConfigFile(argv[3]);
       for (const auto &entry : entries) {
          const std::string file = entry["file"];
          for (const bool enforce : {false, true}) {
             swsec::replay::ReplayOptions options;
             options.capturePath = (manifest.parent_path() / file).string();
-            options.vmMac = swsec::replay::parseMac(entry["vmMac"].get<std::string>(), "vmMac");
+            options.vmMac = swsec::session::parseMac(entry["vmMac"].get<std::string>(), "vmMac");
             if (enforce) {
                options.config = enforcing;
             }

@@ -52,8 +52,8 @@ replay::ReplayResult replayExample(replay::FrameRecords records)
 {
    replay::ReplayOptions options;
    options.capturePath = (sourceDir() / "examples/example-dhcp-then-spoof.pcap").string();
-   options.vmMac = replay::parseMac("02:00:5e:c0:00:01", "test");
-   options.config = replay::loadConfigFile((sourceDir() / "examples/enforcing.json").string());
+   options.vmMac = session::parseMac("02:00:5e:c0:00:01", "test");
+   options.config = session::loadConfigFile((sourceDir() / "examples/enforcing.json").string());
    options.untilSeconds = 200;
    options.frameRecords = records;
    options.describeDrops = true;

@@ -118,7 +118,7 @@ TEST(HostileCapture, a_pcapng_block_longer_than_the_file_is_refused_before_anyth
    try {
       readCapture(dir.path() / "huge.pcapng");
       ADD_FAILURE() << "read a block longer than the file";
-   } catch (const replay::ReplayError &e) {
+   } catch (const session::InputError &e) {
       EXPECT_NE(std::string(e.what()).find("corrupt pcapng block at offset 48 (length 4294967280, 200 bytes left"),
                 std::string::npos)
          << e.what();
@@ -374,7 +374,7 @@ TEST(ReplayIdleTime, skipping_idle_ticks_gives_what_firing_every_tick_gives)
          options.capturePath = capture.string();
          options.untilSeconds = until;
          if (config) {
-            options.config = replay::loadConfigFile(*config);
+            options.config = session::loadConfigFile(*config);
          }
          options.skipIdleTime = false;
          const auto ticked = replay::replayJson(replay::runReplay(options));

@@ -94,7 +94,7 @@ protected:
       options.batch = batch;
       options.reasons = reasons;
       if (c.setting == "enforcing") {
-         options.config = replay::loadConfigFile((sourceDir() / "examples/enforcing.json").string());
+         options.config = session::loadConfigFile((sourceDir() / "examples/enforcing.json").string());
       }
       return replay::runReplay(options);
    }
@@ -107,7 +107,7 @@ TEST(ManifestSettings, the_shipped_configurations_are_the_manifests_settings)
    const json &entry = manifest().at(0);
    for (const char *name : {"learning", "enforcing"}) {
       const json &expected = settingFor(entry, name);
-      const auto config = replay::loadConfigFile((sourceDir() / "examples" / (std::string(name) + ".json")).string());
+      const auto config = session::loadConfigFile((sourceDir() / "examples" / (std::string(name) + ".json")).string());
       EXPECT_EQ(config.features, expected["featuresEnabled"].get<uint32_t>()) << name;
       EXPECT_EQ(config.trusted, expected["trusted"].get<int>() != 0) << name;
       EXPECT_EQ(config.portDbSize, expected["portDbSize"].get<uint32_t>()) << name;
@@ -116,8 +116,8 @@ TEST(ManifestSettings, the_shipped_configurations_are_the_manifests_settings)
       EXPECT_EQ(config.errRateLimitPeriod, expected["errRateLimitPeriod"].get<uint32_t>()) << name;
    }
    // Learning is what a new port starts with, so replays without --config match it too.
-   EXPECT_EQ(replay::configRecord(replay::PortSecurityConfig{}),
-             replay::configRecord(replay::loadConfigFile((sourceDir() / "examples/learning.json").string())));
+   EXPECT_EQ(session::configRecord(session::PortSecurityConfig{}),
+             session::configRecord(session::loadConfigFile((sourceDir() / "examples/learning.json").string())));
 }
 
 TEST_P(ManifestReplay, verdicts_events_database_and_counters_match_the_manifest)

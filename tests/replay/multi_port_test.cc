@@ -38,7 +38,7 @@ replay::ReplayOptions threePorts()
    for (int i = 0; i < 3; ++i) {
       replay::PortSpec &port = options.ports.emplace_back();
       port.name = "vm" + std::to_string(i + 1);
-      port.macs.push_back(replay::parseMac(kVmMacs[i], "test"));
+      port.macs.push_back(session::parseMac(kVmMacs[i], "test"));
    }
    return options;
 }
@@ -58,7 +58,7 @@ TEST(MultiPort, each_port_of_a_bridge_capture_learns_only_its_own_vms_lease)
 {
    for (const char *config : {"learning.json", "enforcing.json"}) {
       replay::ReplayOptions options = threePorts();
-      options.config = replay::loadConfigFile((sourceDir() / "examples" / config).string());
+      options.config = session::loadConfigFile((sourceDir() / "examples" / config).string());
       const auto result = replay::runReplay(options);
       ASSERT_EQ(result.ports.size(), 3u);
       EXPECT_TRUE(result.violations.empty());
@@ -117,8 +117,8 @@ TEST(MultiPort, network_macs_make_every_other_source_the_vm)
    writePcapng(dir.path() / "spoof.pcapng", frames);
    replay::ReplayOptions options;
    options.capturePath = (dir.path() / "spoof.pcapng").string();
-   options.networkMacs.push_back(replay::parseMac("02:00:5e:c0:00:fe", "test"));
-   options.config = replay::loadConfigFile(enforcing());
+   options.networkMacs.push_back(session::parseMac("02:00:5e:c0:00:fe", "test"));
+   options.config = session::loadConfigFile(enforcing());
    const auto single = replay::runReplay(options);
    ASSERT_EQ(single.ports.size(), 1u);
    ASSERT_EQ(single.frames.size(), 24u);
@@ -250,7 +250,7 @@ TEST(ReplayStreams, the_vlan_option_replays_one_vlan_and_unseen_vm_macs_are_warn
    const std::string capture = (sourceDir() / "tests/data/attack-vlan100.pcap").string();
    replay::ReplayOptions options;
    options.capturePath = capture;
-   options.vmMac = replay::parseMac("02:00:5e:c0:00:10", "test");
+   options.vmMac = session::parseMac("02:00:5e:c0:00:10", "test");
    const auto all = replay::runReplay(options);
    options.vlan = 100;
    const auto tagged = replay::runReplay(options);
@@ -290,7 +290,7 @@ TEST(ReplayReportLog, a_line_the_module_repeats_is_kept_once_with_its_count)
    writePcapng(dir.path() / "repeated.pcapng", frames);
    replay::ReplayOptions options;
    options.capturePath = (dir.path() / "repeated.pcapng").string();
-   options.vmMac = replay::parseMac("02:00:5e:c0:00:10", "test");
+   options.vmMac = session::parseMac("02:00:5e:c0:00:10", "test");
    const auto result = replay::runReplay(options);
    size_t entries = 0;
    for (const auto &line : result.log) {

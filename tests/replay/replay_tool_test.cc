@@ -30,7 +30,7 @@ TEST(ReplayDirections, the_vm_mac_decides_unless_the_capture_records_a_direction
    TempDir dir;
    auto frames = readCapture(example());
    replay::ReplayOptions options;
-   options.vmMac = replay::parseMac(kVmMac, "test");
+   options.vmMac = session::parseMac(kVmMac, "test");
    options.capturePath = example();
    auto byMac = replay::runReplay(options);
    ASSERT_EQ(byMac.frames.size(), frames.size());
@@ -63,7 +63,7 @@ TEST(ReplayClock, running_on_past_the_lease_and_arp_lifetimes_ages_the_bindings_
 {
    replay::ReplayOptions options;
    options.capturePath = example();
-   options.vmMac = replay::parseMac(kVmMac, "test");
+   options.vmMac = session::parseMac(kVmMac, "test");
    const auto atEnd = replay::runReplay(options);
    ASSERT_EQ(atEnd.ports[0].portDb.size(), 2u);   // the DHCP lease and the ARP-snooped 192.0.2.1
 
@@ -85,7 +85,7 @@ TEST(ReplayClock, the_lease_counts_down_on_capture_time)
 {
    replay::ReplayOptions options;
    options.capturePath = example();
-   options.vmMac = replay::parseMac(kVmMac, "test");
+   options.vmMac = session::parseMac(kVmMac, "test");
    options.untilSeconds = 50;
    const auto result = replay::runReplay(options);
    ASSERT_FALSE(result.ports[0].portDb.empty());
@@ -98,10 +98,10 @@ TEST(ReplayClock, the_lease_counts_down_on_capture_time)
 
 TEST(ReplayConfig, static_bindings_are_written_in_the_record_layout)
 {
-   const auto config = replay::parseConfig(
+   const auto config = session::parseConfig(
       R"({"features":["dai","ip-discovery"],"trusted":false,"static":[{"vlan":258,"mac":"02:00:5e:c0:00:01","ip":"192.0.2.7"}]})",
       "inline");
-   const auto bytes = replay::configRecord(config);
+   const auto bytes = session::configRecord(config);
    ASSERT_EQ(bytes.size(), 26u + 12u);
    EXPECT_EQ(bytes[0], 1);                                  // version
    EXPECT_EQ(bytes[1], 0x0c);                               // DAI | IP discovery
@@ -119,8 +119,8 @@ TEST(ReplayConfig, a_static_binding_lets_its_owner_pass_inspection_without_dhcp)
                    R"("static":[{"vlan":0,"mac":"02:00:5e:c0:00:01","ip":"192.0.2.101"}]})");
    replay::ReplayOptions options;
    options.capturePath = example();
-   options.vmMac = replay::parseMac(kVmMac, "test");
-   options.config = replay::loadConfigFile(path.string());
+   options.vmMac = session::parseMac(kVmMac, "test");
+   options.config = session::loadConfigFile(path.string());
    const auto result = replay::runReplay(options);
    // Frame 10, the VM's ARP reply from 192.0.2.101, passes on the static binding.
    EXPECT_TRUE(result.frames.at(9).passed);

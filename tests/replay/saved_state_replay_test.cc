@@ -73,7 +73,7 @@ protected:
       replay::ReplayOptions options;
       options.capturePath = capture.string();
       if (enforcing) {
-         options.config = replay::loadConfigFile((sourceDir() / "examples/enforcing.json").string());
+         options.config = session::loadConfigFile((sourceDir() / "examples/enforcing.json").string());
       }
       options.untilSeconds = until;
       options.saveStatePath = save;
@@ -126,8 +126,8 @@ TEST_P(SplitReplay, a_capture_cut_in_two_decides_as_one_run)
       EXPECT_EQ(afterPort.featureSummary.has_value(), wholePort.featureSummary.has_value());
       ASSERT_EQ(afterPort.portDb.size(), wholePort.portDb.size());
       for (size_t i = 0; i < afterPort.portDb.size(); ++i) {
-         const replay::PortDbEntry &a = afterPort.portDb[i];
-         const replay::PortDbEntry &w = wholePort.portDb[i];
+         const session::PortDbEntry &a = afterPort.portDb[i];
+         const session::PortDbEntry &w = wholePort.portDb[i];
          EXPECT_EQ(std::tie(a.vlan, a.mac, a.ip, a.method, a.chaddr, a.clientIdLen, a.serverIp, a.leaseTime),
                    std::tie(w.vlan, w.mac, w.ip, w.method, w.chaddr, w.clientIdLen, w.serverIp, w.leaseTime));
          // Whole seconds of two clocks that started at different fractions.
@@ -191,7 +191,7 @@ TEST_F(StateTool, bad_state_files_are_refused_with_one_line_and_nothing_written)
 {
    const std::string good = (dir_.path() / "good.state").string();
    ASSERT_EQ(runTool({"replay", "--vm-mac", "02:00:5e:c0:00:01", "--save-state", good, example()}).status, 0);
-   const std::vector<uint8_t> blob = common::readStateFile(good);
+   const std::vector<uint8_t> blob = session::readStateFile(good);
 
    struct Bad {
       const char *name;

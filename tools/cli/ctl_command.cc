@@ -171,7 +171,7 @@ int runCtl(const CtlCommandOptions &options)
       std::fprintf(stderr, "swsec ctl: %s\n", e.what());
       return kExitFailure;
    }
-   const std::string line = common::jsonText(request) + "\n";
+   const std::string line = session::jsonText(request) + "\n";
    if (send(fd, line.data(), line.size(), MSG_NOSIGNAL) != static_cast<ssize_t>(line.size())) {
       std::fprintf(stderr, "swsec ctl: %s: %s\n", options.ctl.c_str(), std::strerror(errno));
       close(fd);
@@ -197,10 +197,10 @@ int runCtl(const CtlCommandOptions &options)
       if (command == "metrics") {
          std::cout << ctl::metricsText(result);
       } else if (options.json) {
-         std::cout << (reply.value("streaming", false) ? "" : common::jsonText(result, 1) + "\n");
+         std::cout << (reply.value("streaming", false) ? "" : session::jsonText(result, 1) + "\n");
          if (reply.value("streaming", false)) {
             for (const auto &entry : result) {
-               std::cout << common::jsonText(entry) << "\n";
+               std::cout << session::jsonText(entry) << "\n";
             }
          }
       } else {
@@ -213,7 +213,7 @@ int runCtl(const CtlCommandOptions &options)
             if (event.is_discarded()) {
                continue;
             }
-            std::cout << (options.json ? common::jsonText(event) + "\n" : ctl::eventText(command, event)) << std::flush;
+            std::cout << (options.json ? session::jsonText(event) + "\n" : ctl::eventText(command, event)) << std::flush;
          }
          std::fprintf(stderr, "swsec ctl: swsec inline closed the connection\n");
          status = kExitFailure;

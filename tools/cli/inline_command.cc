@@ -105,7 +105,7 @@ live::InlineOptions parseOptions(const InlineCommandOptions &command)
    // anything changes.
    for (const auto &port : options.ports) {
       if (!port.configPath.empty()) {
-         (void)replay::loadConfigFile(port.configPath);
+         (void)session::loadConfigFile(port.configPath);
       }
    }
    return options;
@@ -121,7 +121,7 @@ int runInline(const InlineCommandOptions &command)
    } catch (const UsageError &e) {
       std::fprintf(stderr, "swsec inline: %s\n", e.what());
       return kExitUsage;
-   } catch (const replay::ReplayError &e) {
+   } catch (const session::InputError &e) {
       std::fprintf(stderr, "swsec inline: %s\n", e.what());
       return kExitUsage;
    }
@@ -153,7 +153,7 @@ int runInline(const InlineCommandOptions &command)
          daemon->pump();
          daemon.reset();
       }
-      return dynamic_cast<const ports::Refused *>(&e) != nullptr ? kExitUsage : kExitFailure;
+      return dynamic_cast<const session::Refused *>(&e) != nullptr ? kExitUsage : kExitFailure;
    }
    events.log("info", "inline", "running; control socket " + options.ctlPath);
 

@@ -60,7 +60,7 @@ double parseUntil(const std::string &text)
    const auto [stop, error] = std::from_chars(text.data(), end, seconds, std::chars_format::general);
    if (text.empty() || error != std::errc{} || stop != end || !std::isfinite(seconds) || seconds < 0 ||
        seconds > replay::kMaxUntilSeconds) {
-      throw replay::ReplayError("--until: expected seconds from 0 to 10000000000, got \"" + text.substr(0, 40) +
+      throw session::InputError("--until: expected seconds from 0 to 10000000000, got \"" + text.substr(0, 40) +
                                 (text.size() > 40 ? "...\"" : "\""));
    }
    return seconds;
@@ -75,7 +75,7 @@ std::pair<std::string, std::string> namedValue(const std::string &text, const ch
                        name.find_first_not_of("abcdefghijklmnopqrstuvwxyzABCDEFGHIJKLMNOPQRSTUVWXYZ0123456789._-") ==
                           std::string::npos;
    if (equals == std::string::npos || !nameOk || equals + 1 == text.size()) {
-      throw replay::ReplayError(std::string(option) + " \"" + text.substr(0, 60) +
+      throw session::InputError(std::string(option) + " \"" + text.substr(0, 60) +
                                 "\": expected NAME=VALUE, NAME of letters, digits, '.', '_' or '-' (at most 31)");
    }
    return {name, text.substr(equals + 1)};
@@ -89,16 +89,16 @@ std::vector<replay::PortSpec> parsePorts(const ReplayCommandOptions &options)
       auto [name, list] = namedValue(text, "--port");
       for (const auto &port : ports) {
          if (port.name == name) {
-            throw replay::ReplayError("--port " + name + ": given twice");
+            throw session::InputError("--port " + name + ": given twice");
          }
       }
       replay::PortSpec &port = ports.emplace_back();
       port.name = name;
       for (size_t at = 0; at <= list.size();) {
          const size_t comma = std::min(list.find(',', at), list.size());
-         port.macs.push_back(replay::parseMac(list.substr(at, comma - at), "--port " + name));
+         port.macs.push_back(session::parseMac(list.substr(at, comma - at), "--port " + name));
          if (!macs.insert(port.macs.back()).second) {
-            throw replay::ReplayError("--port " + name + ": " + list.substr(at, comma - at) +
+            throw session::InputError("--port " + name + ": " + list.substr(at, comma - at) +
                                       " is already another port's MAC");
          }
          at = comma + 1;
@@ -110,17 +110,17 @@ std::vector<replay::PortSpec> parsePorts(const ReplayCommandOptions &options)
       const std::string &file = named.second;
       auto found = std::find_if(ports.begin(), ports.end(), [&name](const auto &port) { return port.name == name; });
       if (found == ports.end()) {
-         throw replay::ReplayError("--port-config " + name + ": no --port of that name");
+         throw session::InputError("--port-config " + name + ": no --port of that name");
       }
       if (found->config) {
-         throw replay::ReplayError("--port-config " + name + ": given twice");
+         throw session::InputError("--port-config " + name + ": given twice");
       }
-      found->config = replay::loadConfigFile(file);
+      found->config = session::loadConfigFile(file);
    }
    for (const std::string &text : options.networkMacs) {
-      const replay::Mac mac = replay::parseMac(text, "--network-mac");
+      const replay::Mac mac = session::parseMac(text, "--network-mac");
       if (macs.count(mac) != 0) {
-         throw replay::ReplayError("--network-mac " + text + ": is a port's MAC");
+         throw session::InputError("--network-mac " + text + ": is a port's MAC");
       }
    }
    return ports;
@@ -173,16 +173,16 @@ int runReplay(const ReplayCommandOptions &options)
       run.capturePath = options.capture;
       if (!options.vmMac.empty()) {
          if (!options.ports.empty()) {
-            throw replay::ReplayError("--vm-mac: give the VM's MAC in its --port instead");
+            throw session::InputError("--vm-mac: give the VM's MAC in its --port instead");
          }
-         run.vmMac = replay::parseMac(options.vmMac, "--vm-mac");
+         run.vmMac = session::parseMac(options.vmMac, "--vm-mac");
       }
       run.ports = parsePorts(options);
       for (const std::string &text : options.networkMacs) {
-         run.networkMacs.push_back(replay::parseMac(text, "--network-mac"));
+         run.networkMacs.push_back(session::parseMac(text, "--network-mac"));
       }
       if (!options.config.empty()) {
-         run.config = replay::loadConfigFile(options.config);
+         run.config = session::loadConfigFile(options.config);
       }
       if (options.vlan >= 0) {
          run.vlan = static_cast<uint16_t>(options.vlan);
@@ -191,7 +191,7 @@ int runReplay(const ReplayCommandOptions &options)
          run.untilSeconds = parseUntil(options.until);
       }
       if (options.json && options.jsonLines) {
-         throw replay::ReplayError("--json and --json-lines: give one");
+         throw session::InputError("--json and --json-lines: give one");
       }
       run.batch = options.batch;
       // Every frame streams to the JSON and the dropped ones to the verbose
@@ -254,7 +254,7 @@ int runReplay(const ReplayCommandOptions &options)
                       static_cast<unsigned long long>(result.warningsNotShown));
       }
       return result.violations.empty() ? kExitOk : kExitFailure;
-   } catch (const replay::ReplayError &e) {
+   } catch (const session::InputError &e) {
       std::cout.flush();
       std::fprintf(stderr, "swsec replay: %s\n", e.what());
       return kExitUsage;

@@ -24,18 +24,18 @@ void addStateOptions(CLI::App &command, StateShowOptions &options)
 int runStateShow(const StateShowOptions &options)
 {
    try {
-      const std::vector<uint8_t> blob = common::readStateFile(options.file);
-      const common::SavedPortState state = common::decodeSavedState(blob);
+      const std::vector<uint8_t> blob = session::readStateFile(options.file);
+      const session::SavedPortState state = session::decodeSavedState(blob);
       if (options.json) {
-         std::cout << common::jsonText(common::savedStateJson(state), 1) << "\n";
+         std::cout << session::jsonText(session::savedStateJson(state), 1) << "\n";
       } else {
-         common::printSavedState(std::cout, state);
+         session::printSavedState(std::cout, state);
       }
       return kExitOk;
-   } catch (const common::StateFileError &e) {
+   } catch (const session::StateFileError &e) {
       std::fprintf(stderr, "swsec state: %s\n", e.what());
       return kExitUsage;
-   } catch (const common::BadSavedState &e) {
+   } catch (const session::BadSavedState &e) {
       std::fprintf(stderr, "swsec state: %s: %s\n", options.file.c_str(), e.what());
       return kExitUsage;
    }

@@ -91,10 +91,10 @@ CtlAnswer answerRequest(std::string_view line, EventHub &events, CtlHandler &han
 {
    CtlAnswer answer;
    auto fail = [&answer](const std::string &message) {
-      answer.reply = common::jsonText({{"ok", false}, {"error", message}}) + "\n";
+      answer.reply = session::jsonText({{"ok", false}, {"error", message}}) + "\n";
    };
    nlohmann::json request;
-   if (common::jsonDepth(line) <= common::kMaxJsonDepth) {
+   if (session::jsonDepth(line) <= session::kMaxJsonDepth) {
       request = nlohmann::json::parse(line, nullptr, false);
    } else {
       request = nlohmann::json::value_t::discarded;
@@ -127,11 +127,11 @@ CtlAnswer answerRequest(std::string_view line, EventHub &events, CtlHandler &han
       if (answer.follow) {
          reply["streaming"] = true;
       }
-      answer.reply = common::jsonText(reply) + "\n";
+      answer.reply = session::jsonText(reply) + "\n";
       return answer;
    }
    try {
-      answer.reply = common::jsonText({{"ok", true}, {"result", handler.handle(request)}}) + "\n";
+      answer.reply = session::jsonText({{"ok", true}, {"result", handler.handle(request)}}) + "\n";
    } catch (const CtlError &e) {
       fail(e.what());
    } catch (const std::exception &e) {
@@ -195,7 +195,7 @@ void CtlServer::serve()
          const size_t followers = static_cast<size_t>(
             std::count_if(clients.begin(), clients.end(), [](const Client &c) { return c.following; }));
          if (followers >= limits_.maxFollowers) {
-            client.out = common::jsonText({{"ok", false},
+            client.out = session::jsonText({{"ok", false},
                                            {"error", "too many streams (" + std::to_string(followers) + ")"}}) +
                          "\n";
             client.closeAfterWrite = true;
@@ -236,7 +236,7 @@ void CtlServer::serve()
             continue;
          }
          for (const auto &event : events_.since(client.followKind, client.lastSeq)) {
-            client.out += common::jsonText(event.body) + "\n";
+            client.out += session::jsonText(event.body) + "\n";
             client.lastSeq = event.seq;
          }
          client.lastSeq = std::max(client.lastSeq, events_.lastSeq());
@@ -269,7 +269,7 @@ void CtlServer::serve()
                   handleLine(client, line);
                }
                if (client.in.size() > kMaxRequestBytes) {
-                  client.out += common::jsonText({{"ok", false},
+                  client.out += session::jsonText({{"ok", false},
                                                   {"error", "request longer than " +
                                                                std::to_string(kMaxRequestBytes) + " bytes"}}) +
                                 "\n";
@@ -329,7 +329,7 @@ void CtlServer::serve()
             }
             if (!allowed || clients.size() >= limits_.maxClients) {
                const std::string message =
-                  common::jsonText({{"ok", false}, {"error", allowed ? "too many clients" : "not allowed"}}) + "\n";
+                  session::jsonText({{"ok", false}, {"error", allowed ? "too many clients" : "not allowed"}}) + "\n";
                (void)!send(fd, message.data(), message.size(), MSG_DONTWAIT | MSG_NOSIGNAL);
                close(fd);
                continue;

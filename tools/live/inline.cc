@@ -46,8 +46,8 @@ InlineDaemon::~InlineDaemon()
 
 std::vector<uint8_t> InlineDaemon::recordFor(const PortSpec &portSpec)
 {
-   return replay::configRecord(portSpec.configPath.empty() ? replay::PortSecurityConfig{}
-                                                       : replay::loadConfigFile(portSpec.configPath));
+   return session::configRecord(portSpec.configPath.empty() ? session::PortSecurityConfig{}
+                                                       : session::loadConfigFile(portSpec.configPath));
 }
 
 std::string InlineDaemon::statePath(const PortSpec &portSpec) const
@@ -67,16 +67,16 @@ void InlineDaemon::restoreState(const PortSpec &portSpec, host::FilterId filter)
       return;
    }
    try {
-      const std::vector<uint8_t> blob = common::readStateFile(path);
+      const std::vector<uint8_t> blob = session::readStateFile(path);
       // An empty blob would be taken as "nothing to restore"; a state file has one.
       if (blob.empty()) {
-         throw common::StateFileError(path + ": empty file, no saved state");
+         throw session::StateFileError(path + ": empty file, no saved state");
       }
-      common::restorePortState(session_.host(), filter, blob);
+      session::restorePortState(session_.host(), filter, blob);
       events_.log("info", "inline", portSpec.name + ": state restored from " + path);
-   } catch (const common::StateFileError &e) {
+   } catch (const session::StateFileError &e) {
       events_.log("error", "inline", portSpec.name + ": " + e.what() + "; the port starts empty");
-   } catch (const common::StateRefused &e) {
+   } catch (const session::StateRefused &e) {
       events_.log("error", "inline", portSpec.name + ": " + path + ": saved state refused: " + e.what() +
                                          "; the port starts empty");
    }
@@ -87,11 +87,11 @@ void InlineDaemon::saveState(const PortSpec &portSpec, host::FilterId filter)
 {
    const std::string path = statePath(portSpec);
    try {
-      common::writeStateFile(path, common::savePortState(session_.host(), filter), 0600);
+      session::writeStateFile(path, session::savePortState(session_.host(), filter), 0600);
       events_.log("info", "inline", portSpec.name + ": state saved to " + path);
-   } catch (const common::StateFileError &e) {
+   } catch (const session::StateFileError &e) {
       events_.log("error", "inline", portSpec.name + ": state not saved: " + e.what());
-   } catch (const common::StateRefused &e) {
+   } catch (const session::StateRefused &e) {
       events_.log("error", "inline", portSpec.name + ": state not saved: " + e.what());
    }
 }
@@ -133,7 +133,7 @@ void InlineDaemon::pump()
 {
    std::lock_guard guard(mutex_);
    for (auto &record : session_.takeLog()) {
-      events_.log(record.severity >= 2 ? "error" : "info", "module", ports::withoutNewline(record.text));
+      events_.log(record.severity >= 2 ? "error" : "info", "module", session::withoutNewline(record.text));
    }
    for (const auto &note : session_.takeNotifications()) {
       const size_t index = note.portID - 1;
@@ -162,7 +162,7 @@ void InlineDaemon::reload()
          session_.configure(port.guarded->filter(), recordFor(port.portSpec));
          port.configSource = port.portSpec.configPath;
          events_.log("info", "inline", name + ": configuration re-read from " + port.portSpec.configPath);
-      } catch (const replay::ReplayError &e) {
+      } catch (const session::InputError &e) {
          events_.log("error", "inline", name + ": " + e.what() + "; the port keeps its configuration");
       } catch (const std::exception &e) {
          events_.log("error", "inline", name + ": " + port.portSpec.configPath + ": " + e.what() +
@@ -235,7 +235,7 @@ nlohmann::json InlineDaemon::portsJson()
 nlohmann::json InlineDaemon::bindingsJson(const Port &port)
 {
    nlohmann::json list = nlohmann::json::array();
-   const ports::PortState state = session_.readState(port.guarded->options().portID);
+   const session::PortState state = session_.readState(port.guarded->options().portID);
    for (const auto &entry : state.portDb) {
       list.push_back({{"port", port.portSpec.name},
                       {"vlan", entry.vlan},
@@ -270,7 +270,7 @@ nlohmann::json InlineDaemon::countersJson(Port &port)
    if (!port.guarded->running()) {
       return entry;
    }
-   const ports::PortState state = session_.readState(port.guarded->options().portID);
+   const session::PortState state = session_.readState(port.guarded->options().portID);
    entry["drops"] = state.counters;
    nlohmann::json methods = {{"DHCP Snooping", 0}, {"Static", 0}, {"TOFU", 0}, {"ARP Snooping", 0}};
    for (const auto &binding : state.portDb) {
@@ -306,7 +306,7 @@ nlohmann::json InlineDaemon::handle(const nlohmann::json &request)
    }
    if (command == "summary") {
       Port &port = runningPort(request);
-      const ports::PortState state = session_.readState(port.guarded->options().portID);
+      const session::PortState state = session_.readState(port.guarded->options().portID);
       if (!state.featureSummary) {
          return {{"port", port.portSpec.name}, {"fields", nullptr}, {"text", "(the port has no IP discovery)\n"}};
       }
@@ -336,7 +336,7 @@ nlohmann::json InlineDaemon::handle(const nlohmann::json &request)
       }
       try {
          session_.clear(port.guarded->options().portID, key);
-      } catch (const ports::Refused &e) {
+      } catch (const session::Refused &e) {
          throw CtlError(e.what());
       }
       return {{"port", port.portSpec.name}, {"cleared", key ? "one" : "all"}};
@@ -346,10 +346,10 @@ nlohmann::json InlineDaemon::handle(const nlohmann::json &request)
       const std::string text = requiredString(request, "text");
       const std::string origin = request.value("origin", std::string("(control request)"));
       try {
-         session_.configure(port.guarded->filter(), replay::configRecord(replay::parseConfig(text, origin)));
-      } catch (const replay::ReplayError &e) {
+         session_.configure(port.guarded->filter(), session::configRecord(session::parseConfig(text, origin)));
+      } catch (const session::InputError &e) {
          throw CtlError(e.what());
-      } catch (const ports::Refused &e) {
+      } catch (const session::Refused &e) {
          throw CtlError(origin + ": " + e.what());
       }
       port.configSource = origin;

@@ -73,7 +73,7 @@ private:
 
    InlineOptions options_;
    EventHub &events_;
-   ports::ModuleSession session_;
+   session::ModuleSession session_;
    std::recursive_mutex mutex_;   // the ports against the control thread
    std::vector<Port> ports_;
 };

@@ -51,7 +51,7 @@ host::FrameView portView(const ReceivedFrame &frame, std::vector<uint8_t> &scrat
    return view;
 }
 
-GuardedPort::GuardedPort(ports::ModuleSession &session, PortOptions options,
+GuardedPort::GuardedPort(session::ModuleSession &session, PortOptions options,
                          std::function<void(const std::string &)> log, std::function<void()> stopped)
    : session_(session), options_(std::move(options)), log_(std::move(log)), stopped_(std::move(stopped))
 {

@@ -58,7 +58,7 @@ class GuardedPort {
 public:
    // `log` takes a line for the administrator; `stopped` is called (from a
    // forwarding thread) when the port stops by itself, its interface gone.
-   GuardedPort(ports::ModuleSession &session, PortOptions options, std::function<void(const std::string &)> log,
+   GuardedPort(session::ModuleSession &session, PortOptions options, std::function<void(const std::string &)> log,
                std::function<void()> stopped);
    ~GuardedPort();
    GuardedPort(const GuardedPort &) = delete;
@@ -66,7 +66,7 @@ public:
 
    // Sets the port up and configures it with `record`; `restore`, if given,
    // is called with the new module port before it is configured and before
-   // any frame flows. Throws (ports::Refused, NetdevError, std::system_error)
+   // any frame flows. Throws (session::Refused, NetdevError, std::system_error)
    // after putting back what it changed.
    void start(const std::vector<uint8_t> &record, const std::function<void(host::FilterId)> &restore = {});
    // Stops forwarding and takes the set-up down as the fail mode says, or,
@@ -95,7 +95,7 @@ private:
    void vanish(const std::string &reason);
    void takeDown(bool restoreAsFound);
 
-   ports::ModuleSession &session_;
+   session::ModuleSession &session_;
    PortOptions options_;
    std::function<void(const std::string &)> log_;
    std::function<void()> stopped_;

@@ -21,7 +21,7 @@ CaptureReader::CaptureReader(const std::string &path) : path_(path)
 {
    fd_ = path == "-" ? ::dup(STDIN_FILENO) : ::open(path.c_str(), O_RDONLY | O_CLOEXEC);
    if (fd_ < 0) {
-      throw ReplayError(path + ": cannot read capture: " + std::strerror(errno));
+      throw session::InputError(path + ": cannot read capture: " + std::strerror(errno));
    }
    struct stat st {};
    if (::fstat(fd_, &st) == 0 && S_ISREG(st.st_mode)) {
@@ -31,20 +31,20 @@ CaptureReader::CaptureReader(const std::string &path) : path_(path)
    } else if (::fstat(fd_, &st) == 0 && S_ISDIR(st.st_mode)) {
       ::close(fd_);
       fd_ = -1;
-      throw ReplayError(path + ": cannot read capture: it is a directory");
+      throw session::InputError(path + ": cannot read capture: it is a directory");
    }
    const cookie_io_functions_t io{readCookie, nullptr, nullptr, closeCookie};
    FILE *stream = fopencookie(this, "r", io);
    if (stream == nullptr) {
       ::close(fd_);
       fd_ = -1;
-      throw ReplayError(path + ": cannot read capture: " + std::strerror(errno));
+      throw session::InputError(path + ": cannot read capture: " + std::strerror(errno));
    }
    std::array<char, PCAP_ERRBUF_SIZE> error{};
    handle_ = pcap_fopen_offline_with_tstamp_precision(stream, PCAP_TSTAMP_PRECISION_NANO, error.data());
    if (handle_ == nullptr) {
       std::fclose(stream);   // closes the descriptor too
-      throw ReplayError(path + ": cannot read capture: " +
+      throw session::InputError(path + ": cannot read capture: " +
                         (scanner_.error().empty() ? std::string(error.data()) : scanner_.error()));
    }
    const int linkType = pcap_datalink(handle_);
@@ -53,7 +53,7 @@ CaptureReader::CaptureReader(const std::string &path) : path_(path)
       const std::string named = name != nullptr ? name : std::to_string(linkType);
       pcap_close(handle_);
       handle_ = nullptr;
-      throw ReplayError(path + ": not an Ethernet capture (link type " + named + ")");
+      throw session::InputError(path + ": not an Ethernet capture (link type " + named + ")");
    }
 }
 
@@ -92,7 +92,7 @@ int CaptureReader::closeCookie(void *cookie)
 
 void CaptureReader::fail(const std::string &what)
 {
-   throw ReplayError(path_ + ": " + (scanner_.error().empty() ? what : scanner_.error()));
+   throw session::InputError(path_ + ": " + (scanner_.error().empty() ? what : scanner_.error()));
 }
 
 bool CaptureReader::next(CaptureFrame &frame)

@@ -44,14 +44,14 @@ struct FileIdentity {
 
 class CaptureReader {
 public:
-   // Throws ReplayError naming the file when it cannot be opened or is not
+   // Throws session::InputError naming the file when it cannot be opened or is not
    // an Ethernet capture. "-" is standard input.
    explicit CaptureReader(const std::string &path);
    ~CaptureReader();
    CaptureReader(const CaptureReader &) = delete;
    CaptureReader &operator=(const CaptureReader &) = delete;
 
-   // The next frame, or false at the end. Throws ReplayError on a corrupt
+   // The next frame, or false at the end. Throws session::InputError on a corrupt
    // file or a frame captured shorter than it was on the wire.
    bool next(CaptureFrame &frame);
 

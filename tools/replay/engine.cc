@@ -8,12 +8,12 @@
 #include "replay/frame_batch.h"
 #include "replay/output_path.h"
 #include "replay/pcap_writer.h"
-#include "replay/port_nodes.h"
 #include "replay/routing.h"
 #include "session/error.h"
 
 #include "host/host.h"
 #include "session/port_state.h"
+#include "session/ports_session.h"
 #include "session/state_file.h"
 
 #include <algorithm>
@@ -29,16 +29,12 @@ namespace {
 
 using namespace std::chrono_literals;
 
-constexpr const char *kAgent = "sifra-generic-tarlin-swsec";
-constexpr const char *kSecurityProperty = "sifra-generic-tarlin-swsec.security";
-constexpr const char *kPortset = "vs0";
 // The port is configured this long before the first frame, so that a first
 // frame is not seen in the same instant as the configuration.
 constexpr std::chrono::microseconds kConfigLead = 500ms;
 // A list is cut when the next frame is more than this after its first one,
 // so that timers fire between frames as capture time passes.
 constexpr int64_t kListSpanNs = 1'000'000;
-constexpr size_t kPortDbMsgPayload = 40;
 // The list arena starts with room for a list of full-size untagged
 // Ethernet frames, up to 1 MiB (a list of 65536 frames grows it only if
 // its frames need it).
@@ -60,19 +56,10 @@ constexpr std::chrono::microseconds kTickMargin = 30s;
 // many frames.
 constexpr uint64_t kFramesBetweenLooks = 4096;
 
-std::string withoutNewline(std::string text)
-{
-   while (!text.empty() && text.back() == '\n') {
-      text.pop_back();
-   }
-   return text;
-}
-
 struct Port {
    PortSpec portSpec;
    uint32_t id = 0;   // the switch port number, index + 1
    host::FilterId filter = 0;
-   bool made = false;
    DropCounters counters;   // as last read, with options.reasons
 };
 
@@ -80,20 +67,6 @@ class Run {
 public:
    Run(const ReplayOptions &options, ReplayResult &result);
 
-   // A run cut short by bad input still takes the ports down and unloads
-   // the module, as the hypervisor would, before the error is reported.
-   ~Run()
-   {
-      if (!host_.loaded()) {
-         return;
-      }
-      for (Port &port : ports_) {
-         if (port.made) {
-            (void)host_.sifra().destroyFilterAsHypervisor(port.filter);
-         }
-      }
-      (void)host_.unload();
-   }
    Run(const Run &) = delete;
    Run &operator=(const Run &) = delete;
 
@@ -121,7 +94,10 @@ private:
 
    const ReplayOptions &options_;
    ReplayResult &result_;
-   host::Host host_;
+   // A run cut short by bad input still takes the ports down and unloads
+   // the module (the session's destructor), as the hypervisor would,
+   // before the error is reported.
+   std::optional<session::ModuleSession> session_;
    std::vector<Port> ports_;
    std::vector<uint8_t> restoreState_;   // the state file's bytes, read before the port is made
    std::vector<uint8_t> savedState_;     // the port's state at the end, to write
@@ -177,67 +153,32 @@ Run::Run(const ReplayOptions &options, ReplayResult &result)
 
 void Run::loadModule()
 {
-   host::LoadOptions load;
-   load.modulePath = options_.modulePath;
-   if (options_.modulePath.empty()) {
-      load.linkedModule = options_.linkedModule;
-   }
-   int loaded = 1;
-   try {
-      loaded = host_.load(load);
-   } catch (const std::runtime_error &e) {
-      // An image the user named that cannot be opened is bad input.
-      if (!options_.modulePath.empty()) {
-         throw ReplayError("--module " + options_.modulePath + ": " + e.what());
-      }
-      throw;
-   }
-   if (loaded != 0) {
-      throw std::runtime_error("the module failed to load");
-   }
-   host_.portsets().addPortset(kPortset);
+   session_.emplace(options_.modulePath, options_.linkedModule,
+                    [this](const std::string &v) { result_.violations.push_back(v); });
 }
 
 void Run::startPort(Port &port)
 {
-   host_.portsets().addPort(kPortset, port.id);
-   host::FilterConfig filterConfig;
-   filterConfig.name = port.portSpec.name;
-   filterConfig.vmUuid = "replay-" + port.portSpec.name;
-   const orr_Status status = host_.sifra().createFilter(kAgent, port.id, filterConfig, &port.filter);
-   if (status != ORR_OK) {
-      throw std::runtime_error("port " + port.portSpec.name + " could not be made: " + orr_StatusToString(status));
-   }
-   port.made = true;
+   port.filter = session_->addPort(port.id, port.portSpec.name, "replay-" + port.portSpec.name);
    if (!options_.restoreStatePath.empty()) {
       try {
-         common::restorePortState(host_, port.filter, restoreState_);
-      } catch (const common::StateRefused &e) {
-         throw ReplayError(options_.restoreStatePath + ": saved state refused: " + e.what());
+         session::restorePortState(session_->host(), port.filter, restoreState_);
+      } catch (const session::StateRefused &e) {
+         throw session::InputError(options_.restoreStatePath + ": saved state refused: " + e.what());
       }
    }
-   const std::optional<PortSecurityConfig> &config = port.portSpec.config ? port.portSpec.config : options_.config;
+   const std::optional<session::PortSecurityConfig> &config =
+      port.portSpec.config ? port.portSpec.config : options_.config;
    if (config) {
-      const size_t logBefore = host_.log().records().size();
-      const orr_Status written = host_.sifra().writeProperty(kSecurityProperty, port.filter, configRecord(*config));
-      if (written != ORR_OK) {
-         // The module says why in its log; its error lines are the message.
-         const auto records = host_.log().records();
-         std::string message;
-         for (size_t i = logBefore; i < records.size(); ++i) {
-            if (records[i].severity >= 2) {
-               message += (message.empty() ? "" : "; ") + withoutNewline(records[i].text);
-            }
-         }
-         if (message.empty()) {
-            message = orr_StatusToString(written);
-         }
-         throw ConfigRefused((config->origin.empty() ? "port " + port.portSpec.name : config->origin) +
-                             ": configuration refused: " + message);
+      try {
+         session_->configure(port.filter, session::configRecord(*config));
+      } catch (const session::Refused &e) {
+         throw ConfigRefused((config->origin.empty() ? "port " + port.portSpec.name : config->origin) + ": " +
+                             e.what());
       }
    }
    if (options_.reasons) {
-      port.counters = readDropCounters(host_, port.id);
+      port.counters = session_->dropCounters(port.id);
    }
 }
 
@@ -263,11 +204,11 @@ void Run::advanceTo(std::chrono::microseconds target)
 {
    // Lists that start within the same microsecond need no look at the clock.
    if (target > clockReached_) {
-      const auto now = host_.clock().now();
+      const auto now = session_->host().clock().now();
       if (target - now > kIdleSpan && options_.skipIdleTime) {
          crossIdle(target);
       } else if (target > now) {
-         host_.clock().advance(target - now);
+         session_->host().clock().advance(target - now);
       }
       clockReached_ = std::max(target, now);
    }
@@ -283,21 +224,21 @@ void Run::advanceTo(std::chrono::microseconds target)
 // the target always fire. The outcome is that of firing every tick.
 void Run::crossIdle(std::chrono::microseconds target)
 {
-   while (host_.clock().now() < target) {
-      auto now = host_.clock().now();
+   while (session_->host().clock().now() < target) {
+      auto now = session_->host().clock().now();
       std::optional<std::chrono::seconds> soonest;
       for (const Port &port : ports_) {
-         const auto left = soonestExpiry(host_, port.id);
+         const auto left = session_->soonestExpiry(port.id);
          if (left) {
             soonest = soonest ? std::min(*soonest, *left) : *left;
          }
       }
       const auto until = soonest ? std::min(target, now + std::chrono::microseconds(*soonest)) : target;
       if (until - kTickMargin > now) {
-         host_.clock().skipIdle(until - kTickMargin - now);
+         session_->host().clock().skipIdle(until - kTickMargin - now);
       }
-      now = host_.clock().now();
-      host_.clock().advance(std::min(target, until + kTickMargin) - now);
+      now = session_->host().clock().now();
+      session_->host().clock().advance(std::min(target, until + kTickMargin) - now);
       if (options_.progress) {
          options_.progress(result_.framesRead, 0, 0);
       }
@@ -355,11 +296,11 @@ void Run::openOutputs(const CaptureReader &reader)
    }
    for (const auto *target : {&passed, &dropped}) {
       if (*target && (*target)->identity && reader.identity() && *(*target)->identity == *reader.identity()) {
-         throw ReplayError((*target)->named + ": cannot write: it is the input capture");
+         throw session::InputError((*target)->named + ": cannot write: it is the input capture");
       }
    }
    if (passed && dropped && sameFile(*passed, *dropped)) {
-      throw ReplayError(dropped->named + ": cannot write: it is also the --write-passed file");
+      throw session::InputError(dropped->named + ": cannot write: it is also the --write-passed file");
    }
    if (passed) {
       passed_.emplace(*passed);
@@ -377,7 +318,7 @@ void Run::flush()
    // Capture time that goes backwards leaves the clock where it is.
    advanceTo(clockAt(list_.firstTimeNs()));
    Port &port = ports_[listPort_];
-   const host::PacketsResult out = host_.sifra().processPackets(port.filter, list_.direction(), list_.views());
+   const host::PacketsResult out = session_->host().sifra().processPackets(port.filter, list_.direction(), list_.views());
    kept_.assign(list_.size(), 0);
    for (size_t index : out.kept) {
       if (index < kept_.size()) {
@@ -392,7 +333,7 @@ void Run::flush()
       DropReason reason = DropReason::none;
       if (!passed && options_.reasons) {
          // Alone in its list, so whatever counter moved moved for it.
-         DropCounters after = readDropCounters(host_, port.id);
+         DropCounters after = session_->dropCounters(port.id);
          reason = explainDrop(port.counters, after, list_.bytes(i), list_.direction());
          port.counters = std::move(after);
       }
@@ -442,33 +383,20 @@ void Run::record(size_t frame, bool passed, DropReason reason)
 
 void Run::collectNotifications()
 {
-   const auto posted = host_.portsets().takePosted();
-   for (const auto &message : posted) {
-      if (message.name.rfind("portdb.entry.", 0) != 0 || message.payload.size() < kPortDbMsgPayload ||
-          message.portID == 0 || message.portID > ports_.size()) {
+   for (auto &note : session_->takeNotifications()) {
+      if (note.portID == 0 || note.portID > ports_.size()) {
          continue;
       }
-      const uint8_t *payload = message.payload.data();
-      Notification &note = result_.ports[message.portID - 1].notifications.emplace_back();
-      note.afterFrame = lastHandedOver_;
-      note.name = message.name;
-      uint16_t vlan = 0;
-      std::memcpy(&vlan, payload + 8, sizeof vlan);
-      note.vlan = vlan;
-      note.mac = macText(payload + 10);
-      note.ip = ipText(payload + 20);
-      note.authoritative = payload[36] != 0;
+      Notification &shown = result_.ports[note.portID - 1].notifications.emplace_back();
+      static_cast<session::PortDbNotification &>(shown) = std::move(note);
+      shown.afterFrame = lastHandedOver_;
    }
 }
 
-// The host's log is taken as the run goes, so that a long run holds one
-// record per run of identical lines rather than every line.
 void Run::drainLog()
 {
-   const auto records = host_.log().records();
-   host_.log().clear();
-   for (const auto &record : records) {
-      std::string text = withoutNewline(record.text);
+   for (auto &record : session_->takeLog()) {
+      std::string text = session::withoutNewline(std::move(record.text));
       if (haveLog_ && result_.log.back().severity == record.severity && result_.log.back().text == text) {
          ++result_.log.back().repeated;
          continue;
@@ -488,7 +416,7 @@ void Run::handle(const CaptureFrame &frame)
    switch (route_.kind) {
    case Route::Kind::delivered: break;
    case Route::Kind::noDirection:
-      throw ReplayError(options_.capturePath + ": frame " + std::to_string(frame.index) +
+      throw session::InputError(options_.capturePath + ": frame " + std::to_string(frame.index) +
                         " has no recorded direction; give the VM's MAC with --vm-mac");
    case Route::Kind::spoofedSource:
       warnFrame(frame.index, "sent from " + (frame.bytes.size() >= 12 ? macText(frame.bytes.data() + 6) : "?") +
@@ -545,19 +473,18 @@ void Run::readRestoreState()
       return;
    }
    try {
-      restoreState_ = common::readStateFile(options_.restoreStatePath);
-   } catch (const common::StateFileError &e) {
-      throw ReplayError(e.what());
+      restoreState_ = session::readStateFile(options_.restoreStatePath);
+   } catch (const session::StateFileError &e) {
+      throw session::InputError(e.what());
    }
    // An empty blob would be taken as "nothing to restore"; a state file has one.
    if (restoreState_.empty()) {
-      throw ReplayError(options_.restoreStatePath + ": empty file, no saved state");
+      throw session::InputError(options_.restoreStatePath + ": empty file, no saved state");
    }
 }
 
 void Run::execute()
 {
-   host_.setViolationHandler([this](const std::string &v) { result_.violations.push_back(v); });
    CaptureReader reader(options_.capturePath);
    openOutputs(reader);
    readRestoreState();
@@ -568,8 +495,8 @@ void Run::execute()
    for (Port &port : ports_) {
       startPort(port);
    }
-   host_.clock().advance(kConfigLead);
-   clockBase_ = host_.clock().now();
+   session_->host().clock().advance(kConfigLead);
+   clockBase_ = session_->host().clock().now();
    clockReached_ = clockBase_;
 
    CaptureFrame frame;
@@ -604,27 +531,21 @@ void Run::execute()
    collectNotifications();
    warnUnseenMacs(*router_);
    for (Port &port : ports_) {
-      readPortState(host_, port.id, result_.ports[port.id - 1]);
+      session::PortState state = session_->readState(port.id);
+      PortResult &shown = result_.ports[port.id - 1];
+      shown.featureSummary = std::move(state.featureSummary);
+      shown.featureSummaryText = std::move(state.featureSummaryText);
+      shown.counters = std::move(state.counters);
+      shown.portDb = std::move(state.portDb);
    }
    drainLog();
    if (!options_.saveStatePath.empty()) {
       // Saving only reads the port; it comes after the report's reads so
       // that the report is the same with or without it.
-      savedState_ = common::savePortState(host_, ports_.front().filter);
+      savedState_ = session::savePortState(session_->host(), ports_.front().filter);
    }
 
-   for (Port &port : ports_) {
-      const host::DestroyResult destroyed = host_.sifra().destroyFilterAsHypervisor(port.filter);
-      port.made = false;
-      if (destroyed.status != ORR_OK) {
-         result_.violations.push_back("port " + port.portSpec.name +
-                                      " could not be destroyed: " + orr_StatusToString(destroyed.status));
-      }
-   }
-   const orr_Status unloaded = host_.unload();
-   if (unloaded != ORR_OK) {
-      result_.violations.push_back(std::string("the module did not unload: ") + orr_StatusToString(unloaded));
-   }
+   (void)session_->finish();   // its findings went to the violation handler
    // Outputs are renamed into place only once the whole run succeeded.
    if (passed_) {
       passed_->commit();
@@ -634,9 +555,9 @@ void Run::execute()
    }
    if (!options_.saveStatePath.empty()) {
       try {
-         common::writeStateFile(options_.saveStatePath, savedState_);
-      } catch (const common::StateFileError &e) {
-         throw ReplayError(e.what());
+         session::writeStateFile(options_.saveStatePath, savedState_);
+      } catch (const session::StateFileError &e) {
+         throw session::InputError(e.what());
       }
    }
 }
@@ -646,14 +567,14 @@ void Run::execute()
 ReplayResult runReplay(const ReplayOptions &options)
 {
    if (options.batch == 0) {
-      throw ReplayError("--batch must be at least 1");
+      throw session::InputError("--batch must be at least 1");
    }
    if (!(options.untilSeconds >= 0 && options.untilSeconds <= kMaxUntilSeconds)) {
-      throw ReplayError("--until must be a number of seconds from 0 to 10000000000");
+      throw session::InputError("--until must be a number of seconds from 0 to 10000000000");
    }
    // A saved state is one port's.
    if ((!options.saveStatePath.empty() || !options.restoreStatePath.empty()) && options.ports.size() > 1) {
-      throw ReplayError("--save-state and --restore-state take a replay of one port");
+      throw session::InputError("--save-state and --restore-state take a replay of one port");
    }
    ReplayResult result;
    Run run(options, result);

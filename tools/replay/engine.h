@@ -6,6 +6,7 @@
 
 #include "replay/drop_reason.h"
 #include "session/config_file.h"
+#include "session/ports_session.h"
 
 #include "platform/orr_module.h"
 
@@ -38,7 +39,7 @@ enum class FrameRecords : uint8_t {
 struct PortSpec {
    std::string name;
    std::vector<Mac> macs;
-   std::optional<PortSecurityConfig> config;   // none: ReplayOptions::config
+   std::optional<session::PortSecurityConfig> config;   // none: ReplayOptions::config
 };
 
 inline constexpr uint32_t kNoDescription = UINT32_MAX;
@@ -72,7 +73,7 @@ struct ReplayOptions {
    // known only by the capture's direction flags).
    std::vector<PortSpec> ports;
    std::optional<Mac> vmMac;
-   std::optional<PortSecurityConfig> config;      // every port without its own; none: a new port's defaults
+   std::optional<session::PortSecurityConfig> config;      // every port without its own; none: a new port's defaults
    // Frames from these come from the network, so that any other source is
    // a VM whatever MAC it claims (with one port: that port's VM).
    std::vector<Mac> networkMacs;
@@ -111,25 +112,9 @@ struct ReplayOptions {
 inline constexpr double kMaxUntilSeconds = 1e10;
 inline constexpr size_t kMaxWarnings = 20;
 
-struct PortDbEntry {
-   uint16_t vlan = 0;
-   std::string mac;
-   std::string ip;
-   std::string method;        // "DHCP Snooping", "Static", "ARP Snooping", ...
-   std::string timeRemaining; // as the node renders it: "118 sec", "N/A"
-   std::string chaddr;
-   std::string clientIdLen;
-   std::string serverIp;
-   std::string leaseTime;
-};
-
-struct Notification {
+// A port database notification and where in the capture it was seen.
+struct Notification : session::PortDbNotification {
    uint64_t afterFrame = 0;   // the last frame handed over before it was seen (0: none yet)
-   std::string name;          // "portdb.entry.added" / "portdb.entry.removed"
-   uint16_t vlan = 0;
-   std::string mac;
-   std::string ip;
-   bool authoritative = false;
 };
 
 // A line of the module's log; a run of identical lines is one LogLine.
@@ -149,7 +134,7 @@ struct PortResult {
    std::optional<std::map<std::string, std::string, std::less<>>> featureSummary;
    std::string featureSummaryText;
    std::map<std::string, uint64_t, std::less<>> counters;   // drop counters the port keeps
-   std::vector<PortDbEntry> portDb;
+   std::vector<session::PortDbEntry> portDb;
    std::vector<Notification> notifications;
 };
 
@@ -185,7 +170,7 @@ public:
    using std::runtime_error::runtime_error;
 };
 
-// Throws ReplayError on bad input (before any output file is left behind;
+// Throws session::InputError on bad input (before any output file is left behind;
 // a state file the module refuses is bad input, with the module's message),
 // ConfigRefused when a port refuses its configuration, std::runtime_error
 // when the module does not load.

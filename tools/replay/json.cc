@@ -144,12 +144,12 @@ void JsonFrameStream::frame(const FrameEvent &event)
    json entry = frameJson(event.verdict, event.description, portNames_.at(event.verdict.port));
    if (form_ == Form::lines) {
       entry["type"] = "frame";
-      out_ << common::jsonText(entry) << "\n";
+      out_ << session::jsonText(entry) << "\n";
       return;
    }
    // The document opens with its first frame, so that a run refused before
    // any frame writes nothing.
-   out_ << (first_ ? "{\"frames\": [\n " : ",\n ") << common::jsonText(entry);
+   out_ << (first_ ? "{\"frames\": [\n " : ",\n ") << session::jsonText(entry);
    first_ = false;
 }
 
@@ -158,11 +158,11 @@ void JsonFrameStream::finish(const ReplayResult &result)
    json summary = summaryJson(result);
    if (form_ == Form::lines) {
       summary["type"] = "summary";
-      out_ << common::jsonText(summary) << "\n";
+      out_ << session::jsonText(summary) << "\n";
       return;
    }
    // The summary's members follow the frames inside the one object.
-   const std::string rest = common::jsonText(summary, 1);
+   const std::string rest = session::jsonText(summary, 1);
    out_ << (first_ ? "{\"frames\": [],\n" : "\n],\n") << std::string_view(rest).substr(1) << "\n";
 }
 

@@ -37,7 +37,7 @@ OutputTarget resolveOutput(const std::string &path)
       struct stat st {};
       if (::lstat(current.c_str(), &st) != 0) {
          if (errno != ENOENT) {
-            throw ReplayError(path + ": cannot write: " + std::strerror(errno));
+            throw session::InputError(path + ": cannot write: " + std::strerror(errno));
          }
          // A new file, readable as the umask allows, as any tool makes one.
          target.mode = 0666 & ~currentUmask();
@@ -45,19 +45,19 @@ OutputTarget resolveOutput(const std::string &path)
       }
       if (S_ISLNK(st.st_mode)) {
          if (hops == kMaxLinks) {
-            throw ReplayError(path + ": cannot write: too many levels of symbolic links");
+            throw session::InputError(path + ": cannot write: too many levels of symbolic links");
          }
          std::vector<char> link(static_cast<size_t>(st.st_size > 0 ? st.st_size : 4096) + 1);
          const ssize_t length = ::readlink(current.c_str(), link.data(), link.size() - 1);
          if (length < 0) {
-            throw ReplayError(path + ": cannot write: " + std::strerror(errno));
+            throw session::InputError(path + ": cannot write: " + std::strerror(errno));
          }
          const std::filesystem::path next(std::string(link.data(), static_cast<size_t>(length)));
          current = next.is_absolute() ? next : current.parent_path() / next;
          continue;
       }
       if (!S_ISREG(st.st_mode)) {
-         throw ReplayError(path + ": cannot write: not a regular file");
+         throw session::InputError(path + ": cannot write: not a regular file");
       }
       // Replaced in place: the file keeps its permissions.
       target.identity = FileIdentity{st.st_dev, st.st_ino};

@@ -19,7 +19,7 @@ struct OutputTarget {
    mode_t mode = 0;                        // of the file written
 };
 
-// Throws ReplayError naming `path` when it cannot be a capture output.
+// Throws session::InputError naming `path` when it cannot be a capture output.
 OutputTarget resolveOutput(const std::string &path);
 
 // Whether two targets are the same file (existing or to be made).

@@ -34,7 +34,7 @@ PcapWriter::PcapWriter(const OutputTarget &target) : named_(target.named), path_
    name.insert(name.end(), kSuffix, kSuffix + sizeof kSuffix);
    const int fd = mkstemp(name.data());
    if (fd < 0) {
-      throw ReplayError(path + ": cannot write: " + systemError());
+      throw session::InputError(path + ": cannot write: " + systemError());
    }
    tempPath_ = name.data();
    FILE *file = ::fchmod(fd, target.mode) == 0 ? fdopen(fd, "wb") : nullptr;
@@ -42,14 +42,14 @@ PcapWriter::PcapWriter(const OutputTarget &target) : named_(target.named), path_
       const std::string error = systemError();
       ::close(fd);
       std::remove(tempPath_.c_str());
-      throw ReplayError(path + ": cannot write: " + error);
+      throw session::InputError(path + ": cannot write: " + error);
    }
    dead_ = pcap_open_dead_with_tstamp_precision(DLT_EN10MB, 262144, PCAP_TSTAMP_PRECISION_MICRO);
    dumper_ = dead_ != nullptr ? pcap_dump_fopen(dead_, file) : nullptr;
    if (dumper_ == nullptr) {
       std::fclose(file);
       discard();
-      throw ReplayError(path + ": cannot start a pcap file");
+      throw session::InputError(path + ": cannot start a pcap file");
    }
 }
 
@@ -95,12 +95,12 @@ void PcapWriter::commit()
    if (failed) {
       const std::string error = systemError();
       discard();
-      throw ReplayError(named_ + ": write failed: " + error);
+      throw session::InputError(named_ + ": write failed: " + error);
    }
    if (std::rename(tempPath_.c_str(), path_.c_str()) != 0) {
       const std::string error = systemError();
       discard();
-      throw ReplayError(named_ + ": cannot write: " + error);
+      throw session::InputError(named_ + ": cannot write: " + error);
    }
    tempPath_.clear();
    discard();

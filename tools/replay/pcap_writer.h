@@ -16,7 +16,7 @@ namespace swsec::replay {
 
 class PcapWriter {
 public:
-   // Throws ReplayError naming the output when the temporary file cannot be
+   // Throws session::InputError naming the output when the temporary file cannot be
    // made. The file gets the target's mode.
    explicit PcapWriter(const OutputTarget &target);
    ~PcapWriter();
@@ -24,7 +24,7 @@ public:
    PcapWriter &operator=(const PcapWriter &) = delete;
 
    void write(int64_t timeNs, std::span<const uint8_t> bytes);
-   // Flushes, closes and renames; throws ReplayError on a write failure.
+   // Flushes, closes and renames; throws session::InputError on a write failure.
    void commit();
 
 private:

@@ -16,7 +16,7 @@
 #include <limits>
 #include <sstream>
 
-namespace swsec::replay {
+namespace swsec::session {
 
 namespace {
 
@@ -39,7 +39,7 @@ uint32_t unsignedField(const json &doc, const char *key, const std::string &orig
 {
    const json &value = doc.at(key);
    if (!value.is_number_unsigned() || value.get<uint64_t>() > std::numeric_limits<uint32_t>::max()) {
-      throw ReplayError(origin + ": \"" + key + "\" must be an unsigned 32-bit integer");
+      throw InputError(origin + ": \"" + key + "\" must be an unsigned 32-bit integer");
    }
    return value.get<uint32_t>();
 }
@@ -48,7 +48,7 @@ std::array<uint8_t, 4> parseIp(const json &value, const std::string &what)
 {
    std::array<uint8_t, 4> ip{};
    if (!value.is_string() || inet_pton(AF_INET, value.get<std::string>().c_str(), ip.data()) != 1) {
-      throw ReplayError(what + ": malformed IPv4 address " + common::jsonText(value));
+      throw InputError(what + ": malformed IPv4 address " + session::jsonText(value));
    }
    return ip;
 }
@@ -56,24 +56,24 @@ std::array<uint8_t, 4> parseIp(const json &value, const std::string &what)
 StaticBinding parseStatic(const json &entry, const std::string &what)
 {
    if (!entry.is_object()) {
-      throw ReplayError(what + ": expected an object {vlan, mac, ip}");
+      throw InputError(what + ": expected an object {vlan, mac, ip}");
    }
    for (const auto &[key, value] : entry.items()) {
       if (key != "vlan" && key != "mac" && key != "ip") {
-         throw ReplayError(what + ": unknown key \"" + key + "\"");
+         throw InputError(what + ": unknown key \"" + key + "\"");
       }
    }
    if (!entry.contains("vlan") || !entry.contains("mac") || !entry.contains("ip")) {
-      throw ReplayError(what + ": needs vlan, mac and ip");
+      throw InputError(what + ": needs vlan, mac and ip");
    }
    StaticBinding binding;
    const json &vlan = entry["vlan"];
    if (!vlan.is_number_unsigned() || vlan.get<uint64_t>() > 4095) {
-      throw ReplayError(what + ": \"vlan\" must be 0 to 4095");
+      throw InputError(what + ": \"vlan\" must be 0 to 4095");
    }
    binding.vlan = vlan.get<uint16_t>();
    if (!entry["mac"].is_string()) {
-      throw ReplayError(what + ": \"mac\" must be a string");
+      throw InputError(what + ": \"mac\" must be a string");
    }
    binding.mac = parseMac(entry["mac"].get<std::string>(), what);
    binding.ip = parseIp(entry["ip"], what);
@@ -92,37 +92,37 @@ std::array<uint8_t, 6> parseMac(std::string_view text, const std::string &what)
       ok = error == std::errc{} && end == first + 2 && (i == 5 || text[i * 3 + 2] == ':');
    }
    if (!ok) {
-      throw ReplayError(what + ": malformed MAC address \"" + std::string(text) + "\"");
+      throw InputError(what + ": malformed MAC address \"" + std::string(text) + "\"");
    }
    return mac;
 }
 
 PortSecurityConfig parseConfig(std::string_view text, const std::string &origin)
 {
-   if (common::jsonDepth(text) > common::kMaxJsonDepth) {
-      throw ReplayError(origin + ": nested deeper than " + std::to_string(common::kMaxJsonDepth) + " levels");
+   if (session::jsonDepth(text) > session::kMaxJsonDepth) {
+      throw InputError(origin + ": nested deeper than " + std::to_string(session::kMaxJsonDepth) + " levels");
    }
    json doc;
    try {
       doc = json::parse(text);
    } catch (const json::parse_error &e) {
-      throw ReplayError(origin + ": bad JSON: " + e.what());
+      throw InputError(origin + ": bad JSON: " + e.what());
    } catch (const json::exception &e) {
       // A number too large for any type (1e400): the library's message
       // without its exception tag.
       const std::string what = e.what();
       const size_t tag = what.find("] ");
-      throw ReplayError(origin + ": bad JSON: " + (tag == std::string::npos ? what : what.substr(tag + 2)));
+      throw InputError(origin + ": bad JSON: " + (tag == std::string::npos ? what : what.substr(tag + 2)));
    }
    if (!doc.is_object()) {
-      throw ReplayError(origin + ": expected a JSON object");
+      throw InputError(origin + ": expected a JSON object");
    }
    PortSecurityConfig config;
    config.origin = origin;
    for (const auto &[key, value] : doc.items()) {
       if (key == "features") {
          if (!value.is_array()) {
-            throw ReplayError(origin + ": \"features\" must be a list of feature names");
+            throw InputError(origin + ": \"features\" must be a list of feature names");
          }
          config.features = 0;
          for (const auto &name : value) {
@@ -133,14 +133,14 @@ PortSecurityConfig parseConfig(std::string_view text, const std::string &origin)
                }
             }
             if (found == nullptr) {
-               throw ReplayError(origin + ": unknown feature " + common::jsonText(name) +
+               throw InputError(origin + ": unknown feature " + session::jsonText(name) +
                                  " (known: ip-discovery, dai, ip-source-guard, bpdu-filter, block-dhcp-server)");
             }
             config.features |= found->bit;
          }
       } else if (key == "trusted") {
          if (!value.is_boolean()) {
-            throw ReplayError(origin + ": \"trusted\" must be true or false");
+            throw InputError(origin + ": \"trusted\" must be true or false");
          }
          config.trusted = value.get<bool>();
       } else if (key == "portDbSize") {
@@ -153,13 +153,13 @@ PortSecurityConfig parseConfig(std::string_view text, const std::string &origin)
          config.errRateLimitPeriod = unsignedField(doc, "errRateLimitPeriod", origin);
       } else if (key == "static") {
          if (!value.is_array()) {
-            throw ReplayError(origin + ": \"static\" must be a list of {vlan, mac, ip}");
+            throw InputError(origin + ": \"static\" must be a list of {vlan, mac, ip}");
          }
          for (size_t i = 0; i < value.size(); ++i) {
             config.statics.push_back(parseStatic(value[i], origin + ": static[" + std::to_string(i) + "]"));
          }
       } else {
-         throw ReplayError(origin + ": unknown key \"" + key + "\"");
+         throw InputError(origin + ": unknown key \"" + key + "\"");
       }
    }
    return config;
@@ -169,7 +169,7 @@ PortSecurityConfig loadConfigFile(const std::string &path)
 {
    std::ifstream in(path, std::ios::binary);
    if (!in) {
-      throw ReplayError(path + ": cannot open: " + std::strerror(errno));
+      throw InputError(path + ": cannot open: " + std::strerror(errno));
    }
    std::ostringstream text;
    text << in.rdbuf();
@@ -203,4 +203,4 @@ std::vector<uint8_t> configRecord(const PortSecurityConfig &config)
    return bytes;
 }
 
-}  // namespace swsec::replay
+}  // namespace swsec::session

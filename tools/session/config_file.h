@@ -8,7 +8,7 @@
 #include <string_view>
 #include <vector>
 
-namespace swsec::replay {
+namespace swsec::session {
 
 struct StaticBinding {
    uint16_t vlan = 0;
@@ -28,7 +28,7 @@ struct PortSecurityConfig {
    std::string origin;   // where it was read from, for messages
 };
 
-// Parses a document; `origin` names it in errors. Throws ReplayError on bad
+// Parses a document; `origin` names it in errors. Throws InputError on bad
 // JSON, unknown keys or feature names, wrong types and malformed addresses.
 PortSecurityConfig parseConfig(std::string_view text, const std::string &origin);
 PortSecurityConfig loadConfigFile(const std::string &path);
@@ -36,7 +36,7 @@ PortSecurityConfig loadConfigFile(const std::string &path);
 // The packed record: header then one 12-byte entry per static binding.
 std::vector<uint8_t> configRecord(const PortSecurityConfig &config);
 
-// "02:00:5e:c0:00:01" (six two-digit hex groups); throws ReplayError naming `what`.
+// "02:00:5e:c0:00:01" (six two-digit hex groups); throws InputError naming `what`.
 std::array<uint8_t, 6> parseMac(std::string_view text, const std::string &what);
 
-}  // namespace swsec::replay
+}  // namespace swsec::session

@@ -5,11 +5,11 @@
 #include <stdexcept>
 #include <string>
 
-namespace swsec::replay {
+namespace swsec::session {
 
-class ReplayError : public std::runtime_error {
+class InputError : public std::runtime_error {
 public:
    using std::runtime_error::runtime_error;
 };
 
-}  // namespace swsec::replay
+}  // namespace swsec::session

@@ -1,7 +1,7 @@
 // Bounded JSON nesting and dumping that cannot throw on bad UTF-8.
 #include "session/json_text.h"
 
-namespace swsec::common {
+namespace swsec::session {
 
 size_t jsonDepth(std::string_view text, size_t limit)
 {
@@ -39,4 +39,4 @@ std::string jsonText(const nlohmann::json &value, int indent)
    return value.dump(indent, ' ', false, nlohmann::json::error_handler_t::replace);
 }
 
-}  // namespace swsec::common
+}  // namespace swsec::session

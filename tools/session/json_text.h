@@ -10,7 +10,7 @@
 #include <string>
 #include <string_view>
 
-namespace swsec::common {
+namespace swsec::session {
 
 // Deep enough for any configuration or request; shallow enough that every
 // recursive walk over the document (dump, compare, describe) stays small.
@@ -23,4 +23,4 @@ size_t jsonDepth(std::string_view text, size_t limit = kMaxJsonDepth);
 // The value as one line (or indented by `indent`), invalid UTF-8 replaced.
 std::string jsonText(const nlohmann::json &value, int indent = -1);
 
-}  // namespace swsec::common
+}  // namespace swsec::session

@@ -5,7 +5,7 @@
 #include <regex>
 #include <string>
 
-namespace swsec::common {
+namespace swsec::session {
 
 namespace {
 
@@ -60,4 +60,4 @@ void restorePortState(host::Host &host, host::FilterId port, std::span<const uin
    }
 }
 
-}  // namespace swsec::common
+}  // namespace swsec::session

@@ -9,7 +9,7 @@
 #include <stdexcept>
 #include <vector>
 
-namespace swsec::common {
+namespace swsec::session {
 
 // The module refused a saved state or could not save one: `what()` is the
 // module's own message, on one line.
@@ -26,4 +26,4 @@ std::vector<uint8_t> savePortState(host::Host &host, host::FilterId port);
 // bindings it brings are announced like learned ones. Throws StateRefused.
 void restorePortState(host::Host &host, host::FilterId port, std::span<const uint8_t> blob);
 
-}  // namespace swsec::common
+}  // namespace swsec::session

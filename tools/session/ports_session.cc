@@ -2,12 +2,18 @@
 // notifications, shared by replay and inline.
 #include "session/ports_session.h"
 
+#include "session/error.h"
+
+#include "contract/notification.h"
+
 #include <arpa/inet.h>
 
+#include <algorithm>
+#include <charconv>
 #include <cstdio>
 #include <cstring>
 
-namespace swsec::ports {
+namespace swsec::session {
 
 namespace {
 
@@ -29,6 +35,28 @@ std::string portPath(uint32_t portID)
    return "/security/" + std::to_string(portID);
 }
 
+// A whole decimal count, as the nodes render them; "N/A" and text are not.
+template <typename Number>
+bool parseCount(const std::string &text, Number &value)
+{
+   const char *end = text.data() + text.size();
+   const auto [stop, error] = std::from_chars(text.data(), end, value);
+   return error == std::errc{} && stop == end;
+}
+
+DropCounters countersOf(const std::map<std::string, std::string, std::less<>> &values)
+{
+   DropCounters counters;
+   for (const char *field : kDropCounterFields) {
+      const auto found = values.find(field);
+      uint64_t value = 0;
+      if (found != values.end() && parseCount(found->second, value)) {
+         counters[field] = value;
+      }
+   }
+   return counters;
+}
+
 }  // namespace
 
 std::string withoutNewline(std::string text)
@@ -41,17 +69,19 @@ std::string withoutNewline(std::string text)
 
 std::optional<PortDbNotification> decodePortDbMessage(const host::PostedMessage &message)
 {
-   if (message.name.rfind("portdb.entry.", 0) != 0 || message.payload.size() < kPortDbMessageBytes) {
+   if ((message.name != SWSEC_PORTDB_MSG_ADDED && message.name != SWSEC_PORTDB_MSG_REMOVED) ||
+       message.payload.size() < sizeof(SwSecPortDbMsgPayload)) {
       return std::nullopt;
    }
-   const uint8_t *payload = message.payload.data();
+   SwSecPortDbMsgPayload payload;
+   std::memcpy(&payload, message.payload.data(), sizeof payload);
    PortDbNotification note;
    note.portID = message.portID;
    note.name = message.name;
-   std::memcpy(&note.vlan, payload + 8, sizeof note.vlan);
-   note.mac = macText(payload + 10);
-   note.ip = ipText(payload + 20);
-   note.authoritative = payload[36] != 0;
+   note.vlan = payload.entry.vlanId;
+   note.mac = macText(payload.entry.macAddr);
+   note.ip = ipText(reinterpret_cast<const uint8_t *>(&payload.entry.ipAddr));
+   note.authoritative = payload.entry.authoritative != 0;
    return note;
 }
 
@@ -65,7 +95,17 @@ ModuleSession::ModuleSession(const std::string &modulePath, const orr_ModuleInfo
    if (modulePath.empty()) {
       load.linkedModule = linkedModule;
    }
-   if (host_.load(load) != 0) {
+   int loaded = 1;
+   try {
+      loaded = host_.load(load);
+   } catch (const std::runtime_error &e) {
+      // An image the user named that cannot be opened is bad input.
+      if (!modulePath.empty()) {
+         throw InputError("--module " + modulePath + ": " + e.what());
+      }
+      throw;
+   }
+   if (loaded != 0) {
       throw std::runtime_error("the module failed to load");
    }
    host_.portsets().addPortset(kPortset);
@@ -86,7 +126,7 @@ host::FilterId ModuleSession::addPort(uint32_t portID, const std::string &name, 
    host::FilterId filter = 0;
    const orr_Status status = host_.sifra().createFilter(kAgent, portID, config, &filter);
    if (status != ORR_OK) {
-      throw std::runtime_error(std::string("the port could not be made: ") + orr_StatusToString(status));
+      throw std::runtime_error("port " + name + " could not be made: " + orr_StatusToString(status));
    }
    filters_.push_back(filter);
    return filter;
@@ -151,6 +191,44 @@ void ModuleSession::clear(uint32_t portID, const std::optional<std::vector<std::
    }
 }
 
+DropCounters ModuleSession::dropCounters(uint32_t portID)
+{
+   host::NexoRecord summary;
+   if (host_.nexo().get(portPath(portID) + "/featureSummary", &summary) != ORR_OK) {
+      return {};
+   }
+   return countersOf(summary.values());
+}
+
+std::optional<std::chrono::seconds> ModuleSession::soonestExpiry(uint32_t portID)
+{
+   const std::string path = portPath(portID) + "/vmi";
+   std::vector<int64_t> instances;
+   if (host_.nexo().list(path, &instances) != ORR_OK) {
+      return std::nullopt;
+   }
+   std::optional<std::chrono::seconds> soonest;
+   for (int64_t instance : instances) {
+      host::NexoRecord vmi;
+      if (host_.nexo().get(path + "/" + std::to_string(instance), &vmi) != ORR_OK) {
+         return std::chrono::seconds(0);   // unknown: tick on
+      }
+      const auto values = vmi.values();
+      const auto found = values.find("timeRemaining");
+      if (found == values.end() || found->second == "N/A") {
+         continue;   // a static binding does not expire
+      }
+      uint64_t seconds = 0;
+      const char *end = found->second.data() + found->second.size();
+      if (std::from_chars(found->second.data(), end, seconds).ec != std::errc{}) {
+         return std::chrono::seconds(0);
+      }
+      const std::chrono::seconds left(seconds);
+      soonest = soonest ? std::min(*soonest, left) : left;
+   }
+   return soonest;
+}
+
 PortState ModuleSession::readState(uint32_t portID)
 {
    PortState state;
@@ -159,12 +237,7 @@ PortState ModuleSession::readState(uint32_t portID)
    if (host_.nexo().get(port + "/featureSummary", &summary) == ORR_OK) {
       state.featureSummary = summary.values();
       state.featureSummaryText = summary.text();
-      for (const char *field : kDropCounterFields) {
-         const auto found = state.featureSummary->find(field);
-         if (found != state.featureSummary->end() && found->second != "N/A") {
-            state.counters[field] = std::stoull(found->second);
-         }
-      }
+      state.counters = countersOf(*state.featureSummary);
    }
    std::vector<int64_t> instances;
    if (host_.nexo().list(port + "/vmi", &instances) != ORR_OK) {
@@ -182,7 +255,7 @@ PortState ModuleSession::readState(uint32_t portID)
          return found != values.end() ? found->second : std::string();
       };
       PortDbEntry &entry = state.portDb.emplace_back();
-      entry.vlan = static_cast<uint16_t>(std::stoul(field("vlanId")));
+      (void)parseCount(field("vlanId"), entry.vlan);
       entry.mac = field("macAddr");
       entry.ip = field("ipAddr");
       entry.method = field("discoveryMethod");
@@ -249,4 +322,4 @@ std::vector<std::string> ModuleSession::finish()
    return violations_;
 }
 
-}  // namespace swsec::ports
+}  // namespace swsec::session

@@ -7,6 +7,7 @@
 
 #include "host/host.h"
 
+#include <chrono>
 #include <cstdint>
 #include <map>
 #include <mutex>
@@ -16,7 +17,7 @@
 #include <string_view>
 #include <vector>
 
-namespace swsec::ports {
+namespace swsec::session {
 
 inline constexpr const char *kAgent = "sifra-generic-tarlin-swsec";
 inline constexpr const char *kSecurityProperty = "sifra-generic-tarlin-swsec.security";
@@ -41,13 +42,16 @@ struct PortDbEntry {
    std::string leaseTime;
 };
 
+// The drop counters as the "featureSummary" node shows them, by field name.
+using DropCounters = std::map<std::string, uint64_t, std::less<>>;
+
 // What the management nodes show of one port.
 struct PortState {
    // The "featureSummary" node's fields; none when the port has no IP
    // discovery (the node then does not exist).
    std::optional<std::map<std::string, std::string, std::less<>>> featureSummary;
    std::string featureSummaryText;
-   std::map<std::string, uint64_t, std::less<>> counters;   // drop counters the port keeps
+   DropCounters counters;   // drop counters the port keeps
    std::vector<PortDbEntry> portDb;
 };
 
@@ -68,9 +72,8 @@ public:
    using std::runtime_error::runtime_error;
 };
 
-// The port database message payload: a header, then VLAN (host order) at 8,
-// MAC at 10, IPv4 at 20 and the authoritative flag at 36.
-inline constexpr size_t kPortDbMessageBytes = 40;
+// A posted message decoded, when it is a port database notification whose
+// payload is whole.
 std::optional<PortDbNotification> decodePortDbMessage(const host::PostedMessage &message);
 
 // The host with the module loaded and the ports made on it. Management
@@ -80,8 +83,8 @@ class ModuleSession {
 public:
    // Loads the module from the image at `modulePath`, or, with none, the
    // one linked into the program (`linkedModule`, null: the built image),
-   // and makes the virtual switch; throws std::runtime_error when it does
-   // not load.
+   // and makes the virtual switch. Throws InputError when the image cannot
+   // be opened, std::runtime_error when the module does not load.
    ModuleSession(const std::string &modulePath, const orr_ModuleInfo *linkedModule,
                  host::ViolationHandler violations);
    // Destroys the ports still there and unloads.
@@ -102,6 +105,11 @@ public:
    // The "clearVmi" node: all entries, or one VLAN/MAC/IP. Throws Refused.
    void clear(uint32_t portID, const std::optional<std::vector<std::string>> &key);
    PortState readState(uint32_t portID);
+   // The drop counters alone (none without IP discovery).
+   DropCounters dropCounters(uint32_t portID);
+   // The time left to the binding that expires first (none: no binding
+   // expires); 0 when a node cannot be read.
+   std::optional<std::chrono::seconds> soonestExpiry(uint32_t portID);
 
    // Port database notifications posted since the last call, in order.
    std::vector<PortDbNotification> takeNotifications();
@@ -130,4 +138,4 @@ private:
 
 std::string withoutNewline(std::string text);
 
-}  // namespace swsec::ports
+}  // namespace swsec::session

@@ -6,7 +6,7 @@
 #include <cstdio>
 #include <cstring>
 
-namespace swsec::common {
+namespace swsec::session {
 
 namespace {
 
@@ -289,4 +289,4 @@ void printSavedState(std::ostream &out, const SavedPortState &state)
    }
 }
 
-}  // namespace swsec::common
+}  // namespace swsec::session

@@ -14,7 +14,7 @@
 #include <string>
 #include <vector>
 
-namespace swsec::common {
+namespace swsec::session {
 
 // A blob that is not a well-formed saved state: `what()` says what is wrong.
 class BadSavedState : public std::runtime_error {
@@ -77,4 +77,4 @@ std::string featureNames(uint32_t features);
 nlohmann::json savedStateJson(const SavedPortState &state);
 void printSavedState(std::ostream &out, const SavedPortState &state);
 
-}  // namespace swsec::common
+}  // namespace swsec::session

@@ -9,7 +9,7 @@
 #include <cstdio>
 #include <cstring>
 
-namespace swsec::common {
+namespace swsec::session {
 
 namespace {
 
@@ -125,4 +125,4 @@ void writeStateFile(const std::string &path, std::span<const uint8_t> bytes, mod
    file.release();
 }
 
-}  // namespace swsec::common
+}  // namespace swsec::session

@@ -10,7 +10,7 @@
 #include <string>
 #include <vector>
 
-namespace swsec::common {
+namespace swsec::session {
 
 // A state file that cannot be read or written: `what()` names the file
 // and the problem on one line.
@@ -31,4 +31,4 @@ std::vector<uint8_t> readStateFile(const std::string &path);
 // umask), syncs it and renames it over `path`; on any failure no file is left.
 void writeStateFile(const std::string &path, std::span<const uint8_t> bytes, mode_t mode = 0666);
 
-}  // namespace swsec::common
+}  // namespace swsec::session

@@ -32,7 +32,7 @@ constexpr uint16_t kTpids[4] = {0, 0x8100, 0x88a8, 0x9100};
 // Two static bindings of the VM, on VLAN 0 and 100.
 Bytes configRecord(uint8_t bits)
 {
-   swsec::replay::PortSecurityConfig config;
+   swsec::session::PortSecurityConfig config;
    config.features = bits & 0x1fu;
    config.trusted = (bits & 0x20u) != 0;
    if ((bits & 0x40u) != 0) {
@@ -41,7 +41,7 @@ Bytes configRecord(uint8_t bits)
       config.errRateLimitPeriod = 10;
    }
    config.statics = {{0, kMacs[0], kIps[0]}, {100, kMacs[0], kIps[0]}};
-   return swsec::replay::configRecord(config);
+   return swsec::session::configRecord(config);
 }
 
 void put(Bytes &out, std::initializer_list<uint8_t> bytes)

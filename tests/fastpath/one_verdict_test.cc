@@ -50,7 +50,7 @@ TEST_P(OneVerdict, the_fast_path_and_the_module_alone_agree_on_every_frame)
       throw;
    }
    const auto &[entry, config] = GetParam();
-   ASSERT_TRUE(twin->configure(replay::configRecord(replay::loadConfigFile(config))));
+   ASSERT_TRUE(twin->configure(session::configRecord(session::loadConfigFile(config))));
    replay::CaptureReader capture(kSource / "tests/data" / entry["file"].get<std::string>());
    replay::CaptureFrame frame;
    // The port is configured half a second before the first frame, as replay does.

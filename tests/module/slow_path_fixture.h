@@ -25,10 +25,6 @@ protected:
    {
       return SifraGenericAgentFromHandle(host().sifra().fastPath(kAgent)->agent);
    }
-   SifraGenericFilter *record(host::FilterId id)
-   {
-      return static_cast<SifraGenericFilter *>(host().sifra().filter(id)->record);
-   }
    // The module's record of a registered (or withdrawing) slow path; null when the host forgot it.
    SifraGenericSlowPath *slowPath(uint32_t id)
    {

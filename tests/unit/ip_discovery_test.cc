@@ -80,16 +80,6 @@ protected:
       return arpFrame(src, kBroadcastMac,
                       {.op = op, .senderMac = src, .senderIp = sender, .targetIp = target});
    }
-
-   void addNonDhcp(Ip4 address, uint8_t method)
-   {
-      auto *vmi = static_cast<SwSecVmi *>(SifraGenericAlloc(sizeof(SwSecVmi)));
-      std::memcpy(vmi->macAddr, kVmMac.bytes.data(), 6);
-      vmi->ipAddr = address.raw();
-      vmi->discoveryMethod = method;
-      vmi->expiryTime = method == SwSecDiscStatic ? 0 : uptime() + 180;
-      ASSERT_EQ(SwSecAddVmi(&ctx_, vmi), 0);
-   }
 };
 
 // ---------------------------------------------------------------- DHCP snooping
@@ -135,10 +125,10 @@ class RenewalTest : public IpDiscoveryTest, public ::testing::WithParamInterface
 TEST_P(RenewalTest, the_ack_of_a_renewal_refiles_or_retires_the_binding)
 {
    const RenewalCase &c = GetParam();
-   addNonDhcp(Ip4::parse("10.0.0.99"), kArp);   // so that the hash table is in use
+   ASSERT_EQ(add({0, 1, 99}, kArp, uptime() + 180), 0);   // so that the hash table is in use
    bind(kLeased, 0x100, 600);
    if (c.atNewAddress) {
-      addNonDhcp(kRenumbered, *c.atNewAddress);
+      ASSERT_EQ(add({0, 1, 20}, *c.atNewAddress, *c.atNewAddress == kStatic ? 0 : uptime() + 180), 0);
    }
    host().portsets().clearPosted();
    advanceSeconds(300);

@@ -13,6 +13,9 @@
 
 namespace swsec::testing {
 
+// Why a BPF program cannot be loaded here (no privilege, no BPF), or none.
+std::optional<std::string> bpfUnavailable();
+
 class Twin {
 public:
    // The host has the module loaded; the ports get IDs `firstPort` and the next.

@@ -6,9 +6,13 @@
 #include <sys/stat.h>
 #include <sys/statfs.h>
 
+#include <algorithm>
 #include <cerrno>
+#include <cstdarg>
+#include <cstdio>
 #include <cstring>
 #include <filesystem>
+#include <mutex>
 #include <utility>
 
 namespace swsec::fastpath {
@@ -97,7 +101,47 @@ int takePunt(void *context, void *data, size_t size)
    return 0;
 }
 
+std::mutex logMutex;
+std::function<void(std::string_view)> logSink;
+
+// libbpf's own format and arguments, formatted as libbpf would.
+[[gnu::format(printf, 2, 0)]] int printLibbpf(libbpf_print_level level, const char *format, va_list arguments)
+{
+   if (level == LIBBPF_DEBUG) {
+      return 0;
+   }
+   char text[1024];
+   const int length = std::vsnprintf(text, sizeof text, format, arguments);
+   std::string_view message(text, length < 0 ? 0 : std::min<size_t>(static_cast<size_t>(length), sizeof text - 1));
+   while (!message.empty() && message.back() == '\n') {
+      message.remove_suffix(1);
+   }
+   if (message.find("Exclusivity flag on") != std::string_view::npos) {
+      return 0;   // the clsact qdisc exists already: attaching uses it
+   }
+   const std::lock_guard lock(logMutex);
+   if (logSink) {
+      logSink(message);
+   } else {
+      std::fprintf(stderr, "%.*s\n", static_cast<int>(message.size()), message.data());
+   }
+   return 0;
+}
+
+void installLibbpfLog()
+{
+   static std::once_flag once;
+   std::call_once(once, [] { libbpf_set_print(printLibbpf); });
+}
+
 }  // namespace
+
+void setLibbpfLog(std::function<void(std::string_view)> sink)
+{
+   installLibbpfLog();
+   const std::lock_guard lock(logMutex);
+   logSink = std::move(sink);
+}
 
 Error::Error(const std::string &what, int error)
    : std::runtime_error(what + ": " + std::strerror(error)), error_(error)
@@ -118,6 +162,15 @@ std::string_view reasonName(uint32_t reason)
    return reason < SWSEC_FP_REASON_COUNT ? kReasonNames[reason] : "unknown";
 }
 
+std::string pinDirFor(std::string_view port)
+{
+   const bool control = std::any_of(port.begin(), port.end(), [](char c) { return static_cast<unsigned char>(c) < 0x20 || c == 0x7f; });
+   if (port.empty() || port.size() > 64 || port == "." || port == ".." || port.find('/') != port.npos || control) {
+      throw Error("no pin directory for the port name '" + std::string(port) + "'", EINVAL);
+   }
+   return "/sys/fs/bpf/swsec/" + std::string(port);
+}
+
 Untagged takeOuterTag(std::span<const uint8_t> frame)
 {
    Untagged out;
@@ -136,6 +189,7 @@ Untagged takeOuterTag(std::span<const uint8_t> frame)
 
 Program::Program(const Options &options) : pinDir_(options.pinDir)
 {
+   installLibbpfLog();
    const auto object = embeddedObject();
    auto openOptions = optionsOf<bpf_object_open_opts>();
    openOptions.object_name = "swsec_fastpath";
@@ -224,6 +278,11 @@ swsec_fp_port Program::port() const
 
 void Program::describe(const PortDescription &description)
 {
+   if (description.bindings.size() > SWSEC_FP_MAX_BINDINGS) {
+      throw Error("a port of " + std::to_string(description.bindings.size()) + " bindings (at most " +
+                     std::to_string(SWSEC_FP_MAX_BINDINGS) + ")",
+                  E2BIG);
+   }
    // Not ready while the bindings change, so that no frame is judged on a half-filled map.
    setNotReady();
    const int fd = mapFd("swsec_bindings");
@@ -349,6 +408,7 @@ void Program::unpin()
 
 Attachment::Attachment(const Program &program, int ifindex, bool ingress, bool egress) : ifindex_(ifindex)
 {
+   installLibbpfLog();
    auto hook = optionsOf<bpf_tc_hook>();
    hook.ifindex = ifindex;
    hook.attach_point = BPF_TC_INGRESS;

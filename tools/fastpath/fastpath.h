@@ -38,6 +38,12 @@ private:
 // The program's object file as built, embedded in this library.
 std::span<const uint8_t> embeddedObject();
 
+// Where libbpf's warnings and information go (its debug output is dropped),
+// one message a call without its final newline; standard error until set.
+// The kernel's refusal to make a clsact qdisc that exists already, which
+// attaching expects and handles, is not passed on.
+void setLibbpfLog(std::function<void(std::string_view)> sink);
+
 struct Binding {
    uint16_t vlan = 0;
    std::array<uint8_t, 6> mac{};
@@ -87,6 +93,11 @@ struct Untagged {
    std::optional<uint16_t> vlan;
 };
 Untagged takeOuterTag(std::span<const uint8_t> frame);
+
+// Where a port's maps are pinned: /sys/fs/bpf/swsec/<port>. A port name
+// that is empty, longer than 64 bytes, "." or "..", or holds a '/' or a
+// control character is refused (Error, EINVAL).
+std::string pinDirFor(std::string_view port);
 
 // One port's program and maps. Moving only; the maps stay pinned after
 // the object goes (unpin() removes them).

@@ -11,6 +11,8 @@
 #include <gtest/gtest.h>
 #include <nlohmann/json.hpp>
 
+#include <sys/stat.h>
+
 #include <fstream>
 #include <optional>
 #include <string>
@@ -187,46 +189,90 @@ TEST_F(StateTool, a_saved_state_is_shown_and_restored_by_the_tool)
    EXPECT_EQ(result["ports"][0]["notifications"][0]["ip"], "192.0.2.101");
 }
 
-TEST_F(StateTool, bad_state_files_are_refused_with_one_line_and_nothing_written)
+TEST_F(StateTool, bad_state_files_are_refused_alike_by_show_and_restore_with_one_line_and_nothing_written)
 {
    const std::string good = (dir_.path() / "good.state").string();
-   ASSERT_EQ(runTool({"replay", "--vm-mac", "02:00:5e:c0:00:01", "--save-state", good, example()}).status, 0);
+   ASSERT_EQ(runTool({"replay", "--vm-mac", "02:00:5e:c0:00:01", "--config", enforcing(), "--save-state", good,
+                      example()})
+                .status,
+             0);
    const std::vector<uint8_t> blob = session::readStateFile(good);
-
+   // Offsets in the blob: the agent's part at 48, its first binding at 144.
+   auto changed = [&blob](size_t at, std::initializer_list<uint8_t> bytes) {
+      std::string out(blob.begin(), blob.end());
+      std::copy(bytes.begin(), bytes.end(), out.begin() + static_cast<std::ptrdiff_t>(at));
+      return out;
+   };
    struct Bad {
       const char *name;
-      std::string bytes;
-      const char *replayMessage;
-      const char *showMessage;
+      std::string bytes;   // "" with fifo: a FIFO
+      const char *message;
+      bool fifo = false;
    };
-   std::string shortBlob(blob.begin(), blob.begin() + 47);
-   std::string foreign(blob.begin(), blob.end());
-   foreign[0] = 'x';
-   std::string truncated(blob.begin(), blob.end() - 1);
    const Bad cases[] = {
-      {"empty", "", "empty file, no saved state", "too short for the 48-byte header (0 bytes)"},
-      {"short", shortBlob, "Buffer too short for header (47 bytes)", "too short for the 48-byte header (47 bytes)"},
-      {"foreign", foreign, "Bad state header magic (got 0x65766173676669", "not a saved state (magic"},
-      {"truncated", truncated, "Buffer not large enough", "runs past the"},
+      {"empty", "", "empty file, no saved state"},
+      {"short", std::string(blob.begin(), blob.begin() + 47), "too short for the 48-byte header (47 bytes)"},
+      {"foreign", changed(0, {'x'}), "not a saved state (magic"},
+      {"truncated", std::string(blob.begin(), blob.end() - 1), "runs past the"},
+      {"unknown_method", changed(144 + 12, {3}), "discovery method 3"},
+      {"time_past_32_bits", changed(144 + 16, {0, 0, 0, 0, 1}), "outside 0 to 4294967295"},
+      {"inspection_on_a_trusted_port", changed(48 + 5, {1}), "configuration refused"},
+      {"cut_envelope", "swsecenv\1", "envelope is cut short"},
+      {"fifo", "", "not a regular file", true},
    };
    for (const Bad &bad : cases) {
       SCOPED_TRACE(bad.name);
       const auto path = dir_.path() / (std::string(bad.name) + ".state");
-      writeFile(path, bad.bytes);
+      if (bad.fifo) {
+         ASSERT_EQ(mkfifo(path.c_str(), 0600), 0);
+      } else {
+         writeFile(path, bad.bytes);
+      }
       const auto written = (dir_.path() / "passed.pcap").string();
       const ToolRun replayed = runTool({"replay", "--vm-mac", "02:00:5e:c0:00:01", "--restore-state", path.string(),
                                         "--write-passed", written, example()});
-      EXPECT_EQ(replayed.status, 2);
-      EXPECT_NE(replayed.err.find(bad.replayMessage), std::string::npos) << replayed.err;
-      EXPECT_EQ(std::count(replayed.err.begin(), replayed.err.end(), '\n'), 1) << replayed.err;
-      EXPECT_TRUE(replayed.out.empty());
-      EXPECT_FALSE(std::filesystem::exists(written));
-
       const ToolRun shown = runTool({"state", "show", path.string()});
-      EXPECT_EQ(shown.status, 2);
-      EXPECT_NE(shown.err.find(bad.showMessage), std::string::npos) << shown.err;
+      for (const ToolRun *run : {&replayed, &shown}) {
+         EXPECT_EQ(run->status, 2);
+         EXPECT_NE(run->err.find(bad.message), std::string::npos) << run->err;
+         EXPECT_EQ(std::count(run->err.begin(), run->err.end(), '\n'), 1) << run->err;
+         EXPECT_TRUE(run->out.empty());
+      }
+      EXPECT_FALSE(std::filesystem::exists(written));
    }
-   EXPECT_EQ(runTool({"state", "show", (dir_.path() / "missing").string()}).status, 2);
+}
+
+TEST_F(StateTool, time_since_the_save_is_taken_from_each_lifetime_and_what_ran_out_is_left_out)
+{
+   const std::string saved = (dir_.path() / "port.state").string();
+   ASSERT_EQ(runTool({"replay", "--vm-mac", "02:00:5e:c0:00:01", "--config", enforcing(), "--save-state", saved,
+                      example()})
+                .status,
+             0);
+   const std::vector<uint8_t> blob = session::readStateFile(saved);
+   const session::SavedPortState before = session::decodeSavedState(blob);
+   ASSERT_EQ(before.bindings.size(), 1u);
+   const int64_t left = before.bindings[0].timeRemaining;
+   ASSERT_GT(left, 10);
+
+   const session::SavedPortState aged = session::decodeSavedState(session::ageSavedState(blob, 10));
+   ASSERT_EQ(aged.bindings.size(), 1u);
+   EXPECT_EQ(aged.bindings[0].timeRemaining, left - 10);
+   EXPECT_EQ(aged.counters, before.counters);
+
+   const std::vector<uint8_t> gone = session::ageSavedState(blob, left);
+   const session::SavedPortState expired = session::decodeSavedState(gone);
+   EXPECT_TRUE(expired.bindings.empty());
+   EXPECT_EQ(expired.agentLen, gone.size() - 48);
+   EXPECT_EQ(expired.slowPathOffset, gone.size());
+
+   // In its envelope, with the time of the save, the file is shown and restored.
+   const auto wrapped = session::wrapState(gone, 1'700'000'000'000'000);
+   writeFile(saved, std::string(wrapped.begin(), wrapped.end()));
+   const ToolRun shown = runTool({"state", "show", "--json", saved});
+   ASSERT_EQ(shown.status, 0) << shown.err;
+   EXPECT_EQ(json::parse(shown.out)["savedAt"], 1'700'000'000.0);
+   EXPECT_EQ(runTool({"replay", "--vm-mac", "02:00:5e:c0:00:01", "--restore-state", saved, example()}).status, 0);
 }
 
 }  // namespace

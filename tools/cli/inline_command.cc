@@ -10,6 +10,10 @@
 
 #include <signal.h>
 #include <sys/stat.h>
+#include <unistd.h>
+
+#include <climits>
+#include <cstring>
 
 #include <cerrno>
 #include <cstdio>
@@ -61,6 +65,9 @@ live::InlineOptions parseOptions(const InlineCommandOptions &command)
       if (::stat(command.stateDir.c_str(), &info) != 0 || !S_ISDIR(info.st_mode)) {
          throw UsageError("--state-dir " + command.stateDir + ": not a directory");
       }
+      if (::access(command.stateDir.c_str(), W_OK | X_OK) != 0) {
+         throw UsageError("--state-dir " + command.stateDir + ": not writable: " + std::strerror(errno));
+      }
       options.stateDir = command.stateDir;
    }
    options.bridge = command.bridge;
@@ -76,6 +83,11 @@ live::InlineOptions parseOptions(const InlineCommandOptions &command)
       // The name becomes a file name in the state directory.
       if (!command.stateDir.empty() && (name.find('/') != std::string::npos || name == "." || name == "..")) {
          throw UsageError("--port " + text + ": with --state-dir a port name cannot be a path");
+      }
+      // NAME.state and its temporary NAME.state.partial-XXXXXX must be file names.
+      if (!command.stateDir.empty() && name.size() + sizeof ".state.partial-XXXXXX" - 1 > NAME_MAX) {
+         throw UsageError("--port " + name.substr(0, 32) + "...: with --state-dir a port name has at most " +
+                          std::to_string(NAME_MAX - (sizeof ".state.partial-XXXXXX" - 1)) + " bytes");
       }
       if (!names.insert(name).second) {
          throw UsageError("--port " + text + ": port " + name + " named twice");
@@ -175,7 +187,7 @@ int runInline(const InlineCommandOptions &command)
    for (const auto &violation : violations) {
       std::fprintf(stderr, "swsec inline: host: %s\n", violation.c_str());
    }
-   if (!violations.empty()) {
+   if (!violations.empty() || daemon->stateLost()) {
       status = kExitFailure;
    }
    std::fprintf(stderr, "swsec inline: stopped, %zu host violation(s)\n", violations.size());

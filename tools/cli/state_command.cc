@@ -9,6 +9,7 @@
 #include <CLI/CLI.hpp>
 
 #include <cstdio>
+#include <ctime>
 #include <iostream>
 
 namespace swsec::tools {
@@ -24,11 +25,20 @@ void addStateOptions(CLI::App &command, StateShowOptions &options)
 int runStateShow(const StateShowOptions &options)
 {
    try {
-      const std::vector<uint8_t> blob = session::readStateFile(options.file);
-      const session::SavedPortState state = session::decodeSavedState(blob);
+      const session::StoredState stored = session::readStoredState(options.file);
+      const session::SavedPortState state = session::decodeSavedState(stored.blob);
       if (options.json) {
-         std::cout << session::jsonText(session::savedStateJson(state), 1) << "\n";
+         nlohmann::json doc = session::savedStateJson(state);
+         // Seconds since 1970 of the save, null for a bare blob.
+         doc["savedAt"] = stored.savedAtUs ? nlohmann::json(static_cast<double>(*stored.savedAtUs) / 1e6) : nullptr;
+         std::cout << session::jsonText(doc, 1) << "\n";
       } else {
+         if (stored.savedAtUs) {
+            const std::time_t seconds = static_cast<std::time_t>(*stored.savedAtUs / 1'000'000);
+            char text[64];
+            std::strftime(text, sizeof text, "%Y-%m-%d %H:%M:%S UTC", std::gmtime(&seconds));
+            std::cout << "Saved at " << text << "\n";
+         }
          session::printSavedState(std::cout, state);
       }
       return kExitOk;

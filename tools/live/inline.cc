@@ -4,6 +4,7 @@
 
 #include "session/error.h"
 #include "session/port_state.h"
+#include "session/saved_state_format.h"
 #include "session/state_file.h"
 
 #include <sys/stat.h>
@@ -58,24 +59,42 @@ std::string InlineDaemon::statePath(const PortSpec &portSpec) const
 // A state file that is missing, damaged or refused costs the port its
 // bindings, not its start: the VMs renew their leases and are learned
 // again, while a port that did not start would leave its VM cut off.
+// The time since the save is taken from every lifetime, so that a lease
+// that ran out meanwhile (or that the VM gave back and the server gave
+// to another) does not come back.
 void InlineDaemon::restoreState(const PortSpec &portSpec, host::FilterId filter)
 {
    const std::string path = statePath(portSpec);
    struct stat info {};
-   if (::stat(path.c_str(), &info) != 0 && errno == ENOENT) {
+   if (::lstat(path.c_str(), &info) != 0 && errno == ENOENT) {
       events_.log("info", "inline", portSpec.name + ": no saved state in " + path + "; the port starts empty");
       return;
    }
    try {
-      const std::vector<uint8_t> blob = session::readStateFile(path);
-      // An empty blob would be taken as "nothing to restore"; a state file has one.
-      if (blob.empty()) {
-         throw session::StateFileError(path + ": empty file, no saved state");
+      session::StoredState stored = session::readStoredState(path);
+      std::string age;
+      if (stored.savedAtUs) {
+         const int64_t elapsedUs = static_cast<int64_t>(wallClock() * 1e6) - *stored.savedAtUs;
+         if (elapsedUs < 0) {
+            events_.log("error", "inline", portSpec.name + ": " + path + " was saved " +
+                                               std::to_string(-elapsedUs / 1'000'000) +
+                                               " s in the future; the clock went back: no time deducted");
+         }
+         // Whole seconds, rounded up: a binding is never given time it did not have.
+         const int64_t elapsed = elapsedUs <= 0 ? 0 : (elapsedUs + 999'999) / 1'000'000;
+         const size_t saved = session::decodeSavedState(stored.blob).bindings.size();
+         stored.blob = session::ageSavedState(stored.blob, elapsed);
+         const size_t kept = session::decodeSavedState(stored.blob).bindings.size();
+         age = " (saved " + std::to_string(elapsed) + " s ago; " + std::to_string(saved - kept) +
+               " of its " + std::to_string(saved) + " bindings ran out meanwhile)";
       }
-      session::restorePortState(session_.host(), filter, blob);
-      events_.log("info", "inline", portSpec.name + ": state restored from " + path);
+      session::restorePortState(session_.host(), filter, stored.blob);
+      events_.log("info", "inline", portSpec.name + ": state restored from " + path + age);
    } catch (const session::StateFileError &e) {
       events_.log("error", "inline", portSpec.name + ": " + e.what() + "; the port starts empty");
+   } catch (const session::BadSavedState &e) {
+      events_.log("error", "inline", portSpec.name + ": " + path + ": saved state refused: " + e.what() +
+                                         "; the port starts empty");
    } catch (const session::StateRefused &e) {
       events_.log("error", "inline", portSpec.name + ": " + path + ": saved state refused: " + e.what() +
                                          "; the port starts empty");
@@ -83,16 +102,26 @@ void InlineDaemon::restoreState(const PortSpec &portSpec, host::FilterId filter)
 }
 
 // Only owner-readable: the bindings name the VMs' addresses and leases.
-void InlineDaemon::saveState(const PortSpec &portSpec, host::FilterId filter)
+bool InlineDaemon::saveState(Port &port, host::FilterId filter)
 {
-   const std::string path = statePath(portSpec);
+   const std::string path = statePath(port.portSpec);
+   port.stateDirty = false;
+   port.lastSave = std::chrono::steady_clock::now();
    try {
-      session::writeStateFile(path, session::savePortState(session_.host(), filter), 0600);
-      events_.log("info", "inline", portSpec.name + ": state saved to " + path);
-   } catch (const session::StateFileError &e) {
-      events_.log("error", "inline", portSpec.name + ": state not saved: " + e.what());
-   } catch (const session::StateRefused &e) {
-      events_.log("error", "inline", portSpec.name + ": state not saved: " + e.what());
+      const std::vector<uint8_t> blob = session::savePortState(session_.host(), filter);
+      session::writeStateFile(path, session::wrapState(blob, static_cast<int64_t>(wallClock() * 1e6)), 0600);
+      if (port.saveFailing) {
+         events_.log("info", "inline", port.portSpec.name + ": state saved to " + path + " again");
+      }
+      port.saveFailing = false;
+      return true;
+   } catch (const std::exception &e) {
+      // Said once until a save succeeds again, not at every binding change.
+      if (!port.saveFailing) {
+         events_.log("error", "inline", port.portSpec.name + ": state not saved: " + e.what());
+      }
+      port.saveFailing = true;
+      return false;
    }
 }
 
@@ -137,6 +166,9 @@ void InlineDaemon::pump()
    }
    for (const auto &note : session_.takeNotifications()) {
       const size_t index = note.portID - 1;
+      if (index < ports_.size()) {
+         ports_[index].stateDirty = true;
+      }
       const std::string name = index < ports_.size() ? ports_[index].portSpec.name : std::to_string(note.portID);
       const std::string event = note.name.substr(note.name.rfind('.') + 1);
       events_.notification({{"time", wallClock()}, {"port", name},          {"event", event},
@@ -146,6 +178,14 @@ void InlineDaemon::pump()
    for (Port &port : ports_) {
       if (port.guarded && port.guarded->vanished() && port.guarded->running()) {
          port.guarded->stop();
+      }
+   }
+   // A binding change is on disk within a second, a burst of them in one save.
+   const auto now = std::chrono::steady_clock::now();
+   for (Port &port : ports_) {
+      if (!options_.stateDir.empty() && port.stateDirty && port.guarded && port.guarded->running() &&
+          now - port.lastSave >= std::chrono::seconds(1)) {
+         (void)saveState(port, port.guarded->filter());
       }
    }
 }
@@ -178,7 +218,11 @@ std::vector<std::string> InlineDaemon::stop()
       if (it->guarded) {
          std::function<void(host::FilterId)> save;
          if (!options_.stateDir.empty()) {
-            save = [this, &portSpec = it->portSpec](host::FilterId filter) { saveState(portSpec, filter); };
+            save = [this, &port = *it](host::FilterId filter) {
+               if (!saveState(port, filter)) {
+                  stateLost_ = true;
+               }
+            };
          }
          it->guarded->stop(false, save);
       }

@@ -7,6 +7,7 @@
 #include "session/config_file.h"
 #include "session/ports_session.h"
 
+#include <chrono>
 #include <map>
 #include <memory>
 #include <mutex>
@@ -51,6 +52,8 @@ public:
    // Stops every port as the fail mode says and unloads; returns the
    // host's findings.
    std::vector<std::string> stop();
+   // A port's state could not be saved at stop: its bindings are lost.
+   bool stateLost() const { return stateLost_; }
 
    nlohmann::json handle(const nlohmann::json &request) override;
 
@@ -59,6 +62,9 @@ private:
       PortSpec portSpec;
       std::unique_ptr<GuardedPort> guarded;
       std::string configSource;   // where its configuration came from last
+      bool stateDirty = false;    // bindings changed since the last save
+      bool saveFailing = false;   // the last save failed (said once)
+      std::chrono::steady_clock::time_point lastSave{};
    };
 
    Port &port(const nlohmann::json &request);
@@ -69,13 +75,14 @@ private:
    std::vector<uint8_t> recordFor(const PortSpec &portSpec);
    std::string statePath(const PortSpec &portSpec) const;
    void restoreState(const PortSpec &portSpec, host::FilterId filter);
-   void saveState(const PortSpec &portSpec, host::FilterId filter);
+   bool saveState(Port &port, host::FilterId filter);
 
    InlineOptions options_;
    EventHub &events_;
    session::ModuleSession session_;
    std::recursive_mutex mutex_;   // the ports against the control thread
    std::vector<Port> ports_;
+   bool stateLost_ = false;
 };
 
 }  // namespace swsec::live

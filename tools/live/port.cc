@@ -2,6 +2,7 @@
 #include "live/port.h"
 
 #include "live/netdev.h"
+#include "live/owner_lock.h"
 
 #include "host/host.h"
 
@@ -66,7 +67,15 @@ void GuardedPort::start(const std::vector<uint8_t> &record, const std::function<
 {
    const std::string &name = options_.name;
    // Everything that can be refused is checked before anything changes.
-   const auto vm = findLink(options_.vmIface);
+   auto vm = findLink(options_.vmIface);
+   if (!vm) {
+      throw NetdevError(name + ": no interface " + options_.vmIface);
+   }
+   // This process's from here until the take-down: a second daemon stops
+   // here, before it touches what the first one set up. Read again under
+   // the lock: an owner that just stopped may have changed it.
+   lock_ = std::make_unique<InterfaceLock>(options_.runDir, vm->ifindex, options_.vmIface);
+   vm = findLink(options_.vmIface);
    if (!vm) {
       throw NetdevError(name + ": no interface " + options_.vmIface);
    }
@@ -324,6 +333,7 @@ void GuardedPort::takeDown(bool restoreAsFound)
       attempt({"link", "del", bridgeEnd_});
    }
    pairMade_ = false;
+   lock_.reset();
 }
 
 }  // namespace swsec::live

@@ -11,6 +11,7 @@
 // fail mode says). A start that fails half way leaves the network as found.
 #pragma once
 
+#include "live/owner_lock.h"
 #include "live/socket.h"
 #include "session/ports_session.h"
 
@@ -37,6 +38,7 @@ struct PortOptions {
    uint32_t portID = 0;    // the module port's ID
    FailMode failMode = FailMode::closed;
    size_t batch = 64;      // most frames in one system call and one list
+   std::string runDir = kDefaultRunDir;   // where the interface's owner lock is
 };
 
 // Frames a port has seen, by direction (1 to the VM, 2 from it).
@@ -109,6 +111,7 @@ private:
    bool portMade_ = false;
    bool vmOutOfBridge_ = false;
    host::FilterId filter_ = 0;
+   std::unique_ptr<InterfaceLock> lock_;   // held from the first check to the end of the take-down
    std::unique_ptr<PacketSocket> vmSocket_;
    std::unique_ptr<PacketSocket> guardSocket_;
    int stopEvent_ = -1;                       // eventfd: the forwarding threads stop

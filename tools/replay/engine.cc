@@ -473,13 +473,9 @@ void Run::readRestoreState()
       return;
    }
    try {
-      restoreState_ = session::readStateFile(options_.restoreStatePath);
+      restoreState_ = session::readStoredState(options_.restoreStatePath).blob;
    } catch (const session::StateFileError &e) {
       throw session::InputError(e.what());
-   }
-   // An empty blob would be taken as "nothing to restore"; a state file has one.
-   if (restoreState_.empty()) {
-      throw session::InputError(options_.restoreStatePath + ": empty file, no saved state");
    }
 }
 

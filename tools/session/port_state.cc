@@ -2,6 +2,8 @@
 // with the module's log lines as the message of a refusal.
 #include "session/port_state.h"
 
+#include "session/saved_state_format.h"
+
 #include <regex>
 #include <string>
 
@@ -53,6 +55,13 @@ std::vector<uint8_t> savePortState(host::Host &host, host::FilterId port)
 
 void restorePortState(host::Host &host, host::FilterId port, std::span<const uint8_t> blob)
 {
+   // One judgement for `state show` and a restore: what the decoder
+   // refuses never reaches the module.
+   try {
+      (void)decodeSavedState(blob);
+   } catch (const BadSavedState &e) {
+      throw StateRefused(e.what());
+   }
    const size_t from = host.log().records().size();
    const orr_Status status = host.migration().restore(port, blob);
    if (status != ORR_OK) {

@@ -2,6 +2,9 @@
 // checked against the blob's length first.
 #include "session/saved_state_format.h"
 
+#include "contract/config_record.h"
+
+#include <algorithm>
 #include <cinttypes>
 #include <cstdio>
 #include <cstring>
@@ -95,6 +98,38 @@ void decodeHeader(std::span<const uint8_t> blob, SavedPortState &state)
    }
 }
 
+// Remaining times as the module keeps them: unsigned 32-bit seconds.
+constexpr int64_t kMaxSeconds = UINT32_MAX;
+
+bool isSeconds(int64_t value)
+{
+   return value >= 0 && value <= kMaxSeconds;
+}
+
+// The rules a new configuration is held to, which the module's restore
+// applies to a saved one.
+void checkConfig(const SavedPortState &state, uint32_t numSaved)
+{
+   const uint32_t features = state.featuresEnabled;
+   if ((features & SwSecFeaturesNeedingDiscovery) != 0 &&
+       ((features & SwSecFeatureIpDiscovery) == 0 || state.trusted != 0)) {
+      throw BadSavedState("configuration refused: features " + featureNames(features) +
+                          (state.trusted != 0 ? " on a trusted port" : " without ip-discovery"));
+   }
+   if ((features & SwSecFeatureDai) != 0 && state.arpRateLimit != 0 &&
+       (state.arpRateLimit > SWSEC_ARP_RATE_LIMIT_MAX || state.errRateLimit >= state.arpRateLimit ||
+        state.errRateLimit > SWSEC_ERR_RATE_LIMIT_MAX || state.errRateLimitPeriod < SWSEC_ERR_RATE_LIMIT_PERIOD_MIN)) {
+      throw BadSavedState("configuration refused: ARP rate limit " + number(state.arpRateLimit) + ", " +
+                          number(state.errRateLimit) + " for " + number(state.errRateLimitPeriod) + " s");
+   }
+   if ((features & SwSecFeatureIpDiscovery) != 0 &&
+       (state.portDbSize < SWSEC_PORT_DB_SIZE_MIN || state.portDbSize > SWSEC_PORT_DB_SIZE_MAX ||
+        numSaved > state.portDbSize)) {
+      throw BadSavedState("configuration refused: port database of " + number(state.portDbSize) + " entries with " +
+                          number(numSaved) + " saved");
+   }
+}
+
 SavedBinding decodeBinding(const uint8_t *entry)
 {
    SavedBinding binding;
@@ -131,8 +166,13 @@ void decodeAgentPart(std::span<const uint8_t> part, SavedPortState &state)
    for (size_t i = 0; i < state.counters.size(); ++i) {
       state.counters[i] = le(fixed + 48 + 8 * i, 8);
    }
-   if (numSaved != 0 && (state.featuresEnabled & 0x4u) == 0) {
+   if (numSaved != 0 && (state.featuresEnabled & SwSecFeatureIpDiscovery) == 0) {
       throw BadSavedState(number(numSaved) + " bindings saved with IP discovery off");
+   }
+   checkConfig(state, numSaved);
+   if (state.txRateLimitErr && !isSeconds(state.txRateLimitErrRemaining)) {
+      throw BadSavedState("error-rate-limit state with " + std::to_string(state.txRateLimitErrRemaining) +
+                          " s left, outside 0 to " + number(kMaxSeconds));
    }
 
    uint64_t position = kFixedLen;
@@ -142,6 +182,14 @@ void decodeAgentPart(std::span<const uint8_t> part, SavedPortState &state)
                              number(part.size()) + "-byte part");
       }
       SavedBinding binding = decodeBinding(part.data() + position);
+      if (methodName(binding.method).starts_with("unknown")) {
+         throw BadSavedState("binding " + number(i + 1) + " of " + number(numSaved) + ": discovery method " +
+                             number(binding.method) + " (known: 1, 2, 4, 8)");
+      }
+      if (!isSeconds(binding.timeRemaining)) {
+         throw BadSavedState("binding " + number(i + 1) + " of " + number(numSaved) + ": " +
+                             std::to_string(binding.timeRemaining) + " s left, outside 0 to " + number(kMaxSeconds));
+      }
       const uint8_t clientIdLen = binding.method == kDhcpSnooping ? part[position + 30] : 0;
       if (kEntryLen + clientIdLen > part.size() - position) {
          throw BadSavedState("binding " + number(i + 1) + " of " + number(numSaved) + " runs past the agent's " +
@@ -164,6 +212,50 @@ SavedPortState decodeSavedState(std::span<const uint8_t> blob)
       decodeAgentPart(blob.subspan(static_cast<size_t>(state.agentOffset), static_cast<size_t>(state.agentLen)), state);
    }
    return state;
+}
+
+std::vector<uint8_t> ageSavedState(std::span<const uint8_t> blob, int64_t elapsedSeconds)
+{
+   const SavedPortState state = decodeSavedState(blob);
+   std::vector<uint8_t> out(blob.begin(), blob.end());
+   if (state.agentLen == 0 || elapsedSeconds <= 0) {
+      return out;
+   }
+   auto put = [&out](size_t at, uint64_t value, size_t size) {
+      for (size_t i = 0; i < size; ++i) {
+         out[at + i] = static_cast<uint8_t>(value >> (8 * i));
+      }
+   };
+   const size_t agent = static_cast<size_t>(state.agentOffset);
+   if (state.txRateLimitErr) {
+      const int64_t left = state.txRateLimitErrRemaining - elapsedSeconds;
+      out[agent + 32] = left > 0 ? 1 : 0;
+      put(agent + 40, static_cast<uint64_t>(std::max<int64_t>(left, 0)), 8);
+   }
+   // Entries are rewritten in place and the survivors moved up over those
+   // whose time ran out; whatever followed the part moves up with them.
+   size_t read = agent + kFixedLen;
+   size_t write = read;
+   uint32_t kept = 0;
+   for (const SavedBinding &binding : state.bindings) {
+      const size_t length = kEntryLen + binding.clientId.size();
+      const int64_t left = binding.timeRemaining - elapsedSeconds;
+      if (binding.method == kStatic || left > 0) {
+         std::memcpy(out.data() + write, blob.data() + read, length);
+         if (binding.method != kStatic) {
+            put(write + 16, static_cast<uint64_t>(left), 8);
+         }
+         write += length;
+         ++kept;
+      }
+      read += length;
+   }
+   const size_t removed = read - write;
+   out.erase(out.begin() + static_cast<std::ptrdiff_t>(write), out.begin() + static_cast<std::ptrdiff_t>(read));
+   put(agent + 28, kept, 4);
+   put(24, state.agentLen - removed, 8);
+   put(32, state.slowPathOffset - removed, 8);
+   return out;
 }
 
 std::string methodName(uint8_t method)

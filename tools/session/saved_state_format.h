@@ -64,10 +64,18 @@ inline constexpr std::array<const char *, 6> kSavedCounterNames = {
    "dhcpSnoopingDropCnt", "daiDropCnt", "txRateLimitDropCnt", "txRateLimitErrEntryCnt", "rxRateLimitDropCnt",
    "ipSrcGuardDropCnt"};
 
-// Throws BadSavedState for anything the module's restore would refuse on
-// the blob's own evidence (short, foreign, another version, parts outside
-// the blob or overlapping, counts running past the agent's part).
+// Throws BadSavedState for anything the module's restore would refuse or
+// mishandle on the blob's own evidence (short, foreign, another version,
+// parts outside the blob or overlapping, counts running past the agent's
+// part, a configuration a new port would refuse, an unknown discovery
+// method, a remaining time outside 32 bits).
 SavedPortState decodeSavedState(std::span<const uint8_t> blob);
+
+// The blob as it stands `elapsedSeconds` after its save: every lifetime
+// and the error-rate-limit state shortened by that much, the bindings
+// whose time ran out left out (static ones stay). Throws BadSavedState as
+// decodeSavedState does.
+std::vector<uint8_t> ageSavedState(std::span<const uint8_t> blob, int64_t elapsedSeconds);
 
 // "DHCP Snooping", "Static", "TOFU", "ARP Snooping", or "unknown (N)".
 std::string methodName(uint8_t method);

@@ -5,6 +5,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
@@ -12,6 +13,8 @@
 namespace swsec::session {
 
 namespace {
+
+constexpr char kEnvelopeMagic[] = "swsecenv";
 
 std::string systemError()
 {
@@ -53,7 +56,12 @@ private:
 
 std::vector<uint8_t> readStateFile(const std::string &path)
 {
-   const int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC);
+   // Non-blocking so that a FIFO does not wait for a writer before the
+   // check below refuses it.
+   const int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOFOLLOW);
+   if (fd < 0 && errno == ELOOP) {
+      throw StateFileError(path + ": a symbolic link, not a saved state");
+   }
    if (fd < 0) {
       throw StateFileError(path + ": cannot read: " + systemError());
    }
@@ -86,6 +94,53 @@ std::vector<uint8_t> readStateFile(const std::string &path)
       done += static_cast<size_t>(got);
    }
    return bytes;
+}
+
+std::vector<uint8_t> wrapState(std::span<const uint8_t> blob, int64_t savedAtUs)
+{
+   StateEnvelope envelope{};
+   std::memcpy(envelope.magic, kEnvelopeMagic, sizeof envelope.magic);
+   envelope.version = kStateEnvelopeVersion;
+   envelope.headerLen = sizeof envelope;
+   envelope.savedAtUs = savedAtUs;
+   envelope.blobLen = blob.size();
+   std::vector<uint8_t> bytes(sizeof envelope + blob.size());
+   std::memcpy(bytes.data(), &envelope, sizeof envelope);
+   std::copy(blob.begin(), blob.end(), bytes.begin() + sizeof envelope);
+   return bytes;
+}
+
+StoredState unwrapState(std::vector<uint8_t> bytes, const std::string &path)
+{
+   if (bytes.size() < sizeof kEnvelopeMagic - 1 || std::memcmp(bytes.data(), kEnvelopeMagic, 8) != 0) {
+      return {std::move(bytes), std::nullopt};
+   }
+   StateEnvelope envelope{};
+   if (bytes.size() < sizeof envelope) {
+      throw StateFileError(path + ": saved state refused: the envelope is cut short (" + std::to_string(bytes.size()) + " bytes)");
+   }
+   std::memcpy(&envelope, bytes.data(), sizeof envelope);
+   if (envelope.version != kStateEnvelopeVersion || envelope.headerLen != sizeof envelope) {
+      throw StateFileError(path + ": saved state refused: envelope version " + std::to_string(envelope.version) +
+                           " (this tool reads version " + std::to_string(kStateEnvelopeVersion) + ")");
+   }
+   if (envelope.blobLen != bytes.size() - sizeof envelope) {
+      throw StateFileError(path + ": saved state refused: the envelope announces " + std::to_string(envelope.blobLen) +
+                           " bytes of saved state and holds " + std::to_string(bytes.size() - sizeof envelope));
+   }
+   bytes.erase(bytes.begin(), bytes.begin() + sizeof envelope);
+   const int64_t savedAtUs = envelope.savedAtUs;
+   return {std::move(bytes), savedAtUs};
+}
+
+StoredState readStoredState(const std::string &path)
+{
+   StoredState stored = unwrapState(readStateFile(path), path);
+   // An empty blob would be taken as "nothing to restore"; a state file has one.
+   if (stored.blob.empty()) {
+      throw StateFileError(path + ": empty file, no saved state");
+   }
+   return stored;
 }
 
 void writeStateFile(const std::string &path, std::span<const uint8_t> bytes, mode_t mode)

@@ -4,7 +4,9 @@
 
 #include <sys/types.h>
 
+#include <cstddef>
 #include <cstdint>
+#include <optional>
 #include <span>
 #include <stdexcept>
 #include <string>
@@ -24,8 +26,38 @@ public:
 inline constexpr uint64_t kMaxStateFileBytes = uint64_t{16} << 20;
 
 // Reads the whole file; refuses one larger than kMaxStateFileBytes before
-// reading it.
+// reading it, and anything but a regular file (a FIFO, a device, a
+// symbolic link) without waiting on it.
 std::vector<uint8_t> readStateFile(const std::string &path);
+
+// The daemon's state files carry the blob in an envelope that says when
+// it was saved, so that a restore can count the time since. Packed,
+// little-endian; the blob follows.
+struct __attribute__((packed)) StateEnvelope {
+   char magic[8];          // "swsecenv"
+   uint32_t version;       // kStateEnvelopeVersion
+   uint32_t headerLen;     // sizeof(StateEnvelope): a later version may grow it
+   int64_t savedAtUs;      // wall clock of the save, microseconds since 1970
+   uint64_t blobLen;       // the bytes after the header, all of them
+};
+static_assert(sizeof(StateEnvelope) == 32);
+static_assert(offsetof(StateEnvelope, version) == 8);
+static_assert(offsetof(StateEnvelope, headerLen) == 12);
+static_assert(offsetof(StateEnvelope, savedAtUs) == 16);
+static_assert(offsetof(StateEnvelope, blobLen) == 24);
+inline constexpr uint32_t kStateEnvelopeVersion = 1;
+
+struct StoredState {
+   std::vector<uint8_t> blob;            // the module's saved state
+   std::optional<int64_t> savedAtUs;     // none: a bare blob (swsec replay --save-state)
+};
+
+std::vector<uint8_t> wrapState(std::span<const uint8_t> blob, int64_t savedAtUs);
+// A file's bytes, enveloped or a bare blob; throws StateFileError naming
+// `path` for an envelope that is not whole or of another version.
+StoredState unwrapState(std::vector<uint8_t> bytes, const std::string &path);
+// readStateFile, then unwrapState; an empty blob is refused.
+StoredState readStoredState(const std::string &path);
 
 // Writes `bytes` to a temporary file beside `path` (with `mode` less the
 // umask), syncs it and renames it over `path`; on any failure no file is left.

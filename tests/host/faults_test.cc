@@ -5,9 +5,7 @@
 #include <gmock/gmock.h>
 
 #include <functional>
-#include <thread>
 #include <vector>
-#include <stdexcept>
 
 using ::testing::ElementsAre;
 using ::testing::IsNull;
@@ -52,40 +50,6 @@ TEST_F(FaultTest, RulesFailTheNthCallFromTheirMakingOnceOrUntilCleared)
    EXPECT_EQ(host.faults().calls("orr_HeapCreate"), 5u) << "clearing rules keeps the counts";
    orr_HeapDestroy(made[0]);
    orr_HeapDestroy(made[3]);
-}
-
-// Each thread counts in a shard of its own while it lives; threads beyond
-// the shards share one, and a shard given back keeps what was counted.
-TEST_F(FaultTest, CallsFromManyThreadsAtOnceAreCountedExactly)
-{
-   constexpr int kThreads = 24;
-   constexpr int kCallsEach = 2000;
-   for (int wave = 0; wave < 2; ++wave) {
-      std::vector<std::thread> threads;
-      for (int thread = 0; thread < kThreads; ++thread) {
-         threads.emplace_back([] {
-            uint8_t mac[6];
-            for (int call = 0; call < kCallsEach; ++call) {
-               (void)Net_StrToMac("02:00:00:00:00:01", mac);
-            }
-         });
-      }
-      for (auto &thread : threads) {
-         thread.join();
-      }
-   }
-   EXPECT_EQ(host.faults().calls("Net_StrToMac"), 2u * kThreads * kCallsEach);
-   host.faults().failOnce("Net_StrToMac", ORR_FAILURE, 2);
-   uint8_t mac[6];
-   EXPECT_EQ(Net_StrToMac("02:00:00:00:00:01", mac), ORR_OK);
-   EXPECT_EQ(Net_StrToMac("02:00:00:00:00:01", mac), ORR_FAILURE) << "rules count on from the exact total";
-}
-
-TEST_F(FaultTest, RulesForUnknownOperationsAreRefused)
-{
-   EXPECT_THROW(host.faults().failOnce("orr_HeapAlloc", ORR_NO_MEMORY), std::invalid_argument);
-   EXPECT_THROW(host.faults().failFrom("orr_HeapCreate", ORR_NO_MEMORY, 0), std::invalid_argument);
-   EXPECT_THROW((void)host.faults().calls("orr_Nothing"), std::invalid_argument);
 }
 
 orr_Status noPlexWrite(void *, void *, void *, const char *, int32_t)

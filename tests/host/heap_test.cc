@@ -97,18 +97,6 @@ TEST_F(HeapTest, LeaksAndMisuseAreReported)
           orr_HeapDestroy(second);
        },
        {"is not a live block of heap 'second'"}},
-      {"destroyed before an object made on it",
-       [](HeapTest &t) {
-          orr_HeapID heap = t.makeHeap("owner");
-          orr_LogProps props{};
-          orr_NameInitialize(&props.name, "component");
-          props.heap = heap;
-          orr_LogHandle log = nullptr;
-          ASSERT_EQ(orr_LogRegister(&props, &log), ORR_OK);
-          orr_HeapDestroy(heap);
-          orr_LogUnregister(log);
-       },
-       {"heap 'owner' destroyed before log 'component'"}},
       {"hash tables: bucket counts not a power of two, and one freed with a record linked",
        [](HeapTest &t) {
           orr_HeapID heap = t.makeHeap("hash");
@@ -133,29 +121,6 @@ TEST_F(HeapTest, LeaksAndMisuseAreReported)
          EXPECT_THAT(violations[i], HasSubstr(c.violations[i]));
       }
       EXPECT_EQ(host.heap().liveBlocks(), 0u);
-   }
-}
-
-TEST_F(HeapTest, CreateRefusesWhatItCannotHonour)
-{
-   struct Case {
-      uint32_t kind, initialSize, maximumSize, flags;
-      orr_Status expected;
-   };
-   const Case cases[] = {
-      {1, 0, 4096, 0, ORR_NOT_SUPPORTED},   // unknown kind
-      {0, 8192, 4096, 0, ORR_BAD_PARAM},    // initial above maximum
-      {0, 0, 4096, 1, ORR_BAD_PARAM},       // unknown flags
-      {0, 4096, 4096, 0, ORR_OK},
-   };
-   for (const auto &c : cases) {
-      orr_HeapProps props{.kind = c.kind, .name = {}, .module = 7, .initialSize = c.initialSize,
-                          .maximumSize = c.maximumSize, .flags = c.flags};
-      orr_HeapID heap = nullptr;
-      EXPECT_EQ(orr_HeapCreate(&props, &heap), c.expected) << c.initialSize << " " << c.flags;
-      if (heap != nullptr) {
-         orr_HeapDestroy(heap);
-      }
    }
 }
 

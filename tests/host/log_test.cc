@@ -49,28 +49,6 @@ TEST_F(LogTest, RecordsKeepSeverityComponentAndWholeTextUpToTheComponentLevel)
    EXPECT_FALSE(host.log().contains("into freed memory"));
 }
 
-TEST_F(LogTest, RegistrationRefusesASecondComponentOfTheSameNameAnExtraSettingAndAnUnknownHeap)
-{
-   orr_LogHandle log = makeLog("twice");
-   orr_LogProps props{};
-   orr_NameInitialize(&props.name, "twice");
-   orr_LogHandle second = nullptr;
-   EXPECT_EQ(orr_LogRegister(&props, &second), ORR_EXISTS);
-   EXPECT_EQ(second, nullptr);
-   orr_LogUnregister(log);
-   int extra = 0;
-   props.extra = &extra;
-   EXPECT_EQ(orr_LogRegister(&props, &second), ORR_BAD_PARAM);
-   props.extra = nullptr;
-   orr_HeapID heap = makeHeap("gone");
-   orr_HeapDestroy(heap);
-   props.heap = heap;
-   EXPECT_EQ(orr_LogRegister(&props, &second), ORR_INVALID_HANDLE);
-   props.heap = nullptr;
-   EXPECT_EQ(orr_LogRegister(&props, &second), ORR_OK) << "the name is free again";
-   orr_LogUnregister(second);
-}
-
 TEST_F(LogTest, TextHelpersCutToTheirBufferAndSayWhatTheyWrote)
 {
    char buffer[8];

@@ -290,55 +290,6 @@ TEST_F(SifraTest, IoctlRepliesAreCapturedInOrderAndMappedLengthFollowsTheDirecti
    EXPECT_EQ(mappedSeen.load(), 14u);
 }
 
-TEST_F(SifraTest, SlowPathRepliesWaitForTheTestAndCarryTheScriptedOutcomes)
-{
-   const host::FilterId filter = create();
-   slowPaths().scriptReplies(SlowPathRequestKind::Set, {ORR_TIMEOUT});
-   EXPECT_EQ(orr_SifraSetSlowPath(agent.handle, 9, onReply, &cookie, 2000), ORR_OK);
-   ASSERT_EQ(slowPaths().pendingReplies().size(), 1u);
-   EXPECT_THAT(agent.replies, IsEmpty());
-   agent.resendOnFailure = true;
-   EXPECT_EQ(slowPaths().deliverReplies(), 1u) << "the reply's own request waits for the next call";
-   ASSERT_EQ(agent.replies.size(), 1u);
-   EXPECT_EQ(agent.replies[0].record, &record);
-   EXPECT_EQ(agent.replies[0].cookie, &cookie);
-   EXPECT_EQ(agent.replies[0].status, ORR_TIMEOUT);
-   EXPECT_FALSE(host.sifra().filter(filter)->slowPathID);
-   EXPECT_EQ(slowPaths().deliverReplies(filter), 1u);
-   EXPECT_EQ(agent.replies.back().status, ORR_OK) << "the default once the script is used up";
-   EXPECT_EQ(host.sifra().filter(filter)->slowPathID, 9u);
-   ASSERT_EQ(slowPaths().requests().size(), 2u);
-   EXPECT_EQ(slowPaths().requests()[1].timeoutMs, 100);
-   host.faults().failOnce("orr_SifraClearSlowPath", ORR_BUSY);
-   EXPECT_EQ(orr_SifraClearSlowPath(agent.handle), ORR_BUSY);
-   EXPECT_EQ(host.sifra().filter(filter)->slowPathID, 9u) << "a failed clear changes nothing";
-   EXPECT_EQ(orr_SifraClearSlowPath(agent.handle), ORR_OK);
-   EXPECT_FALSE(host.sifra().filter(filter)->slowPathID);
-
-   slowPaths().setAutoDeliver(true);
-   EXPECT_EQ(orr_SifraSetSlowPath(agent.handle, 9, onReply, &cookie, 10), ORR_OK);
-   EXPECT_EQ(slowPaths().pendingReplies().size(), 1u) << "a request outside a module call waits";
-   EXPECT_EQ(slowPaths().registerSlowPath("test-agent", 1), ORR_OK);
-   EXPECT_THAT(slowPaths().pendingReplies(), IsEmpty()) << "delivered after the call into the module";
-}
-
-TEST_F(SifraTest, BusySlowPathWithdrawalsAreCalledAgainUntilTheyGo)
-{
-   EXPECT_EQ(slowPaths().registerSlowPath("test-agent", 1), ORR_OK);
-   EXPECT_EQ(slowPaths().registerSlowPath("test-agent", 2), ORR_OK);
-   EXPECT_THROW((void)slowPaths().registerSlowPath("test-agent", 1), std::invalid_argument);
-   EXPECT_THROW((void)slowPaths().registerSlowPath("other", 3), std::invalid_argument);
-   agent.busyUnregisters = 2;
-   EXPECT_EQ(slowPaths().unregisterSlowPath(1), ORR_BUSY);
-   ASSERT_EQ(slowPaths().registered().size(), 2u);
-   EXPECT_TRUE(slowPaths().registered()[0].withdrawing);
-   EXPECT_FALSE(slowPaths().registered()[1].withdrawing);
-   EXPECT_EQ(slowPaths().retryWithdrawals(), 1u);
-   EXPECT_EQ(slowPaths().retryWithdrawals(), 0u);
-   ASSERT_EQ(slowPaths().registered().size(), 1u);
-   EXPECT_EQ(slowPaths().registered()[0].id, 2u);
-}
-
 // Each breach of the host contract a module can make, as the violation it
 // must raise (or, where the host fences a buffer for AddressSanitizer, the
 // report that ends the process there).

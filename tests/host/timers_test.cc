@@ -1,13 +1,10 @@
 // Virtual time and timers: one time base for uptime and cycles, timers
 // fired in due-time order, periodic re-arming, removal (also from inside a
-// callback and while a callback runs elsewhere), sleeps that move time.
+// callback), sleeps that move time.
 #include "host_unit.h"
 
 #include <gmock/gmock.h>
 
-#include <atomic>
-#include <future>
-#include <thread>
 
 using ::testing::ElementsAre;
 using ::testing::FieldsAre;
@@ -165,43 +162,6 @@ TEST_F(TimerTest, RemoveSyncTellsWhetherTheTimerWasPendingAlsoFromItsOwnCallback
    EXPECT_EQ(host.clock().pendingTimers(), 0u);
 }
 
-TEST_F(TimerTest, RemoveSyncWaitsForACallbackRunningOnAnotherThread)
-{
-   std::promise<void> entered;
-   std::promise<void> release;
-   std::atomic<bool> finished{false};
-   auto callback = [&, released = release.get_future().share()] {
-      entered.set_value();
-      released.wait();
-      finished = true;
-   };
-   orr_Timer timer = schedule(&callback, 10, ORR_TIMER_ONE_SHOT, invoke<decltype(callback)>);
-   std::thread advancer([&] { host.clock().advance(10us); });
-   entered.get_future().wait();
-
-   std::atomic<bool> removerStarted{false};
-   bool removed = false;
-   bool finishedWhenRemoved = false;
-   std::thread remover([&] {
-      removerStarted = true;
-      removed = orr_TimerRemoveSync(timer);
-      finishedWhenRemoved = finished;
-   });
-   while (!removerStarted) {
-      std::this_thread::yield();
-   }
-   release.set_value();
-   remover.join();
-   advancer.join();
-   EXPECT_TRUE(finished);
-   // The remover either waited for the running callback, or came after it
-   // had finished and found nothing left to remove.
-   if (removed) {
-      EXPECT_TRUE(finishedWhenRemoved);
-   }
-   EXPECT_EQ(host.clock().pendingTimers(), 0u);
-}
-
 TEST_F(TimerTest, BadSchedulesAreRefusedAndAQueueGoesWithoutPendingTimers)
 {
    orr_Timer timer = 0;
@@ -219,22 +179,6 @@ TEST_F(TimerTest, BadSchedulesAreRefusedAndAQueueGoesWithoutPendingTimers)
    EXPECT_THAT(takeViolations(), ElementsAre(HasSubstr("'doomed.queue' destroyed with 1 pending timer")));
    host.clock().advance(100us);
    EXPECT_TRUE(firings.empty());
-}
-
-TEST_F(TimerTest, RealTimeFiresTimersOnAHostThread)
-{
-   host.clock().useRealTime();
-   EXPECT_FALSE(host.clock().isVirtual());
-   EXPECT_THROW(host.clock().advance(1us), std::logic_error);
-   EXPECT_GE(uptimeUs(), start) << "time does not jump back at the switch";
-   std::promise<std::thread::id> ran;
-   orr_Timer timer = 0;
-   ASSERT_EQ(orr_TimerAdd([](void *data) { static_cast<std::promise<std::thread::id> *>(data)->set_value(std::this_thread::get_id()); },
-                          &ran, 0, false, 0, &timer),
-             ORR_OK);
-   auto fired = ran.get_future();
-   ASSERT_EQ(fired.wait_for(10s), std::future_status::ready);
-   EXPECT_NE(fired.get(), std::this_thread::get_id());
 }
 
 }  // namespace

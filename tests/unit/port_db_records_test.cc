@@ -215,22 +215,6 @@ TEST_F(PortDbRecordsTest, ageing_keeps_an_entry_until_the_pass_after_its_expiry)
    expectCountersAgree();
 }
 
-TEST_F(PortDbRecordsTest, clear_by_key_skips_absent_keys_and_keeps_static_ones)
-{
-   ASSERT_EQ(add({1, 1, 1}, kDhcp), 0);
-   ASSERT_EQ(add({300, 0xab, 2}, kStatic), 0);
-   ASSERT_EQ(add({1, 3, 3}, kArp), 0);
-   notices();
-   const SwSecVmiKey keys[] = {Key{300, 0xab, 2}.raw(), Key{9, 9, 9}.raw(), Key{1, 3, 3}.raw()};
-
-   EXPECT_EQ(SwSecClearVmi(&ctx_, false, 3, keys), ORR_OK);
-
-   EXPECT_EQ(entries(), (Entries{{{1, 1, 1}, kDhcp}, {{300, 0xab, 2}, kStatic}}));
-   EXPECT_EQ(notices(), (std::vector<Notice>{removed({1, 3, 3}, 0)}));
-   EXPECT_TRUE(logged("port-7: Trying to delete a static entry: 300 02:00:00:00:00:ab 10.0.0.2"))
-      << ::testing::PrintToString(logTexts());
-}
-
 TEST_F(PortDbRecordsTest, clear_does_nothing_on_a_disabled_database)
 {
    ASSERT_EQ(add({1, 1, 1}, kArp), 0);

@@ -6,7 +6,6 @@
 #include "swsec/swsec_security_property.h"
 
 #include <cstddef>
-#include <cstdio>
 #include <cstring>
 #include <string>
 #include <vector>
@@ -56,7 +55,6 @@ INSTANTIATE_TEST_SUITE_P(
       WriteCase{"empty", {}, "Invalid security config"},
       WriteCase{"one_byte", {1}, kLength + "Got 1, expecting 26"},
       WriteCase{"version_2", record(2, 0, 26), "Invalid version. Got 2, expecting 1"},
-      WriteCase{"version_0", record(0, 0, 26), "Invalid version. Got 0, expecting 1"},
       WriteCase{"one_byte_too_many", record(1, 0, 27), kLength + "Got 27, expecting 26"},
       WriteCase{"one_byte_short", record(1, 2, 49), kLength + "Got 49, expecting 50"},
       WriteCase{"one_entry_too_many", record(1, 2, 62), kLength + "Got 62, expecting 50"},
@@ -64,39 +62,6 @@ INSTANTIATE_TEST_SUITE_P(
       WriteCase{"numStatic_without_overflow", record(1, 0xffffffffu, 26),
                 kLength + "Got 26, expecting 51539607566"}),
    [](const auto &test) { return std::string(test.param.name); });
-
-using SecurityPropertyTest = HostTest;
-
-TEST_F(SecurityPropertyTest, well_formed_records_and_reads_need_a_filter_with_a_port)
-{
-   SifraGenericFilter withoutContext{};
-   withoutContext.magic = SIFRAGENERIC_FILTER_MAGIC;
-   char expected[64];
-   std::snprintf(expected, sizeof(expected), "Filter not found: %p\n",
-                 static_cast<void *>(&withoutContext));
-
-   for (const Bytes &bytes : {record(1, 0, 26), record(1, 2, 50)}) {
-      host().log().clear();
-      const auto length = static_cast<uint32_t>(bytes.size());
-      EXPECT_EQ(SWSecPropWrite(nullptr, nullptr, bytes.data(), length), ORR_INVALID_HANDLE);
-      EXPECT_EQ(SWSecPropWrite(&withoutContext, nullptr, bytes.data(), length), ORR_INVALID_HANDLE);
-      const auto records = host().log().records();
-      ASSERT_EQ(records.size(), 2u);
-      EXPECT_EQ(records[0].text.rfind("Filter not found: ", 0), 0u) << records[0].text;
-      EXPECT_EQ(records[1].text, expected);
-   }
-
-   // Reads and polls find nothing either, and say nothing.
-   host().log().clear();
-   uint8_t buffer[64];
-   uint32_t length = 1234;
-   for (SifraGenericFilter *filter : {static_cast<SifraGenericFilter *>(nullptr), &withoutContext}) {
-      EXPECT_EQ(SWSecPropRead(filter, nullptr, buffer, sizeof(buffer)), ORR_INVALID_HANDLE);
-      EXPECT_FALSE(SWSecPropPoll(filter, nullptr, &length));
-   }
-   EXPECT_EQ(length, 1234u);
-   EXPECT_TRUE(host().log().records().empty());
-}
 
 }  // namespace
 }  // namespace swsec::testing

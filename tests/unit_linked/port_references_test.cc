@@ -2,7 +2,6 @@
 // that a test can hold a port filter map reference the way an exported
 // query or a management handler does, for as long as it likes.
 #include "support/host_fixture.h"
-#include "support/security_config.h"
 
 #include "framework/sifra_generic_filter.h"
 #include "platform/orr_module.h"
@@ -16,7 +15,6 @@ namespace {
 
 constexpr uint32_t kPortId = 11;
 constexpr const char *kAgent = "sifra-generic-tarlin-swsec";
-constexpr const char *kProperty = "sifra-generic-tarlin-swsec.security";
 
 class PortReferenceTest : public HostTest {
 protected:
@@ -39,11 +37,6 @@ protected:
          EXPECT_EQ(host().sifra().destroyFilter(filter_), ORR_OK);
       }
       HostTest::TearDown();
-   }
-
-   orr_Status configure(uint32_t features)
-   {
-      return host().sifra().writeProperty(kProperty, filter_, configBytes({.features = features}));
    }
 
    host::FilterId filter_ = 0;
@@ -70,25 +63,6 @@ TEST_F(PortReferenceTest, destroy_retries_twenty_times_ten_ms_apart_while_a_read
    SwSecReleasePortFilterMap(kPortId, ctx);
    EXPECT_EQ(host().sifra().destroyFilter(filter_), ORR_OK);
    filter_ = 0;
-}
-
-TEST_F(PortReferenceTest, a_disable_while_referenced_is_busy_and_refuses_new_readers_until_it_succeeds)
-{
-   SwSecContext *ctx = nullptr;
-   ASSERT_EQ(SwSecRefPortFilterMap(kPortId, &ctx), ORR_OK);
-
-   EXPECT_EQ(configure(SwSecFeatureBpduFilter), ORR_BUSY);
-   EXPECT_TRUE(logged("vm1.eth0: PFM busy: pfm: 11 -> "));
-   EXPECT_EQ(+ctx->config.featuresEnabled, SwSecFeatureIpDiscovery) << "features stay on";
-   SwSecContext *other = nullptr;
-   EXPECT_EQ(SwSecRefPortFilterMap(kPortId, &other), ORR_NOT_FOUND);
-
-   SwSecReleasePortFilterMap(kPortId, ctx);
-   EXPECT_EQ(configure(SwSecFeatureBpduFilter), ORR_OK);
-   EXPECT_EQ(SwSecRefPortFilterMap(kPortId, &other), ORR_NOT_FOUND) << "no map entry without IP discovery";
-   EXPECT_EQ(configure(SwSecFeatureIpDiscovery), ORR_OK);
-   ASSERT_EQ(SwSecRefPortFilterMap(kPortId, &other), ORR_OK) << "re-enabled, the port is back";
-   SwSecReleasePortFilterMap(kPortId, other);
 }
 
 }  // namespace

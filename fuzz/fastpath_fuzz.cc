@@ -37,14 +37,9 @@ Bytes configRecord(uint8_t bits)
                                        .errRateLimitPeriod = 10, .statics = {{0, kMacs[0], kIps[0]}, {100, kMacs[0], kIps[0]}}});
 }
 
-void put(Bytes &out, std::initializer_list<uint8_t> bytes)
-{
-   out.insert(out.end(), bytes);
-}
-
 void put16(Bytes &out, uint16_t value)
 {
-   put(out, {static_cast<uint8_t>(value >> 8), static_cast<uint8_t>(value)});
+   out.insert(out.end(), {static_cast<uint8_t>(value >> 8), static_cast<uint8_t>(value)});
 }
 
 Bytes frame(FuzzInput &in, uint32_t &direction)
@@ -68,7 +63,7 @@ Bytes frame(FuzzInput &in, uint32_t &direction)
       const uint8_t flags = in.byte();
       const uint8_t words = 5 + (in.byte() & 1u);
       put16(out, 0x0800);
-      put(out, {static_cast<uint8_t>(0x40 | words), 0, 0, 60, 0, 1, flags, in.byte(), 64,
+      out.insert(out.end(), {static_cast<uint8_t>(0x40 | words), 0, 0, 60, 0, 1, flags, in.byte(), 64,
                 static_cast<uint8_t>(kind == 0 ? 17 : kind == 1 ? 6 : 1), 0, 0});
       out.insert(out.end(), ip.begin(), ip.end());
       out.insert(out.end(), kIps[2].begin(), kIps[2].end());
@@ -77,7 +72,7 @@ Bytes frame(FuzzInput &in, uint32_t &direction)
    }
    case 3:
       put16(out, 0x0806);
-      put(out, {0, 1, 8, 0, 6, 4, 0, static_cast<uint8_t>(1 + (choices >> 7))});
+      out.insert(out.end(), {0, 1, 8, 0, 6, 4, 0, static_cast<uint8_t>(1 + (choices >> 7))});
       out.insert(out.end(), src.begin(), src.end());
       out.insert(out.end(), ip.begin(), ip.end());
       out.resize(out.size() + 6, 0);
@@ -85,7 +80,7 @@ Bytes frame(FuzzInput &in, uint32_t &direction)
       break;
    case 4:
       put16(out, 0x86dd);
-      put(out, {0x60, 0, 0, 0, 0, 16, static_cast<uint8_t>(in.byte() & 0x11u), 64});
+      out.insert(out.end(), {0x60, 0, 0, 0, 0, 16, static_cast<uint8_t>(in.byte() & 0x11u), 64});
       out.resize(out.size() + 32, 0xfe);
       break;
    default:

@@ -18,7 +18,7 @@ namespace {
 
 TEST(FastPathKernel, detaching_removes_only_what_attaching_made_and_pinned_maps_outlive_the_loader)
 {
-   std::string skip = bpfUnavailable().value_or("");
+   std::string skip = fastpath::unavailable().value_or("");
    std::thread([&skip] {
       if (!skip.empty()) {
          return;

@@ -40,7 +40,7 @@ class OneVerdict : public ModuleTest, public ::testing::WithParamInterface<Case>
 
 TEST_P(OneVerdict, the_fast_path_and_the_module_alone_agree_on_every_frame)
 {
-   if (const auto why = bpfUnavailable()) {
+   if (const auto why = fastpath::unavailable()) {
       GTEST_SKIP() << "BPF programs cannot be loaded here: " << *why;
    }
    Twin twin(host(), 1);

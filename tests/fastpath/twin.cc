@@ -3,6 +3,7 @@
 #include <linux/pkt_cls.h>
 
 #include <map>
+#include <set>
 #include <utility>
 
 namespace swsec::testing {
@@ -32,19 +33,6 @@ std::vector<std::map<std::string, std::string, std::less<>>> vmis(host::Host &ho
 }
 
 }  // namespace
-
-std::optional<std::string> bpfUnavailable()
-{
-   try {
-      fastpath::Program probe(fastpath::Program::Options{});
-   } catch (const fastpath::Error &error) {
-      if (error.error() == EPERM || error.error() == EACCES || error.error() == ENOSYS) {
-         return error.what();
-      }
-      throw;
-   }
-   return std::nullopt;
-}
 
 Twin::Twin(host::Host &host, uint32_t firstPort)
    : host_(host), alonePort_(firstPort), kernelPort_(firstPort + 1), program_(fastpath::Program::Options{})
@@ -86,7 +74,7 @@ bool Twin::configure(std::span<const uint8_t> record)
    // As the daemon does on a new configuration: start the mirror over.
    (void)host_.portsets().takePosted();
    mirror_->start();
-   kernelGuardDrops_ = 0;
+   guardBase_ = program_.counters()[SWSEC_FP_DROP_IP_SOURCE_GUARD];   // the module's counters restart
    return taken;
 }
 
@@ -108,30 +96,25 @@ std::string Twin::judge(std::span<const uint8_t> frame, uint32_t direction)
    const host::FrameSpec asSwitched{.bytes = untagged.bytes, .vlanId = untagged.vlan.value_or(0)};
    const bool passedAlone = host_.sifra().processPackets(alone_, direction, {asSwitched}).kept.size() == 1;
 
-   const uint64_t guardBefore = program_.counters()[SWSEC_FP_DROP_IP_SOURCE_GUARD];
    const int action = program_.testRun(frame, direction).action;
    std::vector<fastpath::Punt> punts;
    program_.drainPunts([&punts](fastpath::Punt &&punt) { punts.push_back(std::move(punt)); });
+   if ((action == TC_ACT_STOLEN) != (punts.size() == 1) ||
+       (!punts.empty() && (punts[0].bytes != untagged.bytes || punts[0].vlan != asSwitched.vlanId ||
+                           punts[0].direction != direction || punts[0].portId != kernelPort_))) {
+      return "action " + std::to_string(action) + " with " + std::to_string(punts.size()) +
+             " punt records, or not the frame as switched";
+   }
    bool passedKernel = action == TC_ACT_OK;
-   std::string how = "decided in the kernel (action " + std::to_string(action) + ")";
    if (action == TC_ACT_STOLEN) {
-      if (punts.size() != 1 || punts[0].bytes != untagged.bytes || punts[0].vlan != asSwitched.vlanId ||
-          punts[0].direction != direction || punts[0].portId != kernelPort_) {
-         return "punted, but " + std::to_string(punts.size()) + " records do not carry the frame as switched";
-      }
-      how = "punted (" + std::string(fastpath::reasonName(punts[0].reason)) + ")";
       const host::FrameSpec punted{.bytes = punts[0].bytes, .vlanId = punts[0].vlan};
       passedKernel = host_.sifra().processPackets(kernel_, direction, {punted}).kept.size() == 1;
       mirror_->follow(host_.portsets().takePosted());
-   } else {
-      kernelGuardDrops_ += program_.counters()[SWSEC_FP_DROP_IP_SOURCE_GUARD] - guardBefore;
-      if (!punts.empty()) {
-         return how + ", and punted too";
-      }
    }
    if (passedAlone != passedKernel) {
       return std::string("the module alone ") + (passedAlone ? "passed" : "dropped") + " it, the fast path " +
-             (passedKernel ? "passed" : "dropped") + " it: " + how;
+             (passedKernel ? "passed" : "dropped") + " it, " +
+             (punts.empty() ? "in the kernel" : "punted: " + std::string(fastpath::reasonName(punts[0].reason)));
    }
    return counters();
 }
@@ -141,8 +124,8 @@ std::string Twin::counters()
 {
    const auto alone = node(host_, "/security/" + std::to_string(alonePort_) + "/featureSummary");
    auto kernel = node(host_, "/security/" + std::to_string(kernelPort_) + "/featureSummary");
-   if (kernelGuardDrops_ != 0) {
-      kernel["ipSrcGuardDropCnt"] = std::to_string(std::stoull(kernel["ipSrcGuardDropCnt"]) + kernelGuardDrops_);
+   if (const uint64_t drops = program_.counters()[SWSEC_FP_DROP_IP_SOURCE_GUARD] - guardBase_; drops != 0) {
+      kernel["ipSrcGuardDropCnt"] = std::to_string(std::stoull(kernel["ipSrcGuardDropCnt"]) + drops);
    }
    for (const auto &[name, value] : alone) {
       if (kernel[name] != value) {
@@ -157,13 +140,10 @@ std::string Twin::databases()
    if (vmis(host_, alonePort_) != vmis(host_, kernelPort_)) {
       return "the two port databases differ";
    }
-   auto inMap = program_.bindings();
-   auto inModule = fastpath::readPort(host_, kernel_, kernelPort_).bindings;
-   std::sort(inMap.begin(), inMap.end());
-   std::sort(inModule.begin(), inModule.end());
-   if (inMap != inModule) {
-      return "the binding map (" + std::to_string(inMap.size()) + ") is not the port database (" +
-             std::to_string(inModule.size()) + ")";
+   const auto inMap = program_.bindings();
+   const auto inModule = fastpath::readPort(host_, kernel_, kernelPort_).bindings;
+   if (std::set(inMap.begin(), inMap.end()) != std::set(inModule.begin(), inModule.end())) {
+      return "the binding map is not the kernel port's database";
    }
    return {};
 }

@@ -13,9 +13,6 @@
 
 namespace swsec::testing {
 
-// Why a BPF program cannot be loaded here (no privilege, no BPF), or none.
-std::optional<std::string> bpfUnavailable();
-
 class Twin {
 public:
    // The host has the module loaded; the ports get IDs `firstPort` and the next.
@@ -42,7 +39,7 @@ private:
    host::FilterId alone_ = 0;
    host::FilterId kernel_ = 0;
    std::optional<fastpath::Mirror> mirror_;
-   uint64_t kernelGuardDrops_ = 0;
+   uint64_t guardBase_ = 0;   // the program's source guard drops when the module's counters were cleared
 };
 
 }  // namespace swsec::testing

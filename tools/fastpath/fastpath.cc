@@ -187,6 +187,19 @@ Untagged takeOuterTag(std::span<const uint8_t> frame)
    return out;
 }
 
+std::optional<std::string> unavailable()
+{
+   try {
+      const Program probe(Program::Options{});
+   } catch (const Error &error) {
+      if (error.error() == EPERM || error.error() == EACCES || error.error() == ENOSYS || error.error() == EOPNOTSUPP) {
+         return error.what();
+      }
+      throw;
+   }
+   return std::nullopt;
+}
+
 Program::Program(const Options &options) : pinDir_(options.pinDir)
 {
    installLibbpfLog();

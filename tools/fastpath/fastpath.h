@@ -38,6 +38,11 @@ private:
 // The program's object file as built, embedded in this library.
 std::span<const uint8_t> embeddedObject();
 
+// Why this kernel fast path cannot be had here, for the user-space data
+// path to say so: the program cannot be loaded for want of privilege or of
+// BPF. None when it loads; any other failure is an Error.
+std::optional<std::string> unavailable();
+
 // Where libbpf's warnings and information go (its debug output is dropped),
 // one message a call without its final newline; standard error until set.
 // The kernel's refusal to make a clsact qdisc that exists already, which

@@ -287,8 +287,8 @@ sw_ctl log --json | grep -q "keeps its configuration" || fail "ctl log lacks the
 step "a release removes the binding"
 in_ns "$vm1" dhclient -r -pf "$work/dhclient.pid" -lf "$work/dhclient.leases" -sf "$work/dhclient-script" eth0
 wait_for 5 sh -c "! $swsec ctl --ctl $ctl bindings vm1 --json | grep -q '\"$vm1_ip\"'" || fail "binding kept after release"
-wait_for 5 grep -q "\"event\":\"added\".*\"ip\":\"$vm1_ip\"" "$work/watch.log" || fail "watch missed the addition: $(cat "$work/watch.log")"
-wait_for 5 grep -q "\"event\":\"removed\".*\"ip\":\"$vm1_ip\"" "$work/watch.log" || fail "watch missed the removal"
+wait_for 5 grep -q "\"ip\":\"$vm1_ip\".*\"name\":\"portdb.entry.added\"" "$work/watch.log" || fail "watch missed the addition: $(cat "$work/watch.log")"
+wait_for 5 grep -q "\"ip\":\"$vm1_ip\".*\"name\":\"portdb.entry.removed\"" "$work/watch.log" || fail "watch missed the removal"
 
 step "clear: one binding by VLAN, MAC and IP; a malformed key is refused"
 sw_ctl clear vm2 0 "$vm2_mac" "$vm2_ip" >/dev/null || fail "clearing one binding was refused"

@@ -184,7 +184,7 @@ TEST_F(CtlServerTest, log_follow_and_watch_stream_what_comes_after_the_recent_li
    watch.send("{\"command\": \"watch\"}\n");
    EXPECT_TRUE(nlohmann::json::parse(watch.line())["result"].empty());
 
-   events_.notification({{"port", "vm1"}, {"event", "added"}, {"ip", "192.0.2.5"}});
+   events_.notification({{"port", "vm1"}, {"name", "portdb.entry.added"}, {"ip", "192.0.2.5"}});
    events_.log("error", "module", "after");
    EXPECT_EQ(nlohmann::json::parse(watch.line())["ip"], "192.0.2.5");
    EXPECT_EQ(nlohmann::json::parse(log.line())["text"], "after");

@@ -4,6 +4,7 @@
 // the tool writes, shows and refuses them.
 #include "replay_support.h"
 
+#include "live/inline.h"
 #include "replay/engine.h"
 #include "session/saved_state_format.h"
 #include "session/state_file.h"
@@ -160,8 +161,8 @@ protected:
 TEST_F(StateTool, a_saved_state_is_shown_and_restored_by_the_tool)
 {
    const std::string state = (dir_.path() / "port.state").string();
-   const ToolRun saved = runTool({"replay", "--vm-mac", "02:00:5e:c0:00:01", "--config", enforcing(), "--save-state",
-                                  state, example()});
+   const ToolRun saved = runTool({"replay", "--json", "--vm-mac", "02:00:5e:c0:00:01", "--config", enforcing(),
+                                  "--save-state", state, example()});
    ASSERT_EQ(saved.status, 0) << saved.err;
 
    const ToolRun shown = runTool({"state", "show", "--json", state});
@@ -173,6 +174,22 @@ TEST_F(StateTool, a_saved_state_is_shown_and_restored_by_the_tool)
    EXPECT_EQ(doc["bindings"][0]["method"], "DHCP Snooping");
    EXPECT_EQ(doc["bindings"][0]["ip"], "192.0.2.101");
    EXPECT_EQ(doc["counters"]["ipSrcGuardDropCnt"], 2);
+
+   // One binding, one shape: in replay's port database, in the saved state
+   // shown, and in ctl's reply for the same port state (each may add its own).
+   replay::ReplayOptions options;
+   options.capturePath = example();
+   options.vmMac = session::parseMac("02:00:5e:c0:00:01", "test");
+   options.config = session::loadConfigFile(enforcing());
+   json ctl = live::bindingsReply("vm", replay::runReplay(options).ports[0])[0];
+   json shownBinding = doc["bindings"][0];
+   EXPECT_EQ(ctl.value("port", ""), "vm");
+   EXPECT_FALSE(shownBinding["clientId"].is_null());
+   ctl.erase("port");
+   shownBinding.erase("clientId");
+   EXPECT_EQ(json::parse(saved.out)["ports"][0]["portDb"][0], shownBinding);
+   EXPECT_EQ(ctl, shownBinding);
+   EXPECT_TRUE(shownBinding["timeRemaining"].is_number() && shownBinding["clientIdLen"].is_number());
 
    const ToolRun text = runTool({"state", "show", state});
    EXPECT_EQ(text.status, 0);

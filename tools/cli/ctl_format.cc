@@ -1,6 +1,8 @@
 // Text forms of the control replies.
 #include "cli/ctl_format.h"
 
+#include "session/serializer.h"
+
 #include <cstdio>
 #include <ctime>
 #include <sstream>
@@ -22,7 +24,7 @@ std::string field(const nlohmann::json &object, const char *key)
       return "-";
    }
    const auto &value = object[key];
-   return value.is_string() ? value.get<std::string>() : value.dump();
+   return value.is_string() ? value.get<std::string>() : value.is_null() ? "-" : value.dump();
 }
 
 std::string timeText(const nlohmann::json &object)
@@ -38,29 +40,7 @@ std::string timeText(const nlohmann::json &object)
    return std::string(text) + fraction;
 }
 
-// Columns as wide as their widest cell.
-std::string table(const std::vector<std::vector<std::string>> &rows)
-{
-   std::vector<size_t> widths;
-   for (const auto &row : rows) {
-      widths.resize(std::max(widths.size(), row.size()));
-      for (size_t i = 0; i < row.size(); ++i) {
-         widths[i] = std::max(widths[i], row[i].size());
-      }
-   }
-   std::string text;
-   for (const auto &row : rows) {
-      std::string line;
-      for (size_t i = 0; i < row.size(); ++i) {
-         line += row[i];
-         if (i + 1 < row.size()) {
-            line += std::string(widths[i] - row[i].size() + 2, ' ');
-         }
-      }
-      text += line + "\n";
-   }
-   return text;
-}
+using session::textTable;
 
 // A label value with backslash, quote and newline escaped as the format says.
 std::string labelValue(const std::string &value)
@@ -95,17 +75,17 @@ std::string humanText(const std::string &command, const nlohmann::json &result)
          rows.push_back({field(port, "name"), field(port, "interface"), field(port, "bridge"), field(port, "portId"),
                          state, field(port, "failMode"), config.empty() ? "(defaults)" : config});
       }
-      return table(rows);
+      return textTable(rows);
    }
    if (command == "bindings") {
       std::vector<std::vector<std::string>> rows{
-         {"PORT", "VLAN", "MAC", "IP", "METHOD", "REMAINING", "SERVER", "LEASE"}};
+         {"PORT", "VLAN", "MAC", "IP", "METHOD", "REMAINING (S)", "SERVER", "LEASE (S)"}};
       for (const auto &entry : result) {
          rows.push_back({field(entry, "port"), field(entry, "vlan"), field(entry, "mac"), field(entry, "ip"),
                          field(entry, "method"), field(entry, "timeRemaining"), field(entry, "serverIp"),
                          field(entry, "leaseTime")});
       }
-      return table(rows) + std::to_string(result.size()) + " binding(s)\n";
+      return textTable(rows) + std::to_string(result.size()) + " binding(s)\n";
    }
    if (command == "summary") {
       return result.value("text", "");
@@ -127,7 +107,7 @@ std::string humanText(const std::string &command, const nlohmann::json &result)
                                         port.value("sendErrors", 0ULL)),
                          drops.empty() ? "-" : drops});
       }
-      return table(rows);
+      return textTable(rows);
    }
    if (command == "clear") {
       return "cleared " + std::string(result.value("cleared", "") == "one" ? "the binding" : "every binding") +
@@ -149,7 +129,8 @@ std::string humanText(const std::string &command, const nlohmann::json &result)
 std::string eventText(const std::string &command, const nlohmann::json &event)
 {
    if (command == "watch") {
-      return timeText(event) + " " + field(event, "port") + " " + field(event, "event") + " vlan " +
+      const std::string name = field(event, "name");
+      return timeText(event) + " " + field(event, "port") + " " + name.substr(name.rfind('.') + 1) + " vlan " +
              field(event, "vlan") + " " + field(event, "mac") + " " + field(event, "ip") +
              (event.value("authoritative", false) ? " (authoritative)" : "") + "\n";
    }

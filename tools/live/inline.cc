@@ -5,6 +5,7 @@
 #include "session/error.h"
 #include "session/port_state.h"
 #include "session/saved_state_format.h"
+#include "session/serializer.h"
 #include "session/state_file.h"
 
 #include <sys/stat.h>
@@ -170,10 +171,10 @@ void InlineDaemon::pump()
          ports_[index].stateDirty = true;
       }
       const std::string name = index < ports_.size() ? ports_[index].portSpec.name : std::to_string(note.portID);
-      const std::string event = note.name.substr(note.name.rfind('.') + 1);
-      events_.notification({{"time", wallClock()}, {"port", name},          {"event", event},
-                            {"vlan", note.vlan},   {"mac", note.mac},        {"ip", note.ip},
-                            {"authoritative", note.authoritative}});
+      nlohmann::json event = session::notificationJson(note);
+      event["time"] = wallClock();
+      event["port"] = name;
+      events_.notification(std::move(event));
    }
    for (Port &port : ports_) {
       if (port.guarded && port.guarded->vanished() && port.guarded->running()) {
@@ -276,23 +277,20 @@ nlohmann::json InlineDaemon::portsJson()
    return list;
 }
 
-nlohmann::json InlineDaemon::bindingsJson(const Port &port)
+nlohmann::json bindingsReply(const std::string &port, const session::PortState &state)
 {
    nlohmann::json list = nlohmann::json::array();
-   const session::PortState state = session_.readState(port.guarded->options().portID);
    for (const auto &entry : state.portDb) {
-      list.push_back({{"port", port.portSpec.name},
-                      {"vlan", entry.vlan},
-                      {"mac", entry.mac},
-                      {"ip", entry.ip},
-                      {"method", entry.method},
-                      {"timeRemaining", entry.timeRemaining},
-                      {"chaddr", entry.chaddr},
-                      {"clientIdLen", entry.clientIdLen},
-                      {"serverIp", entry.serverIp},
-                      {"leaseTime", entry.leaseTime}});
+      nlohmann::json binding = session::bindingJson(entry);
+      binding["port"] = port;
+      list.push_back(std::move(binding));
    }
    return list;
+}
+
+nlohmann::json InlineDaemon::bindingsJson(const Port &port)
+{
+   return bindingsReply(port.portSpec.name, session_.readState(port.guarded->options().portID));
 }
 
 nlohmann::json InlineDaemon::countersJson(Port &port)
@@ -354,7 +352,9 @@ nlohmann::json InlineDaemon::handle(const nlohmann::json &request)
       if (!state.featureSummary) {
          return {{"port", port.portSpec.name}, {"fields", nullptr}, {"text", "(the port has no IP discovery)\n"}};
       }
-      return {{"port", port.portSpec.name}, {"fields", *state.featureSummary}, {"text", state.featureSummaryText}};
+      return {{"port", port.portSpec.name},
+              {"fields", session::featureSummaryJson(state)},
+              {"text", state.featureSummaryText}};
    }
    if (command == "counters") {
       nlohmann::json list = nlohmann::json::array();

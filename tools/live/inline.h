@@ -34,6 +34,9 @@ struct InlineOptions {
    std::string stateDir;   // "" keeps no state; else DIR/<port name>.state across restarts
 };
 
+// A port's "bindings" reply: its port database entries, each with "port".
+nlohmann::json bindingsReply(const std::string &port, const session::PortState &state);
+
 // The ports and the control handler over them; the daemon's main loop
 // owns one.
 class InlineDaemon final : public CtlHandler {

@@ -105,20 +105,6 @@ std::string describeArp(std::span<const uint8_t> arp)
 
 }  // namespace
 
-std::string macText(const uint8_t *mac)
-{
-   std::array<char, 18> text{};
-   std::snprintf(text.data(), text.size(), "%02x:%02x:%02x:%02x:%02x:%02x", mac[0], mac[1], mac[2], mac[3],
-                 mac[4], mac[5]);
-   return text.data();
-}
-
-std::string ipText(const uint8_t *ip)
-{
-   return std::to_string(ip[0]) + "." + std::to_string(ip[1]) + "." + std::to_string(ip[2]) + "." +
-          std::to_string(ip[3]);
-}
-
 uint16_t frameVlan(std::span<const uint8_t> bytes)
 {
    if (bytes.size() >= 18 && be16(bytes, 12) == kEtherVlan) {

@@ -2,6 +2,8 @@
 // BPDU, ...), read within the bytes given.
 #pragma once
 
+#include "session/serializer.h"
+
 #include <cstdint>
 #include <span>
 #include <string>
@@ -22,8 +24,8 @@ struct FrameFacts {
 FrameFacts frameFacts(std::span<const uint8_t> bytes);
 
 // "02:00:5e:c0:00:01" and "192.0.2.1" from raw bytes.
-std::string macText(const uint8_t *mac);
-std::string ipText(const uint8_t *ip);
+using session::ipText;
+using session::macText;
 
 // The 802.1Q VLAN ID of a tagged frame, 0 for an untagged one.
 uint16_t frameVlan(std::span<const uint8_t> bytes);

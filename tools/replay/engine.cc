@@ -527,12 +527,7 @@ void Run::execute()
    collectNotifications();
    warnUnseenMacs(*router_);
    for (Port &port : ports_) {
-      session::PortState state = session_->readState(port.id);
-      PortResult &shown = result_.ports[port.id - 1];
-      shown.featureSummary = std::move(state.featureSummary);
-      shown.featureSummaryText = std::move(state.featureSummaryText);
-      shown.counters = std::move(state.counters);
-      shown.portDb = std::move(state.portDb);
+      static_cast<session::PortState &>(result_.ports[port.id - 1]) = session_->readState(port.id);
    }
    drainLog();
    if (!options_.saveStatePath.empty()) {

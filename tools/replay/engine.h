@@ -124,17 +124,13 @@ struct LogLine {
    uint64_t repeated = 0;     // further identical lines that followed it
 };
 
-struct PortResult {
+// A port's frame totals and notifications, and its nodes as read at the end.
+struct PortResult : session::PortState {
    std::string name;
    std::vector<std::string> macs;
    uint64_t seen = 0;         // frames from or to one of its MACs
    // [direction][0 passed, 1 dropped], direction indexed by kDirToVm/kDirFromVm.
    std::array<std::array<uint64_t, 2>, 3> totals{};
-   // The "featureSummary" node's fields, when the port has IP discovery.
-   std::optional<std::map<std::string, std::string, std::less<>>> featureSummary;
-   std::string featureSummaryText;
-   std::map<std::string, uint64_t, std::less<>> counters;   // drop counters the port keeps
-   std::vector<session::PortDbEntry> portDb;
    std::vector<Notification> notifications;
 };
 

@@ -5,6 +5,7 @@
 
 #include "replay/capture.h"
 #include "replay/report.h"
+#include "session/serializer.h"
 #include "session/json_text.h"
 
 #include <charconv>
@@ -14,22 +15,6 @@ namespace swsec::replay {
 namespace {
 
 using nlohmann::json;
-
-// A rendered node value: a leading count (with its unit dropped, as in
-// "118 sec") is a number, "N/A" is null, anything else stays text.
-json nodeValue(const std::string &text)
-{
-   if (text == "N/A") {
-      return nullptr;
-   }
-   uint64_t number = 0;
-   const char *end = text.data() + text.size();
-   const auto [stop, error] = std::from_chars(text.data(), end, number);
-   if (error == std::errc{} && (stop == end || std::string_view(stop, end) == " sec")) {
-      return number;
-   }
-   return text;
-}
 
 json totalsJson(const PortResult &port)
 {
@@ -45,38 +30,16 @@ json portJson(const PortResult &port)
    doc["totals"] = totalsJson(port);
    json portDb = json::array();
    for (const auto &e : port.portDb) {
-      portDb.push_back({{"vlan", e.vlan},
-                        {"mac", e.mac},
-                        {"ip", e.ip},
-                        {"method", e.method},
-                        {"timeRemaining", nodeValue(e.timeRemaining)},
-                        {"chaddr", nodeValue(e.chaddr)},
-                        {"clientIdLen", nodeValue(e.clientIdLen)},
-                        {"serverIp", nodeValue(e.serverIp)},
-                        {"leaseTime", nodeValue(e.leaseTime)}});
+      portDb.push_back(session::bindingJson(e));
    }
    doc["portDb"] = std::move(portDb);
-   doc["counters"] = json::object();
-   for (const auto &[name, value] : port.counters) {
-      doc["counters"][name] = value;
-   }
-   if (port.featureSummary) {
-      json summary = json::object();
-      for (const auto &[name, value] : *port.featureSummary) {
-         summary[name] = nodeValue(value);
-      }
-      doc["featureSummary"] = std::move(summary);
-   } else {
-      doc["featureSummary"] = nullptr;
-   }
+   doc["counters"] = session::countersJson(port.counters);
+   doc["featureSummary"] = session::featureSummaryJson(port);
    json notes = json::array();
    for (const auto &n : port.notifications) {
-      notes.push_back({{"afterFrame", n.afterFrame},
-                       {"name", n.name},
-                       {"vlan", n.vlan},
-                       {"mac", n.mac},
-                       {"ip", n.ip},
-                       {"authoritative", n.authoritative}});
+      json note = session::notificationJson(n);
+      note["afterFrame"] = n.afterFrame;
+      notes.push_back(std::move(note));
    }
    doc["notifications"] = std::move(notes);
    return doc;

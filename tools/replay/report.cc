@@ -4,6 +4,7 @@
 #include "replay/report.h"
 
 #include "replay/capture.h"
+#include "session/serializer.h"
 
 #include <cstdio>
 #include <iomanip>
@@ -72,14 +73,13 @@ void printPort(std::ostream &out, const PortResult &port, bool named)
 
    out << "\nport database (" << port.portDb.size() << " entries)\n";
    if (!port.portDb.empty()) {
-      out << "  VLAN  MAC                IP               method          remaining  chaddr             "
-             "clientIdLen  server           lease\n";
+      std::vector<std::vector<std::string>> rows{
+         {"VLAN", "MAC", "IP", "method", "remaining", "chaddr", "clientIdLen", "server", "lease"}};
       for (const auto &e : port.portDb) {
-         out << "  " << std::left << std::setw(6) << e.vlan << std::setw(19) << e.mac << std::setw(17) << e.ip
-             << std::setw(16) << e.method << std::setw(11) << e.timeRemaining << std::setw(19) << e.chaddr
-             << std::setw(13) << e.clientIdLen << std::setw(17) << e.serverIp << e.leaseTime << std::right
-             << "\n";
+         rows.push_back({std::to_string(e.vlan), e.mac, e.ip, e.method, e.timeRemaining, e.chaddr, e.clientIdLen,
+                         e.serverIp, e.leaseTime});
       }
+      out << session::textTable(rows, "  ");
    }
 
    out << "\nnotifications (" << port.notifications.size() << ")\n";

@@ -3,10 +3,9 @@
 #include "session/ports_session.h"
 
 #include "session/error.h"
+#include "session/serializer.h"
 
 #include "contract/notification.h"
-
-#include <arpa/inet.h>
 
 #include <algorithm>
 #include <charconv>
@@ -16,19 +15,6 @@
 namespace swsec::session {
 
 namespace {
-
-std::string macText(const uint8_t *mac)
-{
-   char text[18];
-   std::snprintf(text, sizeof text, "%02x:%02x:%02x:%02x:%02x:%02x", mac[0], mac[1], mac[2], mac[3], mac[4], mac[5]);
-   return text;
-}
-
-std::string ipText(const uint8_t *ip)
-{
-   char text[INET_ADDRSTRLEN];
-   return inet_ntop(AF_INET, ip, text, sizeof text) != nullptr ? std::string(text) : std::string();
-}
 
 std::string portPath(uint32_t portID)
 {

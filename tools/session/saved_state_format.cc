@@ -2,6 +2,8 @@
 // checked against the blob's length first.
 #include "session/saved_state_format.h"
 
+#include "session/serializer.h"
+
 #include "contract/config_record.h"
 
 #include <algorithm>
@@ -41,18 +43,6 @@ std::array<uint8_t, N> bytesAt(const uint8_t *bytes)
    std::array<uint8_t, N> out{};
    std::memcpy(out.data(), bytes, N);
    return out;
-}
-
-std::string macText(const std::array<uint8_t, 6> &mac)
-{
-   char text[18];
-   std::snprintf(text, sizeof text, "%02x:%02x:%02x:%02x:%02x:%02x", mac[0], mac[1], mac[2], mac[3], mac[4], mac[5]);
-   return text;
-}
-
-std::string ipText(const std::array<uint8_t, 4> &ip)
-{
-   return number(ip[0]) + "." + number(ip[1]) + "." + number(ip[2]) + "." + number(ip[3]);
 }
 
 std::string hexText(const std::vector<uint8_t> &bytes)
@@ -325,18 +315,22 @@ nlohmann::json savedStateJson(const SavedPortState &state)
    doc["counters"] = std::move(counters);
    json bindings = json::array();
    for (const SavedBinding &b : state.bindings) {
-      json entry = {{"vlan", b.vlan},
-                    {"mac", macText(b.mac)},
-                    {"ip", ipText(b.ip)},
-                    {"method", methodName(b.method)},
-                    {"timeRemaining", b.method == kStatic ? json(nullptr) : json(b.timeRemaining)}};
-      if (b.method == kDhcpSnooping) {
-         entry["chaddr"] = macText(b.chaddr);
-         entry["clientId"] = hexText(b.clientId);
-         entry["serverIp"] = ipText(b.serverIp);
-         entry["leaseTime"] = b.leaseTime;
-      }
-      bindings.push_back(std::move(entry));
+      // As the port's "vmi" node would show it once restored, plus the
+      // client identifier the node gives only the length of.
+      const bool dhcp = b.method == kDhcpSnooping;
+      PortDbEntry entry;
+      entry.vlan = b.vlan;
+      entry.mac = macText(b.mac.data());
+      entry.ip = ipText(b.ip.data());
+      entry.method = methodName(b.method);
+      entry.timeRemaining = b.method == kStatic ? "N/A" : std::to_string(b.timeRemaining) + " sec";
+      entry.chaddr = dhcp ? macText(b.chaddr.data()) : "N/A";
+      entry.clientIdLen = dhcp ? std::to_string(b.clientId.size()) : "N/A";
+      entry.serverIp = dhcp ? ipText(b.serverIp.data()) : "N/A";
+      entry.leaseTime = dhcp ? std::to_string(b.leaseTime) : "N/A";
+      json shown = bindingJson(entry);
+      shown["clientId"] = dhcp ? json(hexText(b.clientId)) : json(nullptr);
+      bindings.push_back(std::move(shown));
    }
    doc["bindings"] = std::move(bindings);
    return doc;
@@ -369,12 +363,12 @@ void printSavedState(std::ostream &out, const SavedPortState &state)
    }
    out << "\nBindings (" << state.bindings.size() << ")\n";
    for (const SavedBinding &b : state.bindings) {
-      out << "   vlan " << b.vlan << "  " << macText(b.mac) << "  " << ipText(b.ip) << "  " << methodName(b.method);
+      out << "   vlan " << b.vlan << "  " << macText(b.mac.data()) << "  " << ipText(b.ip.data()) << "  " << methodName(b.method);
       if (b.method != kStatic) {
          out << "  " << b.timeRemaining << " s left";
       }
       if (b.method == kDhcpSnooping) {
-         out << "  chaddr " << macText(b.chaddr) << "  server " << ipText(b.serverIp) << "  lease " << b.leaseTime
+         out << "  chaddr " << macText(b.chaddr.data()) << "  server " << ipText(b.serverIp.data()) << "  lease " << b.leaseTime
              << " s  client id " << (b.clientId.empty() ? std::string("none") : hexText(b.clientId));
       }
       out << "\n";

@@ -280,7 +280,7 @@ TEST(ReplayReport, the_readable_report_shows_the_binding_the_spoofs_and_the_log)
    for (const char *line : {"  from-vm          8        4\n",
                             "dropped #16  10.344753  from-vm  DAI: 02:00:5e:c0:00:01 > ff:ff:ff:ff:ff:ff ARP reply 192.0.2.1 is at 02:00:5e:c0:00:01\n",
                             "dropped #14  10.144753  from-vm  IP source guard: ",
-                            "  0     02:00:5e:c0:00:01  192.0.2.101      DHCP Snooping",
+                            "  0     02:00:5e:c0:00:01  192.0.2.101  DHCP Snooping  118 sec",
                             "after #4     portdb.entry.added    VLAN 0    02:00:5e:c0:00:01  192.0.2.101      authoritative\n",
                             "   DAI drop count           : 2\n",
                             "featuresEnabled = 0x1f: Configured successfully\n"}) {

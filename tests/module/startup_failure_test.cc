@@ -81,25 +81,6 @@ TEST_P(StartupFaultTest, load_fails_with_the_steps_message_and_leaves_nothing_be
 INSTANTIATE_TEST_SUITE_P(EachStep, StartupFaultTest, ::testing::ValuesIn(startupFaults()),
                          [](const auto &test) { return std::string(test.param.name); });
 
-// The security property only serves the agent: the module loads without it.
-using PropertyFaultTest = HostTest;
-
-TEST_F(PropertyFaultTest, load_succeeds_without_the_security_property)
-{
-   host().faults().failOnce("orr_SifraPropertyRegister", kInjected);
-
-   ASSERT_EQ(host().load(), 0);
-   EXPECT_TRUE(loggedWithPrefix(host(),
-                                kAgent + ": Failed to register security property handler " +
-                                   statusText(kInjected),
-                                ORR_LOG_ERROR));
-   EXPECT_TRUE(host().sifra().properties().empty());
-   EXPECT_EQ(host().sifra().fastPaths().size(), 1u);
-
-   EXPECT_EQ(host().unload(), ORR_OK);
-   EXPECT_FALSE(logged("Unregistering security property handler"));
-}
-
 // Fails the 1st, 2nd, ... call of one host operation during the load until
 // the load no longer reaches it. Every failure logs an error and leaves
 // nothing behind; only a failed property keeps the load going.

@@ -34,12 +34,9 @@ void append(Bytes &out, const Bytes &tail)
 
 uint16_t checksum(const uint8_t *data, size_t length)
 {
-   uint32_t sum = 0;
+   uint32_t sum = 0;   // over an even length (the IPv4 header)
    for (size_t i = 0; i + 1 < length; i += 2) {
       sum += static_cast<uint32_t>(data[i] << 8 | data[i + 1]);
-   }
-   if (length % 2 != 0) {
-      sum += static_cast<uint32_t>(data[length - 1] << 8);
    }
    while (sum >> 16) {
       sum = (sum & 0xffff) + (sum >> 16);
@@ -103,7 +100,7 @@ Bytes ethernet(const EthernetHeader &header, const Bytes &payload)
    return out;
 }
 
-Bytes arpPayload(const Arp &arp)
+static Bytes arpPayload(const Arp &arp)
 {
    Bytes out;
    put16(out, arp.hardwareType);
@@ -125,9 +122,8 @@ Bytes ipv4(const Ipv4Header &header, const Bytes &payload)
    out.push_back(0);
    put16(out, static_cast<uint16_t>(20 + payload.size()));
    put16(out, header.id);
-   put16(out, static_cast<uint16_t>((header.moreFragments ? 0x2000 : 0) |
-                                    (header.fragmentOffset & 0x1fff)));
-   out.push_back(header.ttl);
+   put16(out, static_cast<uint16_t>(header.fragmentOffset & 0x1fff));
+   out.push_back(64);   // TTL
    out.push_back(header.protocol);
    put16(out, 0);
    putArray(out, header.src.bytes);
@@ -157,13 +153,13 @@ Bytes udp(const UdpHeader &header, const Bytes &payload)
    Bytes out;
    put16(out, header.srcPort);
    put16(out, header.dstPort);
-   put16(out, header.lengthOverride.value_or(static_cast<uint16_t>(8 + payload.size())));
+   put16(out, static_cast<uint16_t>(8 + payload.size()));
    put16(out, 0);  // no checksum, as IPv4 allows
    append(out, payload);
    return out;
 }
 
-Bytes dhcpPayload(const Dhcp &dhcp)
+static Bytes dhcpPayload(const Dhcp &dhcp)
 {
    Bytes out;
    out.push_back(dhcp.op);
@@ -246,14 +242,12 @@ Bytes udp6Frame(const Udp6Frame &frame)
 
 Bytes bpduFrame(const Mac &src, const Mac &dst)
 {
-   Bytes llc{0x42, 0x42, 0x03};
-   Bytes bpdu(35, 0);  // protocol 0, version 0, type 0 (configuration), fields zero
-   llc.insert(llc.end(), bpdu.begin(), bpdu.end());
    Bytes out;
    putArray(out, dst.bytes);
    putArray(out, src.bytes);
-   put16(out, static_cast<uint16_t>(llc.size()));  // 802.3 length, not an ethertype
-   append(out, llc);
+   put16(out, 38);   // an 802.3 length, not an ethertype: LLC, then a configuration BPDU of zeros
+   append(out, {0x42, 0x42, 0x03});
+   out.resize(out.size() + 35, 0);
    return out;
 }
 

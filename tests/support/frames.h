@@ -59,14 +59,11 @@ struct Arp {
    uint8_t hardwareLength = 6;
    uint8_t protocolLength = 4;
 };
-Bytes arpPayload(const Arp &arp);
 
 struct Ipv4Header {
    Ip4 src;
    Ip4 dst;
    uint8_t protocol = 17;
-   uint8_t ttl = 64;
-   bool moreFragments = false;
    uint16_t fragmentOffset = 0;      // in 8-byte units
    uint16_t id = 1;
 };
@@ -80,11 +77,9 @@ struct Ipv6Header {
 };
 Bytes ipv6(const Ipv6Header &header, const Bytes &payload);
 
-// A UDP header; `lengthOverride` writes another length than the real one.
 struct UdpHeader {
    uint16_t srcPort = 0;
    uint16_t dstPort = 0;
-   std::optional<uint16_t> lengthOverride;
 };
 Bytes udp(const UdpHeader &header, const Bytes &payload);
 
@@ -123,7 +118,6 @@ struct Dhcp {
    bool end = true;                  // write option 255
    std::array<uint8_t, 4> cookie{99, 130, 83, 99};
 };
-Bytes dhcpPayload(const Dhcp &dhcp);
 
 // Whole frames for the common cases.
 

@@ -102,14 +102,11 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size)
    // Made on first use and kept until exit; a host violation aborts.
    static auto *host = new swsec::host::Host;
    static auto *twin = host->load() == 0 ? new swsec::testing::Twin(*host, 1) : (std::abort(), nullptr);
-   static int current = -1;
    FuzzInput in(data, size);
-   const uint8_t config = in.byte();
-   if (config != current) {
-      if (!twin->configure(configRecord(config))) {
-         return 0;   // a configuration the module refuses changes nothing
-      }
-      current = config;
+   // Each input configures the ports anew (counters, limiters and the
+   // error state restart; learned bindings stay as the module keeps them).
+   if (!twin->configure(configRecord(in.byte()))) {
+      return 0;   // a configuration the module refuses changes nothing
    }
    for (int frames = 0; frames < 64 && in.remaining() != 0; ++frames) {
       twin->advance(std::chrono::milliseconds(100 * in.byte()));

@@ -61,6 +61,7 @@ inline constexpr const char *kDefaultCtlSocket = "/run/swsec.sock";
 struct InlineCommandOptions {
    std::string bridge;
    std::vector<std::string> ports;         // NAME=IFACE
+   std::string watch;                      // a pattern of interfaces guarded as they join the bridge
    std::string config;                     // every port's, unless --port-config names one
    std::vector<std::string> portConfigs;   // NAME=FILE
    std::string failMode = "closed";
@@ -76,6 +77,7 @@ int runInline(const InlineCommandOptions &options);
 struct CtlCommandOptions {
    std::string ctl = kDefaultCtlSocket;
    std::vector<std::string> words;         // COMMAND ARGS...
+   std::string config;                     // add-port: the new port's configuration file
    bool json = false;
    bool follow = false;
 };

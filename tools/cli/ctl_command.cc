@@ -28,9 +28,10 @@ void addCtlOptions(CLI::App &command, CtlCommandOptions &options)
    command.add_option("--ctl", options.ctl, "control socket path");
    command.add_flag("--json", options.json, "print the reply as JSON (streams: one object a line)");
    command.add_flag("-f,--follow", options.follow, "log: go on showing lines as they come");
+   command.add_option("--config", options.config, "add-port: the new port's configuration file");
    command.add_option("COMMAND", options.words,
                       "ports | bindings [PORT] | summary PORT | counters | metrics | clear PORT [VLAN MAC IP] | "
-                      "config PORT FILE | watch | log [-f]")
+                      "config PORT FILE | add-port NAME=IFACE [--config F] | remove-port NAME | watch | log [-f]")
       ->required();
 }
 
@@ -42,6 +43,18 @@ class UsageError : public std::runtime_error {
 public:
    using std::runtime_error::runtime_error;
 };
+
+// Read here, with the caller's own rights; the daemon gets the text.
+std::string fileText(const std::string &path)
+{
+   std::ifstream file(path, std::ios::binary);
+   if (!file) {
+      throw UsageError(path + ": " + std::strerror(errno));
+   }
+   std::ostringstream text;
+   text << file.rdbuf();
+   return text.str();
+}
 
 nlohmann::json buildRequest(const CtlCommandOptions &options)
 {
@@ -80,15 +93,23 @@ nlohmann::json buildRequest(const CtlCommandOptions &options)
    } else if (command == "config") {
       expect(2, 2);
       request["port"] = words[1];
-      // Read here, with the caller's own rights; the daemon gets the text.
-      std::ifstream file(words[2], std::ios::binary);
-      if (!file) {
-         throw UsageError(words[2] + ": " + std::strerror(errno));
-      }
-      std::ostringstream text;
-      text << file.rdbuf();
-      request["text"] = text.str();
+      request["text"] = fileText(words[2]);
       request["origin"] = words[2];
+   } else if (command == "add-port") {
+      expect(1, 1);
+      const size_t equals = words[1].find('=');
+      if (equals == 0 || equals == std::string::npos || equals + 1 == words[1].size()) {
+         throw UsageError("add-port " + words[1] + ": expected NAME=IFACE");
+      }
+      request["port"] = words[1].substr(0, equals);
+      request["interface"] = words[1].substr(equals + 1);
+      if (!options.config.empty()) {
+         request["text"] = fileText(options.config);
+         request["origin"] = options.config;
+      }
+   } else if (command == "remove-port") {
+      expect(1, 1);
+      request["port"] = words[1];
    } else {
       throw UsageError("unknown command '" + command + "'");
    }

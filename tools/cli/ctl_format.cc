@@ -116,6 +116,13 @@ std::string humanText(const std::string &command, const nlohmann::json &result)
    if (command == "config") {
       return field(result, "port") + " configured\n";
    }
+   if (command == "add-port") {
+      return field(result, "name") + " guards " + field(result, "interface") + " through " +
+             field(result, "bridgeEnd") + "\n";
+   }
+   if (command == "remove-port") {
+      return field(result, "port") + " removed; its VM is " + field(result, "vm") + "\n";
+   }
    if (command == "log" || command == "watch") {
       std::string text;
       for (const auto &entry : result) {

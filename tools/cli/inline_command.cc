@@ -26,8 +26,10 @@ namespace swsec::tools {
 void addInlineOptions(CLI::App &command, InlineCommandOptions &options)
 {
    command.add_option("--bridge", options.bridge, "the Linux bridge whose ports are guarded")->required();
-   command.add_option("--port", options.ports, "NAME=IFACE: guard the VM interface IFACE as port NAME")
-      ->required();
+   command.add_option("--port", options.ports, "NAME=IFACE: guard the VM interface IFACE as port NAME");
+   command.add_option("--watch", options.watch,
+                      "PATTERN: guard every interface matching it (e.g. 'vnet*') that joins the bridge, "
+                      "let go of those that leave");
    command.add_option("--config", options.config, "JSON security configuration of every port");
    command.add_option("--port-config", options.portConfigs, "NAME=FILE: this port's configuration instead");
    command.add_option("--fail", options.failMode, "what the VM is left with when swsec stops: closed (cut off) or "
@@ -70,7 +72,12 @@ live::InlineOptions parseOptions(const InlineCommandOptions &command)
       }
       options.stateDir = command.stateDir;
    }
+   if (command.ports.empty() && command.watch.empty()) {
+      throw UsageError("nothing to guard: give --port NAME=IFACE or --watch PATTERN");
+   }
    options.bridge = command.bridge;
+   options.watch = command.watch;
+   options.configPath = command.config;
    options.failMode = command.failMode == "open" ? live::FailMode::open : live::FailMode::closed;
    options.ctlPath = command.ctl;
    options.modulePath = command.modulePath;
@@ -98,7 +105,7 @@ live::InlineOptions parseOptions(const InlineCommandOptions &command)
       if (iface == command.bridge) {
          throw UsageError("--port " + text + ": that is the bridge");
       }
-      options.ports.push_back({name, iface, command.config});
+      options.ports.push_back({name, iface, command.config, "", "", ""});
    }
    for (const auto &text : command.portConfigs) {
       auto [name, file] = splitPair(text, "--port-config");
@@ -115,6 +122,9 @@ live::InlineOptions parseOptions(const InlineCommandOptions &command)
    }
    // Every configuration is read now: a bad one stops the start before
    // anything changes.
+   if (!command.config.empty()) {
+      (void)session::loadConfigFile(command.config);
+   }
    for (const auto &port : options.ports) {
       if (!port.configPath.empty()) {
          (void)session::loadConfigFile(port.configPath);

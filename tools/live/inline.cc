@@ -2,15 +2,22 @@
 // the module's own management nodes and notifications.
 #include "live/inline.h"
 
+#include "live/netdev.h"
+
 #include "session/error.h"
 #include "session/port_state.h"
 #include "session/saved_state_format.h"
 #include "session/serializer.h"
 #include "session/state_file.h"
 
+#include <net/if.h>
+
 #include <sys/stat.h>
 
+#include <algorithm>
 #include <cerrno>
+#include <climits>
+#include <cstdlib>
 #include <fstream>
 #include <sstream>
 
@@ -37,7 +44,9 @@ InlineDaemon::InlineDaemon(InlineOptions options, EventHub &events)
    // Ports' timers fire on real time from here on, on the host's timer thread.
    session_.host().clock().useRealTime();
    for (const PortSpec &portSpec : options_.ports) {
-      ports_.push_back(Port{portSpec, nullptr, portSpec.configPath});
+      ports_.push_back(std::make_unique<Port>());
+      ports_.back()->portSpec = portSpec;
+      ports_.back()->configSource = portSpec.configPath;
    }
 }
 
@@ -48,13 +57,16 @@ InlineDaemon::~InlineDaemon()
 
 std::vector<uint8_t> InlineDaemon::recordFor(const PortSpec &portSpec)
 {
+   if (!portSpec.configText.empty()) {
+      return session::configRecord(session::parseConfig(portSpec.configText, portSpec.configOrigin));
+   }
    return session::configRecord(portSpec.configPath.empty() ? session::PortSecurityConfig{}
                                                        : session::loadConfigFile(portSpec.configPath));
 }
 
 std::string InlineDaemon::statePath(const PortSpec &portSpec) const
 {
-   return options_.stateDir + "/" + portSpec.name + ".state";
+   return options_.stateDir + "/" + (portSpec.stateKey.empty() ? portSpec.name : portSpec.stateKey) + ".state";
 }
 
 // A state file that is missing, damaged or refused costs the port its
@@ -126,35 +138,226 @@ bool InlineDaemon::saveState(Port &port, host::FilterId filter)
    }
 }
 
+void InlineDaemon::startPort(Port &port)
+{
+   PortOptions options;
+   options.name = port.portSpec.name;
+   options.vmIface = port.portSpec.vmIface;
+   options.bridge = options_.bridge;
+   options.portID = nextPortID_++;
+   options.failMode = options_.failMode;
+   options.batch = options_.batch;
+   port.guarded = std::make_unique<GuardedPort>(
+      session_, options, [this](const std::string &line) { events_.log("info", "inline", line); }, nullptr);
+   std::function<void(host::FilterId)> restore;
+   if (!options_.stateDir.empty()) {
+      restore = [this, &port](host::FilterId filter) { restoreState(port.portSpec, filter); };
+   }
+   try {
+      port.guarded->start(recordFor(port.portSpec), restore);
+   } catch (...) {
+      port.guarded.reset();
+      throw;
+   }
+}
+
 void InlineDaemon::start()
 {
    std::lock_guard guard(mutex_);
-   uint32_t portID = 1;
-   for (Port &port : ports_) {
-      PortOptions options;
-      options.name = port.portSpec.name;
-      options.vmIface = port.portSpec.vmIface;
-      options.bridge = options_.bridge;
-      options.portID = portID++;
-      options.failMode = options_.failMode;
-      options.batch = options_.batch;
-      port.guarded = std::make_unique<GuardedPort>(
-         session_, options, [this](const std::string &line) { events_.log("info", "inline", line); }, nullptr);
+   // Listening before the bridge is looked at: nothing that changes after
+   // the look goes unheard.
+   links_ = std::make_unique<LinkMonitor>();
+   const auto bridge = findLink(options_.bridge);
+   if (!options_.watch.empty() && (!bridge || bridge->kind != "bridge")) {
+      throw NetdevError(options_.bridge + " is not a bridge");
+   }
+   bridgeIndex_ = bridge ? bridge->ifindex : 0;
+   for (auto &port : ports_) {
       try {
-         std::function<void(host::FilterId)> restore;
-         if (!options_.stateDir.empty()) {
-            restore = [this, &port](host::FilterId filter) { restoreState(port.portSpec, filter); };
-         }
-         port.guarded->start(recordFor(port.portSpec), restore);
+         startPort(*port);
       } catch (...) {
-         port.guarded.reset();
          for (auto it = ports_.rbegin(); it != ports_.rend(); ++it) {
-            if (it->guarded) {
-               it->guarded->stop(true);
-               it->guarded.reset();
+            if ((*it)->guarded) {
+               (*it)->guarded->stop(true);
+               (*it)->guarded.reset();
             }
          }
          throw;
+      }
+   }
+   if (!options_.watch.empty()) {
+      watchScan();
+   }
+}
+
+InlineDaemon::Port &InlineDaemon::addPort(PortSpec portSpec, bool watched)
+{
+   if (bridgeIndex_ == 0) {
+      throw CtlError("bridge " + options_.bridge + " is gone; no port can be added");
+   }
+   for (const auto &port : ports_) {
+      if (port->portSpec.name == portSpec.name) {
+         throw CtlError("a port named '" + portSpec.name + "' exists");
+      }
+      if (port->portSpec.vmIface == portSpec.vmIface && port->guarded && port->guarded->running()) {
+         throw CtlError(portSpec.vmIface + " is guarded by port '" + port->portSpec.name + "'");
+      }
+   }
+   if (portSpec.vmIface == options_.bridge || isOwnPairEnd(portSpec.vmIface)) {
+      throw CtlError(portSpec.vmIface + " is the bridge or swsec's own");
+   }
+   const std::string source = portSpec.configText.empty() ? portSpec.configPath : portSpec.configOrigin;
+   ports_.push_back(std::make_unique<Port>());
+   Port &port = *ports_.back();
+   port.portSpec = std::move(portSpec);
+   port.configSource = source;
+   port.watched = watched;
+   try {
+      startPort(port);
+   } catch (const std::exception &e) {
+      const std::string what = e.what();
+      ports_.pop_back();
+      throw CtlError(what);
+   }
+   return port;
+}
+
+void InlineDaemon::stopPort(Port &port)
+{
+   std::function<void(host::FilterId)> save;
+   if (!options_.stateDir.empty()) {
+      save = [this, &port](host::FilterId filter) {
+         if (!saveState(port, filter)) {
+            stateLost_ = true;
+         }
+      };
+   }
+   port.guarded->stop(false, save);
+}
+
+void InlineDaemon::removePort(const std::string &name, const std::string &why)
+{
+   for (auto it = ports_.begin(); it != ports_.end(); ++it) {
+      if ((*it)->portSpec.name == name) {
+         events_.log("info", "inline", name + ": " + why + "; the port is removed");
+         if ((*it)->guarded) {
+            stopPort(**it);
+         }
+         ports_.erase(it);
+         return;
+      }
+   }
+}
+
+InlineDaemon::Port *InlineDaemon::portOn(int ifindex)
+{
+   for (auto &port : ports_) {
+      if (port->guarded && port->guarded->running() && port->guarded->vmIfindex() == ifindex) {
+         return port.get();
+      }
+   }
+   return nullptr;
+}
+
+// The bridge's ports that the pattern matches, and interfaces a killed run
+// left out of the bridge with their pair's end in it.
+void InlineDaemon::watchScan()
+{
+   for (const LinkInfo &link : bridgePorts(options_.bridge)) {
+      LinkEvent event;
+      event.ifindex = link.ifindex;
+      event.name = link.name;
+      event.hasMaster = true;
+      event.master = bridgeIndex_;
+      event.mac = link.mac;
+      event.kind = link.kind;
+      if (isOwnPairEnd(link.name) && link.name.back() == 'b') {
+         char vm[IF_NAMESIZE];
+         const int index = std::atoi(link.name.c_str() + 5);
+         const auto found = if_indextoname(static_cast<unsigned>(index), vm) ? findLink(vm) : std::nullopt;
+         if (!found || !found->master.empty()) {
+            continue;
+         }
+         event.ifindex = found->ifindex;
+         event.name = found->name;
+         event.mac = found->mac;
+         event.kind = found->kind;
+      }
+      followLink(event);
+   }
+}
+
+void InlineDaemon::bridgeGone()
+{
+   const std::string reason = "bridge " + options_.bridge + " deleted";
+   events_.log("error", "inline", reason + "; every port stops");
+   bridgeIndex_ = 0;
+   for (auto &port : ports_) {
+      if (port->guarded && port->guarded->running()) {
+         port->guarded->setStopReason(reason);
+         stopPort(*port);
+      }
+   }
+}
+
+void InlineDaemon::followLink(const LinkEvent &event)
+{
+   if (bridgeIndex_ != 0 && event.ifindex == bridgeIndex_ && event.removed) {
+      bridgeGone();
+      return;
+   }
+   Port *port = portOn(event.ifindex);
+   if (port != nullptr && !event.removed && event.mtu != 0 && event.mtu != port->guarded->mtu()) {
+      try {
+         port->guarded->followMtu(event.mtu);
+      } catch (const NetdevError &e) {
+         events_.log("error", "inline", port->portSpec.name + ": MTU not followed: " + e.what());
+      }
+   }
+   if (options_.watch.empty() || bridgeIndex_ == 0) {
+      return;
+   }
+   if (port != nullptr && !port->watched) {
+      return;   // named on the command line or added by hand: it stays until removed
+   }
+   switch (watchAction(event, bridgeIndex_, options_.watch, port != nullptr)) {
+   case WatchAction::guard: {
+      PortSpec spec{event.name, event.name, options_.configPath, "", "", ""};
+      if (!event.mac.empty()) {
+         // A VM restarted on a new interface finds its bindings again by its MAC.
+         spec.stateKey = event.mac;
+         std::replace(spec.stateKey.begin(), spec.stateKey.end(), ':', '-');
+      }
+      try {
+         addPort(spec, true);
+      } catch (const CtlError &e) {
+         events_.log("error", "inline", event.name + " joined " + options_.bridge + " but is not guarded: " + e.what());
+      }
+      break;
+   }
+   case WatchAction::release:
+      removePort(port->portSpec.name, event.name + (event.removed ? " is gone" : " left " + options_.bridge));
+      break;
+   case WatchAction::none:
+      break;
+   }
+}
+
+void InlineDaemon::followLinks()
+{
+   if (!links_) {
+      return;
+   }
+   bool lost = false;
+   for (const LinkEvent &event : links_->drain(&lost)) {
+      followLink(event);
+   }
+   if (lost) {
+      events_.log("error", "inline", "link events lost; looking at the bridge again");
+      if (bridgeIndex_ != 0 && !findLink(options_.bridge)) {
+         bridgeGone();
+      } else if (bridgeIndex_ != 0 && !options_.watch.empty()) {
+         watchScan();
       }
    }
 }
@@ -166,35 +369,48 @@ void InlineDaemon::pump()
       events_.log(record.severity >= 2 ? "error" : "info", "module", session::withoutNewline(record.text));
    }
    for (const auto &note : session_.takeNotifications()) {
-      const size_t index = note.portID - 1;
-      if (index < ports_.size()) {
-         ports_[index].stateDirty = true;
+      std::string name = std::to_string(note.portID);
+      for (const auto &port : ports_) {
+         if (port->guarded && port->guarded->options().portID == note.portID) {
+            name = port->portSpec.name;
+            port->stateDirty = true;
+         }
       }
-      const std::string name = index < ports_.size() ? ports_[index].portSpec.name : std::to_string(note.portID);
       nlohmann::json event = session::notificationJson(note);
       event["time"] = wallClock();
       event["port"] = name;
       events_.notification(std::move(event));
    }
-   for (Port &port : ports_) {
-      if (port.guarded && port.guarded->vanished() && port.guarded->running()) {
-         port.guarded->stop();
+   std::vector<std::string> gone;
+   for (auto &port : ports_) {
+      if (port->guarded && port->guarded->vanished() && port->guarded->running()) {
+         if (port->watched) {
+            // Its state is kept by its VM's MAC: the VM may come back on a new interface.
+            gone.push_back(port->portSpec.name);
+         } else {
+            port->guarded->stop();
+         }
       }
+   }
+   for (const auto &name : gone) {
+      removePort(name, "its interface disappeared");
    }
    // A binding change is on disk within a second, a burst of them in one save.
    const auto now = std::chrono::steady_clock::now();
-   for (Port &port : ports_) {
-      if (!options_.stateDir.empty() && port.stateDirty && port.guarded && port.guarded->running() &&
-          now - port.lastSave >= std::chrono::seconds(1)) {
-         (void)saveState(port, port.guarded->filter());
+   for (auto &port : ports_) {
+      if (!options_.stateDir.empty() && port->stateDirty && port->guarded && port->guarded->running() &&
+          now - port->lastSave >= std::chrono::seconds(1)) {
+         (void)saveState(*port, port->guarded->filter());
       }
    }
+   followLinks();
 }
 
 void InlineDaemon::reload()
 {
    std::lock_guard guard(mutex_);
-   for (Port &port : ports_) {
+   for (auto &entry : ports_) {
+      Port &port = *entry;
       if (!port.guarded || !port.guarded->running() || port.portSpec.configPath.empty()) {
          continue;
       }
@@ -215,17 +431,10 @@ void InlineDaemon::reload()
 std::vector<std::string> InlineDaemon::stop()
 {
    std::lock_guard guard(mutex_);
+   links_.reset();
    for (auto it = ports_.rbegin(); it != ports_.rend(); ++it) {
-      if (it->guarded) {
-         std::function<void(host::FilterId)> save;
-         if (!options_.stateDir.empty()) {
-            save = [this, &port = *it](host::FilterId filter) {
-               if (!saveState(port, filter)) {
-                  stateLost_ = true;
-               }
-            };
-         }
-         it->guarded->stop(false, save);
+      if ((*it)->guarded) {
+         stopPort(**it);
       }
    }
    std::vector<std::string> violations = session_.finish();
@@ -236,9 +445,9 @@ std::vector<std::string> InlineDaemon::stop()
 InlineDaemon::Port &InlineDaemon::port(const nlohmann::json &request)
 {
    const std::string name = requiredString(request, "port");
-   for (Port &port : ports_) {
-      if (port.portSpec.name == name) {
-         return port;
+   for (auto &port : ports_) {
+      if (port->portSpec.name == name) {
+         return *port;
       }
    }
    throw CtlError("no port named '" + name + "'");
@@ -257,24 +466,34 @@ InlineDaemon::Port &InlineDaemon::runningPort(const nlohmann::json &request)
 nlohmann::json InlineDaemon::portsJson()
 {
    nlohmann::json list = nlohmann::json::array();
-   for (Port &port : ports_) {
-      nlohmann::json entry = {{"name", port.portSpec.name},
-                              {"interface", port.portSpec.vmIface},
-                              {"bridge", options_.bridge},
-                              {"failMode", options_.failMode == FailMode::open ? "open" : "closed"},
-                              {"config", port.configSource}};
-      if (port.guarded) {
-         entry["portId"] = port.guarded->options().portID;
-         entry["running"] = port.guarded->running();
-         entry["stopReason"] = port.guarded->stopReason();
-         entry["bridgeEnd"] = port.guarded->bridgeEnd();
-         entry["guardEnd"] = port.guarded->guardEnd();
-      } else {
-         entry["running"] = false;
-      }
-      list.push_back(entry);
+   for (auto &port : ports_) {
+      list.push_back(portJson(*port));
    }
    return list;
+}
+
+nlohmann::json InlineDaemon::portJson(const Port &port)
+{
+   nlohmann::json entry = {{"name", port.portSpec.name},
+                           {"interface", port.portSpec.vmIface},
+                           {"bridge", options_.bridge},
+                           {"failMode", options_.failMode == FailMode::open ? "open" : "closed"},
+                           {"config", port.configSource},
+                           {"watched", port.watched}};
+   if (!options_.stateDir.empty()) {
+      entry["stateFile"] = statePath(port.portSpec);
+   }
+   if (port.guarded) {
+      entry["portId"] = port.guarded->options().portID;
+      entry["running"] = port.guarded->running();
+      entry["stopReason"] = port.guarded->stopReason();
+      entry["bridgeEnd"] = port.guarded->bridgeEnd();
+      entry["guardEnd"] = port.guarded->guardEnd();
+      entry["mtu"] = port.guarded->mtu();
+   } else {
+      entry["running"] = false;
+   }
+   return entry;
 }
 
 nlohmann::json bindingsReply(const std::string &port, const session::PortState &state)
@@ -337,9 +556,9 @@ nlohmann::json InlineDaemon::handle(const nlohmann::json &request)
          }
          return list;
       }
-      for (Port &port : ports_) {
-         if (port.guarded && port.guarded->running()) {
-            for (auto &entry : bindingsJson(port)) {
+      for (auto &port : ports_) {
+         if (port->guarded && port->guarded->running()) {
+            for (auto &entry : bindingsJson(*port)) {
                list.push_back(entry);
             }
          }
@@ -358,8 +577,8 @@ nlohmann::json InlineDaemon::handle(const nlohmann::json &request)
    }
    if (command == "counters") {
       nlohmann::json list = nlohmann::json::array();
-      for (Port &port : ports_) {
-         list.push_back(countersJson(port));
+      for (auto &port : ports_) {
+         list.push_back(countersJson(*port));
       }
       return list;
    }
@@ -400,8 +619,36 @@ nlohmann::json InlineDaemon::handle(const nlohmann::json &request)
       events_.log("info", "inline", port.portSpec.name + ": configuration written from " + origin);
       return {{"port", port.portSpec.name}, {"configured", true}};
    }
+   if (command == "add-port") {
+      PortSpec spec{requiredString(request, "port"), requiredString(request, "interface"), options_.configPath,
+                    "", "", ""};
+      // A name becomes a file name in the state directory.
+      if (!options_.stateDir.empty() && (spec.name.find('/') != std::string::npos || spec.name == "." ||
+                                         spec.name == "..")) {
+         throw CtlError("with a state directory a port name cannot be a path");
+      }
+      if (!options_.stateDir.empty() && spec.name.size() + sizeof ".state.partial-XXXXXX" - 1 > NAME_MAX) {
+         throw CtlError("with a state directory a port name has at most " +
+                        std::to_string(NAME_MAX - (sizeof ".state.partial-XXXXXX" - 1)) + " bytes");
+      }
+      if (request.contains("text")) {
+         spec.configText = requiredString(request, "text");
+         spec.configOrigin = request.value("origin", std::string("(control request)"));
+         spec.configPath.clear();
+      }
+      return portJson(addPort(std::move(spec), false));
+   }
+   if (command == "remove-port") {
+      const Port &found = port(request);
+      const std::string name = found.portSpec.name;
+      const bool running = found.guarded && found.guarded->running();
+      removePort(name, "removed on request");
+      return {{"port", name},
+              {"removed", true},
+              {"vm", running && options_.failMode == FailMode::open ? "back on the bridge" : "cut off"}};
+   }
    throw CtlError("unknown command '" + command +
-                  "' (ports, bindings, summary, counters, clear, config, watch, log, metrics)");
+                  "' (ports, bindings, summary, counters, clear, config, add-port, remove-port, watch, log, metrics)");
 }
 
 }  // namespace swsec::live

@@ -4,6 +4,7 @@
 #include "live/ctl_server.h"
 #include "live/events.h"
 #include "live/port.h"
+#include "live/rtnetlink.h"
 #include "session/config_file.h"
 #include "session/ports_session.h"
 
@@ -21,6 +22,9 @@ struct PortSpec {
    std::string name;
    std::string vmIface;
    std::string configPath;   // "" the new port's defaults
+   std::string configText;   // sent over the control socket instead of a path
+   std::string configOrigin; // where configText came from
+   std::string stateKey;     // names its state file; "" the port's name
 };
 
 struct InlineOptions {
@@ -32,6 +36,8 @@ struct InlineOptions {
    const orr_ModuleInfo *linkedModule = nullptr;   // the program's own, unless modulePath names an image
    size_t batch = 64;
    std::string stateDir;   // "" keeps no state; else DIR/<port name>.state across restarts
+   std::string watch;      // "" none; else a shell pattern: the bridge's ports it matches are guarded
+   std::string configPath; // the configuration of ports added later ("" the defaults)
 };
 
 // A port's "bindings" reply: its port database entries, each with "port".
@@ -47,8 +53,9 @@ public:
    // Starts every port; a failure stops those started, putting the network
    // back as found, and rethrows.
    void start();
-   // Moves the module's log and notifications to the event rings and takes
-   // down ports that stopped by themselves.
+   // Moves the module's log and notifications to the event rings, takes
+   // down ports that stopped by themselves and follows link changes (the
+   // bridge deleted, an MTU changed, watched interfaces joining or leaving).
    void pump();
    // SIGHUP: every port re-reads its configuration file.
    void reload();
@@ -65,14 +72,28 @@ private:
       PortSpec portSpec;
       std::unique_ptr<GuardedPort> guarded;
       std::string configSource;   // where its configuration came from last
+      bool watched = false;       // guarded by --watch: let go when its interface leaves
       bool stateDirty = false;    // bindings changed since the last save
       bool saveFailing = false;   // the last save failed (said once)
       std::chrono::steady_clock::time_point lastSave{};
    };
 
+   void startPort(Port &port);
+   // Adds and starts one port; throws CtlError (nothing left behind) when it cannot.
+   Port &addPort(PortSpec portSpec, bool watched);
+   // Stops one port as the fail mode says, saving its state, and forgets it.
+   void removePort(const std::string &name, const std::string &why);
+   void stopPort(Port &port);
+   void followLinks();
+   void followLink(const LinkEvent &event);
+   void watchScan();
+   void bridgeGone();
+   Port *portOn(int ifindex);
+
    Port &port(const nlohmann::json &request);
    Port &runningPort(const nlohmann::json &request);
    nlohmann::json portsJson();
+   nlohmann::json portJson(const Port &port);
    nlohmann::json bindingsJson(const Port &port);
    nlohmann::json countersJson(Port &port);
    std::vector<uint8_t> recordFor(const PortSpec &portSpec);
@@ -84,8 +105,11 @@ private:
    EventHub &events_;
    session::ModuleSession session_;
    std::recursive_mutex mutex_;   // the ports against the control thread
-   std::vector<Port> ports_;
+   std::vector<std::unique_ptr<Port>> ports_;   // stable: ports hold no index into it
    bool stateLost_ = false;
+   uint32_t nextPortID_ = 1;
+   std::unique_ptr<LinkMonitor> links_;
+   int bridgeIndex_ = 0;          // 0 once the bridge is gone
 };
 
 }  // namespace swsec::live

@@ -98,6 +98,22 @@ std::string commandText(const std::vector<std::string> &args)
    return text;
 }
 
+LinkInfo linkInfo(const nlohmann::json &link, const std::string &name)
+{
+   LinkInfo info;
+   info.ifindex = link.value("ifindex", 0);
+   info.name = link.value("ifname", name);
+   info.master = link.value("master", "");
+   info.mtu = link.value("mtu", 0u);
+   info.mac = link.value("address", "");
+   const auto flags = link.value("flags", std::vector<std::string>{});
+   info.up = std::find(flags.begin(), flags.end(), "UP") != flags.end();
+   if (link.contains("linkinfo") && link["linkinfo"].is_object()) {
+      info.kind = link["linkinfo"].value("info_kind", "");
+   }
+   return info;
+}
+
 }  // namespace
 
 void runIp(const std::vector<std::string> &args)
@@ -118,18 +134,23 @@ std::optional<LinkInfo> findLink(const std::string &name)
    if (!document.is_array() || document.empty() || !document[0].is_object()) {
       throw NetdevError("ip -j link show dev " + name + ": unexpected output");
    }
-   const auto &link = document[0];
-   LinkInfo info;
-   info.ifindex = link.value("ifindex", 0);
-   info.name = link.value("ifname", name);
-   info.master = link.value("master", "");
-   info.mtu = link.value("mtu", 0u);
-   const auto flags = link.value("flags", std::vector<std::string>{});
-   info.up = std::find(flags.begin(), flags.end(), "UP") != flags.end();
-   if (link.contains("linkinfo") && link["linkinfo"].is_object()) {
-      info.kind = link["linkinfo"].value("info_kind", "");
+   return linkInfo(document[0], name);
+}
+
+std::vector<LinkInfo> bridgePorts(const std::string &bridge)
+{
+   const Output output = spawnIp({"-j", "-d", "link", "show", "master", bridge});
+   const auto document = nlohmann::json::parse(output.out, nullptr, false);
+   std::vector<LinkInfo> ports;
+   if (output.status != 0 || !document.is_array()) {
+      return ports;
    }
-   return info;
+   for (const auto &link : document) {
+      if (link.is_object()) {
+         ports.push_back(linkInfo(link, ""));
+      }
+   }
+   return ports;
 }
 
 std::optional<bool> ipv6Disabled(const std::string &name)

@@ -23,12 +23,15 @@ struct LinkInfo {
    std::string kind;     // "bridge", "veth", ... ("" a plain device)
    unsigned mtu = 0;
    bool up = false;
+   std::string mac;      // "aa:bb:cc:dd:ee:ff", "" none
 };
 
 // Runs `ip ARGS...` (no shell); throws NetdevError with ip's message when it fails.
 void runIp(const std::vector<std::string> &args);
 // The interface, or none when it does not exist.
 std::optional<LinkInfo> findLink(const std::string &name);
+// The ports of `bridge` (none when it has none or does not exist).
+std::vector<LinkInfo> bridgePorts(const std::string &bridge);
 
 // The interface's IPv6 switch (/proc/sys/net/ipv6/conf/NAME/disable_ipv6),
 // none when the kernel has no IPv6 for it.

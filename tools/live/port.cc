@@ -96,6 +96,8 @@ void GuardedPort::start(const std::vector<uint8_t> &record, const std::function<
    if (bridgeEnd_.size() > IFNAMSIZ - 1) {
       throw NetdevError(name + ": interface index " + std::to_string(vm->ifindex) + " too large for a pair name");
    }
+   vmIfindex_ = vm->ifindex;
+   mtu_ = vm->mtu;
    wasInBridge_ = vm->master == options_.bridge;
    if (!wasInBridge_) {
       // Left so by a run that stopped closed: guarded again from here.
@@ -259,6 +261,28 @@ uint64_t GuardedPort::overruns()
       more += guardSocket_->takeOverruns();
    }
    return counters_.overruns.fetch_add(more, std::memory_order_relaxed) + more;
+}
+
+void GuardedPort::followMtu(unsigned mtu)
+{
+   if (mtu == mtu_ || !running()) {
+      return;
+   }
+   // The bridge end last when raising, first when lowering: the bridge
+   // never takes a frame the guard end could not carry.
+   const std::string text = std::to_string(mtu);
+   const bool raising = mtu > mtu_;
+   runIp({"link", "set", raising ? guardEnd_ : bridgeEnd_, "mtu", text});
+   runIp({"link", "set", raising ? bridgeEnd_ : guardEnd_, "mtu", text});
+   log_(options_.name + ": " + options_.vmIface + " MTU " + std::to_string(mtu_) + " -> " + text +
+        "; the pair follows");
+   mtu_ = mtu;
+}
+
+void GuardedPort::setStopReason(const std::string &reason)
+{
+   std::lock_guard guard(mutex_);
+   stopReason_ = reason;
 }
 
 std::string GuardedPort::stopReason() const

@@ -90,6 +90,14 @@ public:
    uint64_t overruns();
    std::string guardEnd() const { return guardEnd_; }
    std::string bridgeEnd() const { return bridgeEnd_; }
+   // The VM interface's index and the pair's MTU, as found at start.
+   int vmIfindex() const { return vmIfindex_; }
+   unsigned mtu() const { return mtu_; }
+   // The VM interface's MTU changed: the pair follows it, so that the
+   // frames it may now send fit. Throws NetdevError.
+   void followMtu(unsigned mtu);
+   // Why the port was stopped from outside (its bridge gone), for stopReason.
+   void setStopReason(const std::string &reason);
 
 private:
    void forward(PacketSocket &from, PacketSocket &to, uint32_t direction);
@@ -106,6 +114,8 @@ private:
    // The set-up, in the order it is made; takeDown undoes what is set.
    std::string bridgeEnd_;
    std::string guardEnd_;
+   int vmIfindex_ = 0;
+   unsigned mtu_ = 0;
    bool wasInBridge_ = false;
    bool pairMade_ = false;
    bool portMade_ = false;

@@ -1,0 +1,133 @@
+#!/usr/bin/env bash
+# swsec inline with ports that come and go, in network namespaces this
+# script makes and removes: a VM interface that joins the bridge under
+# --watch is guarded within a second and its spoofs dropped, its MTU is
+# followed, one that goes is let go with its state kept by MAC and found
+# again on a new interface; add-port and remove-port while another VM's
+# ping flows lose none of it; the bridge deleted stops every port.
+#
+#   watch_e2e.sh SWSEC_BINARY
+#
+# Exit 0 passed, 1 failed, 77 skipped (the reason is printed).
+set -uo pipefail
+
+swsec=$(realpath "${1:?usage: watch_e2e.sh SWSEC_BINARY}")
+here=$(cd "$(dirname "$0")" && pwd)
+tool="$here/e2e_tool.py"
+examples="$here/../../examples"
+python=/usr/bin/python3
+
+skip() { echo "SKIP: $*"; exit 77; }
+[ "$(id -u)" -eq 0 ] || skip "needs root for network namespaces"
+command -v ip >/dev/null || skip "ip is not installed"
+"$python" -c "import scapy.all" 2>/dev/null || skip "python3-scapy is not installed (scripts/setup.sh installs it)"
+
+tag="sww$$"
+sw="${tag}sw"; srv="${tag}srv"; vm1="${tag}vm1"; vm2="${tag}vm2"; vm3="${tag}vm3"
+work=$(mktemp -d "/tmp/swsec-watch.XXXXXX")
+ctl="$work/ctl.sock"
+pids=()
+cleanup() {
+  local pid
+  for pid in "${pids[@]}"; do kill -TERM "$pid" 2>/dev/null; done
+  for pid in "${pids[@]}"; do
+    for _ in $(seq 50); do kill -0 "$pid" 2>/dev/null || break; sleep 0.1; done
+    kill -KILL "$pid" 2>/dev/null
+  done
+  for ns in "$vm1" "$vm2" "$vm3" "$srv" "$sw"; do ip netns del "$ns" 2>/dev/null; done
+  rm -rf "$work"
+}
+trap cleanup EXIT
+trap 'exit 1' INT TERM
+
+step() { echo "== $*"; }
+fail() {
+  echo "FAIL: $*"
+  echo "-- ports"; sw_ctl ports 2>&1
+  echo "-- swsec inline's log"; tail -n 30 "$work/inline.log" 2>/dev/null
+  exit 1
+}
+sw_ctl() { "$swsec" ctl --ctl "$ctl" "$@"; }
+json() { "$python" -c "import json,sys; d=json.load(sys.stdin); print($1)"; }
+port() { sw_ctl ports --json | json "[p$2 for p in d if p['name']=='$1']"; }
+now_ms() { echo $(($(date +%s%N) / 1000000)); }
+# vm NS LINK [MAC]: a namespace whose eth0 is the peer of LINK in the switch.
+vm() {
+  ip -n "$sw" link add "$2" ${3:+address "$3"} type veth peer name eth0 netns "$1" || fail "cannot make $2"
+  ip -n "$sw" link set "$2" up
+  ip -n "$1" link set eth0 up
+}
+
+step "namespaces: a bridge, a server, vm2 on a guarded port, vm1 and vm3 not yet on it"
+ip netns add "$sw" || skip "cannot make network namespaces"
+for ns in "$srv" "$vm1" "$vm2" "$vm3"; do ip netns add "$ns"; done
+ip -n "$sw" link add br0 type bridge 2>/dev/null || skip "no bridge support in this kernel"
+ip -n "$sw" link set br0 up
+vm "$srv" srvp; vm "$vm2" vm2p; vm "$vm1" vnet0; vm "$vm3" vm3p
+ip -n "$sw" link set srvp master br0; ip -n "$sw" link set vm2p master br0
+ip -n "$srv" addr add 192.0.2.1/24 dev eth0
+ip -n "$vm2" addr add 192.0.2.2/24 dev eth0
+vm1_mac=$(ip netns exec "$vm1" cat /sys/class/net/eth0/address)
+tap_mac=$(ip netns exec "$sw" cat /sys/class/net/vnet0/address)
+mkdir "$work/state"
+echo '{}' >"$work/trusted.json"
+ip netns exec "$sw" "$swsec" inline --bridge br0 --port vm2=vm2p --port-config vm2="$work/trusted.json" \
+  --watch 'vnet*' --ctl "$ctl" --config "$examples/enforcing.json" --state-dir "$work/state" >>"$work/inline.log" 2>&1 &
+inline_pid=$!; pids+=("$inline_pid")
+for _ in $(seq 150); do sw_ctl ports >/dev/null 2>&1 && break; sleep 0.2; done
+sw_ctl ports >/dev/null 2>&1 || fail "swsec inline did not come up"
+
+step "vm2 pings the server throughout; vm1 joins the bridge under --watch, vm3 is added and removed"
+ip netns exec "$vm2" ping -q -i 0.01 -c 500 -W 1 192.0.2.1 >"$work/ping.out" 2>&1 &
+ping_pid=$!; pids+=("$ping_pid")
+sleep 0.5
+joined=$(now_ms)
+ip -n "$sw" link set vnet0 master br0
+until [ "$(port vnet0 "['running']")" = "[True]" ]; do
+  [ $(($(now_ms) - joined)) -lt 5000 ] || fail "vnet0 not guarded after it joined"
+  sleep 0.05
+done
+took=$(($(now_ms) - joined))
+echo "   vnet0 guarded ${took} ms after it joined"
+[ "$took" -le 1000 ] || fail "vnet0 guarded after ${took} ms, more than 1 s"
+sw_ctl add-port vm3=vm3p --config "$examples/enforcing.json" >/dev/null || fail "add-port refused"
+[ "$(port vm3 "['running']")" = "[True]" ] || fail "vm3 not running after add-port"
+out=$(sw_ctl add-port vm3=vm3p 2>&1) && fail "a second port named vm3 was accepted"
+grep -q "exists" <<<"$out" || fail "the refusal does not say why: $out"
+sleep 0.5
+sw_ctl remove-port vm3 | grep -q "removed; its VM is cut off" || fail "remove-port did not report the VM cut off"
+[ "$(port vm3 "")" = "[]" ] || fail "vm3 still listed after remove-port"
+[ -z "$(ip -n "$sw" -j link show dev vm3p | json "d[0].get('master','')")" ] || fail "vm3p back on the bridge (fail closed)"
+wait "$ping_pid"
+grep -q " 0% packet loss" "$work/ping.out" || fail "vm2 lost frames meanwhile: $(cat "$work/ping.out")"
+sw_ctl ports --json | json "[p['name'] for p in d]" | grep -q swsec && fail "a pair end of swsec's own is guarded"
+
+step "vm1's spoof is dropped and counted on its watched port"
+counted() { sw_ctl counters --json | json "[p['drops']['ipSrcGuardDropCnt'] for p in d if p['port']=='vnet0'][0]"; }
+before=$(counted)
+ip netns exec "$vm1" "$python" "$tool" attack ip-spoof eth0 "$vm1_mac" 192.0.2.3 192.0.2.1
+for _ in $(seq 25); do [ "$(counted)" -gt "$before" ] && break; sleep 0.2; done
+[ "$(counted)" -gt "$before" ] || fail "the spoof from vm1 was not dropped"
+
+step "an MTU raised on the VM's interface is followed by its pair"
+ip -n "$sw" link set vnet0 mtu 4000
+end=$(port vnet0 "['bridgeEnd']" | tr -d "[]'")
+for _ in $(seq 25); do [ "$(port vnet0 "['mtu']")" = "[4000]" ] && break; sleep 0.2; done
+[ "$(ip -n "$sw" -j link show dev "$end" | json "d[0]['mtu']")" = 4000 ] || fail "$end did not follow the MTU"
+
+step "vnet0 goes: let go, its state kept by MAC; back as vnet7 with that MAC, the state is found"
+ip -n "$sw" link del vnet0
+for _ in $(seq 25); do [ "$(port vnet0 "")" = "[]" ] && break; sleep 0.2; done
+[ "$(port vnet0 "")" = "[]" ] || fail "vnet0 still listed after it went"
+[ -s "$work/state/${tap_mac//:/-}.state" ] || fail "no state file named by the MAC: $(ls "$work/state")"
+vm "$vm1" vnet7 "$tap_mac"
+ip -n "$sw" link set vnet7 master br0
+for _ in $(seq 25); do [ "$(port vnet7 "['running']")" = "[True]" ] && break; sleep 0.2; done
+grep -q "vnet7: state restored from .*${tap_mac//:/-}.state" "$work/inline.log" || fail "vnet7 did not get vnet0's state"
+
+step "the bridge deleted: every port stops and says why"
+ip -n "$sw" link del br0
+for _ in $(seq 25); do [ "$(port vm2 "['running']")" = "[False]" ] && break; sleep 0.2; done
+port vm2 "['stopReason']" | grep -q "bridge br0 deleted" || fail "vm2 not stopped for the bridge: $(port vm2 "")"
+kill -0 "$inline_pid" || fail "swsec inline died with the bridge"
+echo "PASS"

@@ -300,6 +300,25 @@ void InlineDaemon::bridgeGone()
    }
 }
 
+// A guarded interface put back into the bridge (by hand, or by a VM
+// manager re-plugging it) would carry the VM's frames round the guard: it
+// is taken out again. Looked at afresh, as the event may be one queued
+// before the port took it out itself.
+void InlineDaemon::rejoined(Port &port)
+{
+   const auto now = findLink(port.portSpec.vmIface);
+   if (!now || now->master != options_.bridge) {
+      return;
+   }
+   events_.log("error", "inline", port.portSpec.name + ": " + port.portSpec.vmIface + " was put back into " +
+                                      options_.bridge + " round the guard; taking it out again");
+   try {
+      runIp({"link", "set", port.portSpec.vmIface, "nomaster"});
+   } catch (const NetdevError &e) {
+      events_.log("error", "inline", port.portSpec.name + ": " + e.what());
+   }
+}
+
 void InlineDaemon::followLink(const LinkEvent &event)
 {
    if (bridgeIndex_ != 0 && event.ifindex == bridgeIndex_ && event.removed) {
@@ -313,6 +332,9 @@ void InlineDaemon::followLink(const LinkEvent &event)
       } catch (const NetdevError &e) {
          events_.log("error", "inline", port->portSpec.name + ": MTU not followed: " + e.what());
       }
+   }
+   if (port != nullptr && !event.removed && event.hasMaster && event.master == bridgeIndex_) {
+      rejoined(*port);
    }
    if (options_.watch.empty() || bridgeIndex_ == 0) {
       return;

@@ -88,6 +88,7 @@ private:
    void followLink(const LinkEvent &event);
    void watchScan();
    void bridgeGone();
+   void rejoined(Port &port);
    Port *portOn(int ifindex);
 
    Port &port(const nlohmann::json &request);

@@ -9,7 +9,7 @@ cd "$(dirname "$0")/.."
 
 seconds=${1:-30}
 dir=build/asan
-targets=(dhcp_parse_fuzz frame_fuzz control_fuzz capture_fuzz restore_state_fuzz link_message_fuzz)
+targets=(dhcp_parse_fuzz frame_fuzz control_fuzz capture_fuzz restore_state_fuzz link_message_fuzz ctl_request_fuzz)
 # The kernel fast path's target loads a BPF program: root only.
 if [ "$(id -u)" -eq 0 ]; then
   targets+=(fastpath_fuzz)
@@ -27,6 +27,15 @@ rm -rf "$dir/seeds"
 mkdir -p "$dir/seeds/capture_fuzz"
 cp tests/data/*.pcap fuzz/capture_seeds/*.pcap* "$dir/seeds/capture_fuzz/"
 "$dir/fuzz/state_seeds" "$dir/seeds" tests/data/manifest.json examples/enforcing.json >/dev/null
+# Control requests (an even first byte).
+mkdir -p "$dir/seeds/ctl_request_fuzz"
+n=0
+for line in '{"command": "ports"}' '{"command": "bindings", "port": "vm1"}' '{"command": "log", "follow": true}' \
+            '{"command": "clear", "port": "vm1", "key": ["0", "02:00:5e:c0:00:01", "192.0.2.1"]}' \
+            '{"command": "config", "port": "vm2", "text": "{}", "origin": "f"}' '{"command": "counters"}'; do
+  printf '\0%s' "$line" >"$dir/seeds/ctl_request_fuzz/request$((n += 1))"
+done
+
 
 export ASAN_OPTIONS=detect_leaks=1:abort_on_error=1
 export UBSAN_OPTIONS=print_stacktrace=1:halt_on_error=1
@@ -40,6 +49,10 @@ for target in "${targets[@]}"; do
   limits=(-rss_limit_mb=4096 -max_len=2048)
   if [ "$target" = capture_fuzz ]; then
     limits=(-rss_limit_mb=512 -malloc_limit_mb=256 -max_len=16384)
+  fi
+  # A request or a state held to its limits: nothing grows with the input.
+  if [ "$target" = ctl_request_fuzz ]; then
+    limits=(-rss_limit_mb=512 -malloc_limit_mb=128 -max_len=16384)
   fi
   if ! "$dir/fuzz/$target" -max_total_time="$seconds" -timeout=10 "${limits[@]}" \
        -print_final_stats=1 \

@@ -220,18 +220,16 @@ TEST_F(CtlServerTest, idle_connections_are_closed_and_make_room_for_a_newcomer)
    limits.idleTimeoutMs = 400;
    limits.maxClients = 3;
    CtlServer server(path_, events_, handler_, limits);
-   std::vector<std::unique_ptr<Client>> idle;
-   for (size_t i = 0; i < limits.maxClients; ++i) {
-      idle.push_back(std::make_unique<Client>(path_));
-      usleep(50'000);
-   }
+   Client first(path_);
+   usleep(100'000);
+   Client second(path_), third(path_);
    usleep(100'000);
    // Every place taken by a connection that asks nothing: the newcomer is served.
    Client newcomer(path_);
    newcomer.send("{\"command\": \"ports\"}\n");
    EXPECT_EQ(nlohmann::json::parse(newcomer.line())["result"]["echo"], "ports");
    // The oldest made room, and the rest time out.
-   for (const auto &client : {idle[0].get(), idle[2].get()}) {
+   for (Client *client : {&first, &third}) {
       EXPECT_EQ(client->line(), "");
       EXPECT_TRUE(client->closedByServer());
    }

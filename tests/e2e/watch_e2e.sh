@@ -131,6 +131,12 @@ ip -n "$sw" link set vnet7 master br0
 for _ in $(seq 25); do [ "$(port vnet7 "['running']")" = "[True]" ] && break; sleep 0.2; done
 grep -q "vnet7: state restored from .*${tap_mac//:/-}.state" "$work/inline.log" || fail "vnet7 did not get vnet0's state"
 
+step "a watched port removed by request is not guarded again when its interface rejoins"
+sw_ctl remove-port vnet7 >/dev/null || fail "remove-port vnet7 refused"
+ip -n "$sw" link set vnet7 master br0
+sleep 1
+[ "$(port vnet7 "")" = "[]" ] || fail "vnet7 guarded again after remove-port"
+
 step "the bridge deleted: every port stops and says why"
 ip -n "$sw" link del br0
 for _ in $(seq 25); do [ "$(port vm2 "['running']")" = "[False]" ] && break; sleep 0.2; done

@@ -342,8 +342,14 @@ void InlineDaemon::followLink(const LinkEvent &event)
    if (port != nullptr && !port->watched) {
       return;   // named on the command line or added by hand: it stays until removed
    }
+   if (event.removed) {
+      handsOff_.erase(event.ifindex);
+   }
    switch (watchAction(event, bridgeIndex_, options_.watch, port != nullptr)) {
    case WatchAction::guard: {
+      if (handsOff_.count(event.ifindex) != 0) {
+         break;   // let go of by remove-port: not guarded again until it is made anew
+      }
       PortSpec spec{event.name, event.name, options_.configPath, "", "", ""};
       if (!event.mac.empty()) {
          // A VM restarted on a new interface finds its bindings again by its MAC.
@@ -664,6 +670,10 @@ nlohmann::json InlineDaemon::handle(const nlohmann::json &request)
       const Port &found = port(request);
       const std::string name = found.portSpec.name;
       const bool running = found.guarded && found.guarded->running();
+      if (found.watched && running) {
+         // Back in the bridge (fail open) it would be guarded again at once.
+         handsOff_.insert(found.guarded->vmIfindex());
+      }
       removePort(name, "removed on request");
       return {{"port", name},
               {"removed", true},

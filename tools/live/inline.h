@@ -13,6 +13,7 @@
 #include <memory>
 #include <mutex>
 #include <optional>
+#include <set>
 #include <string>
 #include <vector>
 
@@ -111,6 +112,7 @@ private:
    uint32_t nextPortID_ = 1;
    std::unique_ptr<LinkMonitor> links_;
    int bridgeIndex_ = 0;          // 0 once the bridge is gone
+   std::set<int> handsOff_;       // watched interfaces removed by request, by index
 };
 
 }  // namespace swsec::live

@@ -150,7 +150,7 @@ wait_for 5 has_binding vm1 "$vm1_ip" || fail "no binding for vm1"
 wait_for 5 has_binding vm2 "$vm2_ip" || fail "no binding for vm2"
 
 step "a second daemon on vm1's interface is refused; the first keeps guarding"
-out=$(ip netns exec "$sw" "$swsec" inline --bridge br0 --port vm1=vm1p --ctl "$work/second.sock" 2>&1)
+out=$(timeout 20 ip netns exec "$sw" "$swsec" inline --bridge br0 --port vm1=vm1p --ctl "$work/second.sock" 2>&1)
 [ $? -eq 1 ] || fail "the second daemon did not exit 1: $out"
 grep -q "vm1p is guarded by another swsec inline (PID $inline_pid)" <<<"$out" || fail "refusal without the PID: $out"
 sw_ctl ports --json | json "all(p['running'] for p in d)" | grep -qx True || fail "the first daemon's ports stopped"

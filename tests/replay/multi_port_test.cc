@@ -134,44 +134,6 @@ TEST(MultiPort, network_macs_make_every_other_source_the_vm)
       << several.warnings[0];
 }
 
-struct BadPorts {
-   const char *name;
-   std::vector<std::string> args;
-   const char *message;
-};
-
-class MultiPortBadUsage : public ::testing::TestWithParam<BadPorts> {};
-
-TEST_P(MultiPortBadUsage, is_refused_in_one_line)
-{
-   std::vector<std::string> args = {"replay"};
-   args.insert(args.end(), GetParam().args.begin(), GetParam().args.end());
-   args.push_back(bridgeCapture());
-   const ToolRun run = runTool(args);
-   EXPECT_EQ(run.status, 2);
-   EXPECT_EQ(run.out, "");
-   EXPECT_NE(run.err.find(GetParam().message), std::string::npos) << run.err;
-   EXPECT_EQ(std::count(run.err.begin(), run.err.end(), '\n'), 1) << run.err;
-}
-
-INSTANTIATE_TEST_SUITE_P(
-   Options, MultiPortBadUsage,
-   ::testing::Values(
-      BadPorts{"no_equals", {"--port", "vm1"}, "--port \"vm1\": expected NAME=VALUE"},
-      BadPorts{"bad_name", {"--port", "v m=02:00:5e:c0:00:11"}, "expected NAME=VALUE"},
-      BadPorts{"bad_mac", {"--port", "vm1=02:00:5e:c0:00:1"}, "--port vm1: malformed MAC address"},
-      BadPorts{"name_twice", {"--port", "a=02:00:5e:c0:00:11", "--port", "a=02:00:5e:c0:00:12"}, "given twice"},
-      BadPorts{"mac_twice", {"--port", "a=02:00:5e:c0:00:11", "--port", "b=02:00:5e:c0:00:11"},
-               "is already another port's MAC"},
-      BadPorts{"config_for_no_port", {"--port", "a=02:00:5e:c0:00:11", "--port-config", "b=x.json"},
-               "--port-config b: no --port of that name"},
-      BadPorts{"vm_mac_with_ports", {"--vm-mac", "02:00:5e:c0:00:11", "--port", "a=02:00:5e:c0:00:12"},
-               "--vm-mac: give the VM's MAC in its --port instead"},
-      BadPorts{"network_mac_is_a_port", {"--port", "a=02:00:5e:c0:00:11", "--network-mac", "02:00:5e:c0:00:11"},
-               "is a port's MAC"},
-      BadPorts{"json_twice", {"--json", "--json-lines", "--port", "a=02:00:5e:c0:00:11"}, "give one"}),
-   [](const auto &param) { return std::string(param.param.name); });
-
 // ---------------------------------------------------------------- streams
 
 TEST(ReplayStreams, json_lines_are_the_document_one_frame_a_line_then_the_summary)

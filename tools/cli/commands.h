@@ -6,6 +6,7 @@
 #include <cstdint>
 #include <map>
 #include <string>
+#include <utility>
 #include <vector>
 
 namespace CLI {
@@ -14,10 +15,17 @@ class App;
 
 namespace swsec::tools {
 
+inline constexpr const char *kToolVersion = "0.1.0";
+
 // Exit statuses shared by every subcommand.
 inline constexpr int kExitOk = 0;
-inline constexpr int kExitFailure = 1;   // the module refused or failed
+inline constexpr int kExitFailure = 1;   // refused or failed while running
 inline constexpr int kExitUsage = 2;     // bad command line or bad input
+
+// "NAME=VALUE" as every option that takes one reads it: NAME of letters,
+// digits, '.', '_' or '-' (at most 31), VALUE not empty. Throws
+// session::InputError naming the option.
+std::pair<std::string, std::string> nameValue(const std::string &text, const char *option);
 
 struct InfoOptions {
    bool json = false;

@@ -4,6 +4,8 @@
 #include "cli/commands.h"
 
 #include "cli/ctl_format.h"
+#include "live/ctl_commands.h"
+#include "session/error.h"
 #include "session/json_text.h"
 
 #include <CLI/CLI.hpp>
@@ -14,6 +16,7 @@
 #include <sys/un.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
@@ -29,10 +32,12 @@ void addCtlOptions(CLI::App &command, CtlCommandOptions &options)
    command.add_flag("--json", options.json, "print the reply as JSON (streams: one object a line)");
    command.add_flag("-f,--follow", options.follow, "log: go on showing lines as they come");
    command.add_option("--config", options.config, "add-port: the new port's configuration file");
-   command.add_option("COMMAND", options.words,
-                      "ports | bindings [PORT] | summary PORT | counters | metrics | clear PORT [VLAN MAC IP] | "
-                      "config PORT FILE | add-port NAME=IFACE [--config F] | remove-port NAME | watch | log [-f]")
-      ->required();
+   std::string commands;
+   for (const live::CtlCommand &ctl : live::kCtlCommands) {
+      const std::string usage = ctl.name + std::string(*ctl.arguments != 0 ? " " : "") + ctl.arguments;
+      commands += "\n  " + usage + std::string(std::max<size_t>(2, 27 - usage.size()), ' ') + ctl.what;
+   }
+   command.add_option("COMMAND", options.words, "the command and its arguments:" + commands)->required();
 }
 
 namespace {
@@ -60,58 +65,39 @@ nlohmann::json buildRequest(const CtlCommandOptions &options)
 {
    const auto &words = options.words;
    const std::string &command = words[0];
-   auto expect = [&](size_t least, size_t most) {
-      if (words.size() - 1 < least || words.size() - 1 > most) {
-         throw UsageError(command + ": wrong number of arguments");
-      }
-   };
+   const live::CtlCommand *known = live::findCtlCommand(command);
+   if (known == nullptr) {
+      throw UsageError("unknown command '" + command + "' (" + live::ctlCommandNames(true) + ")");
+   }
+   const size_t given = words.size() - 1;
+   // clear takes a port alone or a port and a whole key.
+   if (given < known->leastArguments || given > known->mostArguments || (command == "clear" && (given == 2 || given == 3))) {
+      throw UsageError(command + ": expected " + command + " " + known->arguments);
+   }
    nlohmann::json request = {{"command", command}};
-   if (command == "ports" || command == "counters" || command == "watch") {
-      expect(0, 0);
-   } else if (command == "metrics") {
-      expect(0, 0);
+   if (command == "metrics") {
       request["command"] = "counters";
    } else if (command == "log") {
-      expect(0, 0);
       request["follow"] = options.follow;
-   } else if (command == "bindings") {
-      expect(0, 1);
-      if (words.size() == 2) {
-         request["port"] = words[1];
-      }
-   } else if (command == "summary") {
-      expect(1, 1);
+   } else if ((command == "bindings" || command == "summary" || command == "clear") && given >= 1) {
       request["port"] = words[1];
-   } else if (command == "clear") {
-      if (words.size() != 2 && words.size() != 5) {
-         throw UsageError("clear: PORT, or PORT VLAN MAC IP");
-      }
-      request["port"] = words[1];
-      if (words.size() == 5) {
+      if (given == 4) {
          request["key"] = {words[2], words[3], words[4]};
       }
    } else if (command == "config") {
-      expect(2, 2);
       request["port"] = words[1];
       request["text"] = fileText(words[2]);
       request["origin"] = words[2];
    } else if (command == "add-port") {
-      expect(1, 1);
-      const size_t equals = words[1].find('=');
-      if (equals == 0 || equals == std::string::npos || equals + 1 == words[1].size()) {
-         throw UsageError("add-port " + words[1] + ": expected NAME=IFACE");
-      }
-      request["port"] = words[1].substr(0, equals);
-      request["interface"] = words[1].substr(equals + 1);
+      const auto [name, iface] = nameValue(words[1], "add-port");
+      request["port"] = name;
+      request["interface"] = iface;
       if (!options.config.empty()) {
          request["text"] = fileText(options.config);
          request["origin"] = options.config;
       }
    } else if (command == "remove-port") {
-      expect(1, 1);
       request["port"] = words[1];
-   } else {
-      throw UsageError("unknown command '" + command + "'");
    }
    return request;
 }
@@ -181,6 +167,8 @@ int runCtl(const CtlCommandOptions &options)
    try {
       request = buildRequest(options);
    } catch (const UsageError &e) {
+      std::fprintf(stderr, "swsec ctl: %s\n", e.what());
+      return kExitUsage;   } catch (const session::InputError &e) {
       std::fprintf(stderr, "swsec ctl: %s\n", e.what());
       return kExitUsage;
    }

@@ -4,6 +4,7 @@
 #include "cli/commands.h"
 
 #include "host/host.h"
+#include "session/error.h"
 
 #include <CLI/CLI.hpp>
 #include <nlohmann/json.hpp>
@@ -29,13 +30,10 @@ std::map<std::string, int, std::less<>> parseParameters(const std::vector<std::s
 {
    std::map<std::string, int, std::less<>> parameters;
    for (const auto &text : texts) {
-      auto eq = text.find('=');
+      const auto [name, number] = nameValue(text, "--param");
       int value = 0;
-      if (eq == std::string::npos || eq == 0) {
-         throw std::invalid_argument("--param '" + text + "': expected NAME=VALUE");
-      }
-      const char *first = text.data() + eq + 1;
-      const char *last = text.data() + text.size();
+      const char *first = number.data();
+      const char *last = number.data() + number.size();
       int base = 10;
       if (last - first > 2 && first[0] == '0' && (first[1] == 'x' || first[1] == 'X')) {
          first += 2;
@@ -45,7 +43,7 @@ std::map<std::string, int, std::less<>> parseParameters(const std::vector<std::s
       if (error != std::errc{} || end != last || first == last) {
          throw std::invalid_argument("--param '" + text + "': value is not an integer");
       }
-      parameters[text.substr(0, eq)] = value;
+      parameters[name] = value;
    }
    return parameters;
 }
@@ -200,6 +198,9 @@ int runInfo(const InfoOptions &options)
    try {
       snap = takeSnapshot(options);
    } catch (const std::invalid_argument &e) {
+      std::fprintf(stderr, "swsec info: %s\n", e.what());
+      return kExitUsage;
+   } catch (const session::InputError &e) {
       std::fprintf(stderr, "swsec info: %s\n", e.what());
       return kExitUsage;
    } catch (const std::runtime_error &e) {

@@ -49,15 +49,6 @@ public:
    using std::runtime_error::runtime_error;
 };
 
-std::pair<std::string, std::string> splitPair(const std::string &text, const char *option)
-{
-   const size_t equals = text.find('=');
-   if (equals == 0 || equals == std::string::npos || equals + 1 == text.size()) {
-      throw UsageError(std::string(option) + " " + text + ": expected NAME=VALUE");
-   }
-   return {text.substr(0, equals), text.substr(equals + 1)};
-}
-
 live::InlineOptions parseOptions(const InlineCommandOptions &command)
 {
    live::InlineOptions options;
@@ -86,9 +77,9 @@ live::InlineOptions parseOptions(const InlineCommandOptions &command)
    std::set<std::string> names;
    std::set<std::string> interfaces;
    for (const auto &text : command.ports) {
-      auto [name, iface] = splitPair(text, "--port");
+      auto [name, iface] = nameValue(text, "--port");
       // The name becomes a file name in the state directory.
-      if (!command.stateDir.empty() && (name.find('/') != std::string::npos || name == "." || name == "..")) {
+      if (!command.stateDir.empty() && (name == "." || name == "..")) {
          throw UsageError("--port " + text + ": with --state-dir a port name cannot be a path");
       }
       // NAME.state and its temporary NAME.state.partial-XXXXXX must be file names.
@@ -108,7 +99,7 @@ live::InlineOptions parseOptions(const InlineCommandOptions &command)
       options.ports.push_back({name, iface, command.config, "", "", ""});
    }
    for (const auto &text : command.portConfigs) {
-      auto [name, file] = splitPair(text, "--port-config");
+      auto [name, file] = nameValue(text, "--port-config");
       bool found = false;
       for (auto &port : options.ports) {
          if (port.name == name) {
@@ -175,7 +166,7 @@ int runInline(const InlineCommandOptions &command)
          daemon->pump();
          daemon.reset();
       }
-      return dynamic_cast<const session::Refused *>(&e) != nullptr ? kExitUsage : kExitFailure;
+      return dynamic_cast<const session::InputError *>(&e) != nullptr ? kExitUsage : kExitFailure;
    }
    events.log("info", "inline", "running; control socket " + options.ctlPath);
 

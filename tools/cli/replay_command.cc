@@ -66,27 +66,12 @@ double parseUntil(const std::string &text)
    return seconds;
 }
 
-// "NAME=VALUE" of an option that names a port.
-std::pair<std::string, std::string> namedValue(const std::string &text, const char *option)
-{
-   const size_t equals = text.find('=');
-   const std::string name = text.substr(0, std::min(equals, text.size()));
-   const bool nameOk = !name.empty() && name.size() <= 31 &&
-                       name.find_first_not_of("abcdefghijklmnopqrstuvwxyzABCDEFGHIJKLMNOPQRSTUVWXYZ0123456789._-") ==
-                          std::string::npos;
-   if (equals == std::string::npos || !nameOk || equals + 1 == text.size()) {
-      throw session::InputError(std::string(option) + " \"" + text.substr(0, 60) +
-                                "\": expected NAME=VALUE, NAME of letters, digits, '.', '_' or '-' (at most 31)");
-   }
-   return {name, text.substr(equals + 1)};
-}
-
 std::vector<replay::PortSpec> parsePorts(const ReplayCommandOptions &options)
 {
    std::vector<replay::PortSpec> ports;
    std::set<replay::Mac> macs;
    for (const std::string &text : options.ports) {
-      auto [name, list] = namedValue(text, "--port");
+      auto [name, list] = nameValue(text, "--port");
       for (const auto &port : ports) {
          if (port.name == name) {
             throw session::InputError("--port " + name + ": given twice");
@@ -105,7 +90,7 @@ std::vector<replay::PortSpec> parsePorts(const ReplayCommandOptions &options)
       }
    }
    for (const std::string &text : options.portConfigs) {
-      const auto named = namedValue(text, "--port-config");
+      const auto named = nameValue(text, "--port-config");
       const std::string &name = named.first;
       const std::string &file = named.second;
       auto found = std::find_if(ports.begin(), ports.end(), [&name](const auto &port) { return port.name == name; });
@@ -261,7 +246,7 @@ int runReplay(const ReplayCommandOptions &options)
    } catch (const replay::ConfigRefused &e) {
       std::cout.flush();
       std::fprintf(stderr, "swsec replay: %s\n", e.what());
-      return kExitUsage;
+      return kExitFailure;
    }
 }
 

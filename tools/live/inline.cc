@@ -2,6 +2,7 @@
 // the module's own management nodes and notifications.
 #include "live/inline.h"
 
+#include "live/ctl_commands.h"
 #include "live/netdev.h"
 
 #include "session/error.h"
@@ -679,8 +680,7 @@ nlohmann::json InlineDaemon::handle(const nlohmann::json &request)
               {"removed", true},
               {"vm", running && options_.failMode == FailMode::open ? "back on the bridge" : "cut off"}};
    }
-   throw CtlError("unknown command '" + command +
-                  "' (ports, bindings, summary, counters, clear, config, add-port, remove-port, watch, log, metrics)");
+   throw CtlError("unknown command '" + command + "' (" + ctlCommandNames(false) + ")");
 }
 
 }  // namespace swsec::live

@@ -240,6 +240,17 @@ TEST(BadUsage, is_named_in_one_short_line_with_status_2_and_nothing_written)
    }
 }
 
+TEST(Help, every_subcommand_says_its_exit_status_and_examples)
+{
+   for (const char *command : {"info", "replay", "inline", "ctl", "state"}) {
+      const ToolRun run = runTool({command, "--help"});
+      EXPECT_EQ(run.status, 0) << command << run.err;
+      EXPECT_NE(run.out.find("EXIT STATUS\n  0  "), std::string::npos) << run.out;
+      EXPECT_NE(run.out.find("EXAMPLES\n  swsec " + std::string(command)), std::string::npos) << run.out;
+   }
+   EXPECT_EQ(runTool({"--version"}).out.rfind("swsec ", 0), 0u);
+}
+
 TEST(HostileCommandLine, until_takes_decimal_and_exponent_seconds)
 {
    const ToolRun run = runTool({"replay", "--json", "--vm-mac", kVmMac, "--until", "2e2", example()});

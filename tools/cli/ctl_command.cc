@@ -35,7 +35,7 @@ void addCtlOptions(CLI::App &command, CtlCommandOptions &options)
    std::string commands;
    for (const live::CtlCommand &ctl : live::kCtlCommands) {
       const std::string usage = ctl.name + std::string(*ctl.arguments != 0 ? " " : "") + ctl.arguments;
-      commands += "\n  " + usage + std::string(std::max<size_t>(2, 27 - usage.size()), ' ') + ctl.what;
+      commands += "\n  " + usage + std::string(usage.size() < 25 ? 27 - usage.size() : 2, ' ') + ctl.what;
    }
    command.add_option("COMMAND", options.words, "the command and its arguments:" + commands)->required();
 }

@@ -386,6 +386,12 @@ public:
    // threads may hand lists to the same filter at once.
    virtual PacketsResult processPackets(FilterId id, uint32_t direction, const std::vector<FrameSpec> &frames) = 0;
    virtual PacketsResult processPackets(FilterId id, uint32_t direction, std::span<const FrameView> frames) = 0;
+   // Hands the frames, as one list, to every filter of port `portID` in
+   // creation order, as the port's filter chain does: a frame one filter
+   // drops is not seen by the next. The list is mapped to the largest
+   // minimum of those filters for `direction`. The first failing status is
+   // returned; no filter on the port passes everything.
+   virtual PacketsResult processPort(uint32_t portID, uint32_t direction, const std::vector<FrameSpec> &frames) = 0;
 
    // ---- per-filter properties, as the management plane uses them
 

@@ -4,6 +4,7 @@
 #include "host/sifra_records.h"
 #include "host/state.h"
 
+#include <algorithm>
 #include <cstring>
 
 namespace swsec::host {
@@ -320,6 +321,39 @@ PacketsResult SifraRegistry::processPackets(FilterId id, uint32_t direction, con
 PacketsResult SifraRegistry::processPackets(FilterId id, uint32_t direction, std::span<const FrameView> frames)
 {
    return judgeList(id, direction, frames);
+}
+
+PacketsResult SifraRegistry::processPort(uint32_t portID, uint32_t direction, const std::vector<FrameSpec> &frames)
+{
+   std::vector<Call> chain;
+   {
+      std::lock_guard guard(mutex_);
+      for (const auto &[id, filter] : filters_) {
+         if (filter->created && filter->portID == portID) {
+            const uint32_t minMapped =
+               direction == ORR_SIFRA_DIR_RX || direction == ORR_SIFRA_DIR_TX ? filter->minMappedLen[direction - 1] : 0;
+            chain.push_back({filter->fastPath->info.ops, filter->record, minMapped});
+         }
+      }
+   }
+   uint32_t minMappedLen = 0;
+   for (const Call &call : chain) {
+      minMappedLen = std::max(minMappedLen, call.minMappedLen);
+   }
+   auto list = frames_.makeList(frames, minMappedLen);
+   PacketsResult result;
+   for (const Call &call : chain) {
+      const orr_Status status =
+         call.ops->processPackets != nullptr ? call.ops->processPackets(call.record, list->list(), direction) : ORR_OK;
+      if (result.status == ORR_OK) {
+         result.status = status;
+      }
+   }
+   result.kept = list->kept();
+   result.released = list->released();
+   list.reset();
+   afterModuleCall();
+   return result;
 }
 
 // Platform operations on a filter handle. An unknown handle would be a

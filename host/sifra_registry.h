@@ -96,6 +96,7 @@ public:
    orr_Status readProperty(std::string_view property, std::optional<FilterId> filter,
                            std::vector<uint8_t> &buffer) override;
    std::optional<uint32_t> pollProperty(std::string_view property, std::optional<FilterId> filter) override;
+   PacketsResult processPort(uint32_t portID, uint32_t direction, const std::vector<FrameSpec> &frames) override;
    SlowPaths &slowPaths() override { return slowPaths_; }
 
    struct FastPath;

@@ -8,8 +8,6 @@
 #include "framework/sifra_generic_ops.h"
 #include "framework/sifra_generic_slow_path.h"
 #include "platform/orr_text.h"
-#include "swsec/swsec_agent.h"
-#include "swsec/swsec_security_property.h"
 
 /*
  * The host may run the agent-creation property write and the management
@@ -74,7 +72,8 @@ static orr_Status SifraGenericCreateAgent(char *text)
    agent->magic = SIFRAGENERIC_AGENT_MAGIC;
    agent->namePtr = agent->name;
    agent->agentArgsPtr = agent->agentArgs;
-   agent->ops = &sifraGenericFwFastPathOps;
+   const SifraGenericAgentKind *kind = SifraGenericAgentKindOf(agent->name);
+   agent->ops = kind->ops;
    SifraGenericListInit(&agent->filterList);
    SifraGenericListInit(&agent->slowPathList);
 
@@ -97,12 +96,17 @@ static orr_Status SifraGenericCreateAgent(char *text)
       goto out_destroy_lock;
    }
 
-   /* Without its property the agent still works; the failure is logged there. */
-   (void)SifraGenericFWInitProperty(agent);
+   status = kind->attach(agent);
+   if (status != ORR_OK) {
+      goto out_unregister;
+   }
 
    SifraGenericListAppend(&agentList, &agent->links);
    return ORR_OK;
 
+out_unregister:
+   orr_SifraUnregisterFastPath(agent->fastPath);
+   agent->fastPath = nullptr;
 out_destroy_lock:
    orr_SpinlockDestroy(agent->lock);
    agent->lock = nullptr;
@@ -174,11 +178,15 @@ orr_Status SifraGenericAgentPropWrite(void * /* portset */, void * /* port */, v
 
 void SifraGenericCleanupFastPathAgent(SifraGenericFastPathAgent *agent)
 {
-   SifraGenericFWCleanupProperty(agent);
+   const SifraGenericAgentKind *kind = SifraGenericAgentKindOf(agent->name);
+   kind->detach(agent);
 
    if (agent->fastPath != nullptr) {
       orr_SifraUnregisterFastPath(agent->fastPath);
       agent->fastPath = nullptr;
+   }
+   if (kind->release != nullptr) {
+      kind->release(agent);
    }
 
    /* An attach callback still scheduled would run on a freed agent. */

@@ -104,6 +104,23 @@ static_assert(offsetof(SifraGenericFastPathAgent, slowPathList) == 320);
 static_assert(offsetof(SifraGenericFastPathAgent, attachTimer) == 336);
 static_assert(offsetof(SifraGenericFastPathAgent, attachRescan) == 344);
 
+/*
+ * What an agent's name makes of it: its callbacks, what is made for it once
+ * the host registered it (`attach`: a failure refuses the agent), what goes
+ * before its fast path is withdrawn (`detach`) and after (`release`, may be
+ * null: the host has destroyed the agent's filters by then).
+ */
+struct SifraGenericAgentKind {
+   const char *name;                            /* null: any other name */
+   const SifraGenericAgentOps *ops;
+   orr_Status (*attach)(SifraGenericFastPathAgent *agent);
+   void (*detach)(SifraGenericFastPathAgent *agent);
+   void (*release)(SifraGenericFastPathAgent *agent);
+};
+
+/* The kind of an agent named `name` (compared over the stored name's bytes). */
+const SifraGenericAgentKind *SifraGenericAgentKindOf(const char *name);
+
 /* The handle the host knows the agent by. */
 static inline orr_SifraAgentHandle SifraGenericAgentHandle(SifraGenericFastPathAgent *agent)
 {

@@ -3,6 +3,7 @@
 
 #include "contract/config_record.h"
 #include "framework/sifra_generic_filter.h"
+#include "swsec/swsec_agent.h"
 #include "framework/sifra_generic_log.h"
 #include "platform/orr_text.h"
 #include "swsec/swsec_config.h"
@@ -54,13 +55,17 @@ void SifraGenericFWCleanupProperty(SifraGenericFastPathAgent *agent)
    agent->propHandle = nullptr;
 }
 
-/* The port context of a filter record, or null when there is none. */
+/* The port context of a filter record, or null when there is none (or it is another agent's). */
 static SwSecContext *SWSecPropContext(orr_SifraFilter filter)
 {
    if (filter == nullptr) {
       return nullptr;
    }
-   return static_cast<SwSecContext *>(static_cast<SifraGenericFilter *>(filter)->agentData);
+   const auto *record = static_cast<SifraGenericFilter *>(filter);
+   if (record->agent != nullptr && record->agent->ops != &sifraGenericFwFastPathOps) {
+      return nullptr;
+   }
+   return static_cast<SwSecContext *>(record->agentData);
 }
 
 orr_Status SWSecPropWrite(orr_SifraFilter filter, void * /* extra */, const void *data,

@@ -1,0 +1,287 @@
+// The first-hop security agent on ports of the loaded module, beside the
+// switch-security agent on the same port: guards, learning, claims across
+// ports, the binding cap, the ND limiter and failures.
+#include "fhs/fhs_context.h"
+#include "framework/sifra_generic_filter.h"
+#include "support/host_fixture.h"
+#include "support/ipv6_frames.h"
+#include "support/security_config.h"
+
+#include <chrono>
+
+namespace swsec::testing {
+namespace {
+
+using namespace std::chrono_literals;
+constexpr const char *kFhs = "sifra-generic-tarlin-fhs";
+constexpr uint32_t kVmPort = 7, kOtherPort = 8, kTx = ORR_SIFRA_DIR_TX, kRx = ORR_SIFRA_DIR_RX;
+const Mac kVm = Mac::parse("02:00:00:00:00:07"), kIntruder = Mac::parse("02:00:00:00:00:08");
+const Addr6 kLinkLocal = a6("fe80::7"), kAny{}, kAllNodes = a6("ff02::1"), kGateway = a6("fe80::1");
+const Bytes kDuid{0, 3, 0, 1, 2, 0, 0, 0, 0, 7};
+
+FhsBindingKey key(const Mac &mac, const Addr6 &addr)
+{
+   FhsBindingKey k{};
+   std::memcpy(k.mac, mac.bytes.data(), 6);
+   std::memcpy(k.addr, addr.data(), 16);
+   return k;
+}
+
+class FhsPortTest : public ModuleTest {
+protected:
+   void SetUp() override
+   {
+      ModuleTest::SetUp();
+      host().portsets().addPortset("vs0");
+      host().portsets().addPort("vs0", kVmPort);
+      host().portsets().addPort("vs0", kOtherPort);
+      ASSERT_EQ(host().plex().write("com.tarlin.common.switch-security", kFhs), ORR_OK);
+      swsec_ = create("sifra-generic-tarlin-swsec", kVmPort);
+      vm_ = create(kFhs, kVmPort);
+      other_ = create(kFhs, kOtherPort);
+      ASSERT_EQ(host().sifra().writeProperty("sifra-generic-tarlin-swsec.security", swsec_,
+                                             configBytes(enforcingConfig())), ORR_OK);
+      ASSERT_EQ(configure(vm_, {.statics = {key(kVm, kLinkLocal)}}), ORR_OK);
+      ASSERT_EQ(configure(other_, {}), ORR_OK);
+   }
+   void TearDown() override
+   {
+      for (const auto &filter : host().sifra().filters()) {
+         EXPECT_EQ(host().sifra().destroyFilterAsHypervisor(filter.id).status, ORR_OK);
+      }
+      ModuleTest::TearDown();
+   }
+   host::FilterId create(const char *agent, uint32_t port)
+   {
+      host::FilterId id = 0;
+      EXPECT_EQ(host().sifra().createFilter(agent, port, {}, &id), ORR_OK);
+      return id;
+   }
+   orr_Status configure(host::FilterId id, const FhsPortConfig &config)
+   {
+      return host().sifra().writeProperty(std::string(kFhs) + ".security", id, fhsConfigBytes(config));
+   }
+   FhsContext *ctx(host::FilterId id)
+   {
+      return static_cast<FhsContext *>(static_cast<SifraGenericFilter *>(host().sifra().filter(id)->record)->agentData);
+   }
+   size_t kept(uint32_t port, uint32_t direction, const std::vector<Bytes> &frames)
+   {
+      std::vector<host::FrameSpec> specs;
+      for (const Bytes &frame : frames) {
+         specs.push_back({.bytes = frame});
+      }
+      return host().sifra().processPort(port, direction, specs).kept.size();
+   }
+   bool passes(uint32_t port, uint32_t direction, const Bytes &frame) { return kept(port, direction, {frame}) == 1; }
+   bool claim(uint32_t port, const Mac &mac, const Addr6 &addr)
+   {
+      return passes(port, kTx, frame6(mac, kAny, a6("ff02::1:ff00:7"), 58, nd(135, addr)));
+   }
+   Bytes udpFrom(const Mac &mac, const Addr6 &src) { return frame6(mac, src, kGateway, 17, udp6(5000, 53, Bytes(8, 1))); }
+   Bytes dhcpFrom(const Bytes &message) { return frame6(kVm, kLinkLocal, a6("ff02::1:2"), 17, udp6(546, 547, message)); }
+   Bytes dhcpTo(const Bytes &message) { return frame6(kIntruder, kGateway, kLinkLocal, 17, udp6(547, 546, message)); }
+
+   host::FilterId swsec_ = 0, vm_ = 0, other_ = 0;
+};
+
+TEST_F(FhsPortTest, each_guard_drops_from_the_vm_with_its_reason_and_a_trusted_port_passes)
+{
+   const auto ra = [](const Bytes &chain) { return frame6(kVm, kLinkLocal, kAllNodes, chain.empty() ? 58 : 0, cat(chain, icmp6(134, Bytes(12, 0)))); };
+   const auto reply = [](uint8_t type) { return frame6(kVm, kLinkLocal, kAllNodes, 17, udp6(546, 546, dhcp6(type, 1, kDuid))); };
+   const struct {
+      const char *name;
+      Bytes frame;
+      uint64_t FhsDropCounters::*counter;   // null: the frame passes
+   } cases[] = {
+      {"router_advertisement", ra({}), &FhsDropCounters::raGuardDropCnt},
+      {"ra_behind_hop_by_hop_and_dest_opts", ra(cat(ext(60), ext(58))), &FhsDropCounters::raGuardDropCnt},
+      {"redirect", frame6(kVm, kLinkLocal, kGateway, 58, icmp6(137, Bytes(36, 0))), &FhsDropCounters::raGuardDropCnt},
+      {"ra_in_first_fragment_without_its_chain", frame6(kVm, kLinkLocal, kAllNodes, 44, cat(frag(60, 0, true), ext(58))), &FhsDropCounters::headerChainDropCnt},
+      {"nine_extension_headers", frame6(kVm, kLinkLocal, kGateway, 60, cat(cat(cat(ext(60), ext(60)), cat(ext(60), ext(60))), cat(cat(ext(60), ext(60)), cat(cat(ext(60), ext(60)), cat(ext(17), Bytes(8, 0)))))), &FhsDropCounters::headerChainDropCnt},
+      {"atomic_fragment_of_ns", frame6(kVm, kLinkLocal, kGateway, 44, cat(frag(58, 0, false), nd(135, kGateway))), &FhsDropCounters::fragmentedNdDropCnt},
+      {"dhcpv6_advertise", reply(2), &FhsDropCounters::dhcpv6GuardDropCnt},
+      {"dhcpv6_reply", reply(7), &FhsDropCounters::dhcpv6GuardDropCnt},
+      {"dhcpv6_reconfigure", reply(10), &FhsDropCounters::dhcpv6GuardDropCnt},
+      {"dhcpv6_relay_reply", frame6(kVm, kLinkLocal, kAllNodes, 17, udp6(546, 547, Bytes{13, 0, 0, 0})), &FhsDropCounters::dhcpv6GuardDropCnt},
+      {"spoofed_source", udpFrom(kVm, a6("2001:db8::66")), &FhsDropCounters::sourceGuardDropCnt},
+      {"source_bound_to_another_mac", udpFrom(kIntruder, kLinkLocal), &FhsDropCounters::sourceGuardDropCnt},
+      {"na_claiming_the_gateway", frame6(kVm, kLinkLocal, kAllNodes, 58, nd(136, kGateway, kVm)), &FhsDropCounters::ndInspectionDropCnt},
+      {"ns_with_a_foreign_link_address", frame6(kVm, kLinkLocal, kGateway, 58, nd(135, kGateway, kIntruder)), &FhsDropCounters::ndInspectionDropCnt},
+      {"ns_with_an_empty_option", frame6(kVm, kLinkLocal, kGateway, 58, cat(nd(135, kGateway), Bytes{1, 0, 0, 0, 0, 0, 0, 0})), &FhsDropCounters::ndInspectionDropCnt},
+      {"ns_for_the_gateway", frame6(kVm, kLinkLocal, kGateway, 58, nd(135, kGateway, kVm)), nullptr},
+      {"na_for_its_own_address", frame6(kVm, kLinkLocal, kAllNodes, 58, nd(136, kLinkLocal, kVm)), nullptr},
+      {"mld_report_from_no_address", frame6(kVm, kAny, a6("ff02::16"), 58, icmp6(143)), nullptr},
+      {"dhcpv6_solicit", dhcpFrom(dhcp6(1, 9, kDuid)), nullptr},
+      {"bound_udp", udpFrom(kVm, kLinkLocal), nullptr},
+   };
+   ASSERT_EQ(configure(other_, {.trusted = 1}), ORR_OK);
+   for (const auto &c : cases) {
+      SCOPED_TRACE(c.name);
+      const FhsDropCounters before = ctx(vm_)->counters;
+      EXPECT_EQ(passes(kVmPort, kTx, c.frame), c.counter == nullptr);
+      FhsDropCounters expected = before;
+      if (c.counter != nullptr) {
+         expected.*c.counter += 1;
+      }
+      EXPECT_EQ(std::memcmp(&ctx(vm_)->counters, &expected, sizeof(expected)), 0) << "only its reason counts";
+      EXPECT_TRUE(passes(kOtherPort, kTx, c.frame)) << "a trusted port";
+      EXPECT_TRUE(passes(kVmPort, kRx, c.frame)) << "towards the VM";
+   }
+   EXPECT_FALSE(passes(kVmPort, kTx, udpFrame({.src = kVm, .ipSrc = Ip4{{10, 9, 9, 9}}}))) << "IPv4 stays the other agent's";
+}
+
+TEST_F(FhsPortTest, dhcpv6_reply_to_a_pending_request_binds_until_release_or_expiry)
+{
+   const Addr6 leased = a6("2001:db8::7"), withdrawn = a6("2001:db8::8");
+   host().clock().advance(5s);   // between two ticks of the port timer
+   ASSERT_TRUE(passes(kVmPort, kTx, dhcpFrom(dhcp6(3, 0x10, kDuid))));
+   const struct {
+      uint32_t xid;
+      Bytes duid;
+   } strangers[] = {{0x11, kDuid}, {0x10, Bytes{0, 3, 9}}};
+   for (const auto &s : strangers) {
+      ASSERT_TRUE(passes(kVmPort, kRx, dhcpTo(dhcp6(7, s.xid, s.duid, {{leased, 3600}}))));
+      EXPECT_FALSE(passes(kVmPort, kTx, udpFrom(kVm, leased))) << "a reply to no request binds nothing";
+   }
+   ASSERT_TRUE(passes(kVmPort, kRx, dhcpTo(dhcp6(7, 0x10, kDuid, {{leased, 3600}, {withdrawn, 0}}))));
+   EXPECT_TRUE(passes(kVmPort, kTx, udpFrom(kVm, leased)));
+   EXPECT_FALSE(passes(kVmPort, kTx, udpFrom(kVm, withdrawn)));
+
+   host().clock().advance(3601s);
+   EXPECT_TRUE(claim(kOtherPort, kIntruder, leased)) << "a lease past its lifetime holds no claim";
+   host().clock().advance(10s);
+   EXPECT_FALSE(passes(kVmPort, kTx, udpFrom(kVm, leased))) << "the lease ran out";
+
+   ASSERT_TRUE(passes(kVmPort, kTx, dhcpFrom(dhcp6(5, 0x12, kDuid))));
+   ASSERT_TRUE(passes(kVmPort, kRx, dhcpTo(dhcp6(7, 0x12, kDuid, {{leased, 3600}}))));
+   ASSERT_TRUE(passes(kVmPort, kTx, udpFrom(kVm, leased)));
+   ASSERT_TRUE(passes(kVmPort, kTx, dhcpFrom(dhcp6(8, 0x13, kDuid, {{leased, 0}}))));
+   EXPECT_FALSE(passes(kVmPort, kTx, udpFrom(kVm, leased))) << "released";
+}
+
+TEST_F(FhsPortTest, first_claim_wins_across_ports_while_its_owner_keeps_using_it)
+{
+   const Addr6 slaac = a6("2001:db8::a");
+   ASSERT_TRUE(claim(kVmPort, kVm, slaac));
+   EXPECT_FALSE(claim(kOtherPort, kIntruder, slaac));
+   EXPECT_EQ(ctx(other_)->counters.claimRefusedDropCnt, 1u);
+   EXPECT_TRUE(logged("Claim of 2001:db8:0:0:0:0:0:a (VLAN 0) refused: bound to another port"));
+   for (int i = 0; i < 12; i++) {
+      host().clock().advance(100s);
+      ASSERT_TRUE(passes(kVmPort, kTx, udpFrom(kVm, slaac))) << "refreshed by its own traffic";
+   }
+   EXPECT_FALSE(claim(kOtherPort, kIntruder, slaac));
+   host().clock().advance(1300s);
+   EXPECT_TRUE(claim(kOtherPort, kIntruder, slaac)) << "the silent owner's binding expired";
+   EXPECT_FALSE(passes(kVmPort, kTx, udpFrom(kVm, slaac)));
+}
+
+TEST_F(FhsPortTest, a_full_port_evicts_its_oldest_dynamic_binding)
+{
+   ASSERT_EQ(configure(vm_, {.bindingLimit = 3, .statics = {key(kVm, kLinkLocal)}}), ORR_OK);
+   const Addr6 first = a6("2001:db8::1"), second = a6("2001:db8::2"), third = a6("2001:db8::3");
+   for (const Addr6 &addr : {first, second, third}) {
+      ASSERT_TRUE(claim(kVmPort, kVm, addr));
+   }
+   EXPECT_TRUE(logged("Binding limit 3 reached: evicted 2001:db8:0:0:0:0:0:1 (VLAN 0)"));
+   EXPECT_EQ(ctx(vm_)->counters.bindingsEvictedCnt, 1u);
+   EXPECT_FALSE(passes(kVmPort, kTx, udpFrom(kVm, first)));
+   for (const Addr6 &addr : {kLinkLocal, second, third}) {
+      EXPECT_TRUE(passes(kVmPort, kTx, udpFrom(kVm, addr)));
+   }
+}
+
+TEST_F(FhsPortTest, an_nd_flood_enters_the_error_state_for_its_period)
+{
+   ASSERT_EQ(configure(vm_, {.ndRateLimit = 5, .errRateLimit = 2, .errRateLimitPeriod = 10, .statics = {key(kVm, kLinkLocal)}}), ORR_OK);
+   const Bytes ns = frame6(kVm, kLinkLocal, kGateway, 58, nd(135, kGateway, kVm));
+   EXPECT_EQ(kept(kVmPort, kTx, std::vector<Bytes>(6, ns)), 5u);
+   EXPECT_EQ(ctx(vm_)->counters.ndRateLimitErrEntryCnt, 1u);
+   host().clock().advance(1s);
+   EXPECT_EQ(kept(kVmPort, kTx, std::vector<Bytes>(4, udpFrom(kVm, kLinkLocal))), 2u) << "every frame counts now";
+   host().clock().advance(20s);
+   EXPECT_EQ(kept(kVmPort, kTx, std::vector<Bytes>(4, udpFrom(kVm, kLinkLocal))), 4u);
+   EXPECT_EQ(ctx(vm_)->counters.ndRateLimitDropCnt, 3u);
+}
+
+TEST_F(FhsPortTest, configurations_are_checked_before_anything_changes)
+{
+   const struct {
+      const char *name;
+      Bytes bytes;
+   } refused[] = {
+      {"version", [] { Bytes b = fhsConfigBytes({}); b[0] = 2; return b; }()},
+      {"length", cat(fhsConfigBytes({}), Bytes{0})},
+      {"limit", fhsConfigBytes({.bindingLimit = FHS_BINDING_LIMIT_MAX + 1})},
+      {"statics_over_the_limit", fhsConfigBytes({.bindingLimit = 1, .statics = {key(kVm, kLinkLocal), key(kVm, kGateway)}})},
+      {"multicast_static", fhsConfigBytes({.statics = {key(kVm, kAllNodes)}})},
+      {"error_rate_not_below_nd_rate", fhsConfigBytes({.ndRateLimit = 4, .errRateLimit = 4, .errRateLimitPeriod = 10})},
+   };
+   for (const auto &c : refused) {
+      EXPECT_EQ(host().sifra().writeProperty(std::string(kFhs) + ".security", vm_, c.bytes), ORR_BAD_PARAM) << c.name;
+   }
+   EXPECT_TRUE(passes(kVmPort, kTx, udpFrom(kVm, kLinkLocal))) << "the static binding stayed";
+   EXPECT_EQ(host().sifra().writeProperty("sifra-generic-tarlin-swsec.security", vm_, configBytes(learningConfig())),
+             ORR_INVALID_HANDLE) << "another agent's property";
+}
+
+TEST_F(FhsPortTest, saved_bindings_keep_their_remaining_lifetimes_on_another_filter)
+{
+   const Addr6 leased = a6("2001:db8::7"), slaac = a6("2001:db8::a");
+   ASSERT_TRUE(passes(kVmPort, kTx, dhcpFrom(dhcp6(3, 0x10, kDuid))));
+   ASSERT_TRUE(passes(kVmPort, kRx, dhcpTo(dhcp6(7, 0x10, kDuid, {{leased, 3600}}))));
+   host().clock().advance(1000s);
+   ASSERT_TRUE(claim(kVmPort, kVm, slaac));
+   ctx(vm_)->counters.raGuardDropCnt = 5;
+   std::vector<uint8_t> blob;
+   ASSERT_EQ(host().migration().saveAsHypervisor(vm_, &blob), ORR_OK);
+   ASSERT_EQ(host().sifra().destroyFilter(vm_), ORR_OK);
+
+   const std::vector<size_t> cuts = {blob.size() - 1, 48 + 104 + 30 + 24 + 10, 48 + 103};
+   for (size_t cut : cuts) {
+      vm_ = create(kFhs, kVmPort);
+      EXPECT_NE(host().migration().restore(vm_, std::span(blob).first(cut)), ORR_OK) << cut;
+      EXPECT_TRUE(passes(kVmPort, kTx, udpFrom(kVm, a6("2001:db8::66")))) << "nothing restored";
+      ASSERT_EQ(host().sifra().destroyFilter(vm_), ORR_OK);
+   }
+   vm_ = create(kFhs, kVmPort);
+   ASSERT_EQ(host().migration().restore(vm_, blob), ORR_OK);
+   EXPECT_EQ(ctx(vm_)->counters.raGuardDropCnt, 5u);
+   EXPECT_FALSE(passes(kVmPort, kTx, udpFrom(kVm, a6("2001:db8::66")))) << "the configuration came along";
+   for (const Addr6 &addr : {kLinkLocal, leased, slaac}) {
+      EXPECT_TRUE(passes(kVmPort, kTx, udpFrom(kVm, addr)));
+   }
+   host().clock().advance(2590s);
+   EXPECT_TRUE(passes(kVmPort, kTx, udpFrom(kVm, leased)));
+   host().clock().advance(20s);
+   EXPECT_FALSE(passes(kVmPort, kTx, udpFrom(kVm, leased))) << "2600 s were left at the save";
+}
+
+// Fails the n-th allocation (then lock, timer) of a port's creation until it succeeds, then a claim's.
+TEST_F(FhsPortTest, every_failure_of_creation_and_learning_is_undone)
+{
+   for (const char *point : {"orr_HeapAllocWithRA", "orr_SpinlockCreate", "orr_TimerAdd"}) {
+      for (uint64_t n = 1;; n++) {
+         SCOPED_TRACE(std::string(point) + " " + std::to_string(n));
+         const uint64_t before = host().faults().calls(point);
+         host().faults().failOnce(point, ORR_NO_MEMORY, n);
+         host::FilterId id = 0;
+         const orr_Status status = host().sifra().createFilter(kFhs, kOtherPort, {}, &id);
+         const bool hit = host().faults().calls(point) - before >= n;
+         host().faults().clear();
+         if (status == ORR_OK) {
+            host().faults().failOnce("orr_HeapAllocWithRA", ORR_NO_MEMORY, 1);
+            EXPECT_FALSE(claim(kOtherPort, kIntruder, a6("fe80::9"))) << "unbound, so not inspected through";
+            host().faults().clear();
+            EXPECT_FALSE(passes(kOtherPort, kTx, udpFrom(kIntruder, a6("fe80::9"))));
+            EXPECT_EQ(host().sifra().destroyFilter(id), ORR_OK);
+            break;
+         }
+         ASSERT_TRUE(hit) << "refused without a failure";
+      }
+   }
+}
+
+}  // namespace
+}  // namespace swsec::testing

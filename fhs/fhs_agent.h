@@ -13,16 +13,10 @@
 
 extern const SifraGenericAgentOps fhsAgentOps;
 
-/*
- * Made when the agent is registered: the bridge table's lock (a failure
- * refuses the agent) and the agent's security property (a failure is
- * logged and tolerated).
- */
-orr_Status FhsAgentAttach(SifraGenericFastPathAgent *agent);
-/* Before the agent's fast path is withdrawn: the property. */
-void FhsAgentDetach(SifraGenericFastPathAgent *agent);
-/* After it was withdrawn, its filters gone: the bridge lock. */
-void FhsAgentRelease(SifraGenericFastPathAgent *agent);
+/* Registers the agent's security property "%s.security" (a failure is logged and costs only the property). */
+orr_Status FhsInitProperty(SifraGenericFastPathAgent *agent);
+/* Withdraws it, if registered. */
+void FhsCleanupProperty(SifraGenericFastPathAgent *agent);
 
 /* Builds the port context with the default configuration; undoes everything on a failure. */
 orr_Status FhsCreateFilter(SifraGenericFilter *filter);

@@ -1,5 +1,6 @@
 /* A port's IPv6 bindings and the bridge table across ports. */
 #include "fhs/fhs_bindings.h"
+#include "fhs/fhs_notify.h"
 
 #include "framework/sifra_generic.h"
 #include "framework/sifra_generic_filter.h"
@@ -9,7 +10,38 @@
 
 #include <cstddef>
 
-constinit FhsBridgeTable fhsBridge = {};
+#include "framework/sifra_generic_lock.h"
+
+constinit FhsBridgeTable fhsBridge = {.users = ORR_MUTEX_INITIALIZER("sifg.fhs.bridgeUsers"), .numPorts = 0,
+                                      .lock = nullptr, .buckets = {}};
+
+orr_Status FhsBridgeJoin(void)
+{
+   orr_Status status = ORR_OK;
+   orr_MutexLock(&fhsBridge.users);
+   if (fhsBridge.numPorts == 0) {
+      status = SifraGenericCreateSpinlock("sifg.fhs.bridge", ORR_SPINLOCK_PLAIN, SifraGenericLockRank::PortFilterMap,
+                                          &fhsBridge.lock);
+      for (orr_ListLinks &bucket : fhsBridge.buckets) {
+         SifraGenericListInit(&bucket);
+      }
+   }
+   if (status == ORR_OK) {
+      fhsBridge.numPorts++;
+   }
+   orr_MutexUnlock(&fhsBridge.users);
+   return status;
+}
+
+void FhsBridgeLeave(void)
+{
+   orr_MutexLock(&fhsBridge.users);
+   if (--fhsBridge.numPorts == 0) {
+      orr_SpinlockDestroy(fhsBridge.lock);
+      fhsBridge.lock = nullptr;
+   }
+   orr_MutexUnlock(&fhsBridge.users);
+}
 
 namespace {
 
@@ -172,6 +204,7 @@ orr_Status FhsAddBinding(FhsContext *ctx, const FhsBindingKey *key, uint8_t meth
    orr_SpinlockUnlock(fhsBridge.lock);
    ctx->numBindings++;
    ctx->numByMethod[MethodIndex(method)]++;
+   FhsPostBindingMsg(ctx, FhsBindingOpAdded, binding);
    return ORR_OK;
 }
 
@@ -184,6 +217,7 @@ void FhsRemoveBinding(FhsContext *ctx, FhsBinding *binding)
    SifraGenericListUnlink(&binding->portLinks);
    ctx->numBindings--;
    ctx->numByMethod[MethodIndex(binding->method)]--;
+   FhsPostBindingMsg(ctx, FhsBindingOpRemoved, binding);
    SifraGenericFree(binding);
 }
 

@@ -118,16 +118,29 @@ struct FhsContext {
    orr_Timer timer;                     /* periodic 10 s, FhsTimerCb; 0 when none */
    orr_Portset *portset;                /* the bridge: claims are judged across its ports */
    uint32_t portId;
+   uint8_t joinedBridge;                /* counted in fhsBridge.numPorts */
    orr_Spinlock configLock;             /* "sifg.fhs.config", reader-writer, rank 4 */
 };
 
-/* The bridge table: every port's bindings by bridge, VLAN and address. */
+/*
+ * The bridge table: every port's bindings by bridge, VLAN and address. It
+ * lives while the agent has ports: the first port's creation makes its
+ * lock, the last port's destruction destroys it, both under `users`, a
+ * sleeping mutex taken before any spinlock.
+ */
 constexpr uint32_t FHS_BRIDGE_BUCKETS = 256;
 struct FhsBridgeTable {
+   orr_Mutex users;                     /* "sifg.fhs.bridgeUsers": numPorts and the lock's life */
+   uint32_t numPorts;
    orr_Spinlock lock;                   /* "sifg.fhs.bridge", rank 5 */
    orr_ListLinks buckets[FHS_BRIDGE_BUCKETS];
 };
 extern FhsBridgeTable fhsBridge;
+
+/* Counts a port in, making the table at the first; the lock's creation status. */
+orr_Status FhsBridgeJoin(void);
+/* Counts a port out (one that joined), destroying the lock at the last. */
+void FhsBridgeLeave(void);
 
 /* Restarts a limiter: one-second interval, already ended, count 0. */
 static inline void FhsRateLimitInit(SifraGenericRateLimit *rateLimit, uint32_t limit)

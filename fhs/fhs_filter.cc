@@ -9,7 +9,6 @@
 #include "platform/orr_text.h"
 
 #define FHS_CONFIG_LOCK_NAME "sifg.fhs.config"
-#define FHS_BRIDGE_LOCK_NAME "sifg.fhs.bridge"
 #define FHS_ND_RATE_LIMIT_LOCK_NAME "sifg.fhs.ndratelimit"
 
 /* Ethernet, two tags, the fixed header and TCP's: the common path reads no further. */
@@ -179,6 +178,12 @@ orr_Status FhsCreateFilter(SifraGenericFilter *filter)
       SG_LOG(ORR_LOG_ERROR, "%s: Could not allocate IPv6 configuration lock", filter->name);
       goto out_destroy_context;
    }
+   status = FhsBridgeJoin();
+   if (status != ORR_OK) {
+      SG_LOG(ORR_LOG_ERROR, "%s: Could not allocate the bridge table lock", filter->name);
+      goto out_destroy_context;
+   }
+   ctx->joinedBridge = 1;
    status = SifraGenericCreateSpinlock(FHS_ND_RATE_LIMIT_LOCK_NAME, ORR_SPINLOCK_PLAIN, SifraGenericLockRank::RateLimit,
                                        &ctx->ndRateLimitLock);
    if (status != ORR_OK) {
@@ -238,6 +243,9 @@ orr_Status FhsDestroyFilter(SifraGenericFilter *filter)
    if (ctx->ndRateLimitLock != nullptr) {
       orr_SpinlockDestroy(ctx->ndRateLimitLock);
       ctx->ndRateLimitLock = nullptr;
+   }
+   if (ctx->joinedBridge != 0) {
+      FhsBridgeLeave();
    }
    SifraGenericFree(ctx);
    filter->agentData = nullptr;
@@ -319,23 +327,11 @@ constinit const orr_SifraPropertyOps fhsPropOps = {
 
 }  // namespace
 
-orr_Status FhsAgentAttach(SifraGenericFastPathAgent *agent)
+orr_Status FhsInitProperty(SifraGenericFastPathAgent *agent)
 {
    agent->propHandle = nullptr;
-   orr_Status status = SifraGenericCreateSpinlock(FHS_BRIDGE_LOCK_NAME, ORR_SPINLOCK_PLAIN,
-                                                  SifraGenericLockRank::PortFilterMap, &fhsBridge.lock);
-   if (status != ORR_OK) {
-      SG_LOG(ORR_LOG_ERROR, "%s: Failed to create lock (%#x): %s", agent->name, SifraGenericStatusValue(status),
-             orr_StatusToString(status));
-      fhsBridge.lock = nullptr;
-      return status;
-   }
-   for (orr_ListLinks &bucket : fhsBridge.buckets) {
-      SifraGenericListInit(&bucket);
-   }
-
    char propertyName[FHS_PROPERTY_NAME_LEN];
-   status = orr_StringFormat(propertyName, sizeof(propertyName), 0, "%s.security", agent->name);
+   orr_Status status = orr_StringFormat(propertyName, sizeof(propertyName), 0, "%s.security", agent->name);
    if (status == ORR_OK) {
       orr_SifraPropertyHandle handle = nullptr;
       status = orr_SifraPropertyRegister(&handle, propertyName, &fhsPropOps);
@@ -347,22 +343,14 @@ orr_Status FhsAgentAttach(SifraGenericFastPathAgent *agent)
    }
    SG_LOG(ORR_LOG_ERROR, "%s: Failed to register security property handler (%#x): %s", agent->name,
           SifraGenericStatusValue(status), orr_StatusToString(status));
-   return ORR_OK;
+   return status;
 }
 
-void FhsAgentDetach(SifraGenericFastPathAgent *agent)
+void FhsCleanupProperty(SifraGenericFastPathAgent *agent)
 {
    if (agent->propHandle != nullptr) {
       SG_LOG(ORR_LOG_INFO, "%s: Unregistering security property handler", agent->name);
       orr_SifraPropertyUnregister(agent->propHandle);
       agent->propHandle = nullptr;
-   }
-}
-
-void FhsAgentRelease(SifraGenericFastPathAgent * /* agent */)
-{
-   if (fhsBridge.lock != nullptr) {
-      orr_SpinlockDestroy(fhsBridge.lock);
-      fhsBridge.lock = nullptr;
    }
 }

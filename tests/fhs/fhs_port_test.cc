@@ -2,6 +2,7 @@
 // switch-security agent on the same port: guards, learning, claims across
 // ports, the binding cap, the ND limiter and failures.
 #include "fhs/fhs_context.h"
+#include "fhs/fhs_notify.h"
 #include "framework/sifra_generic_filter.h"
 #include "support/host_fixture.h"
 #include "support/ipv6_frames.h"
@@ -144,7 +145,18 @@ TEST_F(FhsPortTest, dhcpv6_reply_to_a_pending_request_binds_until_release_or_exp
       ASSERT_TRUE(passes(kVmPort, kRx, dhcpTo(dhcp6(7, s.xid, s.duid, {{leased, 3600}}))));
       EXPECT_FALSE(passes(kVmPort, kTx, udpFrom(kVm, leased))) << "a reply to no request binds nothing";
    }
+   host().portsets().takePosted();
    ASSERT_TRUE(passes(kVmPort, kRx, dhcpTo(dhcp6(7, 0x10, kDuid, {{leased, 3600}, {withdrawn, 0}}))));
+   const auto posted = host().portsets().takePosted();
+   ASSERT_EQ(posted.size(), 1u);
+   EXPECT_EQ(posted[0].name, "fhs.binding.added");
+   FhsBindingMsgPayload added{};
+   ASSERT_EQ(posted[0].payload.size(), sizeof(added));
+   std::memcpy(&added, posted[0].payload.data(), sizeof(added));
+   const FhsBindingKey expected = key(kVm, leased);
+   EXPECT_EQ(std::memcmp(posted[0].payload.data() + offsetof(FhsBindingMsgPayload, key), &expected, sizeof(expected)), 0);
+   EXPECT_EQ(added.method, FhsBindDhcpv6);
+   EXPECT_EQ(added.lifetime, 3600u);
    EXPECT_TRUE(passes(kVmPort, kTx, udpFrom(kVm, leased)));
    EXPECT_FALSE(passes(kVmPort, kTx, udpFrom(kVm, withdrawn)));
 
@@ -156,7 +168,9 @@ TEST_F(FhsPortTest, dhcpv6_reply_to_a_pending_request_binds_until_release_or_exp
    ASSERT_TRUE(passes(kVmPort, kTx, dhcpFrom(dhcp6(5, 0x12, kDuid))));
    ASSERT_TRUE(passes(kVmPort, kRx, dhcpTo(dhcp6(7, 0x12, kDuid, {{leased, 3600}}))));
    ASSERT_TRUE(passes(kVmPort, kTx, udpFrom(kVm, leased)));
+   host().portsets().takePosted();
    ASSERT_TRUE(passes(kVmPort, kTx, dhcpFrom(dhcp6(8, 0x13, kDuid, {{leased, 0}}))));
+   ASSERT_EQ(host().portsets().takePosted().at(0).name, "fhs.binding.removed");
    EXPECT_FALSE(passes(kVmPort, kTx, udpFrom(kVm, leased))) << "released";
 }
 

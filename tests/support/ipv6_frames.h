@@ -97,7 +97,9 @@ inline Bytes fhsConfigBytes(const FhsPortConfig &c)
    header.errRateLimitPeriod = c.errRateLimitPeriod;
    Bytes out(sizeof(header) + c.statics.size() * sizeof(FhsBindingKey));
    std::memcpy(out.data(), &header, sizeof(header));
-   std::memcpy(out.data() + sizeof(header), c.statics.data(), c.statics.size() * sizeof(FhsBindingKey));
+   if (!c.statics.empty()) {
+      std::memcpy(out.data() + sizeof(header), c.statics.data(), c.statics.size() * sizeof(FhsBindingKey));
+   }
    return out;
 }
 

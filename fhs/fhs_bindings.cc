@@ -145,11 +145,11 @@ FhsBinding *FhsFindBinding(FhsContext *ctx, uint16_t vlanId, const uint8_t *mac,
    return nullptr;
 }
 
-FhsBinding *FhsFindAddress(FhsContext *ctx, uint16_t vlanId, const uint8_t *addr)
+FhsBinding *FhsFindDynamicAddress(FhsContext *ctx, const uint8_t *addr)
 {
    for (orr_ListLinks *links = ctx->bindingList.next; links != &ctx->bindingList; links = links->next) {
       FhsBinding *binding = FromPortLinks(links);
-      if (binding->key.vlanId == vlanId && SameAddr(binding->key.addr, addr)) {
+      if (binding->method != FhsBindStatic && SameAddr(binding->key.addr, addr)) {
          return binding;
       }
    }

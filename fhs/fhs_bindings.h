@@ -13,8 +13,8 @@
 /* The binding with this key, or null. */
 FhsBinding *FhsFindBinding(FhsContext *ctx, uint16_t vlanId, const uint8_t *mac, const uint8_t *addr);
 
-/* The first binding of the port for this VLAN and address, whatever its MAC; or null. */
-FhsBinding *FhsFindAddress(FhsContext *ctx, uint16_t vlanId, const uint8_t *addr);
+/* The first dynamic binding of the port for this address, whatever its VLAN and MAC; or null. */
+FhsBinding *FhsFindDynamicAddress(FhsContext *ctx, const uint8_t *addr);
 
 /*
  * Binds `key` by `method` until `expiry` (0: never). An existing binding

@@ -1,4 +1,5 @@
-// The IPv6 header chain walker and the DHCPv6 parser on arbitrary bytes.
+// The IPv6 header chain walker, the DHCPv6 parser and the address text
+// parser on arbitrary bytes.
 // Each gets an exact-size copy, so that a read past what it was given is
 // an AddressSanitizer report.
 //
@@ -6,6 +7,7 @@
 // cut's number of bytes left out of its view; the parser sees the packet.
 #include "fhs/fhs_dhcpv6.h"
 #include "fhs/fhs_ipv6_chain.h"
+#include "fhs/fhs_nexo.h"
 
 #include <cstdint>
 #include <cstdlib>
@@ -35,5 +37,10 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size)
        (msg.clientId < message.data() || msg.clientId + msg.clientIdLen > message.data() + length)) {
       std::abort();
    }
+
+   std::vector<char> text(data + 1, data + size);
+   text.push_back('\0');
+   uint8_t addr[16];
+   (void)FhsParseIpv6(text.data(), addr);
    return 0;
 }

@@ -20,6 +20,10 @@ enum class SwSecNexoNodeId : uint32_t {
    Vmi = 5005,
    StartTest = 5006,
    StopTest = 5007,
+   Ipv6 = 5008,
+   Ipv6Summary = 5009,
+   Ipv6Bindings = 5010,
+   Ipv6Clear = 5011,
 };
 
 /* The branch, published in the module information. */

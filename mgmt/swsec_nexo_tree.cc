@@ -6,6 +6,7 @@
  */
 #include "mgmt/swsec_nexo.h"
 
+#include "fhs/fhs_nexo.h"
 #include "mgmt/swsec_nexo_records.h"
 #include "swsec/swsec_vmi.h"
 
@@ -277,13 +278,28 @@ static constexpr Nexo_NodeDef swsecNexoNodes[] = {
    {.id = SwSecNexoId(SwSecNexoNodeId::StopTest), .name = "stopTest",
     .parentId = SwSecNexoId(SwSecNexoNodeId::Root), .kind = NEXO_NODE_LEAF, .list = nullptr,
     .get = Nexo_NULL_Get, .set = SwSecNexoStopTest, .minArgs = 0, .maxArgs = 0, .output = nullptr},
+   /* The IPv6 first-hop security agent's ports. */
+   {.id = SwSecNexoId(SwSecNexoNodeId::Ipv6), .name = "ipv6", .parentId = SwSecNexoId(SwSecNexoNodeId::Root),
+    .kind = NEXO_NODE_LIST, .list = FhsNexoListPorts, .get = nullptr, .set = nullptr, .minArgs = 0, .maxArgs = 0,
+    .output = nullptr},
+   {.id = SwSecNexoId(SwSecNexoNodeId::Ipv6Summary), .name = "summary", .parentId = SwSecNexoId(SwSecNexoNodeId::Ipv6),
+    .kind = NEXO_NODE_LEAF, .list = nullptr, .get = FhsNexoSummaryGet, .set = Nexo_NULL_Set, .minArgs = 0,
+    .maxArgs = 0, .output = &fhsNexoSummaryRecord},
+   {.id = SwSecNexoId(SwSecNexoNodeId::Ipv6Bindings), .name = "bindings",
+    .parentId = SwSecNexoId(SwSecNexoNodeId::Ipv6), .kind = NEXO_NODE_LEAF_LIST, .list = FhsNexoListBindings,
+    .get = FhsNexoBindingGet, .set = Nexo_NULL_Set, .minArgs = 0, .maxArgs = 0, .output = &fhsNexoBindingRecord},
+   {.id = SwSecNexoId(SwSecNexoNodeId::Ipv6Clear), .name = "clear", .parentId = SwSecNexoId(SwSecNexoNodeId::Ipv6),
+    .kind = NEXO_NODE_LEAF, .list = nullptr, .get = Nexo_NULL_Get, .set = FhsNexoClear, .minArgs = 0, .maxArgs = 1,
+    .output = nullptr},
 };
 
-static_assert(SwSecNexoCountOf(swsecNexoNodes) == 8);
+static_assert(SwSecNexoCountOf(swsecNexoNodes) == 12);
 
 static constexpr const Nexo_RecordDef *swsecNexoRecords[] = {
    &swsecNexoFeatureSummaryRecord,
    &swsecNexoVmiSummaryRecord,
+   &fhsNexoSummaryRecord,
+   &fhsNexoBindingRecord,
 };
 
 constinit const Nexo_Tree swsecNexoTree = {

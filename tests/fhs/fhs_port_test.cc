@@ -272,6 +272,36 @@ TEST_F(FhsPortTest, saved_bindings_keep_their_remaining_lifetimes_on_another_fil
    EXPECT_FALSE(passes(kVmPort, kTx, udpFrom(kVm, leased))) << "2600 s were left at the save";
 }
 
+TEST_F(FhsPortTest, nodes_show_the_summary_and_bindings_and_clear_them)
+{
+   ASSERT_TRUE(claim(kVmPort, kVm, a6("2001:db8::a")));
+   ASSERT_TRUE(claim(kVmPort, kVm, a6("2001:db8::b")));
+   ASSERT_FALSE(passes(kVmPort, kTx, udpFrom(kVm, a6("2001:db8::66"))));
+   std::vector<int64_t> ports;
+   ASSERT_EQ(host().nexo().list("/ipv6", &ports), ORR_OK);
+   EXPECT_EQ(ports, (std::vector<int64_t>{kVmPort, kOtherPort}));
+   host::NexoRecord summary;
+   ASSERT_EQ(host().nexo().get("/ipv6/7/summary", &summary), ORR_OK);
+   EXPECT_EQ(summary.value("numBindings"), "3");
+   EXPECT_EQ(summary.value("numFcfs"), "2");
+   EXPECT_EQ(summary.value("sourceGuardDropCnt"), "1");
+   EXPECT_EQ(summary.value("portMode"), "untrusted");
+   host::NexoRecord binding;
+   ASSERT_EQ(host().nexo().get("/ipv6/7/bindings/1", &binding), ORR_OK);
+   EXPECT_EQ(binding.value("addr"), "2001:db8:0:0:0:0:0:a");
+   EXPECT_EQ(binding.value("mac"), "02:00:00:00:00:07");
+   EXPECT_EQ(binding.value("timeRemaining"), "600");
+
+   EXPECT_EQ(host().nexo().set("/ipv6/7/clear", {"2001:db8::a"}), ORR_OK);
+   EXPECT_FALSE(passes(kVmPort, kTx, udpFrom(kVm, a6("2001:db8::a"))));
+   EXPECT_TRUE(passes(kVmPort, kTx, udpFrom(kVm, a6("2001:db8::b"))));
+   EXPECT_EQ(host().nexo().set("/ipv6/7/clear", {"2001:db8::a::"}), ORR_BAD_PARAM);
+   EXPECT_EQ(host().nexo().set("/ipv6/7/clear", {}), ORR_OK);
+   EXPECT_FALSE(passes(kVmPort, kTx, udpFrom(kVm, a6("2001:db8::b"))));
+   EXPECT_TRUE(passes(kVmPort, kTx, udpFrom(kVm, kLinkLocal))) << "static bindings stay";
+   EXPECT_EQ(host().nexo().get("/ipv6/9/summary", &summary), ORR_NOT_FOUND);
+}
+
 // Fails the n-th allocation (then lock, timer) of a port's creation until it succeeds, then a claim's.
 TEST_F(FhsPortTest, every_failure_of_creation_and_learning_is_undone)
 {

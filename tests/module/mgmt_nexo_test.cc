@@ -46,7 +46,8 @@ TEST_F(NexoTest, the_branch_is_installed_while_the_module_is_loaded)
    EXPECT_EQ(host().nexo().paths(),
              (std::vector<std::string>{"/", "/createAgent", "/security", "/security/<key>/featureSummary",
                                        "/security/<key>/clearVmi", "/security/<key>/vmi", "/startTest",
-                                       "/stopTest"}));
+                                       "/stopTest", "/ipv6", "/ipv6/<key>/summary", "/ipv6/<key>/bindings",
+                                       "/ipv6/<key>/clear"}));
    ASSERT_EQ(host().unload(), ORR_OK);
    EXPECT_FALSE(host().nexo().installed());
    EXPECT_THROW((void)host().nexo().set("/startTest", {}), std::invalid_argument);

@@ -1,6 +1,7 @@
 // The IPv6 header chain walker and the DHCPv6 parser on crafted packets.
 #include "fhs/fhs_dhcpv6.h"
 #include "fhs/fhs_ipv6_chain.h"
+#include "fhs/fhs_nexo.h"
 #include "support/ipv6_frames.h"
 
 #include <gtest/gtest.h>
@@ -91,6 +92,19 @@ TEST(FhsDhcpv6Test, reads_client_id_and_ia_addresses)
    };
    for (const auto &c : refused) {
       EXPECT_EQ(FhsDhcpv6Parse(c.bytes.data(), uint32_t(c.bytes.size()), &msg), -1) << c.name;
+   }
+}
+
+TEST(FhsTextTest, reads_ipv6_addresses_in_full_and_short_forms)
+{
+   uint8_t addr[16];
+   for (const char *text : {"2001:db8::1", "::", "::1", "fe80::", "1:2:3:4:5:6:7:8", "1::8", "1:2:3:4:5:6::8", "FFFF::a"}) {
+      ASSERT_TRUE(FhsParseIpv6(text, addr)) << text;
+      EXPECT_EQ(Addr6(std::to_array(addr)), a6(text)) << text;
+   }
+   for (const char *text : {"", ":", ":::", "1:2", "1::2::3", "1:2:3:4:5:6:7:8:9", "1:2:3:4:5:6:7::8", "12345::", "1:",
+                            "g::", "::1.2.3.4", ":1::"}) {
+      EXPECT_FALSE(FhsParseIpv6(text, addr)) << text;
    }
 }
 

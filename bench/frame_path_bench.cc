@@ -20,6 +20,7 @@
 #include "module_port.h"
 
 #include "host/host.h"
+#include "support/ipv6_frames.h"
 
 #include <benchmark/benchmark.h>
 
@@ -65,6 +66,9 @@ struct Setup {
    std::unique_ptr<MinimalLoop> minimal;
    std::unique_ptr<BpfSourceCheck> bpf;
    std::unique_ptr<host::FrameList> moduleCommonList;
+   // The IPv6 common path: UDP/IPv6 from bound sources, no extension headers.
+   std::unique_ptr<ModulePort> ipv6Port;
+   std::unique_ptr<host::FrameList> ipv6CommonList;
    std::unique_ptr<host::FrameList> minimalCommonList;
    std::unique_ptr<host::FrameList> minimalMixList;
    // Per thread, lists of kThreadListFrames common frames.
@@ -94,6 +98,15 @@ std::unique_ptr<Setup> makeSetup(host::Host &host, uint32_t bindingCount)
    setup->minimal = std::make_unique<MinimalLoop>(setup->bindings);
    setup->bpf = std::make_unique<BpfSourceCheck>(setup->bindings);
    setup->moduleCommonList = setup->commonPort->makeList(setup->common);
+   setup->ipv6Port =
+      std::make_unique<ModulePort>(ModulePort::Ipv6{}, host, 300 + bindingCount, setup->bindings, true);
+   std::vector<MixFrame> ipv6Common(setup->common.size());
+   for (size_t i = 0; i < ipv6Common.size(); ++i) {
+      const Binding &binding = setup->bindings[i % setup->bindings.size()];
+      ipv6Common[i].bytes = testing::frame6(binding.mac, ModulePort::ipv6Of(binding), testing::a6("2001:db8::1"), 17,
+                                            testing::udp6(40000, 53, testing::Bytes(18, 0)));
+   }
+   setup->ipv6CommonList = setup->ipv6Port->makeList(ipv6Common);
    setup->minimalCommonList = setup->commonPort->makeList(setup->common);
    setup->minimalMixList = setup->port->makeList(setup->mix);
    for (uint32_t thread = 0; thread < 2; ++thread) {
@@ -325,6 +338,8 @@ void countAll(const std::vector<std::unique_ptr<Setup>> &setups)
       const size_t frames = s->common.size();
       countInstructions("module/common/" + n, frames,
                         [s] { benchmark::DoNotOptimize(s->commonPort->judge(*s->moduleCommonList)); });
+      countInstructions("ipv6/common/" + n, frames,
+                        [s] { benchmark::DoNotOptimize(s->ipv6Port->judge(*s->ipv6CommonList)); });
       countInstructions("minimal/common/" + n, frames,
                         [s] { benchmark::DoNotOptimize(s->minimal->run(s->minimalCommonList->list())); });
       countInstructions("minimal-hdr/common/" + n, frames,

@@ -8,6 +8,7 @@
 
 #include "host/host.h"
 
+#include <array>
 #include <cstdint>
 #include <memory>
 #include <vector>
@@ -22,6 +23,11 @@ public:
    // a mix with ARP frames judged again and again is judged alike).
    // Throws std::runtime_error when the module refuses.
    ModulePort(host::Host &host, uint32_t portId, const std::vector<Binding> &bindings, bool arpLimits);
+   // The IPv6 agent's port instead, every feature on an untrusted port (ND
+   // rate limiting with `arpLimits`), each binding's MAC bound to its
+   // ipv6Of address.
+   struct Ipv6 {};
+   ModulePort(Ipv6, host::Host &host, uint32_t portId, const std::vector<Binding> &bindings, bool arpLimits);
    ~ModulePort();
    ModulePort(const ModulePort &) = delete;
    ModulePort &operator=(const ModulePort &) = delete;
@@ -37,7 +43,12 @@ public:
    // Module heap bytes the port holds: its filter, context and database.
    uint64_t heapBytes() const { return heapBytes_; }
 
+   // The IPv6 address a binding's IPv4 address stands for on the IPv6 port.
+   static std::array<uint8_t, 16> ipv6Of(const Binding &binding);
+
 private:
+   void attach(const char *agent);
+
    host::Host &host_;
    host::FilterId id_ = 0;
    const orr_SifraFastPathOps *ops_ = nullptr;

@@ -8,25 +8,12 @@
 
 namespace {
 
-/* Without its property an agent still works; the failure is logged there. */
-orr_Status SwSecAgentAttach(SifraGenericFastPathAgent *agent)
-{
-   (void)SifraGenericFWInitProperty(agent);
-   return ORR_OK;
-}
-
-orr_Status FhsAgentAttach(SifraGenericFastPathAgent *agent)
-{
-   (void)FhsInitProperty(agent);
-   return ORR_OK;
-}
-
 constinit const SifraGenericAgentKind sifraGenericAgentKinds[] = {
-   {.name = FHS_AGENT_NAME, .ops = &fhsAgentOps, .attach = FhsAgentAttach, .detach = FhsCleanupProperty,
-    .release = nullptr},
-   /* Every other name runs the switch-security callbacks. */
-   {.name = nullptr, .ops = &sifraGenericFwFastPathOps, .attach = SwSecAgentAttach,
-    .detach = SifraGenericFWCleanupProperty, .release = nullptr},
+   {.name = FHS_AGENT_NAME, .ops = &fhsAgentOps, .initProperty = FhsInitProperty,
+    .cleanupProperty = FhsCleanupProperty},
+   /* Every other name runs the switch-security callbacks (the property only for the built-in name). */
+   {.name = nullptr, .ops = &sifraGenericFwFastPathOps, .initProperty = SifraGenericFWInitProperty,
+    .cleanupProperty = SifraGenericFWCleanupProperty},
 };
 
 }  // namespace

@@ -96,17 +96,14 @@ static orr_Status SifraGenericCreateAgent(char *text)
       goto out_destroy_lock;
    }
 
-   status = kind->attach(agent);
-   if (status != ORR_OK) {
-      goto out_unregister;
+   /* Without its property the agent still works; the failure is logged there. */
+   if (kind->initProperty != nullptr) {
+      (void)kind->initProperty(agent);
    }
 
    SifraGenericListAppend(&agentList, &agent->links);
    return ORR_OK;
 
-out_unregister:
-   orr_SifraUnregisterFastPath(agent->fastPath);
-   agent->fastPath = nullptr;
 out_destroy_lock:
    orr_SpinlockDestroy(agent->lock);
    agent->lock = nullptr;
@@ -179,14 +176,13 @@ orr_Status SifraGenericAgentPropWrite(void * /* portset */, void * /* port */, v
 void SifraGenericCleanupFastPathAgent(SifraGenericFastPathAgent *agent)
 {
    const SifraGenericAgentKind *kind = SifraGenericAgentKindOf(agent->name);
-   kind->detach(agent);
+   if (kind->cleanupProperty != nullptr) {
+      kind->cleanupProperty(agent);
+   }
 
    if (agent->fastPath != nullptr) {
       orr_SifraUnregisterFastPath(agent->fastPath);
       agent->fastPath = nullptr;
-   }
-   if (kind->release != nullptr) {
-      kind->release(agent);
    }
 
    /* An attach callback still scheduled would run on a freed agent. */

@@ -105,17 +105,16 @@ static_assert(offsetof(SifraGenericFastPathAgent, attachTimer) == 336);
 static_assert(offsetof(SifraGenericFastPathAgent, attachRescan) == 344);
 
 /*
- * What an agent's name makes of it: its callbacks, what is made for it once
- * the host registered it (`attach`: a failure refuses the agent), what goes
- * before its fast path is withdrawn (`detach`) and after (`release`, may be
- * null: the host has destroyed the agent's filters by then).
+ * What an agent's name makes of it: its callbacks and its per-agent
+ * property, registered once the host registered the agent (a failure is
+ * logged there and costs only the property; may be null) and withdrawn
+ * first thing at its release (may be null).
  */
 struct SifraGenericAgentKind {
    const char *name;                            /* null: any other name */
    const SifraGenericAgentOps *ops;
-   orr_Status (*attach)(SifraGenericFastPathAgent *agent);
-   void (*detach)(SifraGenericFastPathAgent *agent);
-   void (*release)(SifraGenericFastPathAgent *agent);
+   orr_Status (*initProperty)(SifraGenericFastPathAgent *agent);
+   void (*cleanupProperty)(SifraGenericFastPathAgent *agent);
 };
 
 /* The kind of an agent named `name` (compared over the stored name's bytes). */

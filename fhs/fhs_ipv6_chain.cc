@@ -55,11 +55,14 @@ FhsChainVerdict FhsWalkIpv6Chain(const uint8_t *ip6, uint32_t viewLen, uint32_t 
    chain->fragmented = 0;
    chain->laterFragment = 0;
    chain->numHeaders = 0;
-   if (l3Len < FHS_IPV6_HEADER_LEN || (ip6[0] >> 4) != 6) {
+   if (l3Len < FHS_IPV6_HEADER_LEN) {
       return FhsChainMalformed;
    }
    if (viewLen < FHS_IPV6_HEADER_LEN) {
       return FhsChainNeedView;
+   }
+   if ((ip6[0] >> 4) != 6) {
+      return FhsChainMalformed;
    }
    const uint32_t packetLen = FHS_IPV6_HEADER_LEN + LoadBe16(ip6 + 4);
    if (packetLen > l3Len) {

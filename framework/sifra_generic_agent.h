@@ -117,7 +117,10 @@ struct SifraGenericAgentKind {
    void (*cleanupProperty)(SifraGenericFastPathAgent *agent);
 };
 
-/* The kind of an agent named `name` (compared over the stored name's bytes). */
+/*
+ * The kind of an agent named `name` (compared over the stored name's bytes),
+ * from the module's table of agents (module/agent_kinds.cc).
+ */
 const SifraGenericAgentKind *SifraGenericAgentKindOf(const char *name);
 
 /* The handle the host knows the agent by. */

@@ -1,7 +1,7 @@
 /* What the module image publishes to the host loader. */
-#include "framework/module_entry.h"
 #include "framework/sifra_generic.h"
 #include "mgmt/swsec_nexo.h"
+#include "module/module_entry.h"
 #include "platform/orr_module.h"
 #include "swsec/swsec_port_db_export.h"
 

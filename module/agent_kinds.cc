@@ -1,4 +1,7 @@
-/* The agents the module can make, by name: the composition of the module's agents. */
+/*
+ * The agents the module can make, by name: the composition of the module's
+ * agents. A further agent is one entry before the last.
+ */
 #include "framework/sifra_generic_agent.h"
 
 #include "fhs/fhs_agent.h"

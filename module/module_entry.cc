@@ -1,5 +1,5 @@
 /* The module's entry and exit, called by the host loader. */
-#include "framework/module_entry.h"
+#include "module/module_entry.h"
 
 #include "framework/sifra_generic.h"
 #include "framework/sifra_generic_agent.h"

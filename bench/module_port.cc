@@ -45,7 +45,7 @@ ModulePort::ModulePort(host::Host &host, uint32_t portId, const std::vector<Bind
       entry.ip = binding.ip.bytes;
       config.statics.push_back(entry);
    }
-   if (host.sifra().writeProperty(kSecurityProperty, id_, testing::configBytes(config)) != ORR_OK) {
+   if (host.sifra().writeProperty(kSecurityProperty, id_, testing::configRecord(config)) != ORR_OK) {
       (void)host.sifra().destroyFilterAsHypervisor(id_);
       throw std::runtime_error("security property write refused");
    }

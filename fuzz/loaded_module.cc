@@ -25,7 +25,7 @@ host::FilterId createPort(host::Host &host, uint32_t portId, const testing::Port
    if (host.sifra().createFilter(kAgent, portId, filterConfig, &id) != ORR_OK) {
       fail("createFilter");
    }
-   if (host.sifra().writeProperty(kSecurityProperty, id, testing::configBytes(config)) != ORR_OK) {
+   if (host.sifra().writeProperty(kSecurityProperty, id, testing::configRecord(config)) != ORR_OK) {
       fail("security property write");
    }
    return id;
@@ -41,7 +41,7 @@ LoadedModule *make()
    module->host.portsets().addPort("vs0", kEnforcingPort);
    module->host.portsets().addPort("vs0", kLearningPort);
    // The VM of the test captures, bound statically so that source checks pass for it.
-   const testing::StaticBinding vm{.vlanId = 0, .mac = {0x02, 0x00, 0x5e, 0xc0, 0x00, 0x01}, .ip = {192, 0, 2, 101}};
+   const testing::StaticBinding vm{.vlan = 0, .mac = {0x02, 0x00, 0x5e, 0xc0, 0x00, 0x01}, .ip = {192, 0, 2, 101}};
    module->enforcing = createPort(module->host, kEnforcingPort, testing::enforcingConfig({vm}));
    module->learning = createPort(module->host, kLearningPort, testing::learningConfig());
    module->forgetRecords();

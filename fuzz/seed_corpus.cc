@@ -117,10 +117,10 @@ int main(int argc, char **argv)
       return 1;
    }
 
-   using swsec::testing::configBytes;
-   const swsec::testing::StaticBinding vm{.vlanId = 0, .mac = {0x02, 0, 0x5e, 0xc0, 0, 1}, .ip = {192, 0, 2, 101}};
-   write(controlDir / "security-learning", {0, 0}, configBytes(swsec::testing::learningConfig()));
-   write(controlDir / "security-enforcing", {0, 1}, configBytes(swsec::testing::enforcingConfig({vm, vm})));
+   using swsec::testing::configRecord;
+   const swsec::testing::StaticBinding vm{.vlan = 0, .mac = {0x02, 0, 0x5e, 0xc0, 0, 1}, .ip = {192, 0, 2, 101}};
+   write(controlDir / "security-learning", {0, 0}, configRecord(swsec::testing::learningConfig()));
+   write(controlDir / "security-enforcing", {0, 1}, configRecord(swsec::testing::enforcingConfig({vm, vm})));
    for (uint8_t type = 0; type < 16; ++type) {
       // Request ID 1, then the message type as the payload's first u32.
       write(controlDir / ("ioctl-" + std::to_string(type)), {1, 0, 0, 0, 0, 1}, {type, 0, 0, 0, 0, 0, 0, 0});

@@ -41,7 +41,7 @@ protected:
       vm_ = create(kFhs, kVmPort);
       other_ = create(kFhs, kOtherPort);
       ASSERT_EQ(host().sifra().writeProperty("sifra-generic-tarlin-swsec.security", swsec_,
-                                             configBytes(enforcingConfig())), ORR_OK);
+                                             configRecord(enforcingConfig())), ORR_OK);
       ASSERT_EQ(configure(vm_, {.statics = {key(kVm, kLinkLocal)}}), ORR_OK);
       ASSERT_EQ(configure(other_, {}), ORR_OK);
    }
@@ -236,7 +236,7 @@ TEST_F(FhsPortTest, configurations_are_checked_before_anything_changes)
       EXPECT_EQ(host().sifra().writeProperty(std::string(kFhs) + ".security", vm_, c.bytes), ORR_BAD_PARAM) << c.name;
    }
    EXPECT_TRUE(passes(kVmPort, kTx, udpFrom(kVm, kLinkLocal))) << "the static binding stayed";
-   EXPECT_EQ(host().sifra().writeProperty("sifra-generic-tarlin-swsec.security", vm_, configBytes(learningConfig())),
+   EXPECT_EQ(host().sifra().writeProperty("sifra-generic-tarlin-swsec.security", vm_, configRecord(learningConfig())),
              ORR_INVALID_HANDLE) << "another agent's property";
 }
 

@@ -234,7 +234,7 @@ TEST_F(FilterTest, the_security_property_reads_back_the_header_and_the_static_ke
    EXPECT_EQ(host().sifra().pollProperty(property, id), 62u);
    Bytes larger(62 + 12);
    EXPECT_EQ(host().sifra().readProperty(property, id, larger), ORR_OK);
-   EXPECT_EQ(larger, [&] { Bytes b = configBytes(config); b.resize(62 + 12); return b; }());
+   EXPECT_EQ(larger, [&] { Bytes b = configRecord(config); b.resize(62 + 12); return b; }());
 
    Bytes cut(61);
    EXPECT_EQ(host().sifra().readProperty(property, id, cut), ORR_BAD_PARAM);

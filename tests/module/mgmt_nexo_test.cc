@@ -248,7 +248,7 @@ TEST_P(ClearTest, clears_what_it_names_and_never_a_static_binding)
       if (c.args.size() != 1) {
          const StaticBinding key = binding(static_cast<uint16_t>(std::stoi(c.args[1])), Mac::parse(c.args[2]),
                                            Ip4::parse(c.args[3]));
-         const Bytes record = configBytes({.statics = {key}});
+         const Bytes record = configRecord({.statics = {key}});
          clear.insert(clear.end(), record.end() - 12, record.end());
       }
       EXPECT_EQ(host().sifra().sendIoctl(id, 4, clear), ORR_OK);

@@ -51,7 +51,7 @@ inline Bytes typeOnly(uint32_t type)
 inline Bytes setFeaturesPayload(const PortConfig &config)
 {
    Bytes bytes = typeOnly(7);
-   const Bytes record = configBytes(config);
+   const Bytes record = configRecord(config);
    bytes.insert(bytes.end(), record.begin(), record.end());
    return bytes;
 }
@@ -120,7 +120,7 @@ protected:
 
    orr_Status writeConfig(host::FilterId id, const PortConfig &config)
    {
-      return host().sifra().writeProperty("sifra-generic-tarlin-swsec.security", id, configBytes(config));
+      return host().sifra().writeProperty("sifra-generic-tarlin-swsec.security", id, configRecord(config));
    }
 
    // Sends a set-features request; the reply's result (1 accepted, 0 refused).

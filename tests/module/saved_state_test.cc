@@ -125,7 +125,7 @@ TEST_F(SavedStateTest, the_blob_carries_the_configuration_counters_and_each_entr
    EXPECT_EQ(d.header.agentLen, 96u + 2 * 48 + 3);
    EXPECT_EQ(d.header.slowPathLen, 0u);
    EXPECT_EQ(blob.size(), 48 + d.header.agentLen);
-   const Bytes header = configBytes(config);
+   const Bytes header = configRecord(config);
    EXPECT_EQ(Bytes(blob.begin() + 48, blob.begin() + 48 + 26), Bytes(header.begin(), header.begin() + 26));
    EXPECT_EQ(+d.state.txRateLimitErr, 0);
    EXPECT_EQ(+d.state.counters.ipSrcGuardDropCnt, 1u);

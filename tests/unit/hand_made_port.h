@@ -285,11 +285,11 @@ protected:
    static std::vector<uint8_t> config(uint32_t features, uint8_t trusted, uint32_t portDbSize,
                                       const std::vector<Key> &statics = {})
    {
-      PortConfig config{.features = features, .trusted = trusted, .portDbSize = portDbSize};
+      PortConfig config{.features = features, .trusted = trusted != 0, .portDbSize = portDbSize};
       for (const Key &key : statics) {
          config.statics.push_back({key.vlan, key.macBytes(), {10, 0, 0, key.ip}});
       }
-      return configBytes(config);
+      return configRecord(config);
    }
 
    // Configures the database; the caller copies the rest of the header once it is accepted.

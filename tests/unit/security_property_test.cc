@@ -18,7 +18,7 @@ using Bytes = std::vector<uint8_t>;
 // `length` bytes of a configuration record with `version` and `numStatic`.
 Bytes record(uint8_t version, uint32_t numStatic, size_t length)
 {
-   Bytes bytes = configBytes({});
+   Bytes bytes = configRecord({});
    bytes[0] = version;
    std::memcpy(&bytes[offsetof(SwSecConfig, numStatic)], &numStatic, sizeof numStatic);
    bytes.resize(length);

@@ -3,7 +3,6 @@
 #include "session/config_file.h"
 
 #include "contract/config_record.h"
-#include "contract/vmi_key.h"
 #include "session/error.h"
 #include "session/json_text.h"
 
@@ -174,33 +173,6 @@ PortSecurityConfig loadConfigFile(const std::string &path)
    std::ostringstream text;
    text << in.rdbuf();
    return parseConfig(text.str(), path);
-}
-
-std::vector<uint8_t> configRecord(const PortSecurityConfig &config)
-{
-   SwSecConfig header{};
-   header.version = SWSEC_CONFIG_VERSION;
-   header.featuresEnabled = config.features;
-   header.trusted = config.trusted ? 1 : 0;
-   header.portDbSize = config.portDbSize;
-   header.numStatic = static_cast<uint32_t>(config.statics.size());
-   header.arpRateLimit = config.arpRateLimit;
-   header.errRateLimit = config.errRateLimit;
-   header.errRateLimitPeriod = config.errRateLimitPeriod;
-   std::vector<uint8_t> bytes(SwSecConfigLength(header.numStatic));
-   std::memcpy(bytes.data(), &header, sizeof header);
-   size_t offset = sizeof header;
-   for (const auto &binding : config.statics) {
-      SwSecVmiKey key{};
-      key.vlanId = binding.vlan;
-      std::memcpy(key.macAddr, binding.mac.data(), sizeof key.macAddr);
-      uint32_t ip = 0;   // network order, as the bytes stand
-      std::memcpy(&ip, binding.ip.data(), sizeof ip);
-      key.ipAddr = ip;
-      std::memcpy(bytes.data() + offset, &key, sizeof key);
-      offset += sizeof key;
-   }
-   return bytes;
 }
 
 }  // namespace swsec::session

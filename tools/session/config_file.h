@@ -2,6 +2,8 @@
 // the security property takes.
 #pragma once
 
+#include "contract/config_record_encode.h"
+
 #include <array>
 #include <cstdint>
 #include <string>
@@ -10,21 +12,10 @@
 
 namespace swsec::session {
 
-struct StaticBinding {
-   uint16_t vlan = 0;
-   std::array<uint8_t, 6> mac{};
-   std::array<uint8_t, 4> ip{};   // network order
-};
+using contract::StaticBinding;
 
 // Defaults are those of a new port: IP discovery alone, trusted, 32 entries.
-struct PortSecurityConfig {
-   uint32_t features = 0x04;
-   bool trusted = true;
-   uint32_t portDbSize = 32;
-   uint32_t arpRateLimit = 0;
-   uint32_t errRateLimit = 0;
-   uint32_t errRateLimitPeriod = 0;
-   std::vector<StaticBinding> statics;
+struct PortSecurityConfig : contract::PortSecurityConfig {
    std::string origin;   // where it was read from, for messages
 };
 
@@ -34,7 +25,7 @@ PortSecurityConfig parseConfig(std::string_view text, const std::string &origin)
 PortSecurityConfig loadConfigFile(const std::string &path);
 
 // The packed record: header then one 12-byte entry per static binding.
-std::vector<uint8_t> configRecord(const PortSecurityConfig &config);
+using contract::configRecord;
 
 // "02:00:5e:c0:00:01" (six two-digit hex groups); throws InputError naming `what`.
 std::array<uint8_t, 6> parseMac(std::string_view text, const std::string &what);

@@ -1,10 +1,9 @@
-// Decoding a saved-state blob field by field from its bytes, each read
-// checked against the blob's length first.
+// Decoding a saved-state blob through the layout records the module
+// writes, each copied out only after the blob's length was checked to hold it.
 #include "session/saved_state_format.h"
 
+#include "contract/saved_state_layout.h"
 #include "session/serializer.h"
-
-#include "contract/config_record.h"
 
 #include <algorithm>
 #include <cinttypes>
@@ -15,34 +14,23 @@ namespace swsec::session {
 
 namespace {
 
-constexpr uint64_t kHeaderLen = 48;
-constexpr uint64_t kFixedLen = 96;
-constexpr uint64_t kEntryLen = 48;
-constexpr uint8_t kDhcpSnooping = 1;
-constexpr uint8_t kStatic = 2;
-constexpr char kMagic[] = "sifgsave";
+constexpr uint64_t kFixedLen = sizeof(SwSecSavedState);
+constexpr uint64_t kEntryLen = sizeof(SwSecSavedVmi);
+constexpr uint8_t kDhcpSnooping = SwSecDiscDhcpSnooping;
+constexpr uint8_t kStatic = SwSecDiscStatic;
 
-// Little-endian reads from a range already checked to hold them.
-uint64_t le(const uint8_t *bytes, size_t size)
+// A record copied out of bytes already checked to hold it.
+template <typename Record>
+Record recordAt(const uint8_t *bytes)
 {
-   uint64_t value = 0;
-   for (size_t i = 0; i < size; ++i) {
-      value |= static_cast<uint64_t>(bytes[i]) << (8 * i);
-   }
-   return value;
+   Record record;
+   std::memcpy(&record, bytes, sizeof record);
+   return record;
 }
 
 std::string number(uint64_t value)
 {
    return std::to_string(value);
-}
-
-template <size_t N>
-std::array<uint8_t, N> bytesAt(const uint8_t *bytes)
-{
-   std::array<uint8_t, N> out{};
-   std::memcpy(out.data(), bytes, N);
-   return out;
 }
 
 std::string hexText(const std::vector<uint8_t> &bytes)
@@ -58,20 +46,21 @@ std::string hexText(const std::vector<uint8_t> &bytes)
 
 void decodeHeader(std::span<const uint8_t> blob, SavedPortState &state)
 {
-   if (blob.size() < kHeaderLen) {
+   if (blob.size() < sizeof(SifraGenericStateHeader)) {
       throw BadSavedState("too short for the 48-byte header (" + number(blob.size()) + " bytes)");
    }
-   if (std::memcmp(blob.data(), kMagic, 8) != 0) {
+   const auto header = recordAt<SifraGenericStateHeader>(blob.data());
+   if (header.magic != SIFRAGENERIC_STATE_MAGIC) {
       char text[19];
-      std::snprintf(text, sizeof text, "0x%016" PRIx64, le(blob.data(), 8));
+      std::snprintf(text, sizeof text, "0x%016" PRIx64, header.magic);
       throw BadSavedState(std::string("not a saved state (magic ") + text + ", expected \"sifgsave\")");
    }
-   state.version = le(blob.data() + 8, 8);
-   state.agentOffset = le(blob.data() + 16, 8);
-   state.agentLen = le(blob.data() + 24, 8);
-   state.slowPathOffset = le(blob.data() + 32, 8);
-   state.slowPathLen = le(blob.data() + 40, 8);
-   if (state.version != 1) {
+   state.version = header.version;
+   state.agentOffset = header.agentOffset;
+   state.agentLen = header.agentLen;
+   state.slowPathOffset = header.slowPathOffset;
+   state.slowPathLen = header.slowPathLen;
+   if (state.version != SIFRAGENERIC_STATE_VERSION) {
       throw BadSavedState("version " + number(state.version) + " (this tool reads version 1)");
    }
    uint64_t slowPathEnd = 0;
@@ -81,7 +70,7 @@ void decodeHeader(std::span<const uint8_t> blob, SavedPortState &state)
                           "-byte blob");
    }
    uint64_t agentEnd = 0;
-   if (state.agentOffset < kHeaderLen || __builtin_add_overflow(state.agentOffset, state.agentLen, &agentEnd) ||
+   if (state.agentOffset < SIFRAGENERIC_STATE_HEADER_LEN || __builtin_add_overflow(state.agentOffset, state.agentLen, &agentEnd) ||
        state.slowPathOffset < agentEnd) {
       throw BadSavedState("bad part offsets (agent at " + number(state.agentOffset) + ", " + number(state.agentLen) +
                           " bytes; slow path at " + number(state.slowPathOffset) + ")");
@@ -120,18 +109,20 @@ void checkConfig(const SavedPortState &state, uint32_t numSaved)
    }
 }
 
-SavedBinding decodeBinding(const uint8_t *entry)
+SavedBinding decodeBinding(const SwSecSavedVmi &entry)
 {
    SavedBinding binding;
-   binding.vlan = static_cast<uint16_t>(le(entry, 2));
-   binding.mac = bytesAt<6>(entry + 2);
-   binding.ip = bytesAt<4>(entry + 8);
-   binding.method = entry[12];
-   binding.timeRemaining = static_cast<int64_t>(le(entry + 16, 8));
+   binding.vlan = entry.vlanId;
+   std::memcpy(binding.mac.data(), entry.macAddr, binding.mac.size());
+   const uint32_t ip = entry.ipAddr;   // network order, as the bytes stand
+   std::memcpy(binding.ip.data(), &ip, binding.ip.size());
+   binding.method = entry.discoveryMethod;
+   binding.timeRemaining = entry.timeRemaining;
    if (binding.method == kDhcpSnooping) {
-      binding.chaddr = bytesAt<6>(entry + 24);
-      binding.serverIp = bytesAt<4>(entry + 40);
-      binding.leaseTime = static_cast<uint32_t>(le(entry + 44, 4));
+      std::memcpy(binding.chaddr.data(), entry.chaddr, binding.chaddr.size());
+      const uint32_t serverIp = entry.serverIp;
+      std::memcpy(binding.serverIp.data(), &serverIp, binding.serverIp.size());
+      binding.leaseTime = entry.leaseTime;
    }
    return binding;
 }
@@ -141,21 +132,21 @@ void decodeAgentPart(std::span<const uint8_t> part, SavedPortState &state)
    if (part.size() < kFixedLen) {
       throw BadSavedState("the agent's part has " + number(part.size()) + " bytes, fewer than its fixed 96");
    }
-   const uint8_t *fixed = part.data();
-   state.configVersion = fixed[0];
-   state.featuresEnabled = static_cast<uint32_t>(le(fixed + 1, 4));
-   state.trusted = fixed[5];
-   state.portDbSize = static_cast<uint32_t>(le(fixed + 6, 4));
-   state.numStatic = static_cast<uint32_t>(le(fixed + 10, 4));
-   state.arpRateLimit = static_cast<uint32_t>(le(fixed + 14, 4));
-   state.errRateLimit = static_cast<uint32_t>(le(fixed + 18, 4));
-   state.errRateLimitPeriod = static_cast<uint32_t>(le(fixed + 22, 4));
-   const auto numSaved = static_cast<uint32_t>(le(fixed + 28, 4));
-   state.txRateLimitErr = fixed[32] != 0;
-   state.txRateLimitErrRemaining = static_cast<int64_t>(le(fixed + 40, 8));
-   for (size_t i = 0; i < state.counters.size(); ++i) {
-      state.counters[i] = le(fixed + 48 + 8 * i, 8);
-   }
+   const auto fixed = recordAt<SwSecSavedState>(part.data());
+   state.configVersion = fixed.config.version;
+   state.featuresEnabled = fixed.config.featuresEnabled;
+   state.trusted = fixed.config.trusted;
+   state.portDbSize = fixed.config.portDbSize;
+   state.numStatic = fixed.config.numStatic;
+   state.arpRateLimit = fixed.config.arpRateLimit;
+   state.errRateLimit = fixed.config.errRateLimit;
+   state.errRateLimitPeriod = fixed.config.errRateLimitPeriod;
+   const uint32_t numSaved = fixed.numSavedVmis;
+   state.txRateLimitErr = fixed.txRateLimitErr != 0;
+   state.txRateLimitErrRemaining = fixed.txRateLimitErrRemaining;
+   const SwSecDropCounters counters = fixed.counters;
+   state.counters = {counters.dhcpSnoopingDropCnt,    counters.daiDropCnt,         counters.txRateLimitDropCnt,
+                     counters.txRateLimitErrEntryCnt, counters.rxRateLimitDropCnt, counters.ipSrcGuardDropCnt};
    if (numSaved != 0 && (state.featuresEnabled & SwSecFeatureIpDiscovery) == 0) {
       throw BadSavedState(number(numSaved) + " bindings saved with IP discovery off");
    }
@@ -171,7 +162,8 @@ void decodeAgentPart(std::span<const uint8_t> part, SavedPortState &state)
          throw BadSavedState("binding " + number(i + 1) + " of " + number(numSaved) + " runs past the agent's " +
                              number(part.size()) + "-byte part");
       }
-      SavedBinding binding = decodeBinding(part.data() + position);
+      const auto entry = recordAt<SwSecSavedVmi>(part.data() + position);
+      SavedBinding binding = decodeBinding(entry);
       if (methodName(binding.method).starts_with("unknown")) {
          throw BadSavedState("binding " + number(i + 1) + " of " + number(numSaved) + ": discovery method " +
                              number(binding.method) + " (known: 1, 2, 4, 8)");
@@ -180,7 +172,7 @@ void decodeAgentPart(std::span<const uint8_t> part, SavedPortState &state)
          throw BadSavedState("binding " + number(i + 1) + " of " + number(numSaved) + ": " +
                              std::to_string(binding.timeRemaining) + " s left, outside 0 to " + number(kMaxSeconds));
       }
-      const uint8_t clientIdLen = binding.method == kDhcpSnooping ? part[position + 30] : 0;
+      const uint8_t clientIdLen = binding.method == kDhcpSnooping ? entry.clientIdLen : 0;
       if (kEntryLen + clientIdLen > part.size() - position) {
          throw BadSavedState("binding " + number(i + 1) + " of " + number(numSaved) + " runs past the agent's " +
                              number(part.size()) + "-byte part");
@@ -219,8 +211,9 @@ std::vector<uint8_t> ageSavedState(std::span<const uint8_t> blob, int64_t elapse
    const size_t agent = static_cast<size_t>(state.agentOffset);
    if (state.txRateLimitErr) {
       const int64_t left = state.txRateLimitErrRemaining - elapsedSeconds;
-      out[agent + 32] = left > 0 ? 1 : 0;
-      put(agent + 40, static_cast<uint64_t>(std::max<int64_t>(left, 0)), 8);
+      out[agent + offsetof(SwSecSavedState, txRateLimitErr)] = left > 0 ? 1 : 0;
+      put(agent + offsetof(SwSecSavedState, txRateLimitErrRemaining), static_cast<uint64_t>(std::max<int64_t>(left, 0)),
+          8);
    }
    // Entries are rewritten in place and the survivors moved up over those
    // whose time ran out; whatever followed the part moves up with them.
@@ -233,7 +226,7 @@ std::vector<uint8_t> ageSavedState(std::span<const uint8_t> blob, int64_t elapse
       if (binding.method == kStatic || left > 0) {
          std::memcpy(out.data() + write, blob.data() + read, length);
          if (binding.method != kStatic) {
-            put(write + 16, static_cast<uint64_t>(left), 8);
+            put(write + offsetof(SwSecSavedVmi, timeRemaining), static_cast<uint64_t>(left), 8);
          }
          write += length;
          ++kept;
@@ -242,9 +235,9 @@ std::vector<uint8_t> ageSavedState(std::span<const uint8_t> blob, int64_t elapse
    }
    const size_t removed = read - write;
    out.erase(out.begin() + static_cast<std::ptrdiff_t>(write), out.begin() + static_cast<std::ptrdiff_t>(read));
-   put(agent + 28, kept, 4);
-   put(24, state.agentLen - removed, 8);
-   put(32, state.slowPathOffset - removed, 8);
+   put(agent + offsetof(SwSecSavedState, numSavedVmis), kept, 4);
+   put(offsetof(SifraGenericStateHeader, agentLen), state.agentLen - removed, 8);
+   put(offsetof(SifraGenericStateHeader, slowPathOffset), state.slowPathOffset - removed, 8);
    return out;
 }
 

@@ -1,5 +1,8 @@
 #include "port_mirror.h"
 
+#include "contract/config_record.h"
+#include "contract/notification.h"
+
 #include <charconv>
 #include <cstring>
 #include <string>
@@ -8,22 +11,23 @@ namespace swsec::fastpath {
 namespace {
 
 constexpr std::string_view kSecurityProperty = "sifra-generic-tarlin-swsec.security";
-constexpr std::string_view kAdded = "portdb.entry.added";
-constexpr std::string_view kRemoved = "portdb.entry.removed";
+constexpr std::string_view kAdded = SWSEC_PORTDB_MSG_ADDED;
+constexpr std::string_view kRemoved = SWSEC_PORTDB_MSG_REMOVED;
 
 // The security configuration record's header: features at 1 (u32, host
 // order), trusted at 5.
-constexpr size_t kConfigHeaderLen = 26;
-constexpr size_t kConfigFeaturesOffset = 1;
-constexpr size_t kConfigTrustedOffset = 5;
+constexpr size_t kConfigHeaderLen = sizeof(SwSecConfig);
+constexpr size_t kConfigFeaturesOffset = offsetof(SwSecConfig, featuresEnabled);
+constexpr size_t kConfigTrustedOffset = offsetof(SwSecConfig, trusted);
 
 // A notification's 40-byte payload: op, count, then one entry record
 // (VLAN at 8, MAC at 10, IPv4 at 20 in network order, authoritative at 36).
-constexpr size_t kNotificationLen = 40;
-constexpr size_t kEntryVlanOffset = 8;
-constexpr size_t kEntryMacOffset = 10;
-constexpr size_t kEntryIpOffset = 20;
-constexpr size_t kEntryAuthoritativeOffset = 36;
+constexpr size_t kNotificationLen = sizeof(SwSecPortDbMsgPayload);
+constexpr size_t kEntryOffset = offsetof(SwSecPortDbMsgPayload, entry);
+constexpr size_t kEntryVlanOffset = kEntryOffset + offsetof(SwSecPortDbEntry, vlanId);
+constexpr size_t kEntryMacOffset = kEntryOffset + offsetof(SwSecPortDbEntry, macAddr);
+constexpr size_t kEntryIpOffset = kEntryOffset + offsetof(SwSecPortDbEntry, ipAddr);
+constexpr size_t kEntryAuthoritativeOffset = kEntryOffset + offsetof(SwSecPortDbEntry, authoritative);
 
 std::string portPath(uint32_t portId)
 {

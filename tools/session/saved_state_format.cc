@@ -101,11 +101,18 @@ void checkConfig(const SavedPortState &state, uint32_t numSaved)
       throw BadSavedState("configuration refused: ARP rate limit " + number(state.arpRateLimit) + ", " +
                           number(state.errRateLimit) + " for " + number(state.errRateLimitPeriod) + " s");
    }
-   if ((features & SwSecFeatureIpDiscovery) != 0 &&
-       (state.portDbSize < SWSEC_PORT_DB_SIZE_MIN || state.portDbSize > SWSEC_PORT_DB_SIZE_MAX ||
-        numSaved > state.portDbSize)) {
-      throw BadSavedState("configuration refused: port database of " + number(state.portDbSize) + " entries with " +
-                          number(numSaved) + " saved");
+   if ((features & SwSecFeatureIpDiscovery) == 0) {
+      return;
+   }
+   const std::string sizes =
+      "configuration refused: port database of " + number(state.portDbSize) + " entries with " + number(numSaved) + " saved";
+   if (state.portDbSize < SWSEC_PORT_DB_SIZE_MIN || state.portDbSize > SWSEC_PORT_DB_SIZE_MAX) {
+      throw BadSavedState(sizes);
+   }
+   // The module's restore drops the bindings past the size; a save never
+   // makes such a file, so the tool refuses it rather than guess which go.
+   if (numSaved > state.portDbSize) {
+      throw BadSavedState(sizes, false);
    }
 }
 
@@ -153,7 +160,7 @@ void decodeAgentPart(std::span<const uint8_t> part, SavedPortState &state)
    checkConfig(state, numSaved);
    if (state.txRateLimitErr && !isSeconds(state.txRateLimitErrRemaining)) {
       throw BadSavedState("error-rate-limit state with " + std::to_string(state.txRateLimitErrRemaining) +
-                          " s left, outside 0 to " + number(kMaxSeconds));
+                          " s left, outside 0 to " + number(kMaxSeconds), false);
    }
 
    uint64_t position = kFixedLen;
@@ -166,11 +173,12 @@ void decodeAgentPart(std::span<const uint8_t> part, SavedPortState &state)
       SavedBinding binding = decodeBinding(entry);
       if (methodName(binding.method).starts_with("unknown")) {
          throw BadSavedState("binding " + number(i + 1) + " of " + number(numSaved) + ": discovery method " +
-                             number(binding.method) + " (known: 1, 2, 4, 8)");
+                             number(binding.method) + " (known: 1, 2, 4, 8)", false);
       }
       if (!isSeconds(binding.timeRemaining)) {
          throw BadSavedState("binding " + number(i + 1) + " of " + number(numSaved) + ": " +
-                             std::to_string(binding.timeRemaining) + " s left, outside 0 to " + number(kMaxSeconds));
+                             std::to_string(binding.timeRemaining) + " s left, outside 0 to " + number(kMaxSeconds),
+                             false);
       }
       const uint8_t clientIdLen = binding.method == kDhcpSnooping ? entry.clientIdLen : 0;
       if (kEntryLen + clientIdLen > part.size() - position) {

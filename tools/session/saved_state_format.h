@@ -17,9 +17,15 @@
 namespace swsec::session {
 
 // A blob that is not a well-formed saved state: `what()` says what is wrong.
+// Most refusals are of shape (lengths, offsets, a configuration a new port
+// refuses), where the module's restore refuses too. A few are of content the
+// module takes and then drops or cuts short (a binding with an unknown
+// discovery method, a remaining time past 32 bits): the tool refuses those
+// files rather than restore them wrong, and says so with `shape` false.
 class BadSavedState : public std::runtime_error {
 public:
-   using std::runtime_error::runtime_error;
+   explicit BadSavedState(const std::string &what, bool ofShape = true) : std::runtime_error(what), shape(ofShape) {}
+   bool shape;
 };
 
 struct SavedBinding {

@@ -351,14 +351,14 @@ void InlineDaemon::followLink(const LinkEvent &event)
       if (handsOff_.count(event.ifindex) != 0) {
          break;   // let go of by remove-port: not guarded again until it is made anew
       }
-      PortSpec spec{event.name, event.name, options_.configPath, "", "", ""};
+      PortSpec portSpec{event.name, event.name, options_.configPath, "", "", ""};
       if (!event.mac.empty()) {
          // A VM restarted on a new interface finds its bindings again by its MAC.
-         spec.stateKey = event.mac;
-         std::replace(spec.stateKey.begin(), spec.stateKey.end(), ':', '-');
+         portSpec.stateKey = event.mac;
+         std::replace(portSpec.stateKey.begin(), portSpec.stateKey.end(), ':', '-');
       }
       try {
-         addPort(spec, true);
+         addPort(portSpec, true);
       } catch (const CtlError &e) {
          events_.log("error", "inline", event.name + " joined " + options_.bridge + " but is not guarded: " + e.what());
       }
@@ -649,23 +649,23 @@ nlohmann::json InlineDaemon::handle(const nlohmann::json &request)
       return {{"port", port.portSpec.name}, {"configured", true}};
    }
    if (command == "add-port") {
-      PortSpec spec{requiredString(request, "port"), requiredString(request, "interface"), options_.configPath,
+      PortSpec portSpec{requiredString(request, "port"), requiredString(request, "interface"), options_.configPath,
                     "", "", ""};
       // A name becomes a file name in the state directory.
-      if (!options_.stateDir.empty() && (spec.name.find('/') != std::string::npos || spec.name == "." ||
-                                         spec.name == "..")) {
+      if (!options_.stateDir.empty() && (portSpec.name.find('/') != std::string::npos || portSpec.name == "." ||
+                                         portSpec.name == "..")) {
          throw CtlError("with a state directory a port name cannot be a path");
       }
-      if (!options_.stateDir.empty() && spec.name.size() + sizeof ".state.partial-XXXXXX" - 1 > NAME_MAX) {
+      if (!options_.stateDir.empty() && portSpec.name.size() + sizeof ".state.partial-XXXXXX" - 1 > NAME_MAX) {
          throw CtlError("with a state directory a port name has at most " +
                         std::to_string(NAME_MAX - (sizeof ".state.partial-XXXXXX" - 1)) + " bytes");
       }
       if (request.contains("text")) {
-         spec.configText = requiredString(request, "text");
-         spec.configOrigin = request.value("origin", std::string("(control request)"));
-         spec.configPath.clear();
+         portSpec.configText = requiredString(request, "text");
+         portSpec.configOrigin = request.value("origin", std::string("(control request)"));
+         portSpec.configPath.clear();
       }
-      return portJson(addPort(std::move(spec), false));
+      return portJson(addPort(std::move(portSpec), false));
    }
    if (command == "remove-port") {
       const Port &found = port(request);

@@ -14,141 +14,34 @@
 # feature missing; the reason is printed). Every process started is stopped
 # by its PID, every namespace removed, also on failure.
 set -uo pipefail
+source "$(dirname "$0")/lib.sh" "$@"
+need ip dnsmasq dhclient udhcpc ping scapy
 
-swsec=$(realpath "${1:?usage: inline_e2e.sh SWSEC_BINARY}")
-here=$(cd "$(dirname "$0")" && pwd)
-tool="$here/e2e_tool.py"
-examples="$here/../../examples"
-python=/usr/bin/python3
-
-skip() { echo "SKIP: $*"; exit 77; }
-[ "$(id -u)" -eq 0 ] || skip "needs root for network namespaces"
-for command in ip dnsmasq dhclient udhcpc ping; do
-  command -v "$command" >/dev/null || skip "$command is not installed (scripts/setup.sh installs it)"
-done
-"$python" -c "import scapy.all" 2>/dev/null || skip "python3-scapy is not installed (scripts/setup.sh installs it)"
-
-tag="swe$$"
-sw="${tag}sw"; srv="${tag}srv"; vm1="${tag}vm1"; vm2="${tag}vm2"
-work=$(mktemp -d "/tmp/swsec-e2e.XXXXXX")
-ctl="$work/ctl.sock"
-pids=()
-
-cleanup() {
-  local pid
-  for pid in "${pids[@]}"; do
-    kill -TERM "$pid" 2>/dev/null
-  done
-  for pid in "${pids[@]}"; do
-    for _ in $(seq 50); do kill -0 "$pid" 2>/dev/null || break; sleep 0.1; done
-    kill -KILL "$pid" 2>/dev/null
-  done
-  for file in "$work"/*.pid; do
-    [ -f "$file" ] && kill -TERM "$(cat "$file")" 2>/dev/null
-  done
-  for ns in "$vm1" "$vm2" "$srv" "$sw"; do
-    ip netns del "$ns" 2>/dev/null
-  done
-  rm -rf "$work"
-}
-trap cleanup EXIT
-trap 'exit 1' INT TERM
-
-step() { echo "== $*"; }
-fail() {
-  echo "FAIL: $*"
-  echo "-- counters"; sw_ctl counters --json 2>&1 | head -40
-  echo "-- swsec inline's log"; tail -n 40 "$work/inline.log" 2>/dev/null
-  exit 1
-}
-in_ns() { local ns=$1; shift; ip netns exec "$ns" "$@"; }
-sw_ctl() { "$swsec" ctl --ctl "$ctl" "$@"; }
-json() { "$python" -c "import json,sys; d=json.load(sys.stdin); print($1)"; }
-# wait_for SECONDS COMMAND...: until the command succeeds, at most SECONDS.
-wait_for() {
-  local limit=$1; shift
-  local deadline=$((SECONDS + limit))
-  until "$@" >/dev/null 2>&1; do
-    [ $SECONDS -lt $deadline ] || return 1
-    sleep 0.2
-  done
-}
+e2e_diagnose() { echo "-- counters"; sw_ctl counters --json 2>&1 | head -40; }
 counter() { sw_ctl counters --json | json "[p for p in d if p['port']=='$1'][0]$2"; }
 binding() { sw_ctl bindings "$1" --json | json "[b['method'] for b in d if b['ip']=='$2' and b['mac']=='$3']"; }
-# For the checks that wait_for runs in a new shell.
-export swsec ctl python
-export -f sw_ctl json counter binding
+export -f counter binding
 
 # ---------------------------------------------------------------- set-up
 step "namespaces, bridge, server, VMs"
-ip netns add "$sw" || skip "cannot make network namespaces"
-ip netns add "$srv"; ip netns add "$vm1"; ip netns add "$vm2"
-ip -n "$sw" link add br0 type bridge 2>/dev/null || skip "no bridge support in this kernel"
-ip -n "$sw" link set br0 up
-ip -n "$sw" link add vm1p type veth peer name eth0 netns "$vm1" 2>/dev/null || skip "no veth support in this kernel"
-ip -n "$sw" link add vm2p type veth peer name eth0 netns "$vm2"
-ip -n "$sw" link add srvp type veth peer name eth0 netns "$srv"
-for link in vm1p vm2p srvp; do
-  ip -n "$sw" link set "$link" master br0
-  ip -n "$sw" link set "$link" up
-done
-for ns in "$srv" "$vm1" "$vm2"; do
-  ip -n "$ns" link set lo up
-  ip -n "$ns" link set eth0 up
-done
-ip -n "$srv" addr add 192.0.2.1/24 dev eth0
+netns sw srv vm1 vm2
+bridge "$sw" br0
+veth "$sw" vm1p "$vm1"; veth "$sw" vm2p "$vm2"; veth "$sw" srvp "$srv"
+enslave "$sw" br0 vm1p vm2p srvp
 vm1_mac=$(in_ns "$vm1" cat /sys/class/net/eth0/address)
 vm2_mac=$(in_ns "$vm2" cat /sys/class/net/eth0/address)
 srv_mac=$(in_ns "$srv" cat /sys/class/net/eth0/address)
-
-in_ns "$srv" dnsmasq --conf-file=/dev/null --port=0 --interface=eth0 --bind-interfaces \
-  --dhcp-range=192.0.2.100,192.0.2.150,255.255.255.0,2m --dhcp-leasefile="$work/dnsmasq.leases" \
-  --pid-file="$work/dnsmasq.pid" --log-facility="$work/dnsmasq.log" --log-dhcp \
-  || fail "dnsmasq did not start"
-
-# Client scripts that touch nothing but their namespace's interface.
-cat >"$work/dhclient-script" <<'SCRIPT'
-#!/bin/sh
-case "$reason" in
-  PREINIT) ip link set "$interface" up ;;
-  BOUND|RENEW|REBIND|REBOOT) ip addr replace "$new_ip_address/24" dev "$interface" ;;
-  EXPIRE|FAIL|RELEASE|STOP) [ -n "$old_ip_address" ] && ip addr del "$old_ip_address/24" dev "$interface" ;;
-esac
-exit 0
-SCRIPT
-cat >"$work/udhcpc-script" <<'SCRIPT'
-#!/bin/sh
-case "$1" in
-  deconfig) ip addr flush dev "$interface" ;;
-  bound|renew) ip addr replace "$ip/24" dev "$interface" ;;
-esac
-exit 0
-SCRIPT
-chmod +x "$work/dhclient-script" "$work/udhcpc-script"
+dhcp_server "$srv"
+dhcp_client_scripts
 cp "$examples/enforcing.json" "$work/vm1.json"
 state="$work/state"
 mkdir "$state"
 
 # ---------------------------------------------------------------- start
 start_inline() {
-  # Not through in_ns: the PID must be swsec's own, not a subshell's.
-  ip netns exec "$sw" "$swsec" inline --bridge br0 --port vm1=vm1p --port vm2=vm2p --ctl "$ctl" \
-    --config "$examples/enforcing.json" --port-config vm1="$work/vm1.json" "$@" >>"$work/inline.log" 2>&1 &
-  inline_pid=$!
-  pids+=("$inline_pid")
-  wait_for 30 sw_ctl ports || fail "swsec inline did not come up"
+  inline_start --bridge br0 --port vm1=vm1p --port vm2=vm2p \
+    --config "$examples/enforcing.json" --port-config vm1="$work/vm1.json" "$@"
 }
-stop_inline() {
-  kill -TERM "$inline_pid"
-  local deadline=$((SECONDS + 15))
-  while kill -0 "$inline_pid" 2>/dev/null; do
-    [ $SECONDS -lt $deadline ] || fail "swsec inline did not stop on SIGTERM"
-    sleep 0.1
-  done
-  wait "$inline_pid"; inline_status=$?
-}
-links() { ip -n "$sw" -o link show | awk -F': ' '{print $2}' | cut -d@ -f1; }
-master_of() { ip -n "$sw" -j link show dev "$1" | json "d[0].get('master','')"; }
 
 step "swsec inline guards vm1 and vm2 (no saved state yet)"
 start_inline --state-dir "$state"
@@ -156,20 +49,16 @@ grep -q "vm1: no saved state" "$work/inline.log" || fail "a missing state file w
 [ "$(master_of vm1p)" = "" ] || fail "vm1p is still in the bridge"
 [ "$(stat -c %a "$ctl")" = "600" ] || fail "the control socket is not mode 0600"
 sw_ctl ports --json | json "all(p['running'] for p in d)" | grep -qx True || fail "ports not running"
-# Started directly, not through sw_ctl, so that $! is the client itself.
-"$swsec" ctl --ctl "$ctl" watch --json >"$work/watch.log" 2>&1 &
-pids+=("$!")
+spawn "$swsec" ctl --ctl "$ctl" watch --json >"$work/watch.log" 2>&1
 
 # ---------------------------------------------------------------- leases
 step "dhclient (vm1) and udhcpc (vm2) get leases, learned as DHCP bindings"
-timeout 30 ip netns exec "$vm1" dhclient -4 -1 -pf "$work/dhclient.pid" -lf "$work/dhclient.leases" \
-  -sf "$work/dhclient-script" eth0 || fail "dhclient got no lease through swsec"
-ip netns exec "$vm2" udhcpc -f -R -i eth0 -s "$work/udhcpc-script" -t 10 -T 1 >"$work/udhcpc.log" 2>&1 &
-udhcpc_pid=$!
-pids+=("$udhcpc_pid")
-vm1_ip=$(ip -n "$vm1" -j -4 addr show dev eth0 | json "d[0]['addr_info'][0]['local']")
+dhclient_lease "$vm1" || fail "dhclient got no lease through swsec"
+spawn ip netns exec "$vm2" udhcpc -f -R -i eth0 -s "$work/udhcpc-script" -t 10 -T 1 >"$work/udhcpc.log" 2>&1
+udhcpc_pid=$spawned
+vm1_ip=$(ipv4_of "$vm1")
 wait_for 20 sh -c "ip -n $vm2 -4 addr show dev eth0 | grep -q 'inet '" || fail "udhcpc got no lease through swsec"
-vm2_ip=$(ip -n "$vm2" -j -4 addr show dev eth0 | json "d[0]['addr_info'][0]['local']")
+vm2_ip=$(ipv4_of "$vm2")
 echo "vm1 $vm1_mac $vm1_ip, vm2 $vm2_mac $vm2_ip"
 wait_for 5 bash -c "binding vm1 $vm1_ip $vm1_mac | grep -q 'DHCP Snooping'" \
   || fail "no DHCP binding for vm1: $(sw_ctl bindings --json)"
@@ -180,7 +69,7 @@ sw_ctl bindings vm1 --json | json "d[0]['serverIp']" | grep -qx 192.0.2.1 || fai
 acks() { grep -c DHCPACK "$work/dnsmasq.log"; }
 step "a restart with --state-dir keeps the DHCP bindings"
 acks_before=$(acks)
-stop_inline
+inline_stop
 [ "$inline_status" -eq 0 ] || fail "swsec inline exited $inline_status"
 for port in vm1 vm2; do
   [ -s "$state/$port.state" ] || fail "no state file for $port"
@@ -196,7 +85,7 @@ binding vm2 "$vm2_ip" "$vm2_mac" | grep -q "DHCP Snooping" || fail "vm2's bindin
 in_ns "$vm1" ping -c 1 -W 2 192.0.2.1 >/dev/null || fail "vm1 cut off after the restart"
 
 step "a damaged state file is reported and skipped: vm2 starts empty, vm1 keeps its binding"
-stop_inline
+inline_stop
 truncate -s $(($(stat -c %s "$state/vm2.state") / 2)) "$state/vm2.state"
 start_inline --state-dir "$state"
 grep -q "vm2: .*saved state refused: .*the port starts empty" "$work/inline.log" \
@@ -206,20 +95,18 @@ sw_ctl bindings vm2 --json | json "len(d)" | grep -qx 0 || fail "vm2 not empty: 
 binding vm1 "$vm1_ip" "$vm1_mac" | grep -q "DHCP Snooping" || fail "vm1's binding lost with vm2's file"
 # vm2 gets its lease again, as a VM would once its renewal failed.
 kill -TERM "$udhcpc_pid"; wait "$udhcpc_pid" 2>/dev/null
-ip netns exec "$vm2" udhcpc -f -R -i eth0 -s "$work/udhcpc-script" -t 10 -T 1 >>"$work/udhcpc.log" 2>&1 &
-udhcpc_pid=$!
-pids+=("$udhcpc_pid")
+spawn ip netns exec "$vm2" udhcpc -f -R -i eth0 -s "$work/udhcpc-script" -t 10 -T 1 >>"$work/udhcpc.log" 2>&1
+udhcpc_pid=$spawned
 wait_for 20 bash -c "binding vm2 $vm2_ip $vm2_mac | grep -q 'DHCP Snooping'" \
   || fail "vm2 not learned again: $(sw_ctl bindings --json)"
-"$swsec" ctl --ctl "$ctl" watch --json >>"$work/watch.log" 2>&1 &
-pids+=("$!")
+spawn "$swsec" ctl --ctl "$ctl" watch --json >>"$work/watch.log" 2>&1
 
 # ---------------------------------------------------------------- own traffic
 step "the VMs' own traffic passes: ping and a TCP transfer with default offloads"
 in_ns "$vm1" ping -c 3 -i 0.2 -W 2 192.0.2.1 >/dev/null || fail "vm1 cannot ping the server"
 in_ns "$vm2" ping -c 3 -i 0.2 -W 2 192.0.2.1 >/dev/null || fail "vm2 cannot ping the server"
-ip netns exec "$srv" "$python" "$tool" tcp-sink 5001 >"$work/tcp.out" &
-sink_pid=$!; pids+=("$sink_pid")
+spawn ip netns exec "$srv" "$python" "$tool" tcp-sink 5001 >"$work/tcp.out"
+sink_pid=$spawned
 sleep 0.5
 bytes=$((64 * 1024 * 1024))
 timeout 60 ip netns exec "$vm1" "$python" "$tool" tcp-send 192.0.2.1 5001 $bytes || fail "TCP transfer failed"
@@ -228,8 +115,8 @@ wait "$sink_pid"
 
 # ---------------------------------------------------------------- attacks
 step "a spoofed source does not reach the server; the VM's own does"
-ip netns exec "$srv" "$python" "$tool" udp-listen 9999 20 "$vm1_ip" >"$work/udp.out" &
-listen_pid=$!; pids+=("$listen_pid")
+spawn ip netns exec "$srv" "$python" "$tool" udp-listen 9999 20 "$vm1_ip" >"$work/udp.out"
+listen_pid=$spawned
 wait_for 5 grep -q listening "$work/udp.out" || fail "UDP listener did not start"
 in_ns "$vm1" "$python" "$tool" udp-send 192.0.2.66 192.0.2.1 "$srv_mac" 9999 eth0
 in_ns "$vm1" "$python" "$tool" udp-send "$vm1_ip" 192.0.2.1 "$srv_mac" 9999 eth0
@@ -285,7 +172,7 @@ in_ns "$vm1" ping -c 1 -W 2 192.0.2.1 >/dev/null || fail "vm1 lost traffic after
 
 # ---------------------------------------------------------------- release
 step "a release removes the binding"
-in_ns "$vm1" dhclient -r -pf "$work/dhclient.pid" -lf "$work/dhclient.leases" -sf "$work/dhclient-script" eth0
+dhclient_release "$vm1"
 wait_for 5 sh -c "! $swsec ctl --ctl $ctl bindings vm1 --json | grep -q '\"$vm1_ip\"'" || fail "binding kept after release"
 wait_for 5 grep -q "\"ip\":\"$vm1_ip\".*\"name\":\"portdb.entry.added\"" "$work/watch.log" || fail "watch missed the addition: $(cat "$work/watch.log")"
 wait_for 5 grep -q "\"ip\":\"$vm1_ip\".*\"name\":\"portdb.entry.removed\"" "$work/watch.log" || fail "watch missed the removal"
@@ -309,7 +196,7 @@ ip -n "$vm1" addr del 192.0.2.10/24 dev eth0
 
 # ---------------------------------------------------------------- fail modes
 step "fail closed: stopped, vm1 stays cut off and nothing of swsec is left"
-stop_inline
+inline_stop
 [ "$inline_status" -eq 0 ] || fail "swsec inline exited $inline_status"
 grep -q "0 host violation" "$work/inline.log" || fail "host violations at stop"
 [ -z "$(links | grep '^swsec')" ] || fail "links left: $(links | grep '^swsec')"
@@ -319,17 +206,13 @@ ip -n "$vm1" addr add 192.0.2.11/24 dev eth0
 in_ns "$vm1" ping -c 1 -W 1 192.0.2.1 >/dev/null && fail "vm1 reaches the server after a closed stop"
 
 step "killed outright: the VM stays cut off, and the next start replaces the pair left behind"
-ip netns exec "$sw" "$swsec" inline --bridge br0 --port vm1=vm1p --ctl "$ctl" >>"$work/inline.log" 2>&1 &
-inline_pid=$!; pids+=("$inline_pid")
-wait_for 30 sw_ctl ports || fail "swsec inline did not come up on a port left closed"
+inline_start --bridge br0 --port vm1=vm1p
 kill -KILL "$inline_pid"; wait "$inline_pid" 2>/dev/null
 [ -n "$(links | grep '^swsec')" ] || fail "a killed run took its pair away"
 in_ns "$vm1" ping -c 1 -W 1 192.0.2.1 >/dev/null && fail "vm1 reaches the server after a kill"
 
 step "fail open: restarted on a port left closed, stopped, vm1 back on the bridge"
-ip netns exec "$sw" "$swsec" inline --bridge br0 --port vm1=vm1p --ctl "$ctl" --fail open >>"$work/inline.log" 2>&1 &
-inline_pid=$!; pids+=("$inline_pid")
-wait_for 30 sw_ctl ports || fail "swsec inline did not come up again"
+inline_start --bridge br0 --port vm1=vm1p --fail open
 grep -q "left by an earlier run" "$work/inline.log" || fail "the killed run's pair was not replaced"
 # The failed pings above left the server's address unresolved (FAILED),
 # which the kernel does not probe again for a while.
@@ -347,7 +230,7 @@ if ip -n "$vm1" link add link eth0 name eth0.100 type vlan id 100 2>/dev/null; t
 else
   echo "   skipped the VLAN check: no 802.1Q support in this kernel"
 fi
-stop_inline
+inline_stop
 [ "$(master_of vm1p)" = "br0" ] || fail "vm1p not back in the bridge after an open stop"
 in_ns "$vm1" ping -c 1 -W 2 192.0.2.1 >/dev/null || fail "vm1 cut off after an open stop"
 [ -z "$(links | grep '^swsec')" ] || fail "links left after the open stop"

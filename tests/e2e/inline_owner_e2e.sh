@@ -13,58 +13,12 @@
 # Exit 0 passed, 1 failed, 77 skipped (the reason is printed). Every process
 # started is stopped by its PID, every namespace removed, also on failure.
 set -uo pipefail
+source "$(dirname "$0")/lib.sh" "$@"
+need ip dnsmasq dhclient udhcpc ping
 
-swsec=$(realpath "${1:?usage: inline_owner_e2e.sh SWSEC_BINARY}")
-examples="$(cd "$(dirname "$0")" && pwd)/../../examples"
-python=/usr/bin/python3
-
-skip() { echo "SKIP: $*"; exit 77; }
-[ "$(id -u)" -eq 0 ] || skip "needs root for network namespaces"
-for command in ip dnsmasq dhclient udhcpc ping; do
-  command -v "$command" >/dev/null || skip "$command is not installed (scripts/setup.sh installs it)"
-done
-
-tag="swo$$"
-sw="${tag}sw"; srv="${tag}srv"; vm1="${tag}vm1"; vm2="${tag}vm2"
-work=$(mktemp -d "/tmp/swsec-owner-e2e.XXXXXX")
-ctl="$work/ctl.sock"
 state="$work/state"
-pids=()
-
-cleanup() {
-  local pid
-  for pid in "${pids[@]}"; do kill -TERM "$pid" 2>/dev/null; done
-  for pid in "${pids[@]}"; do
-    for _ in $(seq 50); do kill -0 "$pid" 2>/dev/null || break; sleep 0.1; done
-    kill -KILL "$pid" 2>/dev/null
-  done
-  for file in "$work"/*.pid; do [ -f "$file" ] && kill -TERM "$(cat "$file")" 2>/dev/null; done
-  for ns in "$vm1" "$vm2" "$srv" "$sw"; do ip netns del "$ns" 2>/dev/null; done
-  rm -rf "$work"
-}
-trap cleanup EXIT
-trap 'exit 1' INT TERM
-
-step() { echo "== $*"; }
-fail() {
-  echo "FAIL: $*"
-  echo "-- swsec inline's log"; tail -n 40 "$work/inline.log" 2>/dev/null
-  exit 1
-}
-in_ns() { local ns=$1; shift; ip netns exec "$ns" "$@"; }
-sw_ctl() { "$swsec" ctl --ctl "$ctl" "$@"; }
-json() { "$python" -c "import json,sys; d=json.load(sys.stdin); print($1)"; }
-wait_for() {
-  local limit=$1; shift
-  local deadline=$((SECONDS + limit))
-  until "$@" >/dev/null 2>&1; do
-    [ $SECONDS -lt $deadline ] || return 1
-    sleep 0.2
-  done
-}
 remaining() { sw_ctl bindings "$1" --json | json "[int(str(b['timeRemaining']).split()[0]) for b in d if b['ip']=='$2'][0]"; }
 has_binding() { sw_ctl bindings "$1" --json | json "any(b['ip']=='$2' for b in d)" | grep -qx True; }
-master_of() { ip -n "$sw" -j link show dev "$1" | json "d[0].get('master','')"; }
 # raw: the line on stdin to the control socket, the first reply line printed.
 raw() {
   "$python" -c '
@@ -82,54 +36,21 @@ while b"\n" not in data:
 print(data.split(b"\n")[0].decode("utf-8", "replace"))
 ' "$ctl"
 }
-export swsec ctl python
-export -f sw_ctl json has_binding
+export -f has_binding
 
 step "namespaces, bridge, server, VMs"
-ip netns add "$sw" || skip "cannot make network namespaces"
-ip netns add "$srv"; ip netns add "$vm1"; ip netns add "$vm2"
-ip -n "$sw" link add br0 type bridge 2>/dev/null || skip "no bridge support in this kernel"
-ip -n "$sw" link set br0 up
-for pair in vm1p:"$vm1" vm2p:"$vm2" srvp:"$srv"; do
-  ip -n "$sw" link add "${pair%%:*}" type veth peer name eth0 netns "${pair#*:}" 2>/dev/null \
-    || skip "no veth support in this kernel"
-  ip -n "$sw" link set "${pair%%:*}" master br0
-  ip -n "$sw" link set "${pair%%:*}" up
-  ip -n "${pair#*:}" link set lo up
-  ip -n "${pair#*:}" link set eth0 up
-done
-ip -n "$srv" addr add 192.0.2.1/24 dev eth0
-in_ns "$srv" dnsmasq --conf-file=/dev/null --port=0 --interface=eth0 --bind-interfaces \
-  --dhcp-range=192.0.2.100,192.0.2.150,255.255.255.0,2m --dhcp-leasefile="$work/dnsmasq.leases" \
-  --pid-file="$work/dnsmasq.pid" --log-facility="$work/dnsmasq.log" || fail "dnsmasq did not start"
-cat >"$work/dhclient-script" <<'SCRIPT'
-#!/bin/sh
-case "$reason" in
-  PREINIT) ip link set "$interface" up ;;
-  BOUND|RENEW|REBIND|REBOOT) ip addr replace "$new_ip_address/24" dev "$interface" ;;
-  EXPIRE|FAIL|RELEASE|STOP) [ -n "$old_ip_address" ] && ip addr del "$old_ip_address/24" dev "$interface" ;;
-esac
-exit 0
-SCRIPT
-cat >"$work/udhcpc-script" <<'SCRIPT'
-#!/bin/sh
-case "$1" in
-  deconfig) ip addr flush dev "$interface" ;;
-  bound|renew) ip addr replace "$ip/24" dev "$interface" ;;
-esac
-exit 0
-SCRIPT
-chmod +x "$work/dhclient-script" "$work/udhcpc-script"
+netns sw srv vm1 vm2
+bridge "$sw" br0
+veth "$sw" vm1p "$vm1"; veth "$sw" vm2p "$vm2"; veth "$sw" srvp "$srv"
+enslave "$sw" br0 vm1p vm2p srvp
+dhcp_server "$srv"
+dhcp_client_scripts
 mkdir "$state"
 cp "$examples/enforcing.json" "$work/vm2.json"
 
 start_inline() {
-  ip netns exec "$sw" "$swsec" inline --bridge br0 --port vm1=vm1p --port vm2=vm2p --ctl "$ctl" \
-    --config "$examples/enforcing.json" --port-config vm2="$work/vm2.json" --state-dir "$state" \
-    >>"$work/inline.log" 2>&1 &
-  inline_pid=$!
-  pids+=("$inline_pid")
-  wait_for 30 sw_ctl ports || fail "swsec inline did not come up"
+  inline_start --bridge br0 --port vm1=vm1p --port vm2=vm2p \
+    --config "$examples/enforcing.json" --port-config vm2="$work/vm2.json" --state-dir "$state"
 }
 
 step "a FIFO where a state file belongs does not hold up the start"
@@ -139,13 +60,11 @@ grep -q "vm2: .*not a regular file; the port starts empty" "$work/inline.log" ||
 rm "$state/vm2.state"
 
 step "leases learned as bindings"
-timeout 30 ip netns exec "$vm1" dhclient -4 -1 -pf "$work/dhclient.pid" -lf "$work/dhclient.leases" \
-  -sf "$work/dhclient-script" eth0 || fail "dhclient got no lease through swsec"
-ip netns exec "$vm2" udhcpc -f -i eth0 -s "$work/udhcpc-script" -t 10 -T 1 >"$work/udhcpc.log" 2>&1 &
-pids+=("$!")
+dhclient_lease "$vm1" || fail "dhclient got no lease through swsec"
+spawn ip netns exec "$vm2" udhcpc -f -i eth0 -s "$work/udhcpc-script" -t 10 -T 1 >"$work/udhcpc.log" 2>&1
 wait_for 20 sh -c "ip -n $vm2 -4 addr show dev eth0 | grep -q 'inet '" || fail "udhcpc got no lease through swsec"
-vm1_ip=$(ip -n "$vm1" -j -4 addr show dev eth0 | json "d[0]['addr_info'][0]['local']")
-vm2_ip=$(ip -n "$vm2" -j -4 addr show dev eth0 | json "d[0]['addr_info'][0]['local']")
+vm1_ip=$(ipv4_of "$vm1")
+vm2_ip=$(ipv4_of "$vm2")
 wait_for 5 has_binding vm1 "$vm1_ip" || fail "no binding for vm1"
 wait_for 5 has_binding vm2 "$vm2_ip" || fail "no binding for vm2"
 
@@ -160,8 +79,8 @@ in_ns "$vm1" ping -c 2 -i 0.2 -W 2 192.0.2.1 >/dev/null || fail "vm1 cut off by 
 
 step "hostile control requests get errors while frames flow"
 passed=$(sw_ctl counters --json | json "[p for p in d if p['port']=='vm1'][0]['frames']['from-vm']['passed']")
-in_ns "$vm1" ping -c 25 -i 0.1 -W 1 192.0.2.1 >"$work/ping.out" 2>&1 &
-ping_pid=$!; pids+=("$ping_pid")
+spawn ip netns exec "$vm1" ping -c 25 -i 0.1 -W 1 192.0.2.1 >"$work/ping.out" 2>&1
+ping_pid=$spawned
 for line in '{"command":"log","follow":"yes"}' '{"command":"log","follow":null}' deep; do
   { [ "$line" = deep ] && "$python" -c 'print("[" * 100000 + "]" * 100000)' || echo "$line"; } | raw \
     | grep -q '"ok":false' || fail "no error for $line"
@@ -171,7 +90,7 @@ sw_ctl config vm1 "$work/latin1.json" >"$work/config.out" 2>&1 && fail "a config
 grep -q "bad JSON" "$work/config.out" || fail "config with bad bytes: $(cat "$work/config.out")"
 sw_ctl log --json >/dev/null || fail "ctl log after the bad config"
 # Every place taken by a connection that asks nothing: the next client is still served.
-"$python" - "$ctl" <<'PY' &
+spawn "$python" - "$ctl" <<'PY'
 import socket, sys, time
 idle = []
 for _ in range(64):
@@ -180,7 +99,6 @@ for _ in range(64):
     idle.append(s)
 time.sleep(8)
 PY
-idle_pid=$!; pids+=("$idle_pid")
 sleep 1
 sw_ctl ports >/dev/null || fail "64 idle connections locked a client out"
 wait "$ping_pid"
@@ -190,7 +108,7 @@ grep -q " 0% packet loss" "$work/ping.out" || fail "frames lost meanwhile: $(tai
 kill -0 "$inline_pid" || fail "the daemon died"
 
 step "killed outright with a lease released just before: back with what each had left"
-in_ns "$vm1" dhclient -r -pf "$work/dhclient.pid" -lf "$work/dhclient.leases" -sf "$work/dhclient-script" eth0
+dhclient_release "$vm1"
 wait_for 5 sh -c "! has_binding vm1 $vm1_ip" || fail "vm1's binding kept after its release"
 sleep 1.5   # the save that follows a change comes within a second
 left_before=$(remaining vm2 "$vm2_ip"); at_before=$SECONDS

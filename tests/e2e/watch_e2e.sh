@@ -11,76 +11,30 @@
 #
 # Exit 0 passed, 1 failed, 77 skipped (the reason is printed).
 set -uo pipefail
+source "$(dirname "$0")/lib.sh" "$@"
+need ip scapy
 
-swsec=$(realpath "${1:?usage: watch_e2e.sh SWSEC_BINARY}")
-here=$(cd "$(dirname "$0")" && pwd)
-tool="$here/e2e_tool.py"
-examples="$here/../../examples"
-python=/usr/bin/python3
-
-skip() { echo "SKIP: $*"; exit 77; }
-[ "$(id -u)" -eq 0 ] || skip "needs root for network namespaces"
-command -v ip >/dev/null || skip "ip is not installed"
-"$python" -c "import scapy.all" 2>/dev/null || skip "python3-scapy is not installed (scripts/setup.sh installs it)"
-
-tag="sww$$"
-sw="${tag}sw"; srv="${tag}srv"; vm1="${tag}vm1"; vm2="${tag}vm2"; vm3="${tag}vm3"
-work=$(mktemp -d "/tmp/swsec-watch.XXXXXX")
-ctl="$work/ctl.sock"
-pids=()
-cleanup() {
-  local pid
-  for pid in "${pids[@]}"; do kill -TERM "$pid" 2>/dev/null; done
-  for pid in "${pids[@]}"; do
-    for _ in $(seq 50); do kill -0 "$pid" 2>/dev/null || break; sleep 0.1; done
-    kill -KILL "$pid" 2>/dev/null
-  done
-  for ns in "$vm1" "$vm2" "$vm3" "$srv" "$sw"; do ip netns del "$ns" 2>/dev/null; done
-  rm -rf "$work"
-}
-trap cleanup EXIT
-trap 'exit 1' INT TERM
-
-step() { echo "== $*"; }
-fail() {
-  echo "FAIL: $*"
-  echo "-- ports"; sw_ctl ports 2>&1
-  echo "-- swsec inline's log"; tail -n 30 "$work/inline.log" 2>/dev/null
-  exit 1
-}
-sw_ctl() { "$swsec" ctl --ctl "$ctl" "$@"; }
-json() { "$python" -c "import json,sys; d=json.load(sys.stdin); print($1)"; }
+e2e_diagnose() { echo "-- ports"; sw_ctl ports 2>&1; }
 port() { sw_ctl ports --json | json "[p$2 for p in d if p['name']=='$1']"; }
 now_ms() { echo $(($(date +%s%N) / 1000000)); }
-# vm NS LINK [MAC]: a namespace whose eth0 is the peer of LINK in the switch.
-vm() {
-  ip -n "$sw" link add "$2" ${3:+address "$3"} type veth peer name eth0 netns "$1" || fail "cannot make $2"
-  ip -n "$sw" link set "$2" up
-  ip -n "$1" link set eth0 up
-}
 
 step "namespaces: a bridge, a server, vm2 on a guarded port, vm1 and vm3 not yet on it"
-ip netns add "$sw" || skip "cannot make network namespaces"
-for ns in "$srv" "$vm1" "$vm2" "$vm3"; do ip netns add "$ns"; done
-ip -n "$sw" link add br0 type bridge 2>/dev/null || skip "no bridge support in this kernel"
-ip -n "$sw" link set br0 up
-vm "$srv" srvp; vm "$vm2" vm2p; vm "$vm1" vnet0; vm "$vm3" vm3p
-ip -n "$sw" link set srvp master br0; ip -n "$sw" link set vm2p master br0
+netns sw srv vm1 vm2 vm3
+bridge "$sw" br0
+veth "$sw" srvp "$srv"; veth "$sw" vm2p "$vm2"; veth "$sw" vnet0 "$vm1"; veth "$sw" vm3p "$vm3"
+enslave "$sw" br0 srvp vm2p
 ip -n "$srv" addr add 192.0.2.1/24 dev eth0
 ip -n "$vm2" addr add 192.0.2.2/24 dev eth0
 vm1_mac=$(ip netns exec "$vm1" cat /sys/class/net/eth0/address)
 tap_mac=$(ip netns exec "$sw" cat /sys/class/net/vnet0/address)
 mkdir "$work/state"
 echo '{}' >"$work/trusted.json"
-ip netns exec "$sw" "$swsec" inline --bridge br0 --port vm2=vm2p --port-config vm2="$work/trusted.json" \
-  --watch 'vnet*' --ctl "$ctl" --config "$examples/enforcing.json" --state-dir "$work/state" >>"$work/inline.log" 2>&1 &
-inline_pid=$!; pids+=("$inline_pid")
-for _ in $(seq 150); do sw_ctl ports >/dev/null 2>&1 && break; sleep 0.2; done
-sw_ctl ports >/dev/null 2>&1 || fail "swsec inline did not come up"
+inline_start --bridge br0 --port vm2=vm2p --port-config vm2="$work/trusted.json" \
+  --watch 'vnet*' --config "$examples/enforcing.json" --state-dir "$work/state"
 
 step "vm2 pings the server throughout; vm1 joins the bridge under --watch, vm3 is added and removed"
-ip netns exec "$vm2" ping -q -i 0.01 -c 500 -W 1 192.0.2.1 >"$work/ping.out" 2>&1 &
-ping_pid=$!; pids+=("$ping_pid")
+spawn ip netns exec "$vm2" ping -q -i 0.01 -c 500 -W 1 192.0.2.1 >"$work/ping.out" 2>&1
+ping_pid=$spawned
 sleep 0.5
 joined=$(now_ms)
 ip -n "$sw" link set vnet0 master br0
@@ -98,7 +52,7 @@ grep -q "exists" <<<"$out" || fail "the refusal does not say why: $out"
 sleep 0.5
 sw_ctl remove-port vm3 | grep -q "removed; its VM is cut off" || fail "remove-port did not report the VM cut off"
 [ "$(port vm3 "")" = "[]" ] || fail "vm3 still listed after remove-port"
-[ -z "$(ip -n "$sw" -j link show dev vm3p | json "d[0].get('master','')")" ] || fail "vm3p back on the bridge (fail closed)"
+[ -z "$(master_of vm3p)" ] || fail "vm3p back on the bridge (fail closed)"
 wait "$ping_pid"
 grep -q " 0% packet loss" "$work/ping.out" || fail "vm2 lost frames meanwhile: $(cat "$work/ping.out")"
 
@@ -111,8 +65,8 @@ for _ in $(seq 25); do [ "$(counted)" -gt "$before" ] && break; sleep 0.2; done
 
 step "vnet0 put back into the bridge round the guard is taken out again"
 ip -n "$sw" link set vnet0 master br0
-for _ in $(seq 25); do [ -z "$(ip -n "$sw" -j link show dev vnet0 | json "d[0].get('master','')")" ] && break; sleep 0.2; done
-[ -z "$(ip -n "$sw" -j link show dev vnet0 | json "d[0].get('master','')")" ] || fail "vnet0 stays in the bridge"
+for _ in $(seq 25); do [ -z "$(master_of vnet0)" ] && break; sleep 0.2; done
+[ -z "$(master_of vnet0)" ] || fail "vnet0 stays in the bridge"
 [ "$(port vnet0 "['running']")" = "[True]" ] || fail "vnet0 no longer guarded"
 
 step "an MTU raised on the VM's interface is followed by its pair"
@@ -126,7 +80,7 @@ ip -n "$sw" link del vnet0
 for _ in $(seq 25); do [ "$(port vnet0 "")" = "[]" ] && break; sleep 0.2; done
 [ "$(port vnet0 "")" = "[]" ] || fail "vnet0 still listed after it went"
 [ -s "$work/state/${tap_mac//:/-}.state" ] || fail "no state file named by the MAC: $(ls "$work/state")"
-vm "$vm1" vnet7 "$tap_mac"
+veth "$sw" vnet7 "$vm1" "$tap_mac"
 ip -n "$sw" link set vnet7 master br0
 for _ in $(seq 25); do [ "$(port vnet7 "['running']")" = "[True]" ] && break; sleep 0.2; done
 grep -q "vnet7: state restored from .*${tap_mac//:/-}.state" "$work/inline.log" || fail "vnet7 did not get vnet0's state"

@@ -25,7 +25,8 @@
  */
 #pragma once
 
-#include "fhs/fhs_config_record.h"
+#include "contract/fhs_binding.h"
+#include "contract/fhs_config_record.h"
 #include "fhs/fhs_dhcpv6.h"
 #include "swsec/swsec_context.h"
 
@@ -40,13 +41,6 @@
 struct SifraGenericFilter;
 struct FhsContext;
 
-/* How a binding was learned. */
-enum FhsBindMethod : uint8_t {
-   FhsBindDhcpv6 = 1,
-   FhsBindStatic = 2,
-   FhsBindFcfs = 4,
-};
-
 struct FhsBinding {
    orr_ListLinks portLinks;      /* the port's list, oldest first */
    orr_ListLinks hashLinks;      /* the port's hash bucket */
@@ -57,26 +51,6 @@ struct FhsBinding {
    int64_t expiry;               /* uptime seconds; 0: never (static) */
    FhsContext *owner;
 };
-
-/* Drop reasons, each with its counter and the text the summary shows. */
-#define FHS_DROP_LIST(X)                                      \
-   X(headerChainDropCnt, "header chain")                      \
-   X(fragmentedNdDropCnt, "fragmented ND or RA")              \
-   X(raGuardDropCnt, "RA guard")                              \
-   X(dhcpv6GuardDropCnt, "DHCPv6 guard")                      \
-   X(sourceGuardDropCnt, "source guard")                      \
-   X(ndInspectionDropCnt, "ND inspection")                    \
-   X(claimRefusedDropCnt, "address claimed by another port")  \
-   X(ndRateLimitDropCnt, "ND rate limit")
-
-struct FhsDropCounters {
-#define FHS_DROP_FIELD(name, text) uint64_t name;
-   FHS_DROP_LIST(FHS_DROP_FIELD)
-#undef FHS_DROP_FIELD
-   uint64_t ndRateLimitErrEntryCnt;
-   uint64_t bindingsEvictedCnt;
-};
-static_assert(sizeof(FhsDropCounters) == 80);
 
 /* A DHCPv6 client message awaiting the server's Reply. */
 struct FhsDhcpv6Pending {

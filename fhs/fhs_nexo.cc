@@ -3,6 +3,7 @@
 
 #include "fhs/fhs_agent.h"
 #include "fhs/fhs_bindings.h"
+#include "fhs/fhs_export.h"
 #include "framework/sifra_generic.h"
 #include "framework/sifra_generic_list.h"
 #include "framework/sifra_generic_log.h"
@@ -75,61 +76,13 @@ constinit const Nexo_RecordDef fhsNexoBindingRecord = {
 
 namespace {
 
-/* The agent's record, or null when it was not made. */
-SifraGenericFastPathAgent *FhsAgent()
-{
-   for (orr_ListLinks *links = agentList.next; links != &agentList; links = links->next) {
-      SifraGenericFastPathAgent *agent = SifraGenericAgentFromLinks(links);
-      if (agent->ops == &fhsAgentOps) {
-         return agent;
-      }
-   }
-   return nullptr;
-}
-
-/*
- * Finds the port of instance argument 0 and locks its configLock as asked,
- * under the agent lock (taken first: rank 2 before 4), which keeps the
- * port from being destroyed. FhsNexoPut undoes it.
- */
+/* The port of instance argument 0, locked as FhsLockPort does; FhsUnlockPort undoes it. */
 orr_Status FhsNexoGet(const Nexo_ParamList *instanceArgs, bool write, SifraGenericFastPathAgent **agentOut,
                       FhsContext **ctxOut)
 {
    int32_t key = 0;
-   orr_Status status = Nexo_ParamListGetInt32(instanceArgs, 0, &key);
-   if (status != ORR_OK) {
-      return status;
-   }
-   SifraGenericFastPathAgent *agent = FhsAgent();
-   if (agent == nullptr) {
-      return ORR_NOT_FOUND;
-   }
-   orr_SpinlockLock(agent->lock);
-   for (orr_ListLinks *links = agent->filterList.next; links != &agent->filterList; links = links->next) {
-      auto *ctx = static_cast<FhsContext *>(SifraGenericFilterFromLinks(links)->agentData);
-      if (ctx != nullptr && ctx->portId == static_cast<uint32_t>(key)) {
-         if (write) {
-            orr_SpinlockWriteLock(ctx->configLock);
-         } else {
-            orr_SpinlockReadLock(ctx->configLock);
-         }
-         *agentOut = agent;
-         *ctxOut = ctx;
-         return ORR_OK;
-      }
-   }
-   orr_SpinlockUnlock(agent->lock);
-   return ORR_NOT_FOUND;
-}
-
-void FhsNexoPut(SifraGenericFastPathAgent *agent, FhsContext *ctx, bool write)
-{
-   if (write) {
-      orr_SpinlockWriteUnlock(ctx->configLock);
-   } else {
-      orr_SpinlockReadUnlock(ctx->configLock);
-   }
-   orr_SpinlockUnlock(agent->lock);
+   const orr_Status status = Nexo_ParamListGetInt32(instanceArgs, 0, &key);
+   return status != ORR_OK ? status : FhsLockPort(static_cast<uint32_t>(key), write, agentOut, ctxOut);
 }
 
 void Number(char *field, size_t size, uint64_t value)
@@ -215,7 +168,7 @@ bool FhsParseIpv6(const char *text, uint8_t *addr)
 
 orr_Status FhsNexoListPorts(const Nexo_NodeDef *, const Nexo_ParamList *, Nexo_ParamList *list)
 {
-   SifraGenericFastPathAgent *agent = FhsAgent();
+   SifraGenericFastPathAgent *agent = FhsFindAgent();
    if (agent == nullptr) {
       return ORR_OK;
    }
@@ -273,7 +226,7 @@ orr_Status FhsNexoSummaryGet(const Nexo_NodeDef *, const Nexo_ParamList *instanc
    FHS_DROP_LIST(FHS_NEXO_DROP_FILL)
 #undef FHS_NEXO_DROP_FILL
    Number(summary->bindingsEvictedCnt, sizeof(summary->bindingsEvictedCnt), ctx->counters.bindingsEvictedCnt);
-   FhsNexoPut(agent, ctx, false);
+   FhsUnlockPort(agent, ctx, false);
    return ORR_OK;
 }
 
@@ -288,7 +241,7 @@ orr_Status FhsNexoListBindings(const Nexo_NodeDef *, const Nexo_ParamList *insta
    for (uint32_t index = 0; index < ctx->numBindings && status == ORR_OK; index++) {
       status = Nexo_ParamListAddInt(list, index);
    }
-   FhsNexoPut(agent, ctx, false);
+   FhsUnlockPort(agent, ctx, false);
    return status;
 }
 
@@ -304,7 +257,7 @@ orr_Status FhsNexoBindingGet(const Nexo_NodeDef *, const Nexo_ParamList *instanc
    status = Nexo_ParamListGetUInt32(instanceArgs, 1, &index);
    const FhsBinding *binding = status == ORR_OK ? BindingAt(ctx, index) : nullptr;
    if (binding == nullptr) {
-      FhsNexoPut(agent, ctx, false);
+      FhsUnlockPort(agent, ctx, false);
       return status != ORR_OK ? status : ORR_NOT_FOUND;
    }
    auto *record = static_cast<FhsNexo_Binding *>(output);
@@ -323,7 +276,7 @@ orr_Status FhsNexoBindingGet(const Nexo_NodeDef *, const Nexo_ParamList *instanc
       const int64_t left = __atomic_load_n(&binding->expiry, __ATOMIC_RELAXED) - now.sec;
       Number(record->timeRemaining, sizeof(record->timeRemaining), left > 0 ? static_cast<uint64_t>(left) : 0);
    }
-   FhsNexoPut(agent, ctx, false);
+   FhsUnlockPort(agent, ctx, false);
    return ORR_OK;
 }
 
@@ -365,6 +318,6 @@ orr_Status FhsNexoClear(const Nexo_NodeDef *, const Nexo_ParamList *instanceArgs
       }
    }
    SG_LOG(ORR_LOG_INFO, "%s: Cleared %u IPv6 bindings", ctx->filter->name, removed);
-   FhsNexoPut(agent, ctx, true);
+   FhsUnlockPort(agent, ctx, true);
    return ORR_OK;
 }

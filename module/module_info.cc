@@ -1,4 +1,5 @@
 /* What the module image publishes to the host loader. */
+#include "fhs/fhs_export.h"
 #include "framework/sifra_generic.h"
 #include "mgmt/swsec_nexo.h"
 #include "module/module_entry.h"
@@ -38,6 +39,9 @@ static const orr_ModuleExport sifraGenericModuleExports[] = {
    {"SwSec_PortDBReleaseBuf", reinterpret_cast<orr_ExportedFn>(&SwSec_PortDBReleaseBuf)},
    {"SwSec_PortDBGetEntries", reinterpret_cast<orr_ExportedFn>(&SwSec_PortDBGetEntries)},
    {"SwSec_PortDBGetNumEntries", reinterpret_cast<orr_ExportedFn>(&SwSec_PortDBGetNumEntries)},
+   {"Fhs_BindingsReleaseBuf", reinterpret_cast<orr_ExportedFn>(&Fhs_BindingsReleaseBuf)},
+   {"Fhs_BindingsGetEntries", reinterpret_cast<orr_ExportedFn>(&Fhs_BindingsGetEntries)},
+   {"Fhs_BindingsGetNumEntries", reinterpret_cast<orr_ExportedFn>(&Fhs_BindingsGetNumEntries)},
 };
 
 template <typename T, size_t N>

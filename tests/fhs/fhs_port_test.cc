@@ -302,6 +302,37 @@ TEST_F(FhsPortTest, nodes_show_the_summary_and_bindings_and_clear_them)
    EXPECT_EQ(host().nexo().get("/ipv6/9/summary", &summary), ORR_NOT_FOUND);
 }
 
+TEST_F(FhsPortTest, exported_queries_select_bindings_by_authority_and_a_held_buffer_keeps_the_module)
+{
+   const char *ns = "switchSecurity#1.0";
+   auto *getNum = reinterpret_cast<orr_Status (*)(uint32_t, uint32_t, uint32_t *)>(host().resolveExport(ns, "Fhs_BindingsGetNumEntries"));
+   auto *get = reinterpret_cast<orr_Status (*)(uint32_t, uint32_t, void **, uint32_t *, void **)>(host().resolveExport(ns, "Fhs_BindingsGetEntries"));
+   auto *release = reinterpret_cast<orr_Status (*)(void *)>(host().resolveExport(ns, "Fhs_BindingsReleaseBuf"));
+   ASSERT_TRUE(getNum && get && release);
+   ASSERT_TRUE(claim(kVmPort, kVm, a6("2001:db8::a")));
+   uint32_t count = 9;
+   void *entries = nullptr, *buffer = nullptr;
+   for (const auto &[selector, expected] : {std::pair{0u, 1u}, {1u, 1u}, {2u, 2u}, {3u, 0u}}) {
+      ASSERT_EQ(getNum(kVmPort, selector, &count), ORR_OK);
+      EXPECT_EQ(count, expected) << selector;
+   }
+   EXPECT_EQ(getNum(9, 2, &count), ORR_NOT_FOUND);
+   EXPECT_EQ(get(kVmPort, 2, nullptr, &count, &buffer), ORR_BAD_PARAM);
+   ASSERT_EQ(get(kVmPort, 2, &entries, &count, &buffer), ORR_OK);
+   ASSERT_EQ(count, 2u);
+   FhsBindingEntry got[2];
+   std::memcpy(got, entries, sizeof(got));
+   const FhsBindingKey expected[] = {key(kVm, kLinkLocal), key(kVm, a6("2001:db8::a"))};
+   EXPECT_EQ(std::memcmp(&got[0].key, &expected[0], sizeof(FhsBindingKey)), 0);
+   EXPECT_EQ(std::memcmp(&got[1].key, &expected[1], sizeof(FhsBindingKey)), 0);
+   EXPECT_EQ((std::array{got[0].method, got[0].authoritative, got[1].method, got[1].authoritative}),
+             (std::array<uint8_t, 4>{FhsBindStatic, 1, FhsBindFcfs, 0}));
+   EXPECT_EQ((std::array{got[0].timeRemaining, got[1].timeRemaining}), (std::array{0u, 600u}));
+   EXPECT_EQ(host().useCount(), 1u);
+   EXPECT_EQ(release(buffer), ORR_OK);
+   EXPECT_EQ(host().useCount(), 0u);
+}
+
 // Fails the n-th allocation (then lock, timer) of a port's creation until it succeeds, then a claim's.
 TEST_F(FhsPortTest, every_failure_of_creation_and_learning_is_undone)
 {

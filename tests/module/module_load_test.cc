@@ -37,7 +37,10 @@ TEST_F(ModuleInfoTest, publishes_namespaces_version_parameters_and_exports)
    }
    EXPECT_EQ(exports, (Strings{"switchSecurity#1.0 SwSec_PortDBReleaseBuf",
                                "switchSecurity#1.0 SwSec_PortDBGetEntries",
-                               "switchSecurity#1.0 SwSec_PortDBGetNumEntries"}));
+                               "switchSecurity#1.0 SwSec_PortDBGetNumEntries",
+                               "switchSecurity#1.0 Fhs_BindingsReleaseBuf",
+                               "switchSecurity#1.0 Fhs_BindingsGetEntries",
+                               "switchSecurity#1.0 Fhs_BindingsGetNumEntries"}));
 }
 
 TEST_F(ModuleInfoTest, heap_takes_its_name_and_sizes_from_the_module)

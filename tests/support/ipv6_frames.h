@@ -1,9 +1,9 @@
 // IPv6 frames for the first-hop security tests: extension headers,
 // ICMPv6 and neighbour discovery, DHCPv6 messages, and the agent's
-// configuration record.
+// configuration as the tests write it (every feature, untrusted).
 #pragma once
 
-#include "fhs/fhs_config_record.h"
+#include "contract/fhs_config_encode.h"
 #include "support/frames.h"
 
 #include <arpa/inet.h>
@@ -86,21 +86,9 @@ struct FhsPortConfig {
 };
 inline Bytes fhsConfigBytes(const FhsPortConfig &c)
 {
-   FhsConfig header{};
-   header.version = FHS_CONFIG_VERSION;
-   header.featuresEnabled = c.features;
-   header.trusted = c.trusted;
-   header.bindingLimit = c.bindingLimit;
-   header.numStatic = uint32_t(c.statics.size());
-   header.ndRateLimit = c.ndRateLimit;
-   header.errRateLimit = c.errRateLimit;
-   header.errRateLimitPeriod = c.errRateLimitPeriod;
-   Bytes out(sizeof(header) + c.statics.size() * sizeof(FhsBindingKey));
-   std::memcpy(out.data(), &header, sizeof(header));
-   if (!c.statics.empty()) {
-      std::memcpy(out.data() + sizeof(header), c.statics.data(), c.statics.size() * sizeof(FhsBindingKey));
-   }
-   return out;
+   return contract::fhsConfigRecord({.features = c.features, .trusted = c.trusted != 0, .bindingLimit = c.bindingLimit,
+                                     .ndRateLimit = c.ndRateLimit, .errRateLimit = c.errRateLimit,
+                                     .errRateLimitPeriod = c.errRateLimitPeriod, .statics = c.statics});
 }
 
 }  // namespace swsec::testing

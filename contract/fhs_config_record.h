@@ -4,6 +4,8 @@
  *
  * A packed record in the host's byte order: a 30-byte header followed by
  * `numStatic` 24-byte static bindings (FhsBindingKey).
+ *
+ * Wire contract: freestanding, shared by the module and the tools.
  */
 #pragma once
 

@@ -1,17 +1,22 @@
 // Slow paths registered, attached, retried and withdrawn, and their part of
 // a saved state: the filters of the built-in agent kept on the least loaded
 // slow path while the host accepts, refuses and answers the module's
-// requests as each test scripts.
-#include "slow_path_fixture.h"
+// requests as each test scripts. After every step the module's records must
+// agree with each other and with the host (expectConsistent).
+#include "port_fixture.h"
 
+#include "framework/sifra_generic_agent.h"
+#include "framework/sifra_generic_list.h"
 #include "framework/sifra_generic_saved_state.h"
+#include "framework/sifra_generic_slow_path.h"
 
 #include <gmock/gmock.h>
 
-#include <cstring>
+#include <functional>
+#include <map>
+#include <optional>
 
 using ::testing::ElementsAre;
-using ::testing::IsEmpty;
 
 namespace swsec::testing {
 namespace {
@@ -19,43 +24,113 @@ namespace {
 using host::SlowPathRequestKind;
 using Kind = host::SlowPathStateRequest::Kind;
 
+class SlowPathTest : public PortTest {
+protected:
+   host::SlowPaths &slowPaths() { return host().sifra().slowPaths(); }
+   host::Migration &migration() { return host().migration(); }
+   SifraGenericFastPathAgent *agent() { return SifraGenericAgentFromHandle(host().sifra().fastPath(kAgent)->agent); }
+   void registerSlowPath(uint32_t id) { EXPECT_EQ(slowPaths().registerSlowPath(kAgent, id), ORR_OK); }
+   uint32_t state(host::FilterId id) { return record(id)->attachState; }
+   uint32_t phase(host::FilterId id) { return record(id)->migrationState; }
+   void runAttach() { host().clock().runDue(); }
+   size_t deliver() { return slowPaths().deliverReplies(); }
+   // The slow path ID the module has the filter on; nothing when detached.
+   std::optional<uint32_t> moduleSlowPath(host::FilterId id)
+   {
+      const SifraGenericSlowPath *slowPath = record(id)->slowPath;
+      return slowPath == nullptr ? std::nullopt : std::optional<uint32_t>(slowPath->slowPathID);
+   }
+   // Set requests made so far, as "filter->slow path".
+   std::vector<std::string> setRequests()
+   {
+      std::vector<std::string> texts;
+      for (const auto &request : slowPaths().requests()) {
+         if (request.kind == SlowPathRequestKind::Set) {
+            texts.push_back(std::to_string(request.filter) + "->" + std::to_string(request.slowPathID));
+         }
+      }
+      return texts;
+   }
+   host::FilterId attachedPort(const char *name = "vm")
+   {
+      registerSlowPath(1);
+      const host::FilterId id = create({.name = name});
+      deliver();
+      EXPECT_EQ(state(id), SifraGenericAttachAttached);
+      return id;
+   }
+
+   // Every slow path counts exactly the filters on it; a filter holds one
+   // reference more than its creation's for each reply owed to it; a filter
+   // is on a slow path exactly when its state says so, and the host pairs
+   // it with that slow path exactly when it is attached.
+   void expectConsistent()
+   {
+      std::map<const SifraGenericSlowPath *, uint32_t> onSlowPath;
+      std::map<host::FilterId, uint32_t> owed;
+      for (const auto &reply : slowPaths().pendingReplies()) {
+         ++owed[reply.filter];
+      }
+      for (const auto &filter : host().sifra().filters()) {
+         const auto *rec = static_cast<const SifraGenericFilter *>(filter.record);
+         SCOPED_TRACE("filter " + filter.config.name);
+         EXPECT_EQ(rec->refCount, 1u + owed[filter.id]);
+         EXPECT_EQ(rec->slowPath == nullptr, rec->attachState == SifraGenericAttachDetached);
+         onSlowPath[rec->slowPath] += rec->slowPath != nullptr;
+         if (rec->attachState == SifraGenericAttachAttached) {
+            EXPECT_EQ(filter.slowPathID, rec->slowPath->slowPathID);
+         }
+         if (rec->attachState == SifraGenericAttachAttaching) {
+            EXPECT_EQ(owed[filter.id], 1u) << "an attaching filter is owed its reply";
+         }
+      }
+      for (const auto &info : slowPaths().registered()) {
+         const auto *rec = static_cast<const SifraGenericSlowPath *>(info.record);
+         SCOPED_TRACE("slow path " + std::to_string(info.id));
+         EXPECT_EQ(rec->magic, SIFRAGENERIC_SLOWPATH_MAGIC);
+         EXPECT_EQ(rec->numFilters, onSlowPath[rec]);
+         EXPECT_EQ(rec->useCount, 1u + rec->numFilters);
+         EXPECT_EQ(SifraGenericListIsLinked(&rec->links), !info.withdrawing);
+      }
+   }
+};
+
 // ---------------------------------------------------------------- attaching
 
-TEST_F(SlowPathTest, filters_before_a_registration_wait_for_its_callback_and_later_ones_attach_at_creation)
+// A filter made before any slow path waits for the attach callback; later
+// ones attach at creation, each to the least loaded slow path, ties to the
+// oldest; requests carry the timeout parameter.
+TEST_F(SlowPathTest, filters_attach_by_callback_or_at_creation_to_the_least_loaded_slow_path)
 {
-   const host::FilterId early = create({.name = "early"});
+   ASSERT_EQ(host().unload(), ORR_OK);
+   ASSERT_EQ(host().load({.parameters = {{"SIFRAGENERIC_SLOWPATH_TIMEOUT", 350}}}), 0);
+   host().portsets().addPortset("vs1");
+   for (uint32_t port = 21; port < 26; ++port) {
+      host().portsets().addPort("vs1", port);
+   }
+   const host::FilterId early = create({.name = "early"}, 21);
    registerSlowPath(1);
-   EXPECT_THAT(setRequests(), IsEmpty()) << "the registration itself asks for nothing";
+   EXPECT_TRUE(slowPaths().requests().empty()) << "the registration itself asks for nothing";
    EXPECT_EQ(state(early), SifraGenericAttachDetached);
-
    runAttach();
    EXPECT_EQ(agent()->attachTimer, 0u);
    EXPECT_EQ(state(early), SifraGenericAttachAttaching);
-   ASSERT_EQ(slowPaths().requests().size(), 1u);
-   EXPECT_EQ(slowPaths().requests()[0].timeoutMs, 2000) << "the module parameter's default";
    expectConsistent();
-   EXPECT_EQ(deliver(), 1u);
-   EXPECT_EQ(state(early), SifraGenericAttachAttached);
-   EXPECT_EQ(host().sifra().filter(early)->slowPathID, 1u);
-
-   const size_t timers = host().clock().pendingTimers();
-   const host::FilterId late = create({.name = "late"});
-   EXPECT_EQ(state(late), SifraGenericAttachAttaching) << "attached at creation, without a callback";
-   EXPECT_EQ(host().clock().pendingTimers(), timers + 1) << "the new port's own timer alone";
-   EXPECT_EQ(deliver(), 1u);
-   expectConsistent();
-}
-
-TEST_F(SlowPathTest, a_new_filter_goes_to_the_least_loaded_slow_path_ties_to_the_oldest)
-{
-   registerSlowPath(1);
+   deliver();
    registerSlowPath(2);
    runAttach();
+   const size_t timers = host().clock().pendingTimers();
    std::vector<std::optional<uint32_t>> chosen;
-   for (int i = 0; i < 4; ++i) {
-      chosen.push_back(moduleSlowPath(create({.name = "f" + std::to_string(i)})));
+   for (uint32_t port = 22; port < 26; ++port) {
+      const host::FilterId id = create({.name = "f" + std::to_string(port)}, port);
+      EXPECT_EQ(state(id), SifraGenericAttachAttaching) << "attached at creation, without a callback";
+      chosen.push_back(moduleSlowPath(id));
    }
-   EXPECT_THAT(chosen, ElementsAre(1u, 2u, 1u, 2u));
+   EXPECT_EQ(host().clock().pendingTimers(), timers + 4) << "the new ports' own timers alone";
+   EXPECT_THAT(chosen, ElementsAre(2u, 1u, 2u, 1u));
+   for (const auto &request : slowPaths().requests()) {
+      EXPECT_EQ(request.timeoutMs, 350);
+   }
    deliver();
    expectConsistent();
 }
@@ -77,7 +152,6 @@ TEST_F(SlowPathTest, a_registration_while_the_callback_has_its_locks_released_ma
    const size_t timers = host().clock().pendingTimers();
    runAttach();
    slowPaths().onRequest(nullptr);
-
    EXPECT_THAT(setRequests(), ElementsAre(std::to_string(first) + "->1", std::to_string(second) + "->2",
                                           std::to_string(second) + "->2"));
    EXPECT_EQ(host().clock().pendingTimers(), timers - 1) << "the second registration scheduled no callback";
@@ -91,38 +165,20 @@ TEST_F(SlowPathTest, a_registration_while_the_callback_has_its_locks_released_ma
 // freed and poisoned), so the walk must read its successor only afterwards.
 TEST_F(SlowPathTest, a_walk_goes_on_past_a_filter_destroyed_while_its_locks_were_released)
 {
-   for (const bool unregistering : {false, true}) {
-      SCOPED_TRACE(unregistering ? "unregistration's walk" : "attach callback's walk");
-      if (unregistering) {
-         registerSlowPath(1);
+   const host::FilterId a = create({.name = "a"});
+   const host::FilterId b = create({.name = "b"});
+   const host::FilterId c = create({.name = "c"});
+   registerSlowPath(1);
+   slowPaths().onRequest([&](const host::SlowPathRequest &request) {
+      if (request.filter == a && host().sifra().filter(b)) {
+         EXPECT_EQ(host().sifra().destroyFilter(b), ORR_OK);
       }
-      const host::FilterId a = create({.name = "a"});
-      const host::FilterId b = create({.name = "b"});
-      const host::FilterId c = create({.name = "c"});
-      unregistering ? (void)deliver() : registerSlowPath(1);
-      slowPaths().onRequest([&](const host::SlowPathRequest &request) {
-         if (request.filter == a && host().sifra().filter(b)) {
-            EXPECT_EQ(host().sifra().destroyFilter(b), ORR_OK);
-         }
-      });
-      slowPaths().clearRequests();
-      unregistering ? (void)slowPaths().unregisterSlowPath(1) : runAttach();
-      slowPaths().onRequest(nullptr);
-      std::vector<host::FilterId> asked;
-      for (const auto &request : slowPaths().requests()) {
-         if (request.filter != b) {
-            asked.push_back(request.filter);
-         }
-      }
-      EXPECT_THAT(asked, ElementsAre(a, c));
-      deliver();
-      expectConsistent();
-      EXPECT_EQ(host().sifra().destroyFilter(a), ORR_OK);
-      EXPECT_EQ(host().sifra().destroyFilter(c), ORR_OK);
-      if (!unregistering) {
-         EXPECT_EQ(slowPaths().unregisterSlowPath(1), ORR_OK);
-      }
-   }
+   });
+   runAttach();
+   slowPaths().onRequest(nullptr);
+   EXPECT_THAT(setRequests(), ElementsAre(std::to_string(a) + "->1", std::to_string(c) + "->1"));
+   deliver();
+   expectConsistent();
 }
 
 TEST_F(SlowPathTest, a_failed_scheduling_leaves_filters_for_the_next_registration)
@@ -135,22 +191,6 @@ TEST_F(SlowPathTest, a_failed_scheduling_leaves_filters_for_the_next_registratio
    runAttach();
    deliver();
    EXPECT_EQ(moduleSlowPath(id), 1u) << "the least loaded, the oldest on a tie";
-}
-
-TEST_F(SlowPathTest, requests_carry_the_timeout_module_parameter)
-{
-   ASSERT_EQ(host().unload(), ORR_OK);
-   ASSERT_EQ(host().load({.parameters = {{"SIFRAGENERIC_SLOWPATH_TIMEOUT", 350}}}), 0);
-   host().portsets().addPortset("vs1");
-   host().portsets().addPort("vs1", 21);
-   registerSlowPath(1);
-   slowPaths().scriptReplies(SlowPathRequestKind::Set, {ORR_FAILURE});
-   create({}, 21);
-   deliver();
-   deliver();
-   ASSERT_EQ(slowPaths().requests().size(), 2u);
-   EXPECT_EQ(slowPaths().requests()[0].timeoutMs, 350);
-   EXPECT_EQ(slowPaths().requests()[1].timeoutMs, 350);
 }
 
 // ---------------------------------------------------------------- replies and retries
@@ -173,43 +213,16 @@ TEST_F(SlowPathTest, failed_replies_are_retried_at_once_numbered_from_each_new_a
    // Moved to slow path 2 by the first one's withdrawal: a new attach counts from one.
    registerSlowPath(2);
    runAttach();
-   slowPaths().scriptReplies(SlowPathRequestKind::Set, {ORR_TIMEOUT});
+   slowPaths().scriptReplies(SlowPathRequestKind::Set, {ORR_TIMEOUT, ORR_FAILURE});
    ASSERT_EQ(slowPaths().unregisterSlowPath(1), ORR_OK);
    ASSERT_EQ(deliver(), 1u);
    EXPECT_EQ(record(id)->attachRetries, 1u);
    EXPECT_TRUE(loggedWithPrefix(host(), "vm: Retry (#1) to attach slow path #2", 1));
-   deliver();
-   expectConsistent();
-}
-
-TEST_F(SlowPathTest, a_refused_retry_detaches_the_filter)
-{
-   registerSlowPath(1);
-   slowPaths().scriptReplies(SlowPathRequestKind::Set, {ORR_FAILURE});
-   const host::FilterId id = create({.name = "vm"});
+   // A retry the host refuses detaches the filter.
    host().faults().failOnce("orr_SifraSetSlowPath", ORR_NO_MEMORY);
    EXPECT_EQ(deliver(), 1u);
    EXPECT_EQ(state(id), SifraGenericAttachDetached);
-   EXPECT_EQ(record(id)->refCount, 1u);
    expectConsistent();
-}
-
-TEST_F(SlowPathTest, a_reply_for_a_record_that_is_no_filter_touches_nothing)
-{
-   registerSlowPath(1);
-   const host::FilterId id = create();
-   SifraGenericFilter *filter = record(id);
-   filter->magic = ~SIFRAGENERIC_FILTER_MAGIC;
-   EXPECT_EQ(deliver(), 1u);
-   filter->magic = SIFRAGENERIC_FILTER_MAGIC;
-   EXPECT_TRUE(loggedWithPrefix(host(), "Bad magic for filter", 2));
-   EXPECT_EQ(state(id), SifraGenericAttachAttaching);
-   // Undo what the lost reply would have undone, for the teardown.
-   filter->refCount = 1;
-   filter->attachState = SifraGenericAttachDetached;
-   filter->slowPath = nullptr;
-   slowPath(1)->numFilters = 0;
-   slowPath(1)->useCount = 1;
 }
 
 // ---------------------------------------------------------------- unregistering and destroying
@@ -271,29 +284,6 @@ TEST_F(SlowPathTest, a_failed_reply_for_a_slow_path_being_unregistered_moves_the
    expectConsistent();
 }
 
-TEST_F(SlowPathTest, destroying_a_filter_clears_its_slow_path_first_and_waits_for_a_pending_reply)
-{
-   registerSlowPath(1);
-   const host::FilterId attaching = create({.name = "attaching"});
-   EXPECT_EQ(host().sifra().destroyFilter(attaching), ORR_BUSY);
-   EXPECT_EQ(slowPaths().requests().size(), 1u) << "no clear for a filter still attaching";
-   deliver();
-   slowPaths().clearRequests();
-   EXPECT_EQ(host().sifra().destroyFilter(attaching), ORR_OK);
-   ASSERT_EQ(slowPaths().requests().size(), 1u);
-   EXPECT_EQ(slowPaths().requests()[0].kind, SlowPathRequestKind::Clear);
-
-   // A clear that fails for a while keeps the filter, still counted.
-   const host::FilterId attached = create({.name = "attached"});
-   deliver();
-   host().faults().failOnce("orr_SifraClearSlowPath", ORR_BUSY);
-   EXPECT_EQ(host().sifra().destroyFilter(attached), ORR_BUSY);
-   EXPECT_EQ(state(attached), SifraGenericAttachAttached);
-   expectConsistent();
-   EXPECT_EQ(host().sifra().destroyFilter(attached), ORR_OK);
-   EXPECT_EQ(slowPaths().unregisterSlowPath(1), ORR_OK) << "nothing left counted on it";
-}
-
 // The agent's attachStateChanged sees every change, in order.
 std::vector<uint32_t> seenStates;
 orr_Status recordState(SifraGenericFilter *, uint32_t attachState)
@@ -302,7 +292,9 @@ orr_Status recordState(SifraGenericFilter *, uint32_t attachState)
    return ORR_OK;
 }
 
-TEST_F(SlowPathTest, the_agent_hears_every_attach_state_change)
+// A destroy waits for a pending reply, then clears the slow path first; a
+// clear that fails for a while keeps the filter, still counted.
+TEST_F(SlowPathTest, destroying_a_filter_waits_for_its_reply_and_clears_its_slow_path_first)
 {
    SifraGenericAgentOps ops = *agent()->ops;
    ops.attachStateChanged = recordState;
@@ -312,13 +304,21 @@ TEST_F(SlowPathTest, the_agent_hears_every_attach_state_change)
    registerSlowPath(1);
    slowPaths().scriptReplies(SlowPathRequestKind::Set, {ORR_FAILURE, ORR_OK});
    const host::FilterId id = create();
+   EXPECT_EQ(host().sifra().destroyFilter(id), ORR_BUSY);
+   EXPECT_EQ(slowPaths().requests().size(), 1u) << "no clear for a filter still attaching";
    deliver();
    deliver();
+   slowPaths().clearRequests();
    host().faults().failOnce("orr_SifraClearSlowPath", ORR_TRY_AGAIN);
    EXPECT_EQ(host().sifra().destroyFilter(id), ORR_BUSY);
+   EXPECT_EQ(state(id), SifraGenericAttachAttached);
+   expectConsistent();
    EXPECT_EQ(host().sifra().destroyFilter(id), ORR_OK);
+   ASSERT_EQ(slowPaths().requests().size(), 2u);
+   EXPECT_EQ(slowPaths().requests()[1].kind, SlowPathRequestKind::Clear);
    agent()->ops = original;
    EXPECT_THAT(seenStates, ElementsAre(3u, 4u, 1u, 4u, 1u, 2u));
+   EXPECT_EQ(slowPaths().unregisterSlowPath(1), ORR_OK) << "nothing left counted on it";
 }
 
 TEST_F(SlowPathTest, unloading_with_the_attach_callback_still_scheduled_cancels_it)
@@ -330,26 +330,157 @@ TEST_F(SlowPathTest, unloading_with_the_attach_callback_still_scheduled_cancels_
    // callback pending, and the timer queue must go without it.
 }
 
+// ---------------------------------------------------------------- every host failure of a life cycle
+
+struct SweepCase {
+   const char *name;
+   const char *point;       // fault point, or null: the n-th set reply fails
+   orr_Status status;
+   const char *message;     // logged once the failure is hit; null: none of its own
+};
+
+class SlowPathSweepTest : public SlowPathTest, public ::testing::WithParamInterface<SweepCase> {
+protected:
+   std::vector<orr_Status> failures_;
+
+   void step(const char *what, const std::function<orr_Status()> &action)
+   {
+      SCOPED_TRACE(what);
+      const orr_Status status = action();
+      if (status != ORR_OK) {
+         failures_.push_back(status);
+      }
+      expectConsistent();
+   }
+   host::FilterId createNamed(const char *name)
+   {
+      host::FilterId id = 0;
+      step(name, [&] { return host().sifra().createFilter(kAgent, kPort, {.name = name}, &id); });
+      return id;
+   }
+   void withdraw(uint32_t id)
+   {
+      step("unregister", [&] {
+         bool known = false;
+         for (const auto &info : slowPaths().registered()) {
+            known |= info.id == id;
+         }
+         orr_Status status = known ? slowPaths().unregisterSlowPath(id) : ORR_OK;   // else its registration failed
+         for (int round = 0; status == ORR_BUSY && round < 10; ++round) {
+            deliver();
+            status = slowPaths().retryWithdrawals() == 0 ? ORR_OK : ORR_BUSY;
+         }
+         return status;
+      });
+   }
+   void destroy(host::FilterId id)
+   {
+      if (id != 0) {
+         step("destroy", [&] { return host().sifra().destroyFilterAsHypervisor(id).status; });
+      }
+   }
+   // A filter before any slow path, one attached at creation, a second slow
+   // path taking the next filter, the first slow path withdrawn with its
+   // filters moving, filters destroyed attached and detached.
+   void lifeCycle()
+   {
+      const host::FilterId a = createNamed("a");
+      step("register 1", [&] { return slowPaths().registerSlowPath(kAgent, 1); });
+      runAttach();
+      deliver();
+      const host::FilterId b = createNamed("b");
+      step("register 2", [&] { return slowPaths().registerSlowPath(kAgent, 2); });
+      runAttach();
+      const host::FilterId c = createNamed("c");
+      deliver();
+      expectConsistent();
+      withdraw(1);
+      deliver();
+      expectConsistent();
+      destroy(b);
+      withdraw(2);
+      destroy(a);
+      destroy(c);
+   }
+};
+
+// The n-th call of each kind failed, for every n until the cycle runs
+// clean: each failure is reported where it happens and nothing is left.
+TEST_P(SlowPathSweepTest, each_failure_in_turn_is_reported_and_undone)
+{
+   const SweepCase &c = GetParam();
+   uint64_t n = 1;
+   for (;; ++n) {
+      SCOPED_TRACE("failing call " + std::to_string(n));
+      if (!host().loaded()) {
+         ASSERT_EQ(host().load(), 0);
+      }
+      failures_.clear();
+      const uint64_t callsBefore = c.point != nullptr ? host().faults().calls(c.point) : 0;
+      if (c.point != nullptr) {
+         host().faults().failOnce(c.point, c.status, n);
+      } else {
+         std::vector<orr_Status> replies(n, ORR_OK);
+         replies.back() = c.status;
+         slowPaths().scriptReplies(SlowPathRequestKind::Set, replies);
+      }
+      host().log().clear();
+      slowPaths().clearRequests();
+
+      lifeCycle();
+
+      bool hit = false;
+      if (c.point != nullptr) {
+         hit = host().faults().calls(c.point) - callsBefore >= n;
+      } else {
+         size_t accepted = 0;
+         for (const auto &request : slowPaths().requests()) {
+            accepted += request.kind == SlowPathRequestKind::Set && request.result == ORR_OK;
+         }
+         hit = accepted >= n;
+      }
+      host().faults().clear();
+      if (hit) {
+         if (c.message != nullptr) {
+            EXPECT_TRUE(logged(c.message)) << c.message;
+         }
+         if (std::string(c.name) == "allocation") {
+            EXPECT_EQ(failures_, std::vector<orr_Status>{ORR_NO_MEMORY}) << "one creation or registration refused";
+         } else {
+            EXPECT_TRUE(failures_.empty()) << "the host's failures do not fail the host's calls";
+         }
+      }
+      EXPECT_TRUE(slowPaths().registered().empty());
+      EXPECT_TRUE(host().sifra().filters().empty());
+      ASSERT_EQ(host().unload(), ORR_OK);
+      expectNothingLeft(host());
+      if (!hit) {
+         break;
+      }
+   }
+   EXPECT_GE(n, 3u) << "the cycle makes at least two such calls";
+}
+
+INSTANTIATE_TEST_SUITE_P(
+   Failures, SlowPathSweepTest,
+   ::testing::Values(
+      SweepCase{"allocation", "orr_HeapAllocWithRA", ORR_NO_MEMORY, nullptr},
+      SweepCase{"set_refused", "orr_SifraSetSlowPath", ORR_NO_MEMORY,
+                "Request to set slow path failed (0xbad0014): Out of memory"},
+      SweepCase{"set_reply_failed", nullptr, ORR_TIMEOUT, "Retry (#1) to attach slow path"},
+      SweepCase{"clear_transient", "orr_SifraClearSlowPath", ORR_TRY_AGAIN,
+                "Transient failure in clearing slow path (0xbad0006): Try again"},
+      SweepCase{"clear_failed", "orr_SifraClearSlowPath", ORR_FAILURE,
+                "Request to clear slow path failed (0xbad0001): Failure"},
+      SweepCase{"schedule_failed", "orr_TimerSchedule", ORR_NO_MEMORY,
+                "Could not schedule callback (0xbad0014): Out of memory"}),
+   [](const auto &param) { return std::string(param.param.name); });
+
 // ---------------------------------------------------------------- the slow path's part of a saved state
 
 const Bytes kSlowState = {0xde, 0xad, 0xbe, 0xef, 0x01};
 
-class SavedSlowPathTest : public SlowPathTest {
-protected:
-   uint32_t phase(host::FilterId id) { return record(id)->migrationState; }
-   host::Migration &migration() { return host().migration(); }
-
-   host::FilterId attachedPort(const char *name = "vm")
-   {
-      registerSlowPath(1);
-      const host::FilterId id = create({.name = name});
-      deliver();
-      EXPECT_EQ(state(id), SifraGenericAttachAttached);
-      return id;
-   }
-};
-
-TEST_F(SavedSlowPathTest, the_save_waits_for_the_slow_paths_state_and_carries_it_unchanged)
+TEST_F(SlowPathTest, a_save_waits_for_the_slow_paths_state_and_carries_it_unchanged)
 {
    const host::FilterId id = attachedPort();
    migration().scriptRetrieve({.state = kSlowState});
@@ -361,26 +492,23 @@ TEST_F(SavedSlowPathTest, the_save_waits_for_the_slow_paths_state_and_carries_it
    EXPECT_EQ(migration().length(id, &length), ORR_NOT_READY);
    EXPECT_EQ(migration().deliverReplies(), 1u);
    EXPECT_EQ(record(id)->refCount, 1u);
-
    ASSERT_EQ(migration().length(id, &length), ORR_OK);
    Bytes blob;
    ASSERT_EQ(migration().save(id, length, &blob), ORR_OK);
    SifraGenericStateHeader header{};
    std::memcpy(&header, blob.data(), sizeof header);
    EXPECT_EQ(header.slowPathOffset, 48 + header.agentLen);
-   EXPECT_EQ(header.slowPathLen, kSlowState.size());
    EXPECT_EQ(Bytes(blob.begin() + static_cast<std::ptrdiff_t>(header.slowPathOffset), blob.end()), kSlowState);
    EXPECT_EQ(record(id)->slowPathState, nullptr) << "freed by the save";
-}
-
-TEST_F(SavedSlowPathTest, a_prefetch_while_the_filter_is_still_attaching_asks_no_slow_path)
-{
-   registerSlowPath(1);
-   const host::FilterId id = create({.name = "vm"});
-   ASSERT_EQ(state(id), SifraGenericAttachAttaching);
    migration().prefetch(id);
-   EXPECT_EQ(phase(id), SifraGenericMigrationReady);
-   EXPECT_TRUE(migration().requests().empty());
+   EXPECT_EQ(host().sifra().destroyFilter(id), ORR_BUSY) << "not before the fetch's reply";
+   EXPECT_EQ(migration().deliverReplies(), 1u);
+
+   // A prefetch while a filter is still attaching asks no slow path.
+   const host::FilterId attaching = create({.name = "attaching"}, kOtherPort);
+   migration().prefetch(attaching);
+   EXPECT_EQ(phase(attaching), SifraGenericMigrationReady);
+   EXPECT_EQ(migration().requests().size(), 2u) << "the two fetches for the attached port alone";
    deliver();
 }
 
@@ -395,7 +523,7 @@ struct FetchCase {
    const char *message;       // null: none
 };
 
-class FetchOutcomeTest : public SavedSlowPathTest, public ::testing::WithParamInterface<FetchCase> {};
+class FetchOutcomeTest : public SlowPathTest, public ::testing::WithParamInterface<FetchCase> {};
 
 TEST_P(FetchOutcomeTest, each_fetch_outcome_leaves_its_phase_and_no_reference)
 {
@@ -436,15 +564,6 @@ INSTANTIATE_TEST_SUITE_P(
                 SifraGenericMigrationReady, "vm: Ignoring slow path state reply; wrong state (3)"}),
    [](const auto &testInfo) { return std::string(testInfo.param.name); });
 
-TEST_F(SavedSlowPathTest, a_filter_with_a_fetch_pending_is_not_destroyed_before_its_reply)
-{
-   const host::FilterId id = attachedPort();
-   migration().prefetch(id);
-   EXPECT_EQ(host().sifra().destroyFilter(id), ORR_BUSY);
-   EXPECT_EQ(migration().deliverReplies(), 1u);
-   EXPECT_EQ(host().sifra().destroyFilterAsHypervisor(id).status, ORR_OK);
-}
-
 struct RestoreCase {
    const char *name;
    host::SlowPathStateOutcome outcome;
@@ -453,8 +572,10 @@ struct RestoreCase {
    const char *message;
 };
 
-class SlowPathRestoreTest : public SavedSlowPathTest, public ::testing::WithParamInterface<RestoreCase> {};
+class SlowPathRestoreTest : public SlowPathTest, public ::testing::WithParamInterface<RestoreCase> {};
 
+// The slow path's part goes back to its slow path; the agent's part stays
+// restored whatever becomes of it.
 TEST_P(SlowPathRestoreTest, the_slow_paths_part_goes_back_to_its_slow_path)
 {
    const RestoreCase &c = GetParam();
@@ -463,15 +584,10 @@ TEST_P(SlowPathRestoreTest, the_slow_paths_part_goes_back_to_its_slow_path)
    migration().scriptRetrieve({.state = kSlowState});
    Bytes blob;
    ASSERT_EQ(migration().saveAsHypervisor(source, &blob), ORR_OK);
-
    const host::FilterId id = create({.name = "dest"}, kOtherPort);
    deliver();
    migration().scriptRestore(c.outcome);
    EXPECT_EQ(migration().restore(id, blob), c.status);
-   if (c.status == ORR_OK && c.outcome.replyStatus == ORR_OK) {
-      EXPECT_EQ(phase(id), SifraGenericMigrationRestoring);
-      EXPECT_EQ(record(id)->refCount, 2u);
-   }
    if (c.cancelBeforeReply) {
       EXPECT_EQ(migration().length(id, nullptr), ORR_OK);
    }
@@ -479,7 +595,6 @@ TEST_P(SlowPathRestoreTest, the_slow_paths_part_goes_back_to_its_slow_path)
    EXPECT_TRUE(logged(c.message)) << ::testing::PrintToString(logTexts());
    EXPECT_EQ(phase(id), SifraGenericMigrationIdle);
    EXPECT_EQ(record(id)->refCount, 1u);
-   // The agent's part stays restored whatever became of the slow path's.
    EXPECT_EQ(context(id)->numVmiEntries, 1u);
    const auto requests = migration().requests();
    ASSERT_EQ(requests.size(), 2u);

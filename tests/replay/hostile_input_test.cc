@@ -21,6 +21,7 @@
 #include <chrono>
 #include <cstring>
 #include <functional>
+#include <optional>
 #include <fstream>
 #include <sstream>
 
@@ -177,17 +178,35 @@ TEST(HostileCapture, a_piped_pcapng_keeps_its_direction_flags)
 
 // ---------------------------------------------------------------- command line
 
-// Bad usage and bad input on the command line, in every subcommand: exit
-// status 2, one short line on stderr naming the problem, nothing on stdout
+// Bad usage and bad input, on the command line and in the files it names,
+// in every subcommand: exit status 2 (1 for a configuration the module
+// refuses), one short line on stderr naming the problem, nothing on stdout
 // and nothing written. EXAMPLE, BRIDGE and DIR stand for the example
-// capture, the bridge capture and an empty directory.
+// capture, the bridge capture and an empty directory; a case's file is
+// written to DIR/in first.
+std::string pcapRecord(uint32_t caplen, uint32_t len, size_t present)
+{
+   std::string r = pcapFile(1, {});
+   for (uint32_t word : {1u, 0u, caplen, len}) {
+      put32(r, word);
+   }
+   return r.substr(24) + std::string(present, '\x02');
+}
+
 TEST(BadUsage, is_named_in_one_short_line_with_status_2_and_nothing_written)
 {
    const std::string bridge = (sourceDir() / "tests/data/bridge-three-vms.pcap").string();
    const std::string a = "a=02:00:5e:c0:00:11";
+   const std::vector<std::string> config = {"replay", "--vm-mac", kVmMac, "--config", "DIR/in", "--write-passed",
+                                            "DIR/passed.pcap", "EXAMPLE"};
+   const std::vector<std::string> capture = {"replay", "--vm-mac", kVmMac, "--write-passed", "DIR/p.pcap",
+                                             "--write-dropped", "DIR/d.pcap", "DIR/in"};
+   const std::string pcap = pcapFile(1, {});
    struct Case {
       std::vector<std::string> args;
       const char *message;
+      std::optional<std::string> file = std::nullopt;
+      int status = 2;
    };
    const Case cases[] = {
       {{"replay", "--vm-mac", kVmMac, "--until", "1e15", "EXAMPLE"},
@@ -218,6 +237,26 @@ TEST(BadUsage, is_named_in_one_short_line_with_status_2_and_nothing_written)
       {{"ctl", "--ctl", "DIR/ctl.sock", "clear", "vm1", "0", "02:00:5e:c0:00:01"}, "expected clear PORT [VLAN MAC IP]"},
       {{"state", "show", "DIR/missing.state"}, "missing.state"},
       {{"frobnicate", "EXAMPLE"}, "unknown subcommand \"frobnicate\""},
+      // Configuration files.
+      {config, "bad JSON", R"({"features": [)"},
+      {config, "unknown feature \"firewall\"", R"({"features": ["dai", "firewall"]})"},
+      {config, "unknown key \"trustd\"", R"({"trustd": true})"},
+      {config, "malformed MAC address", R"({"static": [{"vlan": 0, "mac": "02:00:5e:c0:00", "ip": "10.0.0.1"}]})"},
+      {config, "malformed IPv4 address", R"({"static": [{"vlan": 0, "mac": "02:00:5e:c0:00:01", "ip": "10.0.0"}]})"},
+      {config, "0 to 4095", R"({"static": [{"vlan": 4096, "mac": "02:00:5e:c0:00:01", "ip": "10.0.0.1"}]})"},
+      {config, "unsigned 32-bit", R"({"arpRateLimit": -1})"},
+      {config, "number overflow", R"({"portDbSize": 1e400})"},
+      {config, "nested deeper than 64 levels",
+       R"({"features": )" + std::string(100'000, '[') + "\"dai\"" + std::string(100'000, ']') + "}"},
+      // The module's own rule: inspection on a trusted port is refused, in its words.
+      {config, "Invalid config: featuresEnabled = 0xc trusted = 1",
+       R"({"features": ["dai", "ip-discovery"], "trusted": true})", 1},
+      // Captures.
+      {capture, "cannot read capture", "hello, this is text\n"},
+      {capture, "cannot read capture", ""},
+      {capture, "corrupt capture after frame 1", pcap + pcapRecord(60, 60, 60) + pcapRecord(60, 60, 20)},
+      {capture, "frame 2 is truncated (40 of 60 bytes captured)",
+       pcap + pcapRecord(60, 60, 60) + pcapRecord(40, 60, 40)},
    };
    for (const Case &c : cases) {
       TempDir dir;
@@ -229,14 +268,20 @@ TEST(BadUsage, is_named_in_one_short_line_with_status_2_and_nothing_written)
             arg = (dir.path() / arg.substr(4)).string();
          }
       }
+      if (c.file) {
+         writeFile(dir.path() / "in", *c.file);
+      }
       const ToolRun run = runTool(args);
-      SCOPED_TRACE(args[0] + " " + args[1] + " ...: " + run.err);
-      EXPECT_EQ(run.status, 2);
+      SCOPED_TRACE(args[0] + " " + args[1] + " ...: " + c.message + ": " + run.err);
+      EXPECT_EQ(run.status, c.status);
       EXPECT_EQ(run.out, "");
       EXPECT_NE(run.err.find(c.message), std::string::npos);
+      if (c.file) {
+         EXPECT_NE(run.err.find((dir.path() / "in").string()), std::string::npos) << "the file is named";
+      }
       EXPECT_EQ(std::count(run.err.begin(), run.err.end(), '\n'), 1);
-      EXPECT_LT(run.err.size(), 200u);
-      EXPECT_TRUE(dir.files().empty());
+      EXPECT_LT(run.err.size(), c.file ? 300u : 200u);
+      EXPECT_EQ(dir.files(), c.file ? std::vector<std::string>{"in"} : std::vector<std::string>{});
    }
 }
 

@@ -1,6 +1,5 @@
 // The replay as a user meets it: directions, the clock running on, the
-// configuration file, output captures, and every kind of bad input (one
-// line on stderr naming the file, exit status 2, no output file left).
+// configuration file and output captures (bad input: hostile_input_test.cc).
 #include "replay_support.h"
 
 #include "replay/describe.h"
@@ -88,21 +87,6 @@ TEST(ReplayClock, the_lease_counts_down_on_capture_time)
 
 // ---------------------------------------------------------------- configuration
 
-TEST(ReplayConfig, static_bindings_are_written_in_the_record_layout)
-{
-   const auto config = session::parseConfig(
-      R"({"features":["dai","ip-discovery"],"trusted":false,"static":[{"vlan":258,"mac":"02:00:5e:c0:00:01","ip":"192.0.2.7"}]})",
-      "inline");
-   const auto bytes = session::configRecord(config);
-   ASSERT_EQ(bytes.size(), 26u + 12u);
-   EXPECT_EQ(bytes[0], 1);                                  // version
-   EXPECT_EQ(bytes[1], 0x0c);                               // DAI | IP discovery
-   EXPECT_EQ(bytes[5], 0);                                  // untrusted
-   EXPECT_EQ(bytes[10], 1);                                 // one static entry
-   EXPECT_EQ((std::vector<uint8_t>(bytes.begin() + 26, bytes.end())),
-             (std::vector<uint8_t>{0x02, 0x01, 0x02, 0x00, 0x5e, 0xc0, 0x00, 0x01, 192, 0, 2, 7}));
-}
-
 TEST(ReplayConfig, a_static_binding_lets_its_owner_pass_inspection_without_dhcp)
 {
    TempDir dir;
@@ -120,102 +104,7 @@ TEST(ReplayConfig, a_static_binding_lets_its_owner_pass_inspection_without_dhcp)
    EXPECT_EQ(result.ports[0].portDb.front().method, "Static");
 }
 
-struct BadConfig {
-   const char *name;
-   std::string text;
-   const char *message;
-   int status = 2;   // 1: well-formed, but the module refused it
-};
-
-class ReplayBadConfig : public ::testing::TestWithParam<BadConfig> {};
-
-TEST_P(ReplayBadConfig, is_refused_with_the_file_and_the_problem)
-{
-   TempDir dir;
-   const auto path = dir.path() / "port.json";
-   writeFile(path, GetParam().text);
-   const ToolRun run = runTool({"replay", "--vm-mac", kVmMac, "--config", path.string(), "--write-passed",
-                                (dir.path() / "passed.pcap").string(), example()});
-   EXPECT_EQ(run.status, GetParam().status);
-   EXPECT_EQ(run.out, "");
-   EXPECT_NE(run.err.find(path.string()), std::string::npos) << run.err;
-   EXPECT_NE(run.err.find(GetParam().message), std::string::npos) << run.err;
-   EXPECT_EQ(std::count(run.err.begin(), run.err.end(), '\n'), 1) << run.err;
-   EXPECT_EQ(dir.files(), (std::vector<std::string>{"port.json"}));
-}
-
-INSTANTIATE_TEST_SUITE_P(
-   Documents, ReplayBadConfig,
-   ::testing::Values(
-      BadConfig{"bad_json", R"({"features": [)", "bad JSON"},
-      BadConfig{"unknown_feature", R"({"features": ["dai", "firewall"]})", "unknown feature \"firewall\""},
-      BadConfig{"unknown_key", R"({"trustd": true})", "unknown key \"trustd\""},
-      BadConfig{"malformed_static_mac", R"({"static": [{"vlan": 0, "mac": "02:00:5e:c0:00", "ip": "10.0.0.1"}]})",
-                "malformed MAC address"},
-      BadConfig{"malformed_static_ip", R"({"static": [{"vlan": 0, "mac": "02:00:5e:c0:00:01", "ip": "10.0.0"}]})",
-                "malformed IPv4 address"},
-      BadConfig{"vlan_out_of_range", R"({"static": [{"vlan": 4096, "mac": "02:00:5e:c0:00:01", "ip": "10.0.0.1"}]})",
-                "0 to 4095"},
-      BadConfig{"negative_limit", R"({"arpRateLimit": -1})", "unsigned 32-bit"},
-      BadConfig{"number_out_of_range", R"({"portDbSize": 1e400})", "number overflow"},
-      BadConfig{"nested_too_deep", R"({"features": )" + std::string(100'000, '[') + "\"dai\"" +
-                                      std::string(100'000, ']') + "}", "nested deeper than 64 levels"},
-      // The module's own rule: inspection on a trusted port is refused, in its words.
-      BadConfig{"refused_by_the_module", R"({"features": ["dai", "ip-discovery"], "trusted": true})",
-                "Invalid config: featuresEnabled = 0xc trusted = 1", 1}),
-   [](const auto &param) { return std::string(param.param.name); });
-
 // ---------------------------------------------------------------- captures and outputs
-
-struct BadCapture {
-   const char *name;
-   std::string bytes;    // the capture file's contents
-   const char *message;
-};
-
-std::string pcapHeader()
-{
-   std::string h;
-   const uint32_t words[] = {0xa1b2c3d4, 0x00040002, 0, 0, 65535, 1};
-   h.append(reinterpret_cast<const char *>(words), 8);
-   h.append(reinterpret_cast<const char *>(&words[2]), 16);
-   return h;
-}
-
-std::string pcapRecord(uint32_t caplen, uint32_t len, size_t present)
-{
-   std::string r;
-   const uint32_t words[] = {1, 0, caplen, len};
-   r.append(reinterpret_cast<const char *>(words), sizeof words);
-   r.append(present, '\x02');
-   return r;
-}
-
-class ReplayBadCapture : public ::testing::TestWithParam<BadCapture> {};
-
-TEST_P(ReplayBadCapture, is_refused_and_leaves_no_output)
-{
-   TempDir dir;
-   const auto capture = dir.path() / "in.pcap";
-   writeFile(capture, GetParam().bytes);
-   const ToolRun run = runTool({"replay", "--vm-mac", kVmMac, "--write-passed", (dir.path() / "p.pcap").string(),
-                                "--write-dropped", (dir.path() / "d.pcap").string(), capture.string()});
-   EXPECT_EQ(run.status, 2);
-   EXPECT_NE(run.err.find(capture.string()), std::string::npos) << run.err;
-   EXPECT_NE(run.err.find(GetParam().message), std::string::npos) << run.err;
-   EXPECT_EQ(std::count(run.err.begin(), run.err.end(), '\n'), 1) << run.err;
-   EXPECT_EQ(dir.files(), (std::vector<std::string>{"in.pcap"}));
-}
-
-INSTANTIATE_TEST_SUITE_P(
-   Files, ReplayBadCapture,
-   ::testing::Values(BadCapture{"not_a_capture", "hello, this is text\n", "cannot read capture"},
-                     BadCapture{"empty_file", "", "cannot read capture"},
-                     BadCapture{"cut_inside_a_record", pcapHeader() + pcapRecord(60, 60, 60) + pcapRecord(60, 60, 20),
-                                "corrupt capture after frame 1"},
-                     BadCapture{"frame_captured_short", pcapHeader() + pcapRecord(60, 60, 60) + pcapRecord(40, 60, 40),
-                                "frame 2 is truncated (40 of 60 bytes captured)"}),
-   [](const auto &param) { return std::string(param.param.name); });
 
 TEST(ReplayOutputs, passed_and_dropped_frames_are_written_as_they_were_captured)
 {

@@ -22,7 +22,6 @@ namespace swsec::testing {
 namespace {
 
 using host::SlowPathRequestKind;
-using Kind = host::SlowPathStateRequest::Kind;
 
 class SlowPathTest : public PortTest {
 protected:
@@ -97,44 +96,6 @@ protected:
 
 // ---------------------------------------------------------------- attaching
 
-// A filter made before any slow path waits for the attach callback; later
-// ones attach at creation, each to the least loaded slow path, ties to the
-// oldest; requests carry the timeout parameter.
-TEST_F(SlowPathTest, filters_attach_by_callback_or_at_creation_to_the_least_loaded_slow_path)
-{
-   ASSERT_EQ(host().unload(), ORR_OK);
-   ASSERT_EQ(host().load({.parameters = {{"SIFRAGENERIC_SLOWPATH_TIMEOUT", 350}}}), 0);
-   host().portsets().addPortset("vs1");
-   for (uint32_t port = 21; port < 26; ++port) {
-      host().portsets().addPort("vs1", port);
-   }
-   const host::FilterId early = create({.name = "early"}, 21);
-   registerSlowPath(1);
-   EXPECT_TRUE(slowPaths().requests().empty()) << "the registration itself asks for nothing";
-   EXPECT_EQ(state(early), SifraGenericAttachDetached);
-   runAttach();
-   EXPECT_EQ(agent()->attachTimer, 0u);
-   EXPECT_EQ(state(early), SifraGenericAttachAttaching);
-   expectConsistent();
-   deliver();
-   registerSlowPath(2);
-   runAttach();
-   const size_t timers = host().clock().pendingTimers();
-   std::vector<std::optional<uint32_t>> chosen;
-   for (uint32_t port = 22; port < 26; ++port) {
-      const host::FilterId id = create({.name = "f" + std::to_string(port)}, port);
-      EXPECT_EQ(state(id), SifraGenericAttachAttaching) << "attached at creation, without a callback";
-      chosen.push_back(moduleSlowPath(id));
-   }
-   EXPECT_EQ(host().clock().pendingTimers(), timers + 4) << "the new ports' own timers alone";
-   EXPECT_THAT(chosen, ElementsAre(2u, 1u, 2u, 1u));
-   for (const auto &request : slowPaths().requests()) {
-      EXPECT_EQ(request.timeoutMs, 350);
-   }
-   deliver();
-   expectConsistent();
-}
-
 TEST_F(SlowPathTest, a_registration_while_the_callback_has_its_locks_released_makes_it_scan_again)
 {
    const host::FilterId first = create({.name = "a"});
@@ -158,39 +119,6 @@ TEST_F(SlowPathTest, a_registration_while_the_callback_has_its_locks_released_ma
    deliver();
    EXPECT_EQ(moduleSlowPath(second), 2u);
    expectConsistent();
-}
-
-// The walks of the filter list release both locks around each request; a
-// filter after the current one may be destroyed meanwhile (its record
-// freed and poisoned), so the walk must read its successor only afterwards.
-TEST_F(SlowPathTest, a_walk_goes_on_past_a_filter_destroyed_while_its_locks_were_released)
-{
-   const host::FilterId a = create({.name = "a"});
-   const host::FilterId b = create({.name = "b"});
-   const host::FilterId c = create({.name = "c"});
-   registerSlowPath(1);
-   slowPaths().onRequest([&](const host::SlowPathRequest &request) {
-      if (request.filter == a && host().sifra().filter(b)) {
-         EXPECT_EQ(host().sifra().destroyFilter(b), ORR_OK);
-      }
-   });
-   runAttach();
-   slowPaths().onRequest(nullptr);
-   EXPECT_THAT(setRequests(), ElementsAre(std::to_string(a) + "->1", std::to_string(c) + "->1"));
-   deliver();
-   expectConsistent();
-}
-
-TEST_F(SlowPathTest, a_failed_scheduling_leaves_filters_for_the_next_registration)
-{
-   const host::FilterId id = create({.name = "a"});
-   host().faults().failOnce("orr_TimerSchedule", ORR_NO_MEMORY);
-   registerSlowPath(1);
-   EXPECT_EQ(agent()->attachTimer, 0u);
-   registerSlowPath(2);
-   runAttach();
-   deliver();
-   EXPECT_EQ(moduleSlowPath(id), 1u) << "the least loaded, the oldest on a tie";
 }
 
 // ---------------------------------------------------------------- replies and retries
@@ -282,43 +210,6 @@ TEST_F(SlowPathTest, a_failed_reply_for_a_slow_path_being_unregistered_moves_the
    EXPECT_EQ(moduleSlowPath(id), 2u);
    EXPECT_EQ(state(id), SifraGenericAttachAttached);
    expectConsistent();
-}
-
-// The agent's attachStateChanged sees every change, in order.
-std::vector<uint32_t> seenStates;
-orr_Status recordState(SifraGenericFilter *, uint32_t attachState)
-{
-   seenStates.push_back(attachState);
-   return ORR_OK;
-}
-
-// A destroy waits for a pending reply, then clears the slow path first; a
-// clear that fails for a while keeps the filter, still counted.
-TEST_F(SlowPathTest, destroying_a_filter_waits_for_its_reply_and_clears_its_slow_path_first)
-{
-   SifraGenericAgentOps ops = *agent()->ops;
-   ops.attachStateChanged = recordState;
-   const SifraGenericAgentOps *original = agent()->ops;
-   agent()->ops = &ops;
-   seenStates.clear();
-   registerSlowPath(1);
-   slowPaths().scriptReplies(SlowPathRequestKind::Set, {ORR_FAILURE, ORR_OK});
-   const host::FilterId id = create();
-   EXPECT_EQ(host().sifra().destroyFilter(id), ORR_BUSY);
-   EXPECT_EQ(slowPaths().requests().size(), 1u) << "no clear for a filter still attaching";
-   deliver();
-   deliver();
-   slowPaths().clearRequests();
-   host().faults().failOnce("orr_SifraClearSlowPath", ORR_TRY_AGAIN);
-   EXPECT_EQ(host().sifra().destroyFilter(id), ORR_BUSY);
-   EXPECT_EQ(state(id), SifraGenericAttachAttached);
-   expectConsistent();
-   EXPECT_EQ(host().sifra().destroyFilter(id), ORR_OK);
-   ASSERT_EQ(slowPaths().requests().size(), 2u);
-   EXPECT_EQ(slowPaths().requests()[1].kind, SlowPathRequestKind::Clear);
-   agent()->ops = original;
-   EXPECT_THAT(seenStates, ElementsAre(3u, 4u, 1u, 4u, 1u, 2u));
-   EXPECT_EQ(slowPaths().unregisterSlowPath(1), ORR_OK) << "nothing left counted on it";
 }
 
 TEST_F(SlowPathTest, unloading_with_the_attach_callback_still_scheduled_cancels_it)
@@ -562,57 +453,6 @@ INSTANTIATE_TEST_SUITE_P(
                 "vm: Ignoring slow path state reply; wrong state (1)"},
       FetchCase{"a_detach_makes_the_save_ready_and_the_late_reply_is_ignored", {.state = kSlowState}, 'u',
                 SifraGenericMigrationReady, "vm: Ignoring slow path state reply; wrong state (3)"}),
-   [](const auto &testInfo) { return std::string(testInfo.param.name); });
-
-struct RestoreCase {
-   const char *name;
-   host::SlowPathStateOutcome outcome;
-   orr_Status status;
-   bool cancelBeforeReply;
-   const char *message;
-};
-
-class SlowPathRestoreTest : public SlowPathTest, public ::testing::WithParamInterface<RestoreCase> {};
-
-// The slow path's part goes back to its slow path; the agent's part stays
-// restored whatever becomes of it.
-TEST_P(SlowPathRestoreTest, the_slow_paths_part_goes_back_to_its_slow_path)
-{
-   const RestoreCase &c = GetParam();
-   const host::FilterId source = attachedPort("source");
-   ASSERT_TRUE(passes(source, kTx, arpRequest(kVmMac, kVmIp)));
-   migration().scriptRetrieve({.state = kSlowState});
-   Bytes blob;
-   ASSERT_EQ(migration().saveAsHypervisor(source, &blob), ORR_OK);
-   const host::FilterId id = create({.name = "dest"}, kOtherPort);
-   deliver();
-   migration().scriptRestore(c.outcome);
-   EXPECT_EQ(migration().restore(id, blob), c.status);
-   if (c.cancelBeforeReply) {
-      EXPECT_EQ(migration().length(id, nullptr), ORR_OK);
-   }
-   (void)migration().deliverReplies();
-   EXPECT_TRUE(logged(c.message)) << ::testing::PrintToString(logTexts());
-   EXPECT_EQ(phase(id), SifraGenericMigrationIdle);
-   EXPECT_EQ(record(id)->refCount, 1u);
-   EXPECT_EQ(context(id)->numVmiEntries, 1u);
-   const auto requests = migration().requests();
-   ASSERT_EQ(requests.size(), 2u);
-   EXPECT_EQ(requests[1].kind, Kind::restore);
-   EXPECT_EQ(requests[1].state, kSlowState);
-}
-
-INSTANTIATE_TEST_SUITE_P(
-   Outcomes, SlowPathRestoreTest,
-   ::testing::Values(
-      RestoreCase{"a_successful_reply_finishes_the_restore", {}, ORR_OK, false,
-                  "dest: Finished restoring slow path state"},
-      RestoreCase{"a_failed_reply_keeps_the_agents_part", {.replyStatus = ORR_FAILURE}, ORR_OK, false,
-                  "dest: Failed to restore slow path state (0xbad0001): "},
-      RestoreCase{"a_refused_request_returns_its_status", {.refusal = ORR_BUSY}, ORR_BUSY, false,
-                  "dest: Couldn't request slow path state restore (0xbad0004): "},
-      RestoreCase{"a_reply_after_a_cancel_is_unexpected", {}, ORR_OK, true,
-                  "dest: Unexpected restore slow path state reply"}),
    [](const auto &testInfo) { return std::string(testInfo.param.name); });
 
 }  // namespace

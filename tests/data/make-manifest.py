@@ -20,6 +20,7 @@ carry their VID. No capture is long enough (all under 60 s) for a pending
 request or a lease to age out, and no error-rate-limit state can end before
 the capture does (it lasts at least 10 s, the flood capture ends 4 s later).
 """
+import ipaddress
 import json
 import os
 import struct
@@ -86,7 +87,51 @@ CAPTURES = [
      "make-attacks.py: dhclient-lease-renew-release.pcap without its DHCPRELEASE, then, 1 s after, "
      "ICMP from the leased address, spoofed IPv4 sources and ARP replies claiming the server's address."),
 ]
-EXTRA_VM_SRC_MACS = {"attack-ip-spoof": [FOREIGN_MAC]}
+CAPTURES += [
+    ("dhclient6-lease-renew-release", "02:00:5e:c0:00:31", "real",
+     "make-captures6.sh: the VM's link comes up (MLD reports, DAD of its link-local address, a router "
+     "solicitation); dhclient -6 -D LL (isc-dhcp-client 4.4.3) against dnsmasq 2.90's stateful DHCPv6 "
+     "(lease 120 s, router advertisements with the managed flag, no autonomous prefix): Solicit..Reply, "
+     "the DAD of the leased address, a ping to the server, the Renew at T1 (60 s), then `dhclient -6 -r`."),
+    ("slaac-privacy-dad", "02:00:5e:c0:00:32", "real",
+     "make-captures6.sh: the kernel's own SLAAC (use_tempaddr 2, dad_transmits 1) from dnsmasq 2.90's "
+     "router advertisements (ra-only, 2001:db8:1::/64): DAD of the link-local, stable (EUI-64) and "
+     "temporary addresses, MLDv2 reports, then a ping to the server from the temporary and from the "
+     "stable address."),
+    ("attack6-ra-guard", "02:00:5e:c0:00:10", "crafted",
+     "make-attacks6.py: the VM's link-local (DAD) and DHCPv6 address, then router advertisements from "
+     "the VM: plain, behind hop-by-hop and destination-options headers, in a first fragment that ends "
+     "inside its chain (and the fragment after it), as an atomic fragment; a redirect; last, a router "
+     "solicitation from the VM and the router's advertisement to it."),
+    ("attack6-dhcpv6-server", "02:00:5e:c0:00:10", "crafted",
+     "make-attacks6.py: the VM's addresses, then DHCPv6 server messages sent by the VM: Advertise, "
+     "Reply, Reconfigure, Relay-Reply, a Reply behind a destination-options header; last, the VM's "
+     "own Solicit."),
+    ("attack6-nd-spoof", "02:00:5e:c0:00:10", "crafted",
+     "make-attacks6.py: the VM's addresses, then neighbour advertisements from the VM claiming the "
+     "router's link-local and global addresses and another host's, a solicitation with a foreign "
+     "link-layer address option, one from an address the VM does not hold; the VM's own solicitation "
+     "for the router, the router's answer, the VM's advertisement of its own address."),
+    ("attack6-ip-spoof", "02:00:5e:c0:00:10", "crafted",
+     "make-attacks6.py: the VM's addresses, then UDP from its DHCPv6 address, from addresses it does not "
+     "hold (another, the router's, the unspecified address), from its address with a foreign source "
+     "MAC and on VLAN 100; an echo request from its link-local address, an MLDv2 report from the "
+     "unspecified address, an echo request to the VM from a spoofed source."),
+    ("attack6-address-flood", "02:00:5e:c0:00:10", "crafted",
+     "make-attacks6.py: the VM's two addresses, then duplicate-address detection for 66 addresses, four "
+     "a second (the port's default limit is 64 bindings), then UDP from the first addresses the VM held "
+     "and from the claimed ones."),
+    ("attack6-nd-flood", "02:00:5e:c0:00:10", "crafted",
+     "make-attacks6.py: the VM's addresses, then 25 neighbour solicitations from its address in 0.48 s, "
+     "then 8 UDP frames from it 1 s later."),
+]
+EXTRA_VM_SRC_MACS = {"attack-ip-spoof": [FOREIGN_MAC], "attack6-ip-spoof": [FOREIGN_MAC]}
+
+# The two agents on an untrusted port, every feature of each (examples/dual-stack.json).
+DUAL_STACK = {"name": "dual-stack", "featuresEnabled": 0x1F, "trusted": 0, "portDbSize": 32,
+              "arpRateLimit": 10, "errRateLimit": 5, "errRateLimitPeriod": 10,
+              "ipv6": {"featuresEnabled": 0x7F, "trusted": 0, "bindingLimit": 64, "ndRateLimit": 10,
+                       "errRateLimit": 5, "errRateLimitPeriod": 10, "fcfsLifetime": 600}}
 
 CONFIGS = [
     {"name": "learning", "featuresEnabled": 0x04, "trusted": 1, "portDbSize": 32,
@@ -97,6 +142,12 @@ CONFIGS = [
 MSG = {1: "DHCPDISCOVER", 2: "DHCPOFFER", 3: "DHCPREQUEST", 4: "DHCPDECLINE", 5: "DHCPACK",
        6: "DHCPNAK", 7: "DHCPRELEASE", 8: "DHCPINFORM"}
 BPDU_MACS = {"01:80:c2:00:00:00", "01:00:0c:cc:cc:cd"}
+DHCPV6_MSG = {1: "DHCPv6 SOLICIT", 2: "DHCPv6 ADVERTISE", 3: "DHCPv6 REQUEST", 4: "DHCPv6 CONFIRM",
+              5: "DHCPv6 RENEW", 6: "DHCPv6 REBIND", 7: "DHCPv6 REPLY", 8: "DHCPv6 RELEASE",
+              9: "DHCPv6 DECLINE", 10: "DHCPv6 RECONFIGURE", 11: "DHCPv6 INFORMATION-REQUEST",
+              12: "DHCPv6 RELAY-FORW", 13: "DHCPv6 RELAY-REPL"}
+ICMPV6_KIND = {128: "ICMPv6 echo request", 129: "ICMPv6 echo reply", 131: "MLD report", 133: "RS", 134: "RA",
+               135: "NS", 136: "NA", 137: "Redirect", 143: "MLDv2 report"}
 
 
 def read_pcap(path):
@@ -202,7 +253,9 @@ def kind(p, frame):
         return "ARP gratuitous reply" if a["spa"] == a["tpa"] else "ARP reply"
     if "ipv6" in p:
         u = p["udp"]
-        return {2: "DHCPv6 ADVERTISE", 7: "DHCPv6 REPLY"}.get(frame[u["off"] + 8], "IPv6 UDP")
+        return DHCPV6_MSG.get(frame[u["off"] + 8], "IPv6 UDP")
+    if p["etype"] == 0x86DD:
+        return ipv6_kind(frame, p)
     if "ipv4" in p:
         v = p["ipv4"]
         if v["frag"]:
@@ -363,6 +416,272 @@ class Port:
         return None
 
 
+def addr6(b):
+    return str(ipaddress.IPv6Address(bytes(b)))
+
+
+EXT_HEADERS = {0, 43, 44, 51, 60, 135, 139, 140}
+UPPER_LEN = {6: 20, 17: 8, 58: 4}
+
+
+def walk6(frame, l3):
+    """The IPv6 header chain: (None, chain) or (why, None) for a chain that is refused."""
+    if len(frame) < l3 + 40 or frame[l3] >> 4 != 6:
+        return "malformed", None
+    plen = 40 + struct.unpack_from("!H", frame, l3 + 4)[0]
+    if l3 + plen > len(frame):
+        return "malformed", None
+    ip6 = frame[l3:l3 + plen]
+    c = {"src": addr6(ip6[8:24]), "dst": addr6(ip6[24:40]), "frag": False, "later": False, "ip6": ip6}
+    nxt, off, count = ip6[6], 40, 0
+    while nxt in EXT_HEADERS:
+        cut = "not in the first fragment" if c["frag"] else "malformed"
+        if count == 8:
+            return "over the limits", None
+        if nxt == 0 and count:
+            return "malformed", None
+        if off + 2 > plen:
+            return cut, None
+        length = 8 if nxt == 44 else (ip6[off + 1] + 2) * 4 if nxt == 51 else (ip6[off + 1] + 1) * 8
+        if off + length - 40 > 256:
+            return "over the limits", None
+        if off + length > plen:
+            return cut, None
+        count += 1
+        if nxt == 44:
+            if c["frag"]:
+                return "malformed", None
+            c["frag"] = True
+            if struct.unpack_from("!H", ip6, off + 2)[0] & 0xFFF8:
+                c.update(later=True, proto=ip6[off], off=off + length)
+                return None, c
+        nxt, off = ip6[off], off + length
+    if off + UPPER_LEN.get(nxt, 0) > plen:
+        return ("not in the first fragment" if c["frag"] else "malformed"), None
+    c.update(proto=nxt, off=off)
+    return None, c
+
+
+def ipv6_kind(frame, p):
+    why, c = walk6(frame, p["l3"])
+    if why:
+        return f"IPv6 ({why} header chain)"
+    if c["later"]:
+        return "IPv6 fragment (non-first)"
+    ip6, off = c["ip6"], c["off"]
+    behind = " in a fragment" if c["frag"] else " behind extension headers" if off > 40 else ""
+    if c["proto"] == 58:
+        k = ICMPV6_KIND.get(ip6[off], f"ICMPv6 type {ip6[off]}")
+        if ip6[off] == 135 and c["src"] == "::":
+            k = "NS (DAD)"
+        return k + behind
+    if c["proto"] == 17:
+        sp, dp = struct.unpack_from("!HH", ip6, off)
+        if 546 in (sp, dp) or 547 in (sp, dp):
+            return DHCPV6_MSG.get(ip6[off + 8], "DHCPv6") + behind
+        return "IPv6 UDP" + behind
+    return f"IPv6 protocol {c['proto']}" + behind
+
+
+def parse_dhcpv6(msg):
+    """(type, xid, client DUID, [(address, valid lifetime)]) or None for a malformed message."""
+    if len(msg) < 4 or msg[0] in (12, 13):
+        return None
+    typ, xid, cid, addrs = msg[0], int.from_bytes(msg[1:4], "big"), None, []
+
+    def options(data):
+        o = 0
+        while o < len(data):
+            if len(data) - o < 4:
+                raise ValueError
+            code, length = struct.unpack_from("!HH", data, o)
+            if length > len(data) - o - 4:
+                raise ValueError
+            yield code, data[o + 4:o + 4 + length]
+            o += 4 + length
+    try:
+        for code, val in options(msg[4:]):
+            if code == 1:
+                if len(val) > 130:
+                    return None
+                cid = bytes(val)
+            elif code in (3, 4):
+                head = 12 if code == 3 else 4
+                if len(val) < head:
+                    return None
+                for sub, sval in options(val[head:]):
+                    if sub == 5:
+                        if len(sval) < 24:
+                            return None
+                        addrs.append((addr6(sval[0:16]), struct.unpack_from("!I", sval, 20)[0]))
+    except ValueError:
+        return None
+    return typ, xid, cid, addrs
+
+
+FHS_FIRST = "First come first served"
+
+
+class Fhs:
+    """Reference model of one port's IPv6 first-hop security: header chain, RA guard, DHCPv6
+    guard, ND rate limit, ND inspection with first-come-first-served claims, DHCPv6 learning,
+    source guard, in that order; frames from the VM are judged unless the port is trusted."""
+
+    DROPS = ("headerChainDropCnt", "fragmentedNdDropCnt", "raGuardDropCnt", "dhcpv6GuardDropCnt",
+             "sourceGuardDropCnt", "ndInspectionDropCnt", "claimRefusedDropCnt", "ndRateLimitDropCnt",
+             "ndRateLimitErrEntryCnt", "bindingsEvictedCnt")
+
+    def __init__(self, cfg, t_start):
+        self.cfg, self.bindings, self.pending, self.events = cfg, [], [], []
+        self.counters = {k: 0 for k in self.DROPS}
+        self.nd = Limiter(cfg["ndRateLimit"], t_start)
+        self.err = False
+
+    def find(self, vlan, m, a):
+        return next((b for b in self.bindings if (b["vlan"], b["mac"], b["ip"]) == (vlan, m, a)), None)
+
+    def remove(self, b, idx):
+        self.bindings.remove(b)
+        self.events.append({"index": idx, "event": "fhs.binding.removed", **key(b)})
+
+    def bind(self, idx, vlan, m, a, method, lifetime):
+        b = self.find(vlan, m, a)
+        if b:
+            b.update(method=method, leaseSeconds=lifetime)
+            return
+        if len(self.bindings) >= self.cfg["bindingLimit"]:
+            self.remove(self.bindings[0], idx)
+            self.counters["bindingsEvictedCnt"] += 1
+        b = {"vlan": vlan, "mac": m, "ip": a, "method": method, "leaseSeconds": lifetime}
+        self.bindings.append(b)
+        self.events.append({"index": idx, "event": "fhs.binding.added", **key(b)})
+
+    def drop(self, counter, rule):
+        self.counters[counter] += 1
+        return f"{rule} ({counter})"
+
+    def rate_limited(self, t, is_nd):
+        if not self.err and not is_nd:
+            return False
+        if self.err:
+            over = self.nd.reached(t)
+        elif self.nd.reached(t):
+            self.nd, self.err = Limiter(self.cfg["errRateLimit"], t), True
+            self.counters["ndRateLimitErrEntryCnt"] += 1
+            over = True
+        else:
+            return False
+        return over
+
+    def judge(self, idx, t, frame, p, from_vm):
+        f, enforce = self.cfg["featuresEnabled"], from_vm and not self.cfg["trusted"]
+        limit = enforce and self.cfg["ndRateLimit"] and f & 0x40
+        if p["etype"] != 0x86DD:
+            return self.drop("ndRateLimitDropCnt", "ND rate limit") if limit and self.rate_limited(t, False) else None
+        why, c = walk6(frame, p["l3"])
+        if why:
+            return self.drop("headerChainDropCnt", f"header chain {why}") if enforce and f & 0x01 else None
+        ip6, icmp = c["ip6"], None
+        if not c["later"] and c["proto"] == 58:
+            icmp = ip6[c["off"]]
+            is_nd = 133 <= icmp <= 137
+            if enforce and is_nd and c["frag"] and f & 0x01:
+                return self.drop("fragmentedNdDropCnt", "fragmented ND or RA")
+            if enforce and icmp in (134, 137) and f & 0x02:
+                return self.drop("raGuardDropCnt", "RA guard: router advertisement or redirect from the VM")
+            if limit and self.rate_limited(t, is_nd):
+                return self.drop("ndRateLimitDropCnt", "ND rate limit")
+            if from_vm and icmp in (135, 136) and not c["frag"]:
+                why = self.neighbor(idx, p, c, enforce)
+                if why:
+                    return why
+        else:
+            if limit and self.rate_limited(t, False):
+                return self.drop("ndRateLimitDropCnt", "ND rate limit")
+            if not c["later"] and c["proto"] == 17:
+                why = self.udp(idx, p, c, from_vm, enforce)
+                if why:
+                    return why
+        if enforce and f & 0x20:
+            if c["src"] == "::":
+                return None if icmp in (135, 131, 143, 133) else \
+                    self.drop("sourceGuardDropCnt", "source guard: the unspecified source outside DAD, MLD, RS")
+            if not self.find(p["vlan"], p["src"], c["src"]):
+                return self.drop("sourceGuardDropCnt", "source guard: source MAC/address not bound on its VLAN")
+        return None
+
+    def neighbor(self, idx, p, c, enforce):
+        f, ip6, off = self.cfg["featuresEnabled"], c["ip6"], c["off"]
+        inspect = enforce and f & 0x40
+        rule = "ND inspection: "
+        icmp = ip6[off:]
+        if len(icmp) < 24:
+            return self.drop("ndInspectionDropCnt", rule + "short message") if inspect else None
+        typ, target = icmp[0], addr6(icmp[8:24])
+        link_opt = 1 if typ == 135 else 2
+        o = 24
+        while o < len(icmp):
+            olen = icmp[o + 1] * 8 if len(icmp) - o >= 2 else 0
+            if olen == 0 or olen > len(icmp) - o:
+                return self.drop("ndInspectionDropCnt", rule + "malformed option") if inspect else None
+            if icmp[o] == link_opt and (olen < 8 or mac(icmp[o + 2:o + 8]) != p["src"]):
+                return self.drop("ndInspectionDropCnt", rule + "link-layer address not the frame's source") \
+                    if inspect else None
+            o += olen
+        dad = typ == 135 and c["src"] == "::"
+        if dad and f & 0x10:
+            b = self.find(p["vlan"], p["src"], target)
+            if b is None:
+                self.bind(idx, p["vlan"], p["src"], target, FHS_FIRST, self.cfg["fcfsLifetime"])
+        if not inspect:
+            return None
+        if not dad and not self.find(p["vlan"], p["src"], c["src"]):
+            return self.drop("ndInspectionDropCnt", rule + "source not bound")
+        if (dad or typ == 136) and not self.find(p["vlan"], p["src"], target):
+            return self.drop("ndInspectionDropCnt", rule + "target not bound")
+        return None
+
+    def udp(self, idx, p, c, from_vm, enforce):
+        f, ip6, off = self.cfg["featuresEnabled"], c["ip6"], c["off"]
+        sp, dp, ulen = struct.unpack_from("!HHH", ip6, off)
+        if not (dp in (546, 547) or sp == 547) or off + 8 >= len(ip6):
+            return None
+        if enforce and f & 0x04 and ip6[off + 8] in (2, 7, 10, 13):
+            return self.drop("dhcpv6GuardDropCnt", "DHCPv6 guard: server message from the VM")
+        learnable = dp == 547 if from_vm else sp == 547 and dp == 546
+        if not f & 0x08 or not learnable or c["frag"] or ulen < 8 or ulen > len(ip6) - off:
+            return None
+        m = parse_dhcpv6(ip6[off + 8:off + ulen])
+        if not m or m[2] is None:
+            return None
+        typ, xid, cid, addrs = m
+        vlan = p["vlan"]
+        if from_vm:
+            if typ in (1, 3, 4, 5, 6):
+                self.pending = [r for r in self.pending if (r["vlan"], r["cid"]) != (vlan, cid)]
+                self.pending.append({"vlan": vlan, "xid": xid, "cid": cid, "mac": p["src"]})
+            elif typ in (8, 9):
+                for a, _ in addrs:
+                    b = self.find(vlan, p["src"], a)
+                    if b and b["method"] == "DHCPv6":
+                        self.remove(b, idx)
+            return None
+        if typ != 7:
+            return None
+        r = next((r for r in self.pending if (r["vlan"], r["xid"], r["cid"]) == (vlan, xid, cid)), None)
+        if not r:
+            return None
+        for a, valid in addrs:
+            b = self.find(vlan, r["mac"], a)
+            if valid == 0:
+                if b and b["method"] != "Static":
+                    self.remove(b, idx)
+            else:
+                self.bind(idx, vlan, r["mac"], a, "DHCPv6", valid)
+        self.pending.remove(r)
+        return None
+
+
 def same_client(stored, chaddr, cid):
     if len(stored["cid"]) != len(cid):
         return False
@@ -426,12 +745,13 @@ def main():
                             "counters": {k: n for k, n in port.counters.items() if n},
                             "pendingRequests": [{"vlan": r["vlan"], "xid": f"{r['xid']:#010x}", "chaddr": r["chaddr"]}
                                                 for r in port.reqs]})
+        results.append(dual_stack(records, frames, t0))
         facts = dhcp_facts(records, vm_mac)
         entry = {"file": name + ".pcap", "origin": origin, "how": how, "vmMac": vm_mac,
                  "dhcp": {**SRV, **facts} if facts["leases"] or facts["clientIds"] else None,
                  "frames": frames,
                  "expected": {"bindings": results[0]["bindings"], "notes": NOTES.get(name, ""),
-                              "configs": results}}
+                              "configs": results[:2], "dualStack": results[2]}}
         manifest.append(entry)
         md.append(markdown(entry, os.path.getsize(path)))
     with open(os.path.join(HERE, "manifest.json"), "w") as f:
@@ -440,6 +760,29 @@ def main():
     with open(os.path.join(HERE, "MANIFEST.md"), "w") as f:
         f.write(HEADER + "\n".join(md))
     print(f"make-manifest: {len(manifest)} captures")
+
+
+def dual_stack(records, frames, t0):
+    """Both agents on one port, the switch-security agent first: a frame it drops is not
+    seen by the IPv6 agent."""
+    cfg = DUAL_STACK
+    v4, v6 = Port(cfg, -0.5), Fhs(cfg["ipv6"], -0.5)
+    dropped, events = [], []
+    for (t, frame), fr in zip(records, frames):
+        p = parse(frame)
+        why = v4.judge(fr["index"], t - t0, frame, p, fr["fromVm"]) or \
+            v6.judge(fr["index"], t - t0, frame, p, fr["fromVm"])
+        events += v4.events + v6.events
+        v4.events, v6.events = [], []
+        if why:
+            dropped.append({"index": fr["index"], "rule": why})
+    counters = {k: n for k, n in {**v4.counters, **v6.counters}.items() if n}
+    return {**cfg, "dropped": dropped, "events": events,
+            "bindings": [{**key(v), "leaseSeconds": v["leaseSeconds"]} for v in v4.vmis],
+            "ipv6Bindings": [{**key(b), "lifetimeSeconds": b["leaseSeconds"]} for b in v6.bindings],
+            "counters": counters,
+            "pendingRequests": [{"vlan": r["vlan"], "xid": f"{r['xid']:#010x}", "chaddr": r["chaddr"]}
+                                for r in v4.reqs]}
 
 
 def markdown(e, size):
@@ -459,10 +802,13 @@ def markdown(e, size):
     lines.append("")
     if e["expected"]["notes"]:
         lines += [e["expected"]["notes"], ""]
-    for r in e["expected"]["configs"]:
+    for r in e["expected"]["configs"] + [e["expected"]["dualStack"]]:
+        v6 = r.get("ipv6")
         lines.append(f"**{r['name']}** (features {r['featuresEnabled']:#04x}, "
                      f"{'trusted' if r['trusted'] else 'untrusted'}"
                      + (f", arpRateLimit {r['arpRateLimit']}, errRateLimit {r['errRateLimit']}" if r["arpRateLimit"] else "")
+                     + (f"; IPv6 features {v6['featuresEnabled']:#04x}, ndRateLimit {v6['ndRateLimit']}, "
+                        f"bindingLimit {v6['bindingLimit']}" if v6 else "")
                      + "):")
         lines.append("")
         drops = r["dropped"]
@@ -482,6 +828,10 @@ def markdown(e, size):
         b = ", ".join(f"VLAN {x['vlan']} {x['mac']} {x['ip']} {x['method']} {x['leaseSeconds']} s"
                       for x in r["bindings"]) or "none"
         lines.append(f"- port database at the end: {b}")
+        if "ipv6Bindings" in r:
+            b = ", ".join(f"VLAN {x['vlan']} {x['mac']} {x['ip']} {x['method']} {x['lifetimeSeconds']} s"
+                          for x in r["ipv6Bindings"]) or "none"
+            lines.append(f"- IPv6 bindings at the end: {b}")
         if r["pendingRequests"]:
             lines.append("- pending requests at the end: " + ", ".join(
                 f"VLAN {x['vlan']} xid {x['xid']} chaddr {x['chaddr']}" for x in r["pendingRequests"]))
@@ -584,7 +934,9 @@ Regenerate (as root, about a minute):
 
     bash scripts/setup.sh --capture-tools
     bash tests/data/make-captures.sh          # real clients and server in network namespaces
+    bash tests/data/make-captures6.sh         # the same for IPv6 (about 80 s: a DHCPv6 renewal)
     /usr/bin/python3 tests/data/make-attacks.py  # crafted attacks and the combined example
+    /usr/bin/python3 tests/data/make-attacks6.py # crafted IPv6 attacks
     /usr/bin/python3 tests/data/make-manifest.py # this file and manifest.json
 
 Directions: every capture is taken on (or stands for) the VM's port; "from VM"
@@ -610,6 +962,20 @@ first frame). No capture lasts long enough for ageing (pending requests 60 s,
 leases 120 s, ARP entries 180 s) or for the error-rate-limit state to end.
 DHCP bindings are keyed by VLAN, chaddr and client identifier (option 61) when
 present, which is how a renewal, release or NAK finds the client's entry.
+
+A third setting, **dual-stack** (manifest.json: `expected.dualStack`), puts the
+IPv6 first-hop security agent on the port beside the enforcing switch-security
+agent, which judges each frame first (a frame it drops is not seen by the
+second): IPv6 features 0x7f (header chain 0x01, RA guard 0x02, DHCPv6 guard
+0x04, DHCPv6 snooping 0x08, first come first served 0x10, source guard 0x20,
+ND inspection 0x40), untrusted, bindingLimit 64, ndRateLimit 10, errRateLimit
+5, errRateLimitPeriod 10, first-come-first-served lifetime 600 s. Its model
+judges in the order header chain, RA guard, DHCPv6 guard, ND rate limit, ND
+inspection with duplicate-address-detection claims, DHCPv6 snooping, source
+guard. IPv6 bindings are keyed by VLAN, MAC and address; a DHCPv6 Reply binds
+when it matches a pending client message by VLAN, transaction ID and client
+DUID. No IPv6 capture lasts long enough for a binding or a pending message
+to age out.
 
 """
 

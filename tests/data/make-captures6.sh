@@ -1,0 +1,213 @@
+#!/usr/bin/env bash
+# Regenerates the IPv6 captures in this folder with real software.
+#
+# Run as root (network namespaces). Needs: iproute2, dnsmasq, isc-dhcp-client,
+# iputils-ping, tcpdump, tshark  (bash scripts/setup.sh --capture-tools).
+#
+#   bash tests/data/make-captures6.sh [OUTDIR [SCENARIO...]]   (default: this folder, every scenario)
+#
+# SCENARIO: dhclient6 slaac
+#
+# Network, made fresh for every run and removed on exit:
+#
+#   ns SRV: srv0 2001:db8:1::1/64, dnsmasq (router advertisements, DHCPv6)
+#      |  veth
+#   ns SW:  bridge br0 = sw-srv + sw-vm    <- tcpdump -i sw-vm (the VM's port)
+#      |  veth
+#   ns VM:  vm0 (MAC set per scenario), dhclient -6 / the kernel's SLAAC
+#
+# Addresses are from 2001:db8::/32 (documentation range) and exist only in
+# these namespaces. The switch namespace has IPv6 off, so the bridge itself
+# sends nothing. Each capture keeps only ICMPv6 and DHCPv6 frames.
+set -euo pipefail
+
+[ "$(id -u)" -eq 0 ] || { echo "make-captures6: run as root" >&2; exit 1; }
+for tool in ip dnsmasq dhclient ping tcpdump tshark; do
+  command -v "$tool" >/dev/null || { echo "make-captures6: missing $tool (bash scripts/setup.sh --capture-tools)" >&2; exit 1; }
+done
+
+here=$(cd "$(dirname "$0")" && pwd)
+out=$(mkdir -p "${1:-$here}" && cd "${1:-$here}" && pwd)
+tag="sw6cap$$"
+NS_SW="$tag-sw" NS_SRV="$tag-srv" NS_VM="$tag-vm"
+work=$(mktemp -d "/tmp/$tag.XXXXXX")
+pids=()
+started=$(date +%s)
+
+SRV_MAC=02:00:5e:c0:00:fe
+SRV_IP=2001:db8:1::1
+LEASE=2m        # dnsmasq's shortest lease: T1 (renewal) at 60 s
+
+log() { printf 'make-captures6: %s\n' "$*" >&2; }
+
+cleanup() {
+  local rc=$?
+  set +e
+  for pid in "${pids[@]}"; do kill "$pid" 2>/dev/null; done
+  for pid in "${pids[@]}"; do wait "$pid" 2>/dev/null; done
+  for ns in "$NS_VM" "$NS_SRV" "$NS_SW"; do
+    ip netns pids "$ns" 2>/dev/null | xargs -r kill 2>/dev/null
+    ip netns del "$ns" 2>/dev/null
+  done
+  rm -rf "$work"
+  [ $rc -eq 0 ] || log "failed (exit $rc); namespaces and processes removed"
+  exit $rc
+}
+trap cleanup EXIT
+trap 'exit 130' INT TERM
+
+# wait_for SECONDS COMMAND...: polls COMMAND every 0.2 s until it succeeds.
+wait_for() {
+  local limit=$(( $1 * 5 )); shift
+  for ((i = 0; i < limit; i++)); do "$@" && return 0; sleep 0.2; done
+  log "timed out waiting for: $*"; return 1
+}
+
+in_vm() { ip netns exec "$NS_VM" "$@"; }
+
+# An address of vm0 whose duplicate-address detection is over ($1: ip -6 addr filter words).
+vm_addr() { in_vm ip -6 -o addr show dev vm0 "$@" | grep -v tentative | awk '{print $4}' | cut -d/ -f1 | head -n1; }
+has_vm_addr() { [ -n "$(vm_addr "$@")" ]; }
+
+# ---------------------------------------------------------------- network ---
+make_network() {
+  for ns in "$NS_SW" "$NS_SRV" "$NS_VM"; do
+    ip netns add "$ns"
+    ip -n "$ns" link set lo up
+  done
+  ip netns exec "$NS_SW" sysctl -qw net.ipv6.conf.all.disable_ipv6=1 net.ipv6.conf.default.disable_ipv6=1
+  ip -n "$NS_SW" link add br0 type bridge stp_state 0 forward_delay 0 mcast_snooping 0
+  ip -n "$NS_SW" link add sw-srv type veth peer name srv0 netns "$NS_SRV"
+  ip -n "$NS_SW" link add sw-vm type veth peer name vm0 netns "$NS_VM"
+  ip -n "$NS_SW" link set sw-srv master br0
+  ip -n "$NS_SW" link set sw-vm master br0
+  for l in br0 sw-srv sw-vm; do ip -n "$NS_SW" link set "$l" up; done
+  # The server's link is up before any capture: its own DAD and reports are not in them.
+  ip netns exec "$NS_SRV" sysctl -qw net.ipv6.conf.all.forwarding=1 net.ipv6.conf.default.accept_dad=0 \
+    net.ipv6.conf.all.accept_dad=0
+  ip -n "$NS_SRV" link set srv0 address $SRV_MAC
+  ip -n "$NS_SRV" addr add "$SRV_IP/64" dev srv0 nodad
+  ip -n "$NS_SRV" link set srv0 up
+  wait_for 5 sh -c "ip -n $NS_SRV -6 -o addr show dev srv0 scope link | grep -qv tentative"
+}
+
+# ---------------------------------------------------------------- dnsmasq ---
+dnsmasq_pid=""
+start_dnsmasq() {  # dnsmasq options of the scenario
+  ip netns exec "$NS_SRV" dnsmasq --keep-in-foreground --conf-file=/dev/null \
+    --user=root --group=root --port=0 --interface=srv0 --bind-interfaces \
+    --enable-ra --ra-param=srv0,30,600 --dhcp-authoritative --log-dhcp \
+    --dhcp-leasefile="$work/dnsmasq.leases" --pid-file="$work/dnsmasq.pid" \
+    --log-facility="$work/dnsmasq.log" "$@" &
+  dnsmasq_pid=$!; pids+=("$dnsmasq_pid")
+  wait_for 5 grep -qs "router advertisement on" "$work/dnsmasq.log"
+}
+stop_dnsmasq() {
+  kill "$dnsmasq_pid"; wait "$dnsmasq_pid" 2>/dev/null || true
+  : > "$work/dnsmasq.log"; rm -f "$work/dnsmasq.leases"
+}
+
+# ---------------------------------------------------------------- capture ---
+cap_pid=""
+start_capture() {  # NAME
+  cap_name=$1
+  ip netns exec "$NS_SW" tcpdump -i sw-vm -s 0 -U --immediate-mode -Z root \
+    -w "$work/$1.raw.pcap" ip6 \
+    2>"$work/$1.tcpdump.log" &
+  cap_pid=$!; pids+=("$cap_pid")
+  wait_for 5 grep -qs "listening on" "$work/$1.tcpdump.log"
+}
+stop_capture() {
+  sleep 0.5
+  kill -INT "$cap_pid"; wait "$cap_pid" 2>/dev/null || true
+  # tcpdump's filter cannot see ICMPv6 behind extension headers (MLD's
+  # hop-by-hop): tshark keeps every ICMPv6 and DHCPv6 frame.
+  tshark -r "$work/$cap_name.raw.pcap" -Y 'icmpv6 or dhcpv6' -w "$out/$cap_name.pcap" -F pcap 2>/dev/null
+  log "$cap_name: $(tshark -r "$out/$cap_name.pcap" 2>/dev/null | wc -l) frames"
+}
+
+# The VM's link comes up inside the capture, so its own duplicate-address
+# detection of every address is in it.
+vm_up() {  # MAC SYSCTL...
+  local mac=$1; shift
+  in_vm ip link set vm0 down
+  in_vm ip link set vm0 address "$mac"
+  in_vm sysctl -qw net.ipv6.conf.vm0.accept_dad=1 net.ipv6.conf.vm0.dad_transmits=1 \
+    net.ipv6.conf.vm0.addr_gen_mode=0 "$@"
+  in_vm ip link set vm0 up
+  wait_for 10 has_vm_addr scope link
+}
+
+# Minimal dhclient hook script: configure the address, log the event (the
+# distribution's script would also rewrite /etc/resolv.conf of the machine).
+cat > "$work/dhclient6.script" <<SCRIPT
+#!/bin/sh
+echo "\$reason \${new_ip6_address:-}" >> "$work/events"
+case "\$reason" in
+  BOUND6|RENEW6|REBIND6|REBOOT6)
+    ip -6 addr replace "\$new_ip6_address/128" dev "\$interface" valid_lft "\${new_max_life:-forever}" \
+      preferred_lft "\${new_preferred_life:-forever}" ;;
+  EXPIRE6|RELEASE6|STOP6)
+    [ -z "\${old_ip6_address:-}" ] || ip -6 addr del "\$old_ip6_address/128" dev "\$interface" ;;
+esac
+exit 0
+SCRIPT
+chmod +x "$work/dhclient6.script"
+
+events_count() { grep -c "^$1" "$work/events" 2>/dev/null || true; }
+has_events() { [ "$(events_count "$1")" -ge "$2" ]; }
+
+# ------------------------------------------------------------- scenarios ---
+# dhclient -6 (DUID-LL) against dnsmasq's stateful DHCPv6 with router
+# advertisements (managed flag, on-link prefix without autonomous flag, so
+# no SLAAC): Solicit..Reply, the leased address' DAD, a ping to the server,
+# the renewal at T1 (60 s), then `dhclient -6 -r` (Release, Reply).
+scenario_dhclient6() {
+  local name=dhclient6-lease-renew-release mac=02:00:5e:c0:00:31
+  : > "$work/events"
+  start_dnsmasq --dhcp-range=2001:db8:1::100,2001:db8:1::1ff,64,$LEASE
+  start_capture $name
+  vm_up $mac net.ipv6.conf.vm0.use_tempaddr=0 net.ipv6.conf.vm0.autoconf=1
+  ip netns exec "$NS_VM" dhclient -6 -d -v -D LL -cf /dev/null -sf "$work/dhclient6.script" \
+      -lf "$work/dhclient6.leases" -pf "$work/dhclient6.pid" vm0 2>"$work/$name.client.log" &
+  local cpid=$!; pids+=("$cpid")
+  wait_for 20 has_events BOUND6 1
+  local leased; leased=$(awk '/^BOUND6/ {print $2; exit}' "$work/events")
+  wait_for 5 has_vm_addr to "$leased/128"
+  in_vm ping -c 1 -W 1 -I "$leased" $SRV_IP >/dev/null
+  wait_for 90 has_events RENEW6 1
+  ip netns exec "$NS_VM" dhclient -6 -r -v -D LL -cf /dev/null -sf "$work/dhclient6.script" \
+      -lf "$work/dhclient6.leases" -pf "$work/dhclient6.pid" vm0 2>>"$work/$name.client.log"
+  wait "$cpid" 2>/dev/null || true
+  stop_capture; stop_dnsmasq
+  in_vm ip link set vm0 down
+}
+
+# The kernel's own SLAAC with privacy addresses (use_tempaddr 2): dnsmasq
+# advertises 2001:db8:1::/64 for autoconfiguration only (ra-only); the VM
+# detects duplicates of its link-local, stable (EUI-64) and temporary
+# addresses, pings the server from the temporary one (preferred) and the
+# stable one.
+scenario_slaac() {
+  local name=slaac-privacy-dad mac=02:00:5e:c0:00:32
+  start_dnsmasq --dhcp-range=2001:db8:1::,ra-only,64,$LEASE
+  start_capture $name
+  vm_up $mac net.ipv6.conf.vm0.use_tempaddr=2 net.ipv6.conf.vm0.autoconf=1 net.ipv6.conf.vm0.accept_ra=1
+  wait_for 20 has_vm_addr scope global temporary
+  wait_for 10 has_vm_addr scope global mngtmpaddr
+  in_vm ping -c 1 -W 1 -I "$(vm_addr scope global temporary)" $SRV_IP >/dev/null
+  in_vm ping -c 1 -W 1 -I "$(vm_addr scope global mngtmpaddr)" $SRV_IP >/dev/null
+  stop_capture; stop_dnsmasq
+  in_vm ip link set vm0 down
+}
+
+make_network
+scenarios=("${@:2}")
+[ ${#scenarios[@]} -ne 0 ] || scenarios=(dhclient6 slaac)
+for scenario in "${scenarios[@]}"; do
+  case $scenario in
+    dhclient6|slaac) "scenario_$scenario" ;;
+    *) log "unknown scenario $scenario"; exit 2 ;;
+  esac
+done
+log "done in $(( $(date +%s) - started )) s; captures in $out"

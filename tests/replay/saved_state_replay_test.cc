@@ -6,6 +6,8 @@
 
 #include "live/inline.h"
 #include "replay/engine.h"
+#include "session/atomic_file.h"
+#include "session/error.h"
 #include "session/saved_state_format.h"
 #include "session/state_file.h"
 
@@ -272,6 +274,27 @@ TEST_F(StateTool, time_since_the_save_is_taken_from_each_lifetime_and_what_ran_o
    const ToolRun shown = runTool({"state", "show", "--json", saved});
    EXPECT_EQ(json::parse(shown.out)["savedAt"], 1'700'000'000.0) << shown.err;
    EXPECT_EQ(runTool({"replay", "--vm-mac", kVm, "--restore-state", saved, example()}).status, 0);
+}
+
+// The one writer of state files and capture outputs: a link at the target is
+// replaced, not written through; a write given up or failed leaves nothing.
+TEST(AtomicFile, a_link_is_replaced_and_a_write_given_up_leaves_nothing)
+{
+   TempDir dir;
+   const auto target = dir.path() / "vm1.state";
+   writeFile(dir.path() / "elsewhere", "kept");
+   std::filesystem::create_symlink("elsewhere", target);
+   const std::vector<uint8_t> blob{1, 2, 3};
+   session::writeStateFile(target, blob, 0600);
+   EXPECT_EQ(session::readStateFile(target), blob);   // refuses a link
+   EXPECT_EQ(session::readStateFile(dir.path() / "elsewhere").size(), 4u);
+   {
+      session::AtomicFile abandoned(target, 0600);
+      abandoned.write(std::vector<uint8_t>{9});
+   }
+   EXPECT_THROW(session::writeStateFile(dir.path() / "none" / "x.state", blob), session::InputError);
+   EXPECT_EQ(dir.files(), (std::vector<std::string>{"elsewhere", "vm1.state"}));
+   EXPECT_EQ(session::readStateFile(target), blob);
 }
 
 }  // namespace

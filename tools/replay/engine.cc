@@ -545,11 +545,7 @@ void Run::execute()
       dropped_->commit();
    }
    if (!options_.saveStatePath.empty()) {
-      try {
-         session::writeStateFile(options_.saveStatePath, savedState_);
-      } catch (const session::StateFileError &e) {
-         throw session::InputError(e.what());
-      }
+      session::writeStateFile(options_.saveStatePath, savedState_);
    }
 }
 

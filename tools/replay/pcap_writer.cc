@@ -6,59 +6,42 @@
 
 #include <pcap/pcap.h>
 
-#include <sys/stat.h>
 #include <unistd.h>
 
 #include <cerrno>
 #include <cstdio>
-#include <cstdlib>
 #include <cstring>
-#include <vector>
 
 namespace swsec::replay {
 
-namespace {
-
-std::string systemError()
+PcapWriter::PcapWriter(const OutputTarget &target) : file_(target.path, target.mode, target.named)
 {
-   return std::strerror(errno);
-}
-
-}  // namespace
-
-PcapWriter::PcapWriter(const OutputTarget &target) : named_(target.named), path_(target.path)
-{
-   const std::string &path = named_;
-   std::vector<char> name(path_.begin(), path_.end());
-   static constexpr char kSuffix[] = ".partial-XXXXXX";
-   name.insert(name.end(), kSuffix, kSuffix + sizeof kSuffix);
-   const int fd = mkstemp(name.data());
-   if (fd < 0) {
-      throw session::InputError(path + ": cannot write: " + systemError());
-   }
-   tempPath_ = name.data();
-   FILE *file = ::fchmod(fd, target.mode) == 0 ? fdopen(fd, "wb") : nullptr;
-   if (file == nullptr) {
-      const std::string error = systemError();
-      ::close(fd);
-      std::remove(tempPath_.c_str());
-      throw session::InputError(path + ": cannot write: " + error);
+   // libpcap closes the stream it writes to; the writer keeps its own descriptor
+   // to sync and rename by.
+   const int fd = ::dup(file_.fd());
+   FILE *stream = fd >= 0 ? fdopen(fd, "wb") : nullptr;
+   if (stream == nullptr) {
+      const std::string error = std::strerror(errno);
+      if (fd >= 0) {
+         ::close(fd);
+      }
+      throw session::InputError(target.named + ": cannot write: " + error);
    }
    dead_ = pcap_open_dead_with_tstamp_precision(DLT_EN10MB, 262144, PCAP_TSTAMP_PRECISION_MICRO);
-   dumper_ = dead_ != nullptr ? pcap_dump_fopen(dead_, file) : nullptr;
+   dumper_ = dead_ != nullptr ? pcap_dump_fopen(dead_, stream) : nullptr;
    if (dumper_ == nullptr) {
-      std::fclose(file);
-      discard();
-      throw session::InputError(path + ": cannot start a pcap file");
+      std::fclose(stream);
+      closeDumper();
+      throw session::InputError(target.named + ": cannot start a pcap file");
    }
 }
 
 PcapWriter::~PcapWriter()
 {
-   discard();
+   closeDumper();
 }
 
-void PcapWriter::discard()
+void PcapWriter::closeDumper()
 {
    if (dumper_ != nullptr) {
       pcap_dump_close(dumper_);
@@ -68,12 +51,7 @@ void PcapWriter::discard()
       pcap_close(dead_);
       dead_ = nullptr;
    }
-   if (!tempPath_.empty()) {
-      std::remove(tempPath_.c_str());
-      tempPath_.clear();
-   }
 }
-
 void PcapWriter::write(int64_t timeNs, std::span<const uint8_t> bytes)
 {
    pcap_pkthdr header{};
@@ -88,22 +66,14 @@ void PcapWriter::write(int64_t timeNs, std::span<const uint8_t> bytes)
 
 void PcapWriter::commit()
 {
-   FILE *file = pcap_dump_file(dumper_);
-   const bool failed = pcap_dump_flush(dumper_) != 0 || std::ferror(file) != 0;
-   pcap_dump_close(dumper_);   // closes the file
-   dumper_ = nullptr;
+   FILE *stream = pcap_dump_file(dumper_);
+   const bool failed = pcap_dump_flush(dumper_) != 0 || std::ferror(stream) != 0;
+   const std::string error = std::strerror(errno);
+   closeDumper();
    if (failed) {
-      const std::string error = systemError();
-      discard();
-      throw session::InputError(named_ + ": write failed: " + error);
+      throw session::InputError(file_.named() + ": write failed: " + error);
    }
-   if (std::rename(tempPath_.c_str(), path_.c_str()) != 0) {
-      const std::string error = systemError();
-      discard();
-      throw session::InputError(named_ + ": cannot write: " + error);
-   }
-   tempPath_.clear();
-   discard();
+   file_.commit();
 }
 
 }  // namespace swsec::replay

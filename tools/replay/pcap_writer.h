@@ -1,9 +1,9 @@
-// A pcap file written whole or not at all: frames go to a temporary file in
-// the target's directory, renamed over the target by commit(); a writer
-// destroyed without commit removes its temporary file.
+// A pcap file written whole or not at all (session::AtomicFile) to the file
+// the target resolved to.
 #pragma once
 
 #include "replay/output_path.h"
+#include "session/atomic_file.h"
 
 #include <cstdint>
 #include <span>
@@ -28,11 +28,9 @@ public:
    void commit();
 
 private:
-   void discard();
+   void closeDumper();
 
-   std::string named_;
-   std::string path_;
-   std::string tempPath_;
+   session::AtomicFile file_;
    pcap *dead_ = nullptr;
    pcap_dumper *dumper_ = nullptr;
 };

@@ -1,13 +1,14 @@
 // Reading and writing saved-state files.
 #include "session/state_file.h"
 
+#include "session/atomic_file.h"
+
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
-#include <cstdio>
 #include <cstring>
 
 namespace swsec::session {
@@ -21,35 +22,10 @@ std::string systemError()
    return std::strerror(errno);
 }
 
-// Closes a descriptor and, unless released, removes the temporary file.
-class TempFile {
-public:
-   TempFile(int fd, std::string path) : fd_(fd), path_(std::move(path)) {}
-   ~TempFile()
-   {
-      if (fd_ >= 0) {
-         ::close(fd_);
-      }
-      if (!path_.empty()) {
-         ::unlink(path_.c_str());
-      }
-   }
-   TempFile(const TempFile &) = delete;
-   TempFile &operator=(const TempFile &) = delete;
-
-   int fd() const { return fd_; }
-   const std::string &path() const { return path_; }
-   int close()
-   {
-      const int result = ::close(fd_);
-      fd_ = -1;
-      return result;
-   }
-   void release() { path_.clear(); }
-
-private:
-   int fd_;
-   std::string path_;
+// Closes a descriptor on every way out.
+struct FdCloser {
+   int fd;
+   ~FdCloser() { ::close(fd); }
 };
 
 }  // namespace
@@ -65,7 +41,7 @@ std::vector<uint8_t> readStateFile(const std::string &path)
    if (fd < 0) {
       throw StateFileError(path + ": cannot read: " + systemError());
    }
-   TempFile file(fd, "");
+   const FdCloser closer{fd};
    struct stat info {};
    if (::fstat(fd, &info) != 0) {
       throw StateFileError(path + ": cannot read: " + systemError());
@@ -145,39 +121,9 @@ StoredState readStoredState(const std::string &path)
 
 void writeStateFile(const std::string &path, std::span<const uint8_t> bytes, mode_t mode)
 {
-   std::vector<char> name(path.begin(), path.end());
-   static constexpr char kSuffix[] = ".partial-XXXXXX";
-   name.insert(name.end(), kSuffix, kSuffix + sizeof kSuffix);
-   const int fd = mkstemp(name.data());
-   if (fd < 0) {
-      throw StateFileError(path + ": cannot write: " + systemError());
-   }
-   TempFile file(fd, name.data());
-   // mkstemp makes the file owner-only; a state file gets what the caller
-   // asks for and the umask allows.
-   const mode_t mask = ::umask(0);
-   ::umask(mask);
-   if (::fchmod(fd, mode & ~mask) != 0) {
-      throw StateFileError(path + ": cannot write: " + systemError());
-   }
-   size_t done = 0;
-   while (done < bytes.size()) {
-      const ssize_t wrote = ::write(fd, bytes.data() + done, bytes.size() - done);
-      if (wrote < 0 && errno == EINTR) {
-         continue;
-      }
-      if (wrote < 0) {
-         throw StateFileError(path + ": write failed: " + systemError());
-      }
-      done += static_cast<size_t>(wrote);
-   }
-   if (::fsync(fd) != 0 || file.close() != 0) {
-      throw StateFileError(path + ": write failed: " + systemError());
-   }
-   if (std::rename(file.path().c_str(), path.c_str()) != 0) {
-      throw StateFileError(path + ": cannot write: " + systemError());
-   }
-   file.release();
+   AtomicFile file(path, mode & ~currentUmask());
+   file.write(bytes);
+   file.commit();
 }
 
 }  // namespace swsec::session

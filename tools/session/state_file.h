@@ -59,8 +59,8 @@ StoredState unwrapState(std::vector<uint8_t> bytes, const std::string &path);
 // readStateFile, then unwrapState; an empty blob is refused.
 StoredState readStoredState(const std::string &path);
 
-// Writes `bytes` to a temporary file beside `path` (with `mode` less the
-// umask), syncs it and renames it over `path`; on any failure no file is left.
+// Writes `bytes` whole or not at all (AtomicFile: a symbolic link at `path`
+// is replaced, not followed), with `mode` less the umask; throws InputError.
 void writeStateFile(const std::string &path, std::span<const uint8_t> bytes, mode_t mode = 0666);
 
 }  // namespace swsec::session

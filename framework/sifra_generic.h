@@ -50,7 +50,14 @@ extern const orr_PlexClientPortOps sifraGenericCreateAgentOps;
 orr_Status SifraGenericInit(const char *name, const char *clientPortName);
 
 /*
- * Releases every agent (oldest first), then the lock domain, timer queue,
+ * Releases every agent (oldest first), and with each the filters and slow
+ * paths the host still holds of it. The module calls it before it takes
+ * down what the filters use; SifraGenericCleanup calls it again.
+ */
+void SifraGenericCleanupAgents(void);
+
+/*
+ * Releases every agent (SifraGenericCleanupAgents), then the lock domain, timer queue,
  * log, heap, module registration and client-port registration, each only
  * if it exists. Safe after a partial start-up; a second call releases
  * nothing. Returns the status of the client-port withdrawal.

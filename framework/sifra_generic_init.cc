@@ -194,7 +194,7 @@ out_release_framework:
    return status;
 }
 
-orr_Status SifraGenericCleanup(void)
+void SifraGenericCleanupAgents(void)
 {
    /*
     * The loader runs the teardown alone; the registry lock still covers the
@@ -208,6 +208,11 @@ orr_Status SifraGenericCleanup(void)
       SifraGenericCleanupFastPathAgent(SifraGenericAgentFromLinks(links));
    }
    orr_MutexUnlock(&sifraGenericAgentRegistryLock);
+}
+
+orr_Status SifraGenericCleanup(void)
+{
+   SifraGenericCleanupAgents();
 
    if (sifraGenericLockDomain != ORR_INVALID_LOCK_DOMAIN) {
       orr_LockDomainDestroy(sifraGenericLockDomain);

@@ -44,6 +44,12 @@ out_cleanup_framework:
 
 ORR_MODULE_EXPORT orr_Status cleanup_module(void)
 {
+   /*
+    * Filters the hypervisor has not destroyed yet go first, with their
+    * agents: their teardown uses the port filter map and posts to the test
+    * hooks' listener.
+    */
+   SifraGenericCleanupAgents();
    (void)SwSecTestsCleanup();
    SwSecCleanupPortFilterMap();
    return SifraGenericCleanup();

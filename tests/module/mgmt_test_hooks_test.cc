@@ -3,13 +3,13 @@
 // through the exported queries once per selector.
 #include "port_fixture.h"
 
+#include "contract/notification.h"
+
 #include <chrono>
 #include <cstdint>
 
 namespace swsec::testing {
 namespace {
-
-constexpr uint64_t kPortDbClass = 0x0008000000000000ull;
 
 class TestHooksTest : public PortTest {
 protected:
@@ -23,7 +23,7 @@ protected:
    {
       size_t count = 0;
       for (const auto &listener : host().portsets().listeners()) {
-         count += listener.msgClass == kPortDbClass && listener.portset == nullptr && listener.portID == 0 ? 1 : 0;
+         count += listener.msgClass == SWSEC_PORTSET_MSG_PORTDB && listener.portset == nullptr && listener.portID == 0 ? 1 : 0;
       }
       return count;
    }
@@ -106,28 +106,30 @@ TEST_F(TestHooksTest, messages_of_another_class_or_without_a_message_are_ignored
    ASSERT_EQ(host().nexo().set("/startTest", {}), ORR_OK);
    orr_PortsetMessageCB callback = nullptr;
    for (const auto &listener : host().portsets().listeners()) {
-      if (listener.msgClass == kPortDbClass) {
+      if (listener.msgClass == SWSEC_PORTSET_MSG_PORTDB) {
          callback = listener.callback;
       }
    }
    ASSERT_NE(callback, nullptr);
    const uint64_t before = host().faults().calls("orr_PortsetAcquireByPortID");
    orr_PortsetMessageHeader message{};
-   callback(kPort, kPortDbClass << 1, &message);
-   callback(kPort, kPortDbClass, nullptr);
+   callback(kPort, SWSEC_PORTSET_MSG_PORTDB << 1, &message);
+   callback(kPort, SWSEC_PORTSET_MSG_PORTDB, nullptr);
    EXPECT_EQ(host().faults().calls("orr_PortsetAcquireByPortID"), before);
 
    // A port the host does not know: the hold is refused and nothing is read.
    const uint64_t increments = host().faults().calls("orr_ModuleIncUseCount");
-   callback(4242, kPortDbClass, &message);
+   callback(4242, SWSEC_PORTSET_MSG_PORTDB, &message);
    EXPECT_EQ(host().faults().calls("orr_ModuleIncUseCount"), increments);
 }
 
-TEST_F(TestHooksTest, unloading_with_the_hooks_on_withdraws_the_listener)
+// The port's filter is still there: it goes before the map and the hooks it uses.
+TEST_F(TestHooksTest, unloading_with_the_hooks_on_and_a_live_port_withdraws_both)
 {
    ASSERT_EQ(host().nexo().set("/startTest", {}), ORR_OK);
-   EXPECT_EQ(host().sifra().destroyFilterAsHypervisor(filter_).status, ORR_OK);
+   (void)learnOneVmi("02:00:00:00:00:01", "10.0.0.1");
    ASSERT_EQ(host().unload(), ORR_OK);
+   EXPECT_TRUE(host().sifra().filters().empty());
    EXPECT_EQ(portDbListeners(), 0u);
    EXPECT_TRUE(host().violations().empty());
 }

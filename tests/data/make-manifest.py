@@ -561,23 +561,21 @@ class Fhs:
         return f"{rule} ({counter})"
 
     def rate_limited(self, t, is_nd):
-        if not self.err and not is_nd:
-            return False
+        """None, or the rule of a frame over the ND limit (counted)."""
         if self.err:
-            over = self.nd.reached(t)
-        elif self.nd.reached(t):
+            if self.nd.reached(t):
+                return self.drop("ndRateLimitDropCnt", "ND error-rate-limit state")
+        elif is_nd and self.nd.reached(t):
             self.nd, self.err = Limiter(self.cfg["errRateLimit"], t), True
             self.counters["ndRateLimitErrEntryCnt"] += 1
-            over = True
-        else:
-            return False
-        return over
+            return self.drop("ndRateLimitDropCnt", "ND rate limit exceeded, port enters the error-rate-limit state")
+        return None
 
     def judge(self, idx, t, frame, p, from_vm):
         f, enforce = self.cfg["featuresEnabled"], from_vm and not self.cfg["trusted"]
         limit = enforce and self.cfg["ndRateLimit"] and f & 0x40
         if p["etype"] != 0x86DD:
-            return self.drop("ndRateLimitDropCnt", "ND rate limit") if limit and self.rate_limited(t, False) else None
+            return self.rate_limited(t, False) if limit else None
         why, c = walk6(frame, p["l3"])
         if why:
             return self.drop("headerChainDropCnt", f"header chain {why}") if enforce and f & 0x01 else None
@@ -589,15 +587,17 @@ class Fhs:
                 return self.drop("fragmentedNdDropCnt", "fragmented ND or RA")
             if enforce and icmp in (134, 137) and f & 0x02:
                 return self.drop("raGuardDropCnt", "RA guard: router advertisement or redirect from the VM")
-            if limit and self.rate_limited(t, is_nd):
-                return self.drop("ndRateLimitDropCnt", "ND rate limit")
+            why = self.rate_limited(t, is_nd) if limit else None
+            if why:
+                return why
             if from_vm and icmp in (135, 136) and not c["frag"]:
                 why = self.neighbor(idx, p, c, enforce)
                 if why:
                     return why
         else:
-            if limit and self.rate_limited(t, False):
-                return self.drop("ndRateLimitDropCnt", "ND rate limit")
+            why = self.rate_limited(t, False) if limit else None
+            if why:
+                return why
             if not c["later"] and c["proto"] == 17:
                 why = self.udp(idx, p, c, from_vm, enforce)
                 if why:
@@ -842,6 +842,49 @@ def markdown(e, size):
 
 
 NOTES = {
+    "dhclient6-lease-renew-release":
+        "Learning and enforcing judge only DHCPv6 server messages from the VM: every frame passes. "
+        "Dual-stack: the link-local DAD binds fe80::5eff:fec0:31 first come first served; MLD reports "
+        "from the unspecified address pass source guard; the Solicit and then the Request are pending "
+        "(one slot per client DUID), the Reply matching the Request's transaction binds 2001:db8:1::1c6 "
+        "for its valid lifetime (120 s); the Advertise binds nothing. The DAD of the leased address "
+        "finds its own binding; the Renew's Reply only extends it; the Release removes it.",
+    "slaac-privacy-dad":
+        "Dual-stack: each DAD solicitation from the unspecified address binds its target first come "
+        "first served (link-local, stable and temporary address); every later frame of the VM is from "
+        "one of them, so nothing is dropped. The VM's solicitation for the router (target not its own) "
+        "is not a claim and passes ND inspection on its bound source.",
+    "attack6-ra-guard":
+        "Dual-stack: advertisements and the redirect from the VM are dropped by RA guard also behind "
+        "hop-by-hop and destination-options headers; the first fragment whose chain runs into the next "
+        "fragment is dropped by the header chain check, the fragment after it carries no header to "
+        "judge and passes source guard; the atomic fragment holding a whole RA is dropped as "
+        "fragmented ND. The VM's router solicitation and the router's advertisement to it pass.",
+    "attack6-dhcpv6-server":
+        "Enforcing and dual-stack: the IPv4 agent's DHCP server block drops UDP from port 547 right "
+        "behind the IPv6 header (frames 5-8, including the Relay-Reply to port 547), so the IPv6 agent "
+        "never sees them; the Reply behind a destination-options header escapes it and is dropped by "
+        "the DHCPv6 guard. The VM's Solicit passes.",
+    "attack6-nd-spoof":
+        "Dual-stack: an advertisement passes only for a target bound to the VM (the router's "
+        "addresses and the other host's are not); a link-layer address option must be the frame's "
+        "source MAC; a solicitation's source must be bound. The VM's solicitation for the router and "
+        "its advertisement of its own address pass; the router's answer to the VM passes.",
+    "attack6-ip-spoof":
+        "Dual-stack: source guard keys on VLAN, MAC and address: an address the VM does not hold, its "
+        "own address with another MAC or on VLAN 100 are dropped; UDP from the unspecified address is "
+        "dropped (only DAD, MLD reports and router solicitations may use it); the MLDv2 report passes. "
+        "Frames to the VM are not judged.",
+    "attack6-address-flood":
+        "Dual-stack: every DAD claim binds (4 a second stays under the ND limit); from the 63rd claim on "
+        "the port is at its 64 bindings and each new one evicts the oldest dynamic binding: the "
+        "link-local, the DHCPv6 address, then the first two claims (bindingsEvictedCnt 4). UDP from "
+        "those is then dropped by source guard; UDP from the third and the last claim passes.",
+    "attack6-nd-flood":
+        "Dual-stack: as for ARP, ND frames over 10 a second put the port in the error state (frame 15, "
+        "the 11th in its second) and the limiter restarts with errRateLimit 5: frames 16-20 pass, 21-29 "
+        "are dropped; in the next second 5 of the 8 UDP frames pass (every frame of the VM counts in "
+        "the error state).",
     "dhclient-lease-renew-release":
         "dhclient sends no client identifier, so the binding is keyed by chaddr. The renewal is a unicast "
         "REQUEST with ciaddr set and the same xid as the first exchange: it becomes a pending request and "

@@ -121,6 +121,20 @@ TEST_F(SlowPathTest, a_registration_while_the_callback_has_its_locks_released_ma
    expectConsistent();
 }
 
+// The filter waits through a refused scheduling; the next registration's
+// callback puts it on the oldest of two equally loaded slow paths.
+TEST_F(SlowPathTest, a_failed_scheduling_leaves_filters_for_the_next_registration)
+{
+   const host::FilterId id = create({.name = "a"});
+   host().faults().failOnce("orr_TimerSchedule", ORR_NO_MEMORY);
+   registerSlowPath(1);
+   EXPECT_EQ(agent()->attachTimer, 0u);
+   registerSlowPath(2);
+   runAttach();
+   deliver();
+   EXPECT_EQ(moduleSlowPath(id), 1u) << "the least loaded, the oldest on a tie";
+}
+
 // ---------------------------------------------------------------- replies and retries
 
 TEST_F(SlowPathTest, failed_replies_are_retried_at_once_numbered_from_each_new_attach)

@@ -121,6 +121,27 @@ TEST_F(SlowPathTest, a_registration_while_the_callback_has_its_locks_released_ma
    expectConsistent();
 }
 
+// The walks of the filter list release both locks around each request; a
+// filter after the current one may be destroyed meanwhile (its record
+// freed and poisoned), so the walk must read its successor only afterwards.
+TEST_F(SlowPathTest, a_walk_goes_on_past_a_filter_destroyed_while_its_locks_were_released)
+{
+   const host::FilterId a = create({.name = "a"});
+   const host::FilterId b = create({.name = "b"});
+   const host::FilterId c = create({.name = "c"});
+   registerSlowPath(1);
+   slowPaths().onRequest([&](const host::SlowPathRequest &request) {
+      if (request.filter == a && host().sifra().filter(b)) {
+         EXPECT_EQ(host().sifra().destroyFilter(b), ORR_OK);
+      }
+   });
+   runAttach();
+   slowPaths().onRequest(nullptr);
+   EXPECT_THAT(setRequests(), ElementsAre(std::to_string(a) + "->1", std::to_string(c) + "->1"));
+   deliver();
+   expectConsistent();
+}
+
 // The filter waits through a refused scheduling; the next registration's
 // callback puts it on the oldest of two equally loaded slow paths.
 TEST_F(SlowPathTest, a_failed_scheduling_leaves_filters_for_the_next_registration)

@@ -1,6 +1,7 @@
-// Whole frames through a port of the loaded module: the enforcing or the
-// learning port, either direction, the frame in scatter-gather elements and
-// repeated in one list, the virtual clock moved on before it.
+// Whole frames through a port of the loaded module, its switch-security and
+// IPv6 agents in turn: the enforcing or the learning port, either
+// direction, the frame in scatter-gather elements and repeated in one list,
+// the virtual clock moved on before it.
 //
 // Input: [flags] [clock step] [split lengths...] [frame]
 //   flags bit 0: direction (0 from the VM, 1 to it)
@@ -38,8 +39,8 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size)
    // Rate limits, pending requests and leases depend on time: up to 25.5 s a step.
    module.host.clock().advance(std::chrono::milliseconds(100 * clockStep));
    const uint32_t direction = (flags & 1u) != 0 ? ORR_SIFRA_DIR_RX : ORR_SIFRA_DIR_TX;
-   const swsec::host::FilterId port = (flags & 2u) != 0 ? module.learning : module.enforcing;
-   (void)module.host.sifra().processPackets(port, direction, frames);
+   const uint32_t port = (flags & 2u) != 0 ? swsec::fuzz::kLearningPort : swsec::fuzz::kEnforcingPort;
+   (void)module.host.sifra().processPort(port, direction, frames);
    module.forgetRecords();
    return 0;
 }

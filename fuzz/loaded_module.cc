@@ -1,5 +1,6 @@
 #include "loaded_module.h"
 
+#include "contract/fhs_config_encode.h"
 #include "tests/support/security_config.h"
 
 #include <cstdio>
@@ -8,27 +9,35 @@
 namespace swsec::fuzz {
 namespace {
 
-constexpr uint32_t kEnforcingPort = 7;
-constexpr uint32_t kLearningPort = 8;
-
 [[noreturn]] void fail(const char *what)
 {
    std::fprintf(stderr, "fuzz set-up: %s\n", what);
    std::abort();
 }
 
-host::FilterId createPort(host::Host &host, uint32_t portId, const testing::PortConfig &config)
+host::FilterId createFilter(host::Host &host, std::string_view agent, uint32_t portId, std::string_view property,
+                            const std::vector<uint8_t> &record)
 {
    host::FilterConfig filterConfig;
    filterConfig.name = "vm-" + std::to_string(portId) + ".eth0";
    host::FilterId id = 0;
-   if (host.sifra().createFilter(kAgent, portId, filterConfig, &id) != ORR_OK) {
+   if (host.sifra().createFilter(agent, portId, filterConfig, &id) != ORR_OK) {
       fail("createFilter");
    }
-   if (host.sifra().writeProperty(kSecurityProperty, id, testing::configRecord(config)) != ORR_OK) {
+   if (host.sifra().writeProperty(property, id, record) != ORR_OK) {
       fail("security property write");
    }
    return id;
+}
+
+host::FilterId createPort(host::Host &host, uint32_t portId, const testing::PortConfig &config)
+{
+   return createFilter(host, kAgent, portId, kSecurityProperty, testing::configRecord(config));
+}
+
+void addIpv6Agent(host::Host &host, uint32_t portId, const contract::Ipv6SecurityConfig &config)
+{
+   (void)createFilter(host, kFhsAgent, portId, std::string(kFhsAgent) + ".security", contract::fhsConfigRecord(config));
 }
 
 LoadedModule *make()
@@ -44,6 +53,12 @@ LoadedModule *make()
    const testing::StaticBinding vm{.vlan = 0, .mac = {0x02, 0x00, 0x5e, 0xc0, 0x00, 0x01}, .ip = {192, 0, 2, 101}};
    module->enforcing = createPort(module->host, kEnforcingPort, testing::enforcingConfig({vm}));
    module->learning = createPort(module->host, kLearningPort, testing::learningConfig());
+   if (module->host.plex().write(kAgentProperty, kFhsAgent) != ORR_OK) {
+      fail("IPv6 agent");
+   }
+   addIpv6Agent(module->host, kEnforcingPort,
+                {.features = FhsFeaturesKnown, .trusted = false, .ndRateLimit = 10, .errRateLimit = 5, .errRateLimitPeriod = 10});
+   addIpv6Agent(module->host, kLearningPort, {});
    module->forgetRecords();
    return module;
 }

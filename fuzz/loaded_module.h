@@ -1,5 +1,7 @@
 // The module loaded in a host for the process, with one port configured to
 // enforce and one learning, as the frame and control-input targets use it.
+// Each port has the IPv6 agent behind the switch-security agent: every
+// feature on the enforcing port (ND limits as ARP's), trusted on the other.
 #pragma once
 
 #include "host/host.h"
@@ -12,6 +14,9 @@ namespace swsec::fuzz {
 inline constexpr std::string_view kAgent = "sifra-generic-tarlin-swsec";
 inline constexpr std::string_view kSecurityProperty = "sifra-generic-tarlin-swsec.security";
 inline constexpr std::string_view kAgentProperty = "com.tarlin.common.switch-security";
+inline constexpr std::string_view kFhsAgent = "sifra-generic-tarlin-fhs";
+inline constexpr uint32_t kEnforcingPort = 7;
+inline constexpr uint32_t kLearningPort = 8;
 
 struct LoadedModule {
    host::Host host;

@@ -106,9 +106,11 @@ int main(int argc, char **argv)
             const std::string name = stem + "-" + std::to_string(n + 1);
             // No split, the whole frame mapped.
             write(dhcpDir / name, {0, 0x05, 0xee}, frames[n]);
-            // From the VM through the enforcing port, and to the VM through the learning one.
-            write(frameDir / (name + "-tx"), {0x00, 0}, frames[n]);
-            write(frameDir / (name + "-rx"), {0x03, 0}, frames[n]);
+            // From the VM through the enforcing port, and to the VM through the learning one,
+            // 200 ms apart: slower than the ARP and ND rate limits, so that a flood among
+            // the seeds does not hold the port in the error state for the seeds after it.
+            write(frameDir / (name + "-tx"), {0x00, 2}, frames[n]);
+            write(frameDir / (name + "-rx"), {0x03, 2}, frames[n]);
             ++count;
          }
       }

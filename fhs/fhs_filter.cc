@@ -6,6 +6,7 @@
 #include "framework/sifra_generic_list.h"
 #include "framework/sifra_generic_lock.h"
 #include "framework/sifra_generic_log.h"
+#include "framework/sifra_generic_port.h"
 #include "platform/orr_text.h"
 
 #define FHS_CONFIG_LOCK_NAME "sifg.fhs.config"
@@ -14,9 +15,6 @@
 /* Ethernet, two tags, the fixed header and TCP's: the common path reads no further. */
 constexpr uint32_t FHS_MIN_MAPPED_LEN = 14 + 8 + 40 + 20;
 constexpr uint32_t FHS_MAPPED_BOTH_DIRECTIONS = 3;
-constexpr int64_t FHS_TIMER_PERIOD_US = 10'000'000;
-/* The host's options for a port's periodic timer, as the switch-security port's. */
-constexpr uint32_t FHS_TIMER_OPTIONS = 0x2001;
 
 FhsContext *FhsContextOf(const void *filter)
 {
@@ -157,20 +155,9 @@ orr_Status FhsCreateFilter(SifraGenericFilter *filter)
    ctx->fcfsLifetime = FHS_DEFAULT_FCFS_LIFETIME;
 
    /* Each failure below is undone by FhsDestroyFilter, which knows what exists. */
-   orr_Status status = orr_SifraGetPortID(filter->handle, &ctx->portId);
+   orr_Status status = SifraGenericFindPort(filter, &ctx->portId, &ctx->portset);
    if (status != ORR_OK) {
-      SG_LOG(ORR_LOG_ERROR, "%s: Could not get portId", filter->name);
       goto out_destroy_context;
-   }
-   {
-      orr_PortsetHandle portset = {};
-      status = orr_PortsetAcquireByPortID(ctx->portId, ORR_PORTSET_ACQUIRE_SHARED, &portset);
-      if (status != ORR_OK) {
-         SG_LOG(ORR_LOG_ERROR, "%s: Could not lock portset", filter->name);
-         goto out_destroy_context;
-      }
-      ctx->portset = portset.portset;
-      orr_PortsetRelease(&portset);
    }
    status = SifraGenericCreateSpinlock(FHS_CONFIG_LOCK_NAME, ORR_SPINLOCK_RW, SifraGenericLockRank::PortConfig,
                                        &ctx->configLock);
@@ -195,11 +182,8 @@ orr_Status FhsCreateFilter(SifraGenericFilter *filter)
       SG_LOG(ORR_LOG_ERROR, "%s: Could not set minimum mapped packet length", filter->name);
       goto out_destroy_context;
    }
-   status = orr_TimerAdd(FhsTimerCb, ctx, FHS_TIMER_PERIOD_US, true, FHS_TIMER_OPTIONS, &ctx->timer);
+   status = SifraGenericAddPortTimer(filter, FhsTimerCb, ctx, &ctx->timer);
    if (status != ORR_OK) {
-      SG_LOG(ORR_LOG_ERROR, "%s: Could not add IPv6 port timer (%#x): %s", filter->name,
-             SifraGenericStatusValue(status), orr_StatusToString(status));
-      ctx->timer = 0;
       goto out_destroy_context;
    }
    {
@@ -228,11 +212,8 @@ orr_Status FhsDestroyFilter(SifraGenericFilter *filter)
    if (ctx == nullptr) {
       return ORR_OK;
    }
-   if (ctx->timer != 0) {
-      /* Waits for a running tick, which takes configLock: no lock may be held here. */
-      (void)orr_TimerRemoveSync(ctx->timer);
-      ctx->timer = 0;
-   }
+   /* Waits for a running tick, which takes configLock: no lock may be held here. */
+   SifraGenericRemovePortTimer(&ctx->timer);
    if (ctx->configLock != nullptr) {
       orr_SpinlockWriteLock(ctx->configLock);
       FhsClearBindings(ctx, FhsBindDhcpv6 | FhsBindStatic | FhsBindFcfs);

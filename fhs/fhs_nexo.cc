@@ -7,13 +7,12 @@
 #include "framework/sifra_generic.h"
 #include "framework/sifra_generic_list.h"
 #include "framework/sifra_generic_log.h"
+#include "framework/sifra_generic_nexo.h"
 #include "platform/orr_text.h"
 
 #include <cstddef>
 
-#define FHS_NEXO_TEXT(field, text) \
-   {.name = #field, .label = text, .type = NEXO_FIELD_CHARS, .offset = offsetof(FhsNexo_Summary, field), \
-    .size = sizeof(FhsNexo_Summary::field), .enumDef = nullptr}
+#define FHS_NEXO_TEXT(field, text) SIFRAGENERIC_NEXO_CHARS(FhsNexo_Summary, field, text)
 
 static constexpr Nexo_FieldDef fhsNexoSummaryFields[] = {
    FHS_NEXO_TEXT(featuresEnabled, "Features enabled"),
@@ -41,38 +40,21 @@ static constexpr Nexo_EnumDef fhsNexoMethodEnum = {
    .name = "FhsBindMethodEnum",
    .label = "IPv6 binding method",
    .elements = fhsNexoMethodElements,
-   .numElements = sizeof(fhsNexoMethodElements) / sizeof(fhsNexoMethodElements[0]),
+   .numElements = SifraGenericCountOf(fhsNexoMethodElements),
 };
 
 static constexpr Nexo_FieldDef fhsNexoBindingFields[] = {
-   {.name = "vlanId", .label = "VLAN", .type = NEXO_FIELD_CHARS, .offset = offsetof(FhsNexo_Binding, vlanId),
-    .size = sizeof(FhsNexo_Binding::vlanId), .enumDef = nullptr},
-   {.name = "mac", .label = "MAC", .type = NEXO_FIELD_CHARS, .offset = offsetof(FhsNexo_Binding, mac),
-    .size = sizeof(FhsNexo_Binding::mac), .enumDef = nullptr},
-   {.name = "addr", .label = "IPv6 address", .type = NEXO_FIELD_CHARS, .offset = offsetof(FhsNexo_Binding, addr),
-    .size = sizeof(FhsNexo_Binding::addr), .enumDef = nullptr},
-   {.name = "method", .label = "Learned by", .type = NEXO_FIELD_ENUM32, .offset = offsetof(FhsNexo_Binding, method),
-    .size = sizeof(FhsNexo_Binding::method), .enumDef = &fhsNexoMethodEnum},
-   {.name = "timeRemaining", .label = "Seconds left", .type = NEXO_FIELD_CHARS,
-    .offset = offsetof(FhsNexo_Binding, timeRemaining), .size = sizeof(FhsNexo_Binding::timeRemaining),
-    .enumDef = nullptr},
+   SIFRAGENERIC_NEXO_CHARS(FhsNexo_Binding, vlanId, "VLAN"),
+   SIFRAGENERIC_NEXO_CHARS(FhsNexo_Binding, mac, "MAC"),
+   SIFRAGENERIC_NEXO_CHARS(FhsNexo_Binding, addr, "IPv6 address"),
+   SIFRAGENERIC_NEXO_FIELD(FhsNexo_Binding, method, "Learned by", NEXO_FIELD_ENUM32, &fhsNexoMethodEnum),
+   SIFRAGENERIC_NEXO_CHARS(FhsNexo_Binding, timeRemaining, "Seconds left"),
 };
 
-constinit const Nexo_RecordDef fhsNexoSummaryRecord = {
-   .name = "Fhs_Summary",
-   .label = "IPv6 first-hop security summary",
-   .size = sizeof(FhsNexo_Summary),
-   .fields = fhsNexoSummaryFields,
-   .numFields = sizeof(fhsNexoSummaryFields) / sizeof(fhsNexoSummaryFields[0]),
-};
-
-constinit const Nexo_RecordDef fhsNexoBindingRecord = {
-   .name = "Fhs_Binding",
-   .label = "IPv6 binding",
-   .size = sizeof(FhsNexo_Binding),
-   .fields = fhsNexoBindingFields,
-   .numFields = sizeof(fhsNexoBindingFields) / sizeof(fhsNexoBindingFields[0]),
-};
+constinit const Nexo_RecordDef fhsNexoSummaryRecord =
+   SIFRAGENERIC_NEXO_RECORD(FhsNexo_Summary, "Fhs_Summary", "IPv6 first-hop security summary", fhsNexoSummaryFields);
+constinit const Nexo_RecordDef fhsNexoBindingRecord =
+   SIFRAGENERIC_NEXO_RECORD(FhsNexo_Binding, "Fhs_Binding", "IPv6 binding", fhsNexoBindingFields);
 
 namespace {
 
@@ -83,6 +65,22 @@ orr_Status FhsNexoGet(const Nexo_ParamList *instanceArgs, bool write, SifraGener
    int32_t key = 0;
    const orr_Status status = Nexo_ParamListGetInt32(instanceArgs, 0, &key);
    return status != ORR_OK ? status : FhsLockPort(static_cast<uint32_t>(key), write, agentOut, ctxOut);
+}
+
+/* Reads the port of instance argument 0 into `out` under its read lock. */
+using FhsNexoReader = orr_Status (*)(const FhsContext *ctx, const Nexo_ParamList *instanceArgs, void *out);
+
+orr_Status FhsNexoRead(const Nexo_ParamList *instanceArgs, FhsNexoReader read, void *out)
+{
+   SifraGenericFastPathAgent *agent = nullptr;
+   FhsContext *ctx = nullptr;
+   orr_Status status = FhsNexoGet(instanceArgs, false, &agent, &ctx);
+   if (status != ORR_OK) {
+      return status;
+   }
+   status = read(ctx, instanceArgs, out);
+   FhsUnlockPort(agent, ctx, false);
+   return status;
 }
 
 void Number(char *field, size_t size, uint64_t value)
@@ -185,14 +183,10 @@ orr_Status FhsNexoListPorts(const Nexo_NodeDef *, const Nexo_ParamList *, Nexo_P
    return status;
 }
 
-orr_Status FhsNexoSummaryGet(const Nexo_NodeDef *, const Nexo_ParamList *instanceArgs, void *output)
+namespace {
+
+orr_Status FhsNexoFillSummary(const FhsContext *ctx, const Nexo_ParamList *, void *output)
 {
-   SifraGenericFastPathAgent *agent = nullptr;
-   FhsContext *ctx = nullptr;
-   const orr_Status status = FhsNexoGet(instanceArgs, false, &agent, &ctx);
-   if (status != ORR_OK) {
-      return status;
-   }
    auto *summary = static_cast<FhsNexo_Summary *>(output);
    orr_Memset(summary, 0, sizeof(*summary));
    const uint32_t features = ctx->config.featuresEnabled;
@@ -226,38 +220,24 @@ orr_Status FhsNexoSummaryGet(const Nexo_NodeDef *, const Nexo_ParamList *instanc
    FHS_DROP_LIST(FHS_NEXO_DROP_FILL)
 #undef FHS_NEXO_DROP_FILL
    Number(summary->bindingsEvictedCnt, sizeof(summary->bindingsEvictedCnt), ctx->counters.bindingsEvictedCnt);
-   FhsUnlockPort(agent, ctx, false);
    return ORR_OK;
 }
 
-orr_Status FhsNexoListBindings(const Nexo_NodeDef *, const Nexo_ParamList *instanceArgs, Nexo_ParamList *list)
+orr_Status FhsNexoListIndexes(const FhsContext *ctx, const Nexo_ParamList *, void *out)
 {
-   SifraGenericFastPathAgent *agent = nullptr;
-   FhsContext *ctx = nullptr;
-   orr_Status status = FhsNexoGet(instanceArgs, false, &agent, &ctx);
-   if (status != ORR_OK) {
-      return status;
-   }
+   orr_Status status = ORR_OK;
    for (uint32_t index = 0; index < ctx->numBindings && status == ORR_OK; index++) {
-      status = Nexo_ParamListAddInt(list, index);
+      status = Nexo_ParamListAddInt(static_cast<Nexo_ParamList *>(out), index);
    }
-   FhsUnlockPort(agent, ctx, false);
    return status;
 }
 
-orr_Status FhsNexoBindingGet(const Nexo_NodeDef *, const Nexo_ParamList *instanceArgs, void *output)
+orr_Status FhsNexoFillBinding(const FhsContext *ctx, const Nexo_ParamList *instanceArgs, void *output)
 {
-   SifraGenericFastPathAgent *agent = nullptr;
-   FhsContext *ctx = nullptr;
-   orr_Status status = FhsNexoGet(instanceArgs, false, &agent, &ctx);
-   if (status != ORR_OK) {
-      return status;
-   }
    uint32_t index = 0;
-   status = Nexo_ParamListGetUInt32(instanceArgs, 1, &index);
+   const orr_Status status = Nexo_ParamListGetUInt32(instanceArgs, 1, &index);
    const FhsBinding *binding = status == ORR_OK ? BindingAt(ctx, index) : nullptr;
    if (binding == nullptr) {
-      FhsUnlockPort(agent, ctx, false);
       return status != ORR_OK ? status : ORR_NOT_FOUND;
    }
    auto *record = static_cast<FhsNexo_Binding *>(output);
@@ -276,8 +256,24 @@ orr_Status FhsNexoBindingGet(const Nexo_NodeDef *, const Nexo_ParamList *instanc
       const int64_t left = __atomic_load_n(&binding->expiry, __ATOMIC_RELAXED) - now.sec;
       Number(record->timeRemaining, sizeof(record->timeRemaining), left > 0 ? static_cast<uint64_t>(left) : 0);
    }
-   FhsUnlockPort(agent, ctx, false);
    return ORR_OK;
+}
+
+}  // namespace
+
+orr_Status FhsNexoSummaryGet(const Nexo_NodeDef *, const Nexo_ParamList *instanceArgs, void *output)
+{
+   return FhsNexoRead(instanceArgs, FhsNexoFillSummary, output);
+}
+
+orr_Status FhsNexoListBindings(const Nexo_NodeDef *, const Nexo_ParamList *instanceArgs, Nexo_ParamList *list)
+{
+   return FhsNexoRead(instanceArgs, FhsNexoListIndexes, list);
+}
+
+orr_Status FhsNexoBindingGet(const Nexo_NodeDef *, const Nexo_ParamList *instanceArgs, void *output)
+{
+   return FhsNexoRead(instanceArgs, FhsNexoFillBinding, output);
 }
 
 orr_Status FhsNexoClear(const Nexo_NodeDef *, const Nexo_ParamList *instanceArgs, const Nexo_ParamList *input)

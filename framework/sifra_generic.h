@@ -14,6 +14,16 @@
 #include "platform/orr_plex.h"
 #include "platform/orr_time.h"
 
+#include <cstddef>
+#include <cstdint>
+
+/* The number of entries of a constant table. */
+template <typename T, size_t N>
+constexpr uint32_t SifraGenericCountOf(const T (&)[N])
+{
+   return static_cast<uint32_t>(N);
+}
+
 /* The framework's name (timer queue, lock domain) and its client-port property. */
 #define SIFRAGENERIC_FRAMEWORK_NAME "switch-security"
 #define SIFRAGENERIC_CLIENT_PORT_NAME "com.tarlin.common.switch-security"

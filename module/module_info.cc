@@ -44,11 +44,6 @@ static const orr_ModuleExport sifraGenericModuleExports[] = {
    {"Fhs_BindingsGetNumEntries", reinterpret_cast<orr_ExportedFn>(&Fhs_BindingsGetNumEntries)},
 };
 
-template <typename T, size_t N>
-constexpr uint32_t SifraGenericCountOf(const T (&)[N])
-{
-   return static_cast<uint32_t>(N);
-}
 
 ORR_MODULE_EXPORT const orr_ModuleInfo orr_moduleInfo = {
    .infoVersion = ORR_MODULE_INFO_VERSION,

@@ -5,7 +5,7 @@
 #include "framework/sifra_generic_list.h"
 #include "framework/sifra_generic_lock.h"
 #include "framework/sifra_generic_log.h"
-#include "platform/orr_portset.h"
+#include "framework/sifra_generic_port.h"
 #include "swsec/swsec_config.h"
 #include "swsec/swsec_context.h"
 #include "swsec/swsec_port_db.h"
@@ -39,20 +39,9 @@ orr_Status SwSecCreateFilter(SifraGenericFilter *filter)
    ctx->portDbTimer = 0;
 
    /* Each failure below is undone by SwSecDestroyFilter, which knows what exists. */
-   orr_Status status = orr_SifraGetPortID(filter->handle, &ctx->portId);
+   orr_Status status = SifraGenericFindPort(filter, &ctx->portId, &ctx->portset);
    if (status != ORR_OK) {
-      SG_LOG(ORR_LOG_ERROR, "%s: Could not get portId", filter->name);
       goto out_destroy_context;
-   }
-   {
-      orr_PortsetHandle portset = {};
-      status = orr_PortsetAcquireByPortID(ctx->portId, ORR_PORTSET_ACQUIRE_SHARED, &portset);
-      if (status != ORR_OK) {
-         SG_LOG(ORR_LOG_ERROR, "%s: Could not lock portset", filter->name);
-         goto out_destroy_context;
-      }
-      ctx->portset = portset.portset;
-      orr_PortsetRelease(&portset);
    }
    status = SifraGenericCreateSpinlock(SWSEC_CONFIG_LOCK_NAME, ORR_SPINLOCK_RW,
                                        SifraGenericLockRank::PortConfig, &ctx->configLock);
@@ -126,11 +115,8 @@ orr_Status SwSecDestroyFilter(SifraGenericFilter *filter)
                 retry, orr_StatusToString(status));
          return status;
       }
-      if (ctx->portDbTimer != 0) {
-         /* Waits for a running tick, which takes configLock: no lock may be held here. */
-         (void)orr_TimerRemoveSync(ctx->portDbTimer);
-         ctx->portDbTimer = 0;
-      }
+      /* Waits for a running tick, which takes configLock: no lock may be held here. */
+      SifraGenericRemovePortTimer(&ctx->portDbTimer);
       orr_SpinlockDestroy(ctx->configLock);
       ctx->configLock = nullptr;
    }

@@ -13,14 +13,11 @@
 #include "framework/sifra_generic_filter.h"
 #include "framework/sifra_generic_list.h"
 #include "framework/sifra_generic_log.h"
+#include "framework/sifra_generic_port.h"
 #include "platform/orr_text.h"
 #include "swsec/swsec_config.h"
 #include "swsec/swsec_port_db_links.h"
 #include "swsec/swsec_port_filter_map.h"
-
-/* The port timer: every 10 s, periodic; the options value is the host's. */
-constexpr int64_t SWSEC_PORT_TIMER_PERIOD_US = 10000000;
-constexpr uint32_t SWSEC_PORT_TIMER_OPTIONS = 0x2001;
 
 /* Only ports of the built-in agent are entered in the port filter map. */
 static bool SwSecIsBuiltinAgentPort(const SwSecContext *ctx)
@@ -140,11 +137,8 @@ static orr_Status SwSecInitPortDb(SwSecContext *ctx, const SwSecConfig *cfg)
    }
 
    if (ctx->portDbTimer == 0) {
-      status = orr_TimerAdd(SwSecTimerCb, ctx, SWSEC_PORT_TIMER_PERIOD_US, true,
-                            SWSEC_PORT_TIMER_OPTIONS, &ctx->portDbTimer);
+      status = SifraGenericAddPortTimer(ctx->filter, SwSecTimerCb, ctx, &ctx->portDbTimer);
       if (status != ORR_OK) {
-         ctx->portDbTimer = 0;
-         SG_LOG(ORR_LOG_ERROR, "%s: Timer creation failed: %s", name, orr_StatusToString(status));
          goto out_free_map_entry;
       }
    }

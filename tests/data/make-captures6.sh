@@ -6,7 +6,13 @@
 #
 #   bash tests/data/make-captures6.sh [OUTDIR [SCENARIO...]]   (default: this folder, every scenario)
 #
-# SCENARIO: dhclient6 slaac
+# SCENARIO: dhclient6 udhcpc6 slaac
+#
+# udhcpc6 is busybox's DHCPv6 client, which Debian's busybox leaves out: build
+# it from Debian's busybox source (apt-get source busybox; make allnoconfig;
+# set CONFIG_FEATURE_IPV6=y and CONFIG_UDHCPC6=y; make busybox) and name the
+# binary in UDHCPC6 (default: udhcpc6 on the PATH). Without it that scenario
+# is skipped.
 #
 # Network, made fresh for every run and removed on exit:
 #
@@ -152,7 +158,16 @@ case "\$reason" in
 esac
 exit 0
 SCRIPT
-chmod +x "$work/dhclient6.script"
+cat > "$work/udhcpc6.script" <<SCRIPT
+#!/bin/sh
+echo "\$1 \${ipv6:-}" >> "$work/events"
+case "\$1" in
+  deconfig) ip -6 addr flush dev "\$interface" scope global ;;
+  bound|renew) ip -6 addr replace "\$ipv6/128" dev "\$interface" ;;
+esac
+exit 0
+SCRIPT
+chmod +x "$work/dhclient6.script" "$work/udhcpc6.script"
 
 events_count() { grep -c "^$1" "$work/events" 2>/dev/null || true; }
 has_events() { [ "$(events_count "$1")" -ge "$2" ]; }
@@ -183,6 +198,35 @@ scenario_dhclient6() {
   in_vm ip link set vm0 down
 }
 
+# busybox udhcpc6 (1.35, DUID-LL from the MAC) against the same server:
+# Solicit..Reply, the leased address' DAD, a ping, a renewal (SIGUSR1), a
+# release (SIGUSR2).
+scenario_udhcpc6() {
+  local name=udhcpc6-lease-renew-release mac=02:00:5e:c0:00:33 udhcpc6=${UDHCPC6:-udhcpc6}
+  if ! command -v "$udhcpc6" >/dev/null; then
+    log "$name: skipped, no udhcpc6 (see the top of this script)"; return 0
+  fi
+  : > "$work/events"
+  start_dnsmasq --dhcp-range=2001:db8:1::100,2001:db8:1::1ff,64,$LEASE
+  start_capture $name
+  vm_up $mac net.ipv6.conf.vm0.use_tempaddr=0 net.ipv6.conf.vm0.autoconf=1
+  in_vm "$udhcpc6" -f -i vm0 -s "$work/udhcpc6.script" -p "$work/udhcpc6.pid" -t 5 -T 1 \
+      2>"$work/$name.client.log" &
+  local cpid=$!; pids+=("$cpid")
+  wait_for 20 has_events bound 1
+  local leased; leased=$(awk '/^bound/ {print $2; exit}' "$work/events")
+  wait_for 5 has_vm_addr to "$leased/128"
+  in_vm ping -c 1 -W 1 -I "$leased" $SRV_IP >/dev/null
+  kill -USR1 "$(cat "$work/udhcpc6.pid")"
+  wait_for 20 has_events renew 1
+  sleep 0.5
+  kill -USR2 "$(cat "$work/udhcpc6.pid")"
+  wait_for 10 has_events deconfig 2
+  kill "$(cat "$work/udhcpc6.pid")"; wait "$cpid" 2>/dev/null || true
+  stop_capture; stop_dnsmasq
+  in_vm ip link set vm0 down
+}
+
 # The kernel's own SLAAC with privacy addresses (use_tempaddr 2): dnsmasq
 # advertises 2001:db8:1::/64 for autoconfiguration only (ra-only); the VM
 # detects duplicates of its link-local, stable (EUI-64) and temporary
@@ -203,10 +247,10 @@ scenario_slaac() {
 
 make_network
 scenarios=("${@:2}")
-[ ${#scenarios[@]} -ne 0 ] || scenarios=(dhclient6 slaac)
+[ ${#scenarios[@]} -ne 0 ] || scenarios=(dhclient6 udhcpc6 slaac)
 for scenario in "${scenarios[@]}"; do
   case $scenario in
-    dhclient6|slaac) "scenario_$scenario" ;;
+    dhclient6|udhcpc6|slaac) "scenario_$scenario" ;;
     *) log "unknown scenario $scenario"; exit 2 ;;
   esac
 done

@@ -93,6 +93,11 @@ CAPTURES += [
      "solicitation); dhclient -6 -D LL (isc-dhcp-client 4.4.3) against dnsmasq 2.90's stateful DHCPv6 "
      "(lease 120 s, router advertisements with the managed flag, no autonomous prefix): Solicit..Reply, "
      "the DAD of the leased address, a ping to the server, the Renew at T1 (60 s), then `dhclient -6 -r`."),
+    ("udhcpc6-lease-renew-release", "02:00:5e:c0:00:33", "real",
+     "make-captures6.sh: busybox 1.35 udhcpc6 (built from Debian's source with CONFIG_UDHCPC6) against "
+     "the same server: Solicit..Reply, the leased address' DAD, a ping to the server, a renewal "
+     "(SIGUSR1: udhcpc6 sends it as a Request with the first exchange's transaction ID, unicast from "
+     "the leased address), a release (SIGUSR2)."),
     ("slaac-privacy-dad", "02:00:5e:c0:00:32", "real",
      "make-captures6.sh: the kernel's own SLAAC (use_tempaddr 2, dad_transmits 1) from dnsmasq 2.90's "
      "router advertisements (ra-only, 2001:db8:1::/64): DAD of the link-local, stable (EUI-64) and "
@@ -849,6 +854,15 @@ NOTES = {
         "(one slot per client DUID), the Reply matching the Request's transaction binds 2001:db8:1::1c6 "
         "for its valid lifetime (120 s); the Advertise binds nothing. The DAD of the leased address "
         "finds its own binding; the Renew's Reply only extends it; the Release removes it.",
+    "udhcpc6-lease-renew-release":
+        "udhcpc6 closes its socket between messages, so the VM answers the server's messages with ICMPv6 "
+        "port unreachable (from a bound address: they pass). Dual-stack: the Reply to the Request binds "
+        "2001:db8:1::147 (DHCPv6, 120 s); the renewal is a Request from the leased address with the same "
+        "transaction ID, pending again, and its Reply (from the server's global address) only extends "
+        "the binding. The Release, sent from the leased address, removes the binding first and is then "
+        "dropped by source guard on the address it has just unbound: the server never sees it and keeps "
+        "the lease until it expires (dhclient sends its Release from the link-local address, which "
+        "stays bound).",
     "slaac-privacy-dad":
         "Dual-stack: each DAD solicitation from the unspecified address binds its target first come "
         "first served (link-local, stable and temporary address); every later frame of the VM is from "

@@ -128,14 +128,19 @@ static __always_inline int swsec_punt(struct __sk_buff *skb, const struct swsec_
    return TC_ACT_STOLEN;
 }
 
-static __always_inline int swsec_pass(void)
+static __always_inline int swsec_pass(__u32 direction)
 {
-   swsec_count(SWSEC_FP_PASSED);
+   swsec_count(direction == SWSEC_FP_DIR_FROM_VM ? SWSEC_FP_PASSED : SWSEC_FP_PASSED_TO_VM);
    return TC_ACT_OK;
 }
 
 static __always_inline int swsec_judge(struct __sk_buff *skb, __u32 direction)
 {
+   /* Re-injected after the module passed it: counted when it was punted. */
+   if (skb->mark == (direction == SWSEC_FP_DIR_FROM_VM ? SWSEC_FP_MARK_FROM_VM : SWSEC_FP_MARK_TO_VM)) {
+      skb->mark = 0;
+      return TC_ACT_OK;
+   }
    struct swsec_fp_frame frame = {.direction = direction};
    const __u8 *data = (const __u8 *)(long)skb->data;
    const __u8 *end = (const __u8 *)(long)skb->data_end;
@@ -158,10 +163,10 @@ static __always_inline int swsec_judge(struct __sk_buff *skb, __u32 direction)
    const __u32 features = port->features;
    /* A port with every feature off passes every frame untouched. */
    if (features == 0)
-      return swsec_pass();
+      return swsec_pass(direction);
    /* A frame without an Ethernet header passes unexamined, as in the module. */
    if (data + ETH_HLEN > end)
-      return swsec_pass();
+      return swsec_pass(direction);
    const __u8 *type = data + l2;
    if (type + 2 > end)
       return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_UNPARSED);
@@ -181,19 +186,19 @@ static __always_inline int swsec_judge(struct __sk_buff *skb, __u32 direction)
 
    if (ethertype == ETH_P_IPV6) {
       if (direction != SWSEC_FP_DIR_FROM_VM || !(features & SWSEC_FP_FEATURE_BLOCK_DHCP_SERVER))
-         return swsec_pass();
+         return swsec_pass(direction);
       if (l3 + 40 > end)
          return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_UNPARSED);
       if (l3[6] != IPPROTO_UDP_)
-         return swsec_pass(); /* the module looks at a UDP header right after IPv6 only */
+         return swsec_pass(direction); /* the module looks at a UDP header right after IPv6 only */
       if (l3 + 48 > end)
          return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_UNPARSED);
       if (swsec_load_be16(l3 + 40) == DHCPV6_SERVER_PORT)
          return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_DHCP);
-      return swsec_pass();
+      return swsec_pass(direction);
    }
    if (ethertype != ETH_P_IP)
-      return swsec_pass();
+      return swsec_pass(direction);
 
    /* IPv4: a plain 20-byte header, not a fragment, else the module decides. */
    if (l3 + 20 > end || l3[0] != 0x45)
@@ -210,12 +215,12 @@ static __always_inline int swsec_judge(struct __sk_buff *skb, __u32 direction)
          return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_DHCP);
    }
    if (direction != SWSEC_FP_DIR_FROM_VM)
-      return swsec_pass();
+      return swsec_pass(direction);
 
    const int guard = (features & SWSEC_FP_FEATURE_IP_SOURCE_GUARD) != 0;
    const int refresh = (features & SWSEC_FP_FEATURE_IP_DISCOVERY) && (port->flags & SWSEC_FP_PORT_TRUSTED);
    if (!guard && !refresh)
-      return swsec_pass();
+      return swsec_pass(direction);
    struct swsec_fp_binding_key key = {.vlan = frame.vlan};
    __builtin_memcpy(key.mac, data + 6, 6);
    __builtin_memcpy(&key.ip, l3 + 12, 4);
@@ -227,7 +232,7 @@ static __always_inline int swsec_judge(struct __sk_buff *skb, __u32 direction)
       swsec_count(SWSEC_FP_DROP_IP_SOURCE_GUARD);
       return TC_ACT_SHOT;
    }
-   return swsec_pass();
+   return swsec_pass(direction);
 }
 
 SEC("tc")
@@ -240,6 +245,25 @@ SEC("tc")
 int swsec_to_vm(struct __sk_buff *skb)
 {
    return swsec_judge(skb, SWSEC_FP_DIR_TO_VM);
+}
+
+/*
+ * The re-injection end's ingress: a frame the module passed, sent here by
+ * user space with the mark of its direction, goes on into the VM
+ * interface's ingress (towards the bridge) or out of it (to the VM).
+ */
+SEC("tc")
+int swsec_inject(struct __sk_buff *skb)
+{
+   __u32 zero = 0;
+   const struct swsec_fp_port *port = bpf_map_lookup_elem(&swsec_port, &zero);
+   if (!port || port->vm_ifindex == 0)
+      return TC_ACT_SHOT;
+   if (skb->mark == SWSEC_FP_MARK_FROM_VM)
+      return bpf_redirect(port->vm_ifindex, BPF_F_INGRESS);
+   if (skb->mark == SWSEC_FP_MARK_TO_VM)
+      return bpf_redirect(port->vm_ifindex, 0);
+   return TC_ACT_SHOT;
 }
 
 char LICENSE[] SEC("license") = "GPL";

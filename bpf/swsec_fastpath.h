@@ -33,17 +33,28 @@
 #define SWSEC_FP_PORT_READY 0x1u     /* the maps mirror the module: decide; else punt every frame */
 #define SWSEC_FP_PORT_TRUSTED 0x2u   /* the port's IP discovery is in trusted mode */
 #define SWSEC_FP_PORT_ERR_STATE 0x4u /* the port is in the error-rate-limit state */
+#define SWSEC_FP_PORT_OWN_QDISC 0x8u /* user space made the VM interface's clsact qdisc (the program ignores it) */
+
+/*
+ * A frame the module passed goes back where it was going through the
+ * re-injection program, marked so that the guard lets it through once: a
+ * VM's frames carry no mark (a tap or a veth from another namespace starts
+ * them with none), and only a privileged socket can set one.
+ */
+#define SWSEC_FP_MARK_TO_VM 0x53570001u
+#define SWSEC_FP_MARK_FROM_VM 0x53570002u
 
 /* The port's configuration and error state, as the module has them. */
 struct swsec_fp_port {
    __u32 features; /* the module's featuresEnabled bits */
    __u32 flags;    /* SWSEC_FP_PORT_* */
    __u32 port_id;  /* the switch port ID, copied into punt records */
-   __u32 reserved;
+   __u32 vm_ifindex; /* where the re-injection program sends frames the module passed */
 };
 SWSEC_FP_STATIC_ASSERT(sizeof(struct swsec_fp_port) == 16, "swsec_fp_port layout");
 SWSEC_FP_STATIC_ASSERT(offsetof(struct swsec_fp_port, flags) == 4, "swsec_fp_port layout");
 SWSEC_FP_STATIC_ASSERT(offsetof(struct swsec_fp_port, port_id) == 8, "swsec_fp_port layout");
+SWSEC_FP_STATIC_ASSERT(offsetof(struct swsec_fp_port, vm_ifindex) == 12, "swsec_fp_port layout");
 
 /* Feature bits of `features` that the program reads (the module's values). */
 #define SWSEC_FP_FEATURE_BPDU_FILTER 0x01u
@@ -77,7 +88,8 @@ SWSEC_FP_STATIC_ASSERT(sizeof(struct swsec_fp_binding) == 4, "swsec_fp_binding l
  * the module to judge.
  */
 #define SWSEC_FP_REASON_LIST(X)                                               \
-   X(SWSEC_FP_PASSED, "passed")                                               \
+   X(SWSEC_FP_PASSED, "passed from the VM")                                   \
+   X(SWSEC_FP_PASSED_TO_VM, "passed to the VM")                               \
    X(SWSEC_FP_DROP_IP_SOURCE_GUARD, "IP source guard")                        \
    X(SWSEC_FP_PUNT_NOT_READY, "punted: not ready")                            \
    X(SWSEC_FP_PUNT_ARP, "punted: ARP")                                        \

@@ -8,13 +8,14 @@
 # --state-dir keeps the bindings while a damaged state file is skipped, and
 # nothing of the set-up is left behind. Everything is checked through `swsec ctl --json`.
 #
-#   inline_e2e.sh SWSEC_BINARY
+#   inline_e2e.sh SWSEC_BINARY [kernel|user]   (the data path; default kernel)
 #
 # Exit 0 passed, 1 failed, 77 skipped (not root, or a tool or kernel
 # feature missing; the reason is printed). Every process started is stopped
 # by its PID, every namespace removed, also on failure.
 set -uo pipefail
 source "$(dirname "$0")/lib.sh" "$@"
+datapath=${2:-kernel}
 need ip dnsmasq dhclient udhcpc ping scapy
 
 e2e_diagnose() { echo "-- counters"; sw_ctl counters --json 2>&1 | head -40; }
@@ -46,7 +47,14 @@ start_inline() {
 step "swsec inline guards vm1 and vm2 (no saved state yet)"
 start_inline --state-dir "$state"
 grep -q "vm1: no saved state" "$work/inline.log" || fail "a missing state file was not reported"
-[ "$(master_of vm1p)" = "" ] || fail "vm1p is still in the bridge"
+if [ "$datapath" = kernel ]; then
+  [ "$(master_of vm1p)" = br0 ] || fail "vm1p is not in the bridge on the kernel data path"
+  tc -n "$sw" filter show dev vm1p ingress | grep -q swsec_from_vm || fail "no program on vm1p's ingress"
+else
+  [ "$(master_of vm1p)" = "" ] || fail "vm1p is still in the bridge"
+fi
+sw_ctl ports --json | json "all(p['datapath']=='$datapath' for p in d)" | grep -qx True \
+  || fail "not every port on the $datapath data path: $(sw_ctl ports --json)"
 [ "$(stat -c %a "$ctl")" = "600" ] || fail "the control socket is not mode 0600"
 sw_ctl ports --json | json "all(p['running'] for p in d)" | grep -qx True || fail "ports not running"
 spawn "$swsec" ctl --ctl "$ctl" watch --json >"$work/watch.log" 2>&1
@@ -112,6 +120,9 @@ bytes=$((64 * 1024 * 1024))
 timeout 60 ip netns exec "$vm1" "$python" "$tool" tcp-send 192.0.2.1 5001 $bytes || fail "TCP transfer failed"
 wait "$sink_pid"
 [ "$(cat "$work/tcp.out")" = "$bytes" ] || fail "TCP transfer lost bytes: $(cat "$work/tcp.out") of $bytes"
+if [ "$datapath" = kernel ]; then
+  [ "$(counter vm1 "['kernel']['passed from the VM']")" -gt 100 ] || fail "the program did not carry vm1's data"
+fi
 
 # ---------------------------------------------------------------- attacks
 step "a spoofed source does not reach the server; the VM's own does"
@@ -209,6 +220,9 @@ step "killed outright: the VM stays cut off, and the next start replaces the pai
 inline_start --bridge br0 --port vm1=vm1p
 kill -KILL "$inline_pid"; wait "$inline_pid" 2>/dev/null
 [ -n "$(links | grep '^swsec')" ] || fail "a killed run took its pair away"
+if [ "$datapath" = kernel ]; then
+  tc -n "$sw" filter show dev vm1p ingress | grep -q swsec_from_vm || fail "a killed run's program went with it"
+fi
 in_ns "$vm1" ping -c 1 -W 1 192.0.2.1 >/dev/null && fail "vm1 reaches the server after a kill"
 
 step "fail open: restarted on a port left closed, stopped, vm1 back on the bridge"
@@ -234,6 +248,8 @@ inline_stop
 [ "$(master_of vm1p)" = "br0" ] || fail "vm1p not back in the bridge after an open stop"
 in_ns "$vm1" ping -c 1 -W 2 192.0.2.1 >/dev/null || fail "vm1 cut off after an open stop"
 [ -z "$(links | grep '^swsec')" ] || fail "links left after the open stop"
+[ -z "$(tc -n "$sw" filter show dev vm1p ingress; tc -n "$sw" filter show dev vm1p egress)" ] \
+  || fail "a program left on vm1p after the open stop"
 
 step "a start-up that fails half way leaves the bridge as it was"
 in_ns "$sw" "$swsec" inline --bridge br0 --port vm1=vm1p --port bad=nosuchif --ctl "$ctl" >>"$work/inline.log" 2>&1 \

@@ -165,11 +165,12 @@ dhclient_release() {
 # ipv4_of NS: the first IPv4 address of NS's eth0.
 ipv4_of() { ip -n "$1" -j -4 addr show dev eth0 | json "d[0]['addr_info'][0]['local']"; }
 
-# inline_start ARGUMENTS...: swsec inline in $sw on the control socket ctl,
+# inline_start ARGUMENTS...: swsec inline in $sw on the control socket ctl
+# (on the data path $datapath when the script set one),
 # its output appended to work/inline.log, PID in inline_pid; fails unless
 # its control socket answers within 30 s.
 inline_start() {
-  spawn ip netns exec "$sw" "$swsec" inline --ctl "$ctl" "$@" >>"$work/inline.log" 2>&1
+  spawn ip netns exec "$sw" "$swsec" inline --ctl "$ctl" ${datapath:+--datapath "$datapath"} "$@" >>"$work/inline.log" 2>&1
   inline_pid=$spawned
   wait_for 30 sw_ctl ports || fail "swsec inline did not come up"
 }

@@ -77,6 +77,7 @@ struct InlineCommandOptions {
    std::string stateDir;
    std::string modulePath;
    uint32_t batch = 64;
+   std::string datapath;                   // "kernel", "user", "" the kernel's where it loads
 };
 
 void addInlineOptions(CLI::App &command, InlineCommandOptions &options);

@@ -40,6 +40,10 @@ void addInlineOptions(CLI::App &command, InlineCommandOptions &options)
    command.add_option("--batch", options.batch, "most frames in one system call and one list")
       ->check(CLI::Range(1u, 1024u));
    command.add_option("--module", options.modulePath, "module image (default: the built one)");
+   command.add_option("--datapath", options.datapath,
+                      "who carries the VM's frames: kernel (a tc program on the VM interface, which stays in the "
+                      "bridge) or user (this process, through a veth pair); default kernel where it loads, else user")
+      ->check(CLI::IsMember({"kernel", "user"}));
 }
 
 namespace {
@@ -74,6 +78,9 @@ live::InlineOptions parseOptions(const InlineCommandOptions &command)
    options.modulePath = command.modulePath;
    options.linkedModule = linkedModule();
    options.batch = command.batch;
+   if (!command.datapath.empty()) {
+      options.datapath = command.datapath == "kernel" ? live::Datapath::kernel : live::Datapath::user;
+   }
    std::set<std::string> names;
    std::set<std::string> interfaces;
    for (const auto &text : command.ports) {

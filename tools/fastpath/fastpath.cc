@@ -281,6 +281,26 @@ int Program::programFd(uint32_t direction) const
    return check(program != nullptr ? bpf_program__fd(program) : -ENOENT, std::string("no program ") + name);
 }
 
+int Program::injectFd() const
+{
+   const bpf_program *program = bpf_object__find_program_by_name(object_, "swsec_inject");
+   return check(program != nullptr ? bpf_program__fd(program) : -ENOENT, "no program swsec_inject");
+}
+
+int Program::puntFd() const
+{
+   return check(ring_buffer__epoll_fd(ring_), "no punt ring");
+}
+
+void Program::setVmInterface(uint32_t ifindex, bool ownQdisc)
+{
+   swsec_fp_port value = port();
+   value.vm_ifindex = ifindex;
+   value.flags = ownQdisc ? (value.flags | SWSEC_FP_PORT_OWN_QDISC) : (value.flags & ~SWSEC_FP_PORT_OWN_QDISC);
+   const uint32_t zero = 0;
+   check(bpf_map_update_elem(mapFd("swsec_port"), &zero, &value, BPF_ANY), "cannot write the port map");
+}
+
 swsec_fp_port Program::port() const
 {
    const uint32_t zero = 0;
@@ -298,6 +318,7 @@ void Program::describe(const PortDescription &description)
    }
    // Not ready while the bindings change, so that no frame is judged on a half-filled map.
    setNotReady();
+   const swsec_fp_port before = port();
    const int fd = mapFd("swsec_bindings");
    for (const Binding &binding : bindings()) {
       const swsec_fp_binding_key key = keyOf(binding);
@@ -309,7 +330,8 @@ void Program::describe(const PortDescription &description)
    swsec_fp_port value{};
    value.features = description.features;
    value.port_id = description.portId;
-   value.flags = SWSEC_FP_PORT_READY | (description.trusted ? SWSEC_FP_PORT_TRUSTED : 0u) |
+   value.vm_ifindex = before.vm_ifindex;
+   value.flags = (before.flags & SWSEC_FP_PORT_OWN_QDISC) | SWSEC_FP_PORT_READY | (description.trusted ? SWSEC_FP_PORT_TRUSTED : 0u) |
                  (description.errorState ? SWSEC_FP_PORT_ERR_STATE : 0u);
    const uint32_t zero = 0;
    check(bpf_map_update_elem(mapFd("swsec_port"), &zero, &value, BPF_ANY), "cannot write the port map");
@@ -419,7 +441,13 @@ void Program::unpin()
    std::filesystem::remove(pinDir_, ignored);
 }
 
-Attachment::Attachment(const Program &program, int ifindex, bool ingress, bool egress) : ifindex_(ifindex)
+Attachment::Attachment(const Program &program, int ifindex, bool ingress, bool egress)
+   : Attachment(ifindex, Hooks{.ingressFd = ingress ? program.programFd(SWSEC_FP_DIR_FROM_VM) : -1,
+                               .egressFd = egress ? program.programFd(SWSEC_FP_DIR_TO_VM) : -1})
+{
+}
+
+Attachment::Attachment(int ifindex, const Hooks &hooks) : ifindex_(ifindex)
 {
    installLibbpfLog();
    auto hook = optionsOf<bpf_tc_hook>();
@@ -431,18 +459,23 @@ Attachment::Attachment(const Program &program, int ifindex, bool ingress, bool e
       madeQdisc_ = true;
    }
    try {
-      const auto attach = [&](Hook &state, bpf_tc_attach_point point, uint32_t direction) {
+      const auto attach = [&](Hook &state, bpf_tc_attach_point point, int fd) {
          hook.attach_point = point;
          auto options = optionsOf<bpf_tc_opts>();
-         options.prog_fd = program.programFd(direction);
+         options.prog_fd = fd;
+         if (hooks.priority != 0) {
+            options.handle = 1;
+            options.priority = hooks.priority;
+            options.flags = BPF_TC_F_REPLACE;
+         }
          check(bpf_tc_attach(&hook, &options), "cannot attach to interface " + std::to_string(ifindex));
          state = Hook{.attached = true, .handle = options.handle, .priority = options.priority};
       };
-      if (ingress) {
-         attach(ingress_, BPF_TC_INGRESS, SWSEC_FP_DIR_FROM_VM);
+      if (hooks.ingressFd >= 0) {
+         attach(ingress_, BPF_TC_INGRESS, hooks.ingressFd);
       }
-      if (egress) {
-         attach(egress_, BPF_TC_EGRESS, SWSEC_FP_DIR_TO_VM);
+      if (hooks.egressFd >= 0) {
+         attach(egress_, BPF_TC_EGRESS, hooks.egressFd);
       }
    } catch (...) {
       try {

@@ -122,6 +122,14 @@ public:
 
    // The program of one direction (SWSEC_FP_DIR_*), to attach.
    int programFd(uint32_t direction) const;
+   // The re-injection program, for the ingress of the veth end that frames
+   // the module passed are sent to.
+   int injectFd() const;
+   // Readable when punted frames wait in the ring buffer.
+   int puntFd() const;
+   // Where the re-injection program sends frames (0: it drops them), and
+   // whether user space made the interface's clsact qdisc; both kept by describe.
+   void setVmInterface(uint32_t ifindex, bool ownQdisc);
 
    // Makes the maps mirror `port` (the bindings replaced whole) and marks
    // the port ready: from then on the program decides.
@@ -165,6 +173,12 @@ private:
 // was made here; other filters on the hooks are left alone.
 class Attachment {
 public:
+   struct Hooks {
+      int ingressFd = -1;      // -1: not on this hook
+      int egressFd = -1;
+      uint32_t priority = 0;   // 0: the kernel picks; else the filter there (handle 1) is replaced
+   };
+   Attachment(int ifindex, const Hooks &hooks);
    Attachment(const Program &program, int ifindex, bool ingress, bool egress);
    ~Attachment();
    Attachment(const Attachment &) = delete;
@@ -172,6 +186,9 @@ public:
 
    // Detaches now; errors are reported (the destructor ignores them).
    void detach();
+   bool madeQdisc() const { return madeQdisc_; }
+   // A qdisc found here was made by an earlier run: detach removes it.
+   void adoptQdisc() { madeQdisc_ = true; }
 
 private:
    struct Hook {

@@ -40,7 +40,8 @@ std::string requiredString(const nlohmann::json &request, const char *key)
 
 InlineDaemon::InlineDaemon(InlineOptions options, EventHub &events)
    : options_(std::move(options)), events_(events),
-     session_(options_.modulePath, options_.linkedModule, [&events](const std::string &v) { events.log("error", "host", v); })
+     session_(options_.modulePath, options_.linkedModule, [&events](const std::string &v) { events.log("error", "host", v); }),
+     feed_(session_.host())
 {
    // Ports' timers fire on real time from here on, on the host's timer thread.
    session_.host().clock().useRealTime();
@@ -148,23 +149,77 @@ void InlineDaemon::startPort(Port &port)
    options.portID = nextPortID_++;
    options.failMode = options_.failMode;
    options.batch = options_.batch;
-   port.guarded = std::make_unique<GuardedPort>(
-      session_, options, [this](const std::string &line) { events_.log("info", "inline", line); }, nullptr);
+   options.datapath = datapath_;
+   options.feed = &feed_;
    std::function<void(host::FilterId)> restore;
    if (!options_.stateDir.empty()) {
       restore = [this, &port](host::FilterId filter) { restoreState(port.portSpec, filter); };
    }
+   const std::vector<uint8_t> record = recordFor(port.portSpec);
+   const auto log = [this](const std::string &line) { events_.log("info", "inline", line); };
+   port.guarded = std::make_unique<GuardedPort>(session_, options, log, nullptr);
    try {
-      port.guarded->start(recordFor(port.portSpec), restore);
+      port.guarded->start(record, restore);
+   } catch (const fastpath::Error &e) {
+      port.guarded.reset();
+      if (options_.datapath) {
+         throw;
+      }
+      // Chosen, not asked for: this port goes on the user path.
+      events_.log("error", "inline", port.portSpec.name + ": the kernel data path failed (" + e.what() +
+                                         "); the port uses the user data path");
+      options.datapath = Datapath::user;
+      port.guarded = std::make_unique<GuardedPort>(session_, options, log, nullptr);
+      try {
+         port.guarded->start(record, restore);
+      } catch (...) {
+         port.guarded.reset();
+         throw;
+      }
    } catch (...) {
       port.guarded.reset();
       throw;
    }
 }
 
+void InlineDaemon::chooseDatapath()
+{
+   std::optional<std::string> why;
+   try {
+      why = fastpath::unavailable();
+   } catch (const fastpath::Error &e) {
+      why = e.what();
+   }
+   if (!why) {
+      datapath_ = Datapath::kernel;
+      events_.log("info", "inline", "data path: kernel (the fast path program on each VM interface)");
+      return;
+   }
+   if (options_.datapath == Datapath::kernel) {
+      throw fastpath::Error("--datapath kernel: the fast path program cannot be loaded here (" + *why + ")", ENOTSUP);
+   }
+   datapath_ = Datapath::user;
+   userReason_ = options_.datapath ? "asked for" : *why;
+   events_.log("info", "inline", "data path: user (" + userReason_ + ")");
+}
+
+void InlineDaemon::configured(Port &port)
+{
+   if (KernelPath *kernel = port.guarded->kernel()) {
+      kernel->configured();
+   }
+}
+
 void InlineDaemon::start()
 {
    std::lock_guard guard(mutex_);
+   if (options_.datapath == Datapath::user) {
+      datapath_ = Datapath::user;
+      userReason_ = "asked for";
+      events_.log("info", "inline", "data path: user (asked for)");
+   } else {
+      chooseDatapath();
+   }
    // Listening before the bridge is looked at: nothing that changes after
    // the look goes unheard.
    links_ = std::make_unique<LinkMonitor>();
@@ -308,7 +363,7 @@ void InlineDaemon::bridgeGone()
 void InlineDaemon::rejoined(Port &port)
 {
    const auto now = findLink(port.portSpec.vmIface);
-   if (!now || now->master != options_.bridge) {
+   if (!now || now->master != options_.bridge || port.guarded->kernel() != nullptr) {
       return;
    }
    events_.log("error", "inline", port.portSpec.name + ": " + port.portSpec.vmIface + " was put back into " +
@@ -397,7 +452,14 @@ void InlineDaemon::pump()
    for (auto &record : session_.takeLog()) {
       events_.log(record.severity >= 2 ? "error" : "info", "module", session::withoutNewline(record.text));
    }
-   for (const auto &note : session_.takeNotifications()) {
+   feed_.take();
+   std::vector<session::PortDbNotification> notes;
+   for (const auto &message : feed_.drain()) {
+      if (auto note = session::decodePortDbMessage(message)) {
+         notes.push_back(std::move(*note));
+      }
+   }
+   for (const auto &note : notes) {
       std::string name = std::to_string(note.portID);
       for (const auto &port : ports_) {
          if (port->guarded && port->guarded->options().portID == note.portID) {
@@ -446,6 +508,7 @@ void InlineDaemon::reload()
       const std::string &name = port.portSpec.name;
       try {
          session_.configure(port.guarded->filter(), recordFor(port.portSpec));
+         configured(port);
          port.configSource = port.portSpec.configPath;
          events_.log("info", "inline", name + ": configuration re-read from " + port.portSpec.configPath);
       } catch (const session::InputError &e) {
@@ -513,6 +576,10 @@ nlohmann::json InlineDaemon::portJson(const Port &port)
       entry["stateFile"] = statePath(port.portSpec);
    }
    if (port.guarded) {
+      entry["datapath"] = datapathName(port.guarded->options().datapath);
+      if (port.guarded->options().datapath == Datapath::user && !userReason_.empty()) {
+         entry["datapathReason"] = userReason_;
+      }
       entry["portId"] = port.guarded->options().portID;
       entry["running"] = port.guarded->running();
       entry["stopReason"] = port.guarded->stopReason();
@@ -553,6 +620,21 @@ nlohmann::json InlineDaemon::countersJson(Port &port)
       frames[kDirectionNames[direction]] = {{"passed", counters.passed[direction].load()},
                                             {"dropped", counters.dropped[direction].load()}};
    }
+   KernelPath *kernel = port.guarded->running() ? port.guarded->kernel() : nullptr;
+   entry["datapath"] = datapathName(port.guarded->options().datapath);
+   if (kernel != nullptr) {
+      // The frames the program decided itself, added to those the module judged.
+      const fastpath::Counters counts = kernel->counters();
+      nlohmann::json byReason = nlohmann::json::object();
+      for (uint32_t reason = 0; reason < SWSEC_FP_REASON_COUNT; ++reason) {
+         byReason[std::string(fastpath::reasonName(reason))] = counts.frames[reason];
+      }
+      entry["kernel"] = byReason;
+      frames["from-vm"]["passed"] = frames["from-vm"]["passed"].get<uint64_t>() + counts[SWSEC_FP_PASSED];
+      frames["to-vm"]["passed"] = frames["to-vm"]["passed"].get<uint64_t>() + counts[SWSEC_FP_PASSED_TO_VM];
+      frames["from-vm"]["dropped"] =
+         frames["from-vm"]["dropped"].get<uint64_t>() + counts[SWSEC_FP_DROP_IP_SOURCE_GUARD];
+   }
    entry["frames"] = frames;
    entry["truncated"] = counters.truncated.load();
    entry["sendErrors"] = counters.sendErrors.load();
@@ -562,6 +644,10 @@ nlohmann::json InlineDaemon::countersJson(Port &port)
    }
    const session::PortState state = session_.readState(port.guarded->options().portID);
    entry["drops"] = state.counters;
+   if (kernel != nullptr && entry["drops"].contains("ipSrcGuardDropCnt")) {
+      entry["drops"]["ipSrcGuardDropCnt"] =
+         entry["drops"]["ipSrcGuardDropCnt"].get<uint64_t>() + kernel->guardDropsSinceConfigured();
+   }
    nlohmann::json methods = {{"DHCP Snooping", 0}, {"Static", 0}, {"TOFU", 0}, {"ARP Snooping", 0}};
    for (const auto &binding : state.portDb) {
       methods[binding.method] = methods.value(binding.method, 0) + 1;
@@ -600,9 +686,24 @@ nlohmann::json InlineDaemon::handle(const nlohmann::json &request)
       if (!state.featureSummary) {
          return {{"port", port.portSpec.name}, {"fields", nullptr}, {"text", "(the port has no IP discovery)\n"}};
       }
+      nlohmann::json fields = session::featureSummaryJson(state);
+      std::string text = state.featureSummaryText;
+      if (KernelPath *kernel = port.guarded->kernel()) {
+         // The module's summary with the program's source guard drops added.
+         const uint64_t drops = kernel->guardDropsSinceConfigured();
+         if (fields.contains("ipSrcGuardDropCnt") && fields["ipSrcGuardDropCnt"].is_string()) {
+            fields["ipSrcGuardDropCnt"] = std::to_string(std::stoull(fields["ipSrcGuardDropCnt"].get<std::string>()) + drops);
+         } else if (fields.contains("ipSrcGuardDropCnt") && fields["ipSrcGuardDropCnt"].is_number()) {
+            fields["ipSrcGuardDropCnt"] = fields["ipSrcGuardDropCnt"].get<uint64_t>() + drops;
+         }
+         text += "Data path: kernel (" + std::to_string(drops) + " of the IP source guard drops in the kernel)\n";
+      } else {
+         text += "Data path: user\n";
+      }
       return {{"port", port.portSpec.name},
-              {"fields", session::featureSummaryJson(state)},
-              {"text", state.featureSummaryText}};
+              {"datapath", datapathName(port.guarded->options().datapath)},
+              {"fields", fields},
+              {"text", text}};
    }
    if (command == "counters") {
       nlohmann::json list = nlohmann::json::array();
@@ -639,6 +740,7 @@ nlohmann::json InlineDaemon::handle(const nlohmann::json &request)
       const std::string origin = request.value("origin", std::string("(control request)"));
       try {
          session_.configure(port.guarded->filter(), session::configRecord(session::parseConfig(text, origin)));
+         configured(port);
       } catch (const session::InputError &e) {
          throw CtlError(e.what());
       } catch (const session::Refused &e) {

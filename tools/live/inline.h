@@ -3,6 +3,7 @@
 
 #include "live/ctl_server.h"
 #include "live/events.h"
+#include "live/kernel_path.h"
 #include "live/port.h"
 #include "live/rtnetlink.h"
 #include "session/config_file.h"
@@ -39,6 +40,7 @@ struct InlineOptions {
    std::string stateDir;   // "" keeps no state; else DIR/<port name>.state across restarts
    std::string watch;      // "" none; else a shell pattern: the bridge's ports it matches are guarded
    std::string configPath; // the configuration of ports added later ("" the defaults)
+   std::optional<Datapath> datapath;   // none: the kernel's where it loads, else the user path
 };
 
 // A port's "bindings" reply: its port database entries, each with "port".
@@ -80,6 +82,9 @@ private:
    };
 
    void startPort(Port &port);
+   void chooseDatapath();
+   // The module's port counters restarted on a new configuration.
+   void configured(Port &port);
    // Adds and starts one port; throws CtlError (nothing left behind) when it cannot.
    Port &addPort(PortSpec portSpec, bool watched);
    // Stops one port as the fail mode says, saving its state, and forgets it.
@@ -106,6 +111,9 @@ private:
    InlineOptions options_;
    EventHub &events_;
    session::ModuleSession session_;
+   PostedFeed feed_;
+   Datapath datapath_ = Datapath::user;   // what ports start on
+   std::string userReason_;               // why the kernel path is not used, "" when chosen
    std::recursive_mutex mutex_;   // the ports against the control thread
    std::vector<std::unique_ptr<Port>> ports_;   // stable: ports hold no index into it
    bool stateLost_ = false;

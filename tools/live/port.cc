@@ -1,6 +1,7 @@
 // A guarded port's set-up, forwarding threads and take-down.
 #include "live/port.h"
 
+#include "live/kernel_path.h"
 #include "live/netdev.h"
 #include "live/owner_lock.h"
 
@@ -119,8 +120,11 @@ void GuardedPort::start(const std::vector<uint8_t> &record, const std::function<
       }
       runIp({"link", "set", guardEnd_, "up"});
       runIp({"link", "set", bridgeEnd_, "up"});
-      vmSocket_ = std::make_unique<PacketSocket>(options_.vmIface, options_.batch);
-      guardSocket_ = std::make_unique<PacketSocket>(guardEnd_, options_.batch);
+      const bool kernel = options_.datapath == Datapath::kernel;
+      if (!kernel) {
+         vmSocket_ = std::make_unique<PacketSocket>(options_.vmIface, options_.batch);
+         guardSocket_ = std::make_unique<PacketSocket>(guardEnd_, options_.batch);
+      }
 
       filter_ = session_.addPort(options_.portID, name, "inline:" + name);
       portMade_ = true;
@@ -132,6 +136,23 @@ void GuardedPort::start(const std::vector<uint8_t> &record, const std::function<
       stopEvent_ = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
       if (stopEvent_ < 0) {
          throw std::system_error(errno, std::generic_category(), "eventfd");
+      }
+      if (kernel) {
+         // The VM interface stays in (or goes back into) the bridge, guarded by the program on its hooks.
+         kernel_ = std::make_unique<KernelPath>(
+            session_, *options_.feed,
+            KernelPath::Options{name, options_.vmIface, vm->ifindex, options_.portID, guardEnd_, bridgeEnd_}, log_);
+         vmOutOfBridge_ = true;
+         kernel_->start(filter_);
+         if (!wasInBridge_) {
+            runIp({"link", "set", options_.vmIface, "master", options_.bridge});
+         }
+         running_.store(true, std::memory_order_release);
+         threads_.emplace_back([this] { kernel_->run(stopEvent_, counters_, [this](const std::string &why) { vanish(why); }); });
+         log_(name + ": guarding " + options_.vmIface + " in " + options_.bridge + " on the kernel data path (port " +
+              std::to_string(options_.portID) + ", fail " + (options_.failMode == FailMode::open ? "open" : "closed") +
+              ")");
+         return;
       }
       // Swapped: out of the bridge first, so that no frame takes both ways.
       if (wasInBridge_) {
@@ -332,11 +353,21 @@ void GuardedPort::takeDown(bool restoreAsFound)
       const bool back = restoreAsFound ? wasInBridge_ : options_.failMode == FailMode::open;
       if (back) {
          attempt({"link", "set", options_.vmIface, "master", options_.bridge});
-      } else if (!restoreAsFound) {
-         log_(name + ": " + options_.vmIface + " stays out of " + options_.bridge + " (fail closed)");
+      } else {
+         if (kernel_) {
+            // Cut off before the program goes: no frame passes unjudged.
+            attempt({"link", "set", options_.vmIface, "nomaster"});
+         }
+         if (!restoreAsFound) {
+            log_(name + ": " + options_.vmIface + " stays out of " + options_.bridge + " (fail closed)");
+         }
       }
    }
    vmOutOfBridge_ = false;
+   if (kernel_) {
+      kernel_->stop();
+      kernel_.reset();
+   }
    if (stopEvent_ >= 0) {
       close(stopEvent_);
       stopEvent_ = -1;

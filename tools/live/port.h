@@ -31,6 +31,15 @@ namespace swsec::live {
 // its interface stays out of the bridge) or on the bridge unguarded (open).
 enum class FailMode : uint8_t { closed, open };
 
+// Who carries the VM's frames: the fast path program on the VM interface,
+// which stays in the bridge (kernel), or this process through a veth pair
+// bump (user).
+enum class Datapath : uint8_t { kernel, user };
+const char *datapathName(Datapath datapath);
+
+class KernelPath;
+class PostedFeed;
+
 struct PortOptions {
    std::string name;       // the port's name for the administrator ("vm1")
    std::string vmIface;    // the VM's interface, a port of `bridge`
@@ -39,6 +48,8 @@ struct PortOptions {
    FailMode failMode = FailMode::closed;
    size_t batch = 64;      // most frames in one system call and one list
    std::string runDir = kDefaultRunDir;   // where the interface's owner lock is
+   Datapath datapath = Datapath::user;
+   PostedFeed *feed = nullptr;            // the kernel path's notifications
 };
 
 // Frames a port has seen, by direction (1 to the VM, 2 from it).
@@ -98,6 +109,8 @@ public:
    void followMtu(unsigned mtu);
    // Why the port was stopped from outside (its bridge gone), for stopReason.
    void setStopReason(const std::string &reason);
+   // The kernel path, while the port runs on it (else null).
+   KernelPath *kernel() { return kernel_.get(); }
 
 private:
    void forward(PacketSocket &from, PacketSocket &to, uint32_t direction);
@@ -122,6 +135,7 @@ private:
    bool vmOutOfBridge_ = false;
    host::FilterId filter_ = 0;
    std::unique_ptr<InterfaceLock> lock_;   // held from the first check to the end of the take-down
+   std::unique_ptr<KernelPath> kernel_;
    std::unique_ptr<PacketSocket> vmSocket_;
    std::unique_ptr<PacketSocket> guardSocket_;
    int stopEvent_ = -1;                       // eventfd: the forwarding threads stop

@@ -243,7 +243,9 @@ TEST(BadUsage, is_named_in_one_short_line_with_status_2_and_nothing_written)
       {config, "unknown key \"trustd\"", R"({"trustd": true})"},
       {config, "malformed MAC address", R"({"static": [{"vlan": 0, "mac": "02:00:5e:c0:00", "ip": "10.0.0.1"}]})"},
       {config, "malformed IPv4 address", R"({"static": [{"vlan": 0, "mac": "02:00:5e:c0:00:01", "ip": "10.0.0"}]})"},
+      {config, "malformed IPv6 address", R"({"static": [{"vlan": 0, "mac": "02:00:5e:c0:00:01", "ip": "2001:db8::g"}]})"},
       {config, "0 to 4095", R"({"static": [{"vlan": 4096, "mac": "02:00:5e:c0:00:01", "ip": "10.0.0.1"}]})"},
+      {config, "unsigned 32-bit", R"({"ipv6BindingLimit": "64"})"},
       {config, "unsigned 32-bit", R"({"arpRateLimit": -1})"},
       {config, "number overflow", R"({"portDbSize": 1e400})"},
       {config, "nested deeper than 64 levels",
@@ -251,6 +253,7 @@ TEST(BadUsage, is_named_in_one_short_line_with_status_2_and_nothing_written)
       // The module's own rule: inspection on a trusted port is refused, in its words.
       {config, "Invalid config: featuresEnabled = 0xc trusted = 1",
        R"({"features": ["dai", "ip-discovery"], "trusted": true})", 1},
+      {config, "Invalid ND rate limit config: 4 4 10", R"({"ndRateLimit": 4, "errRateLimit": 4, "errRateLimitPeriod": 10})", 1},
       // Captures.
       {capture, "cannot read capture", "hello, this is text\n"},
       {capture, "cannot read capture", ""},

@@ -6,6 +6,7 @@
 #include "replay/engine.h"
 #include "session/config_file.h"
 #include "session/error.h"
+#include "support/ipv6_frames.h"
 
 #include <gtest/gtest.h>
 #include <nlohmann/json.hpp>
@@ -102,6 +103,90 @@ TEST(ReplayConfig, a_static_binding_lets_its_owner_pass_inspection_without_dhcp)
    EXPECT_TRUE(result.frames.at(9).passed);
    ASSERT_FALSE(result.ports[0].portDb.empty());
    EXPECT_EQ(result.ports[0].portDb.front().method, "Static");
+}
+
+// Each IPv6 key lands in the IPv6 agent's record; a document without one makes no IPv6 agent.
+TEST(ReplayConfig, ipv6_keys_give_the_port_the_ipv6_agent_with_their_values)
+{
+   using Ipv6 = contract::Ipv6SecurityConfig;
+   const uint32_t learning = FhsFeatureDhcpv6Snoop | FhsFeatureFcfs;
+   const struct {
+      const char *text;
+      std::optional<Ipv6> ipv6;
+      uint32_t ipv4Features;
+   } cases[] = {
+      {R"({"features": ["dai", "ip-discovery"]})", std::nullopt, 0x0c},
+      {R"({"features": ["ra-guard", "ip-discovery", "nd-inspection"]})",
+       Ipv6{.features = FhsFeatureRaGuard | FhsFeatureNdInspection}, 0x04},
+      {R"({"trusted": false, "ndRateLimit": 9, "errRateLimit": 3, "errRateLimitPeriod": 12})",
+       Ipv6{.features = learning, .trusted = false, .ndRateLimit = 9, .errRateLimit = 3, .errRateLimitPeriod = 12},
+       SwSecFeatureIpDiscovery},
+      {R"({"ipv6BindingLimit": 5, "ipv6FcfsLifetime": 30})", Ipv6{.bindingLimit = 5, .fcfsLifetime = 30},
+       SwSecFeatureIpDiscovery},
+      {R"({"static": [{"vlan": 3, "mac": "02:00:5e:c0:00:01", "ip": "2001:db8::1"}]})",
+       Ipv6{.statics = {FhsBindingKey{3, {2, 0, 0x5e, 0xc0, 0, 1}, {0x20, 1, 0x0d, 0xb8, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 1}}}},
+       SwSecFeatureIpDiscovery},
+   };
+   for (const auto &c : cases) {
+      const auto config = session::parseConfig(c.text, "test");
+      EXPECT_EQ(config.features, c.ipv4Features) << c.text;
+      EXPECT_TRUE(config.statics.empty()) << c.text;
+      ASSERT_EQ(config.ipv6.has_value(), c.ipv6.has_value()) << c.text;
+      if (c.ipv6) {
+         EXPECT_EQ(contract::fhsConfigRecord(*config.ipv6), contract::fhsConfigRecord(*c.ipv6)) << c.text;
+      }
+   }
+}
+
+// A dual-stack VM learns its link-local address and a DHCPv6 lease, then
+// tries each IPv6 attack: every drop names its check, and the report shows
+// the IPv6 bindings and counters in the shapes every front end uses.
+TEST(ReplayIpv6, dual_stack_attacks_are_dropped_with_their_reasons_and_the_bindings_shown)
+{
+   const Mac vm = Mac::parse(kVmMac), router = Mac::parse("02:00:5e:c0:00:02");
+   const Addr6 linkLocal = a6("fe80::7"), leased = a6("2001:db8::7"), gateway = a6("fe80::1");
+   const Bytes duid{0, 3, 0, 1, 2, 0, 0x5e, 0xc0, 0, 1};
+   const auto fromVm = [&](const Addr6 &src, uint8_t next, const Bytes &payload) {
+      return frame6(vm, src, a6("ff02::1"), next, payload);
+   };
+   const struct {
+      Bytes bytes;
+      uint8_t direction;
+      const char *reason;   // null: passes
+   } script[] = {
+      {fromVm(Addr6{}, 58, nd(135, linkLocal)), replay::kDirFromVm, nullptr},
+      {fromVm(linkLocal, 17, udp6(546, 547, dhcp6(3, 0x42, duid))), replay::kDirFromVm, nullptr},
+      {frame6(router, gateway, linkLocal, 17, udp6(547, 546, dhcp6(7, 0x42, duid, {{leased, 7200}}))), replay::kDirToVm, nullptr},
+      {fromVm(leased, 17, udp6(5000, 53, Bytes(8, 1))), replay::kDirFromVm, nullptr},
+      {fromVm(linkLocal, 58, icmp6(134, Bytes(12, 0))), replay::kDirFromVm, "RA guard"},
+      {fromVm(a6("2001:db8::66"), 17, udp6(5000, 53, Bytes(8, 1))), replay::kDirFromVm, "IPv6 source guard"},
+      {fromVm(linkLocal, 58, nd(136, gateway, vm)), replay::kDirFromVm, "ND inspection"},
+      {fromVm(linkLocal, 44, cat(frag(60, 0, true), ext(58))), replay::kDirFromVm, "IPv6 header chain"},
+      {fromVm(linkLocal, 17, udp6(546, 546, dhcp6(7, 1, duid))), replay::kDirFromVm, "DHCPv6 guard"},
+   };
+   TempDir dir;
+   std::vector<CapturedFrame> frames;
+   for (const auto &step : script) {
+      frames.push_back({.timeNs = int64_t(frames.size()) * 1'000'000, .bytes = step.bytes, .direction = step.direction});
+   }
+   writePcapng(dir.path() / "v6.pcapng", frames);
+   const ToolRun run = runTool({"replay", "--json", "--config", (sourceDir() / "examples/dual-stack.json").string(),
+                                (dir.path() / "v6.pcapng").string()});
+   ASSERT_EQ(run.status, 0) << run.err;
+   const auto doc = nlohmann::json::parse(run.out);
+   ASSERT_EQ(doc["frames"].size(), std::size(script));
+   for (size_t i = 0; i < std::size(script); ++i) {
+      EXPECT_EQ(doc["frames"][i]["verdict"], script[i].reason ? "dropped" : "passed") << i;
+      EXPECT_EQ(doc["frames"][i].value("reason", ""), script[i].reason ? script[i].reason : "") << i;
+   }
+   const auto &ipv6 = doc["ports"][0]["ipv6"];
+   EXPECT_EQ(ipv6["bindings"], nlohmann::json::parse(R"([
+      {"vlan": 0, "mac": "02:00:5e:c0:00:01", "ip": "fe80::7", "method": "First come first served", "timeRemaining": 600},
+      {"vlan": 0, "mac": "02:00:5e:c0:00:01", "ip": "2001:db8::7", "method": "DHCPv6", "timeRemaining": 7200}])"));
+   EXPECT_EQ(ipv6["counters"]["raGuardDropCnt"], 1);
+   EXPECT_EQ(ipv6["summary"]["numBindings"], 2);
+   EXPECT_EQ(doc["ports"][0]["notifications"][1]["name"], "fhs.binding.added");
+   EXPECT_EQ(doc["ports"][0]["notifications"][1]["ip"], "2001:db8::7");
 }
 
 // ---------------------------------------------------------------- captures and outputs

@@ -57,13 +57,12 @@ InlineDaemon::~InlineDaemon()
    (void)stop();
 }
 
-std::vector<uint8_t> InlineDaemon::recordFor(const PortSpec &portSpec)
+session::PortSecurityConfig InlineDaemon::configFor(const PortSpec &portSpec)
 {
    if (!portSpec.configText.empty()) {
-      return session::configRecord(session::parseConfig(portSpec.configText, portSpec.configOrigin));
+      return session::parseConfig(portSpec.configText, portSpec.configOrigin);
    }
-   return session::configRecord(portSpec.configPath.empty() ? session::PortSecurityConfig{}
-                                                       : session::loadConfigFile(portSpec.configPath));
+   return portSpec.configPath.empty() ? session::PortSecurityConfig{} : session::loadConfigFile(portSpec.configPath);
 }
 
 std::string InlineDaemon::statePath(const PortSpec &portSpec) const
@@ -140,6 +139,15 @@ bool InlineDaemon::saveState(Port &port, host::FilterId filter)
    }
 }
 
+session::PortSecurityConfig InlineDaemon::checkedFor(const Port &port, session::PortSecurityConfig config)
+{
+   if (config.ipv6 && port.guarded->options().datapath == Datapath::kernel) {
+      throw session::InputError(config.origin + ": IPv6 keys need the user data path; port " + port.portSpec.name +
+                                " is on the kernel data path");
+   }
+   return config;
+}
+
 void InlineDaemon::startPort(Port &port)
 {
    PortOptions options;
@@ -155,11 +163,19 @@ void InlineDaemon::startPort(Port &port)
    if (!options_.stateDir.empty()) {
       restore = [this, &port](host::FilterId filter) { restoreState(port.portSpec, filter); };
    }
-   const std::vector<uint8_t> record = recordFor(port.portSpec);
+   const session::PortSecurityConfig config = configFor(port.portSpec);
+   if (config.ipv6 && options.datapath == Datapath::kernel) {
+      // The kernel program passes IPv6 on its own: only the user path hands it to the IPv6 agent.
+      if (options_.datapath) {
+         throw session::InputError(config.origin + ": IPv6 keys need the user data path (--datapath user)");
+      }
+      events_.log("info", "inline", port.portSpec.name + ": IPv6 keys: the port uses the user data path");
+      options.datapath = Datapath::user;
+   }
    const auto log = [this](const std::string &line) { events_.log("info", "inline", line); };
    port.guarded = std::make_unique<GuardedPort>(session_, options, log, nullptr);
    try {
-      port.guarded->start(record, restore);
+      port.guarded->start(config, restore);
    } catch (const fastpath::Error &e) {
       port.guarded.reset();
       if (options_.datapath) {
@@ -171,7 +187,7 @@ void InlineDaemon::startPort(Port &port)
       options.datapath = Datapath::user;
       port.guarded = std::make_unique<GuardedPort>(session_, options, log, nullptr);
       try {
-         port.guarded->start(record, restore);
+         port.guarded->start(config, restore);
       } catch (...) {
          port.guarded.reset();
          throw;
@@ -507,7 +523,7 @@ void InlineDaemon::reload()
       }
       const std::string &name = port.portSpec.name;
       try {
-         session_.configure(port.guarded->filter(), recordFor(port.portSpec));
+         session_.configure(port.guarded->filter(), checkedFor(port, configFor(port.portSpec)));
          configured(port);
          port.configSource = port.portSpec.configPath;
          events_.log("info", "inline", name + ": configuration re-read from " + port.portSpec.configPath);
@@ -739,7 +755,7 @@ nlohmann::json InlineDaemon::handle(const nlohmann::json &request)
       const std::string text = requiredString(request, "text");
       const std::string origin = request.value("origin", std::string("(control request)"));
       try {
-         session_.configure(port.guarded->filter(), session::configRecord(session::parseConfig(text, origin)));
+         session_.configure(port.guarded->filter(), checkedFor(port, session::parseConfig(text, origin)));
          configured(port);
       } catch (const session::InputError &e) {
          throw CtlError(e.what());

@@ -103,7 +103,10 @@ private:
    nlohmann::json portJson(const Port &port);
    nlohmann::json bindingsJson(const Port &port);
    nlohmann::json countersJson(Port &port);
-   std::vector<uint8_t> recordFor(const PortSpec &portSpec);
+   session::PortSecurityConfig configFor(const PortSpec &portSpec);
+   // `config`, refused (InputError) when it has IPv6 keys and the port is on
+   // the kernel data path, which does not hand IPv6 to the module.
+   session::PortSecurityConfig checkedFor(const Port &port, session::PortSecurityConfig config);
    std::string statePath(const PortSpec &portSpec) const;
    void restoreState(const PortSpec &portSpec, host::FilterId filter);
    bool saveState(Port &port, host::FilterId filter);

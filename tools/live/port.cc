@@ -64,7 +64,7 @@ GuardedPort::~GuardedPort()
    stop();
 }
 
-void GuardedPort::start(const std::vector<uint8_t> &record, const std::function<void(host::FilterId)> &restore)
+void GuardedPort::start(const session::PortSecurityConfig &config, const std::function<void(host::FilterId)> &restore)
 {
    const std::string &name = options_.name;
    // Everything that can be refused is checked before anything changes.
@@ -131,7 +131,7 @@ void GuardedPort::start(const std::vector<uint8_t> &record, const std::function<
       if (restore) {
          restore(filter_);
       }
-      session_.configure(filter_, record);
+      session_.configure(filter_, config);
 
       stopEvent_ = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
       if (stopEvent_ < 0) {
@@ -204,7 +204,6 @@ void GuardedPort::forward(PacketSocket &from, PacketSocket &to, uint32_t directi
    std::vector<size_t> judged;   // index in `frames` of each view
    judged.reserve(options_.batch);
    std::vector<std::vector<uint8_t>> retagged(options_.batch);   // frames whose tag goes back in
-   host::Sifra &sifra = session_.host().sifra();
    uint64_t sendErrors = 0;
 
    while (!vanished_.load(std::memory_order_acquire)) {
@@ -248,7 +247,7 @@ void GuardedPort::forward(PacketSocket &from, PacketSocket &to, uint32_t directi
       if (views.empty()) {
          continue;
       }
-      const host::PacketsResult result = sifra.processPackets(filter_, direction, views);
+      const host::PacketsResult result = session_.judge(filter_, direction, views);
       passed.clear();
       for (size_t kept : result.kept) {
          if (kept < judged.size()) {

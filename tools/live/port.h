@@ -77,11 +77,11 @@ public:
    GuardedPort(const GuardedPort &) = delete;
    GuardedPort &operator=(const GuardedPort &) = delete;
 
-   // Sets the port up and configures it with `record`; `restore`, if given,
+   // Sets the port up and configures it with `config`; `restore`, if given,
    // is called with the new module port before it is configured and before
    // any frame flows. Throws (session::Refused, NetdevError, std::system_error)
    // after putting back what it changed.
-   void start(const std::vector<uint8_t> &record, const std::function<void(host::FilterId)> &restore = {});
+   void start(const session::PortSecurityConfig &config, const std::function<void(host::FilterId)> &restore = {});
    // Stops forwarding and takes the set-up down as the fail mode says, or,
    // for a start-up that fails after this port started, as it was found.
    // `save`, if given, is called with the module port once the last frame

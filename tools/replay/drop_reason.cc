@@ -5,6 +5,8 @@
 #include "replay/capture.h"
 #include "replay/describe.h"
 
+#include <utility>
+
 namespace swsec::replay {
 
 const char *dropReasonName(DropReason reason)
@@ -20,6 +22,15 @@ const char *dropReasonName(DropReason reason)
    case DropReason::bpduFilter: return "BPDU filter";
    case DropReason::dhcpServerBlock: return "DHCP server block";
    case DropReason::dhcpUnansweredAck: return "DHCP snooping: unanswered ACK";
+   case DropReason::ipv6HeaderChain: return "IPv6 header chain";
+   case DropReason::fragmentedNd: return "Fragmented ND or RA";
+   case DropReason::raGuard: return "RA guard";
+   case DropReason::dhcpv6Guard: return "DHCPv6 guard";
+   case DropReason::ipv6SourceGuard: return "IPv6 source guard";
+   case DropReason::ndInspection: return "ND inspection";
+   case DropReason::claimRefused: return "Address claimed by another port";
+   case DropReason::ndRateLimit: return "ND rate limit";
+   case DropReason::ndRateLimitErrorState: return "ND rate limit: error state";
    }
    return "";
 }
@@ -53,6 +64,23 @@ DropReason explainDrop(const DropCounters &before, const DropCounters &after, st
    }
    if (moved(before, after, "ipSrcGuardDropCnt")) {
       return DropReason::ipSourceGuard;
+   }
+   // The IPv6 agent judges what the IPv4 agent passed.
+   if (moved(before, after, "ndRateLimitDropCnt")) {
+      const auto inError = before.find("ndRateLimitErr");
+      return inError != before.end() && inError->second != 0 ? DropReason::ndRateLimitErrorState
+                                                             : DropReason::ndRateLimit;
+   }
+   static constexpr std::pair<std::string_view, DropReason> kIpv6Counters[] = {
+      {"headerChainDropCnt", DropReason::ipv6HeaderChain}, {"fragmentedNdDropCnt", DropReason::fragmentedNd},
+      {"raGuardDropCnt", DropReason::raGuard},             {"dhcpv6GuardDropCnt", DropReason::dhcpv6Guard},
+      {"sourceGuardDropCnt", DropReason::ipv6SourceGuard}, {"ndInspectionDropCnt", DropReason::ndInspection},
+      {"claimRefusedDropCnt", DropReason::claimRefused},
+   };
+   for (const auto &[counter, reason] : kIpv6Counters) {
+      if (moved(before, after, counter)) {
+         return reason;
+      }
    }
    const FrameFacts facts = frameFacts(frame);
    if (facts.bpduDestination) {

@@ -24,6 +24,16 @@ enum class DropReason : uint8_t {
    bpduFilter,
    dhcpServerBlock,
    dhcpUnansweredAck,
+   // The IPv6 agent's checks, each by its counter.
+   ipv6HeaderChain,       // headerChainDropCnt
+   fragmentedNd,          // fragmentedNdDropCnt
+   raGuard,               // raGuardDropCnt
+   dhcpv6Guard,           // dhcpv6GuardDropCnt
+   ipv6SourceGuard,       // sourceGuardDropCnt
+   ndInspection,          // ndInspectionDropCnt
+   claimRefused,          // claimRefusedDropCnt
+   ndRateLimit,           // ndRateLimitDropCnt as the error state is entered
+   ndRateLimitErrorState, // ndRateLimitDropCnt while in the error state (ndRateLimitErr 1 before)
 };
 
 // The names the port's feature summary uses for the checks.

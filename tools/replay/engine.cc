@@ -171,7 +171,7 @@ void Run::startPort(Port &port)
       port.portSpec.config ? port.portSpec.config : options_.config;
    if (config) {
       try {
-         session_->configure(port.filter, session::configRecord(*config));
+         session_->configure(port.filter, *config);
       } catch (const session::Refused &e) {
          throw ConfigRefused((config->origin.empty() ? "port " + port.portSpec.name : config->origin) + ": " +
                              e.what());
@@ -318,7 +318,7 @@ void Run::flush()
    // Capture time that goes backwards leaves the clock where it is.
    advanceTo(clockAt(list_.firstTimeNs()));
    Port &port = ports_[listPort_];
-   const host::PacketsResult out = session_->host().sifra().processPackets(port.filter, list_.direction(), list_.views());
+   const host::PacketsResult out = session_->judge(port.filter, list_.direction(), list_.views());
    kept_.assign(list_.size(), 0);
    for (size_t index : out.kept) {
       if (index < kept_.size()) {

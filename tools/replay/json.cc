@@ -35,6 +35,7 @@ json portJson(const PortResult &port)
    doc["portDb"] = std::move(portDb);
    doc["counters"] = session::countersJson(port.counters);
    doc["featureSummary"] = session::featureSummaryJson(port);
+   doc["ipv6"] = session::ipv6Json(port);
    json notes = json::array();
    for (const auto &n : port.notifications) {
       json note = session::notificationJson(n);

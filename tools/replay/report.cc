@@ -82,6 +82,10 @@ void printPort(std::ostream &out, const PortResult &port, bool named)
       out << session::textTable(rows, "  ");
    }
 
+   if (port.ipv6) {
+      out << "\n" << session::ipv6Text(*port.ipv6);
+   }
+
    out << "\nnotifications (" << port.notifications.size() << ")\n";
    for (const auto &n : port.notifications) {
       out << "  after #" << std::left << std::setw(6) << n.afterFrame << std::setw(22) << n.name << "VLAN "

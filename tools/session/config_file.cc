@@ -4,6 +4,7 @@
 
 #include "contract/config_record.h"
 #include "session/error.h"
+#include "session/ipv6_config.h"
 #include "session/json_text.h"
 
 #include <arpa/inet.h>
@@ -52,7 +53,9 @@ std::array<uint8_t, 4> parseIp(const json &value, const std::string &what)
    return ip;
 }
 
-StaticBinding parseStatic(const json &entry, const std::string &what)
+// An entry whose "ip" is an IPv6 address binds on the IPv6 agent.
+void parseStatic(const json &entry, const std::string &what, PortSecurityConfig &config,
+                 contract::Ipv6SecurityConfig &ipv6, bool &anyIpv6)
 {
    if (!entry.is_object()) {
       throw InputError(what + ": expected an object {vlan, mac, ip}");
@@ -75,8 +78,14 @@ StaticBinding parseStatic(const json &entry, const std::string &what)
       throw InputError(what + ": \"mac\" must be a string");
    }
    binding.mac = parseMac(entry["mac"].get<std::string>(), what);
-   binding.ip = parseIp(entry["ip"], what);
-   return binding;
+   const json &ip = entry["ip"];
+   if (ip.is_string() && ip.get<std::string>().find(':') != std::string::npos) {
+      ipv6.statics.push_back(ipv6StaticKey(binding.vlan, binding.mac, ip, what));
+      anyIpv6 = true;
+      return;
+   }
+   binding.ip = parseIp(ip, what);
+   config.statics.push_back(binding);
 }
 
 }  // namespace
@@ -118,13 +127,21 @@ PortSecurityConfig parseConfig(std::string_view text, const std::string &origin)
    }
    PortSecurityConfig config;
    config.origin = origin;
+   contract::Ipv6SecurityConfig ipv6;
+   bool anyIpv6 = false;
    for (const auto &[key, value] : doc.items()) {
       if (key == "features") {
          if (!value.is_array()) {
             throw InputError(origin + ": \"features\" must be a list of feature names");
          }
          config.features = 0;
+         ipv6.features = 0;
          for (const auto &name : value) {
+            if (const uint32_t bit = name.is_string() ? ipv6FeatureBit(name.get<std::string>()) : 0; bit != 0) {
+               ipv6.features |= bit;
+               anyIpv6 = true;
+               continue;
+            }
             const FeatureName *found = nullptr;
             for (const auto &feature : kFeatureNames) {
                if (name.is_string() && name.get<std::string>() == feature.name) {
@@ -133,7 +150,8 @@ PortSecurityConfig parseConfig(std::string_view text, const std::string &origin)
             }
             if (found == nullptr) {
                throw InputError(origin + ": unknown feature " + session::jsonText(name) +
-                                 " (known: ip-discovery, dai, ip-source-guard, bpdu-filter, block-dhcp-server)");
+                                 " (known: ip-discovery, dai, ip-source-guard, bpdu-filter, block-dhcp-server, " +
+                                kIpv6FeatureNames + ")");
             }
             config.features |= found->bit;
          }
@@ -155,11 +173,20 @@ PortSecurityConfig parseConfig(std::string_view text, const std::string &origin)
             throw InputError(origin + ": \"static\" must be a list of {vlan, mac, ip}");
          }
          for (size_t i = 0; i < value.size(); ++i) {
-            config.statics.push_back(parseStatic(value[i], origin + ": static[" + std::to_string(i) + "]"));
+            parseStatic(value[i], origin + ": static[" + std::to_string(i) + "]", config, ipv6, anyIpv6);
          }
+      } else if (parseIpv6Number(key, value, ipv6, origin)) {
+         anyIpv6 = true;
       } else {
          throw InputError(origin + ": unknown key \"" + key + "\"");
       }
+   }
+   if (anyIpv6) {
+      // The port's mode and the error state's rate and period are the same for both agents.
+      ipv6.trusted = config.trusted;
+      ipv6.errRateLimit = config.errRateLimit;
+      ipv6.errRateLimitPeriod = config.errRateLimitPeriod;
+      config.ipv6 = std::move(ipv6);
    }
    return config;
 }

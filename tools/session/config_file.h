@@ -3,9 +3,11 @@
 #pragma once
 
 #include "contract/config_record_encode.h"
+#include "contract/fhs_config_encode.h"
 
 #include <array>
 #include <cstdint>
+#include <optional>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -17,6 +19,9 @@ using contract::StaticBinding;
 // Defaults are those of a new port: IP discovery alone, trusted, 32 entries.
 struct PortSecurityConfig : contract::PortSecurityConfig {
    std::string origin;   // where it was read from, for messages
+   // The IPv6 agent's configuration, when the document has any IPv6 key:
+   // the port then gets the IPv6 agent too.
+   std::optional<contract::Ipv6SecurityConfig> ipv6;
 };
 
 // Parses a document; `origin` names it in errors. Throws InputError on bad

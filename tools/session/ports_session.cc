@@ -43,6 +43,25 @@ DropCounters countersOf(const std::map<std::string, std::string, std::less<>> &v
    return counters;
 }
 
+std::string ipv6Path(uint32_t portID)
+{
+   return "/ipv6/" + std::to_string(portID);
+}
+
+// The IPv6 counters, and the ND error state as a number for telling drops apart.
+DropCounters ipv6CountersOf(const std::map<std::string, std::string, std::less<>> &values)
+{
+   DropCounters counters;
+   for (const char *field : kIpv6CounterFields) {
+      const auto found = values.find(field);
+      uint64_t value = 0;
+      if (found != values.end() && parseCount(found->second, value)) {
+         counters[field] = value;
+      }
+   }
+   return counters;
+}
+
 }  // namespace
 
 std::string withoutNewline(std::string text)
@@ -55,6 +74,19 @@ std::string withoutNewline(std::string text)
 
 std::optional<PortDbNotification> decodePortDbMessage(const host::PostedMessage &message)
 {
+   if (message.name == FHS_MSG_ADDED || message.name == FHS_MSG_REMOVED) {
+      if (message.payload.size() < sizeof(FhsBindingMsgPayload)) {
+         return std::nullopt;
+      }
+      FhsBindingMsgPayload payload;
+      std::memcpy(&payload, message.payload.data(), sizeof payload);
+      return PortDbNotification{.portID = message.portID,
+                                .name = message.name,
+                                .vlan = payload.key.vlanId,
+                                .mac = macText(payload.key.mac),
+                                .ip = ipv6Text(payload.key.addr),
+                                .authoritative = payload.method != FhsBindFcfs};
+   }
    if ((message.name != SWSEC_PORTDB_MSG_ADDED && message.name != SWSEC_PORTDB_MSG_REMOVED) ||
        message.payload.size() < sizeof(SwSecPortDbMsgPayload)) {
       return std::nullopt;
@@ -115,15 +147,102 @@ host::FilterId ModuleSession::addPort(uint32_t portID, const std::string &name, 
       throw std::runtime_error("port " + name + " could not be made: " + orr_StatusToString(status));
    }
    filters_.push_back(filter);
+   std::lock_guard ports(portsMutex_);
+   ports_[filter] = PortInfo{portID, name, vmUuid, 0};
    return filter;
+}
+
+host::FilterId ModuleSession::ipv6FilterLocked(host::FilterId filter)
+{
+   PortInfo info;
+   {
+      std::lock_guard ports(portsMutex_);
+      const auto found = ports_.find(filter);
+      if (found == ports_.end()) {
+         throw std::runtime_error("no such port");
+      }
+      if (found->second.ipv6 != 0) {
+         return found->second.ipv6;
+      }
+      info = found->second;
+   }
+   if (!host_.sifra().fastPath(kIpv6Agent) && host_.plex().write(kAgentCreationProperty, kIpv6Agent) != ORR_OK) {
+      throw std::runtime_error(std::string("the module did not make the agent ") + kIpv6Agent);
+   }
+   host::FilterConfig config;
+   config.name = info.name;
+   config.vmUuid = info.vmUuid;
+   host::FilterId ipv6 = 0;
+   const orr_Status status = host_.sifra().createFilter(kIpv6Agent, info.portID, config, &ipv6);
+   if (status != ORR_OK) {
+      throw std::runtime_error("port " + info.name + " could not get the IPv6 agent: " + orr_StatusToString(status));
+   }
+   filters_.push_back(ipv6);
+   std::lock_guard ports(portsMutex_);
+   ports_[filter].ipv6 = ipv6;
+   return ipv6;
+}
+
+host::FilterId ModuleSession::ipv6Filter(host::FilterId filter)
+{
+   std::lock_guard guard(mutex_);
+   return ipv6FilterLocked(filter);
+}
+
+std::optional<host::FilterId> ModuleSession::findIpv6Filter(host::FilterId filter)
+{
+   std::lock_guard ports(portsMutex_);
+   const auto found = ports_.find(filter);
+   if (found == ports_.end() || found->second.ipv6 == 0) {
+      return std::nullopt;
+   }
+   return found->second.ipv6;
+}
+
+host::PacketsResult ModuleSession::judge(host::FilterId filter, uint32_t direction,
+                                         std::span<const host::FrameView> frames)
+{
+   host::PacketsResult result = host_.sifra().processPackets(filter, direction, frames);
+   const std::optional<host::FilterId> ipv6 = findIpv6Filter(filter);
+   if (!ipv6 || result.kept.empty()) {
+      return result;
+   }
+   std::vector<host::FrameView> kept;
+   kept.reserve(result.kept.size());
+   for (size_t index : result.kept) {
+      kept.push_back(frames[index]);
+   }
+   const host::PacketsResult second = host_.sifra().processPackets(*ipv6, direction, kept);
+   std::vector<size_t> both;
+   both.reserve(second.kept.size());
+   for (size_t index : second.kept) {
+      both.push_back(result.kept[index]);
+   }
+   result.kept = std::move(both);
+   result.released += second.released;
+   if (result.status == ORR_OK) {
+      result.status = second.status;
+   }
+   return result;
 }
 
 orr_Status ModuleSession::removePort(host::FilterId filter)
 {
    std::lock_guard guard(mutex_);
+   if (const std::optional<host::FilterId> ipv6 = findIpv6Filter(filter)) {
+      const host::DestroyResult destroyed = host_.sifra().destroyFilterAsHypervisor(*ipv6);
+      if (destroyed.status != ORR_OK) {
+         return destroyed.status;
+      }
+      std::erase(filters_, *ipv6);
+      std::lock_guard ports(portsMutex_);
+      ports_[filter].ipv6 = 0;
+   }
    const host::DestroyResult destroyed = host_.sifra().destroyFilterAsHypervisor(filter);
    if (destroyed.status == ORR_OK) {
       std::erase(filters_, filter);
+      std::lock_guard ports(portsMutex_);
+      ports_.erase(filter);
    }
    return destroyed.status;
 }
@@ -149,15 +268,31 @@ std::string ModuleSession::errorsSince(size_t mark)
    return message;
 }
 
-void ModuleSession::configure(host::FilterId filter, const std::vector<uint8_t> &record)
+void ModuleSession::writeProperty(const char *property, host::FilterId filter, const std::vector<uint8_t> &record)
 {
-   std::lock_guard guard(mutex_);
    drainLogLocked();
    const size_t mark = logTail_.size();
-   const orr_Status written = host_.sifra().writeProperty(kSecurityProperty, filter, record);
+   const orr_Status written = host_.sifra().writeProperty(property, filter, record);
    if (written != ORR_OK) {
       std::string message = errorsSince(mark);
       throw Refused("configuration refused: " + (message.empty() ? orr_StatusToString(written) : message));
+   }
+}
+
+void ModuleSession::configure(host::FilterId filter, const std::vector<uint8_t> &record)
+{
+   std::lock_guard guard(mutex_);
+   writeProperty(kSecurityProperty, filter, record);
+}
+
+void ModuleSession::configure(host::FilterId filter, const PortSecurityConfig &config)
+{
+   std::lock_guard guard(mutex_);
+   writeProperty(kSecurityProperty, filter, configRecord(config));
+   if (config.ipv6) {
+      writeProperty(kIpv6SecurityProperty, ipv6FilterLocked(filter), contract::fhsConfigRecord(*config.ipv6));
+   } else if (const std::optional<host::FilterId> ipv6 = findIpv6Filter(filter)) {
+      writeProperty(kIpv6SecurityProperty, *ipv6, contract::fhsConfigRecord({}));
    }
 }
 
@@ -180,10 +315,18 @@ void ModuleSession::clear(uint32_t portID, const std::optional<std::vector<std::
 DropCounters ModuleSession::dropCounters(uint32_t portID)
 {
    host::NexoRecord summary;
-   if (host_.nexo().get(portPath(portID) + "/featureSummary", &summary) != ORR_OK) {
-      return {};
+   DropCounters counters;
+   if (host_.nexo().get(portPath(portID) + "/featureSummary", &summary) == ORR_OK) {
+      counters = countersOf(summary.values());
    }
-   return countersOf(summary.values());
+   host::NexoRecord ipv6;
+   if (host_.nexo().get(ipv6Path(portID) + "/summary", &ipv6) == ORR_OK) {
+      const auto values = ipv6.values();
+      counters.merge(ipv6CountersOf(values));
+      const auto inError = values.find("ndRateLimitErr");
+      counters["ndRateLimitErr"] = inError != values.end() && inError->second == "yes" ? 1 : 0;
+   }
+   return counters;
 }
 
 std::optional<std::chrono::seconds> ModuleSession::soonestExpiry(uint32_t portID)
@@ -215,9 +358,45 @@ std::optional<std::chrono::seconds> ModuleSession::soonestExpiry(uint32_t portID
    return soonest;
 }
 
+std::optional<Ipv6PortState> ModuleSession::readIpv6State(uint32_t portID)
+{
+   const std::string port = ipv6Path(portID);
+   host::NexoRecord summary;
+   if (host_.nexo().get(port + "/summary", &summary) != ORR_OK) {
+      return std::nullopt;
+   }
+   Ipv6PortState state;
+   state.summary = summary.values();
+   state.summaryText = summary.text();
+   state.counters = ipv6CountersOf(state.summary);
+   std::vector<int64_t> instances;
+   if (host_.nexo().list(port + "/bindings", &instances) != ORR_OK) {
+      return state;
+   }
+   for (int64_t instance : instances) {
+      host::NexoRecord record;
+      if (host_.nexo().get(port + "/bindings/" + std::to_string(instance), &record) != ORR_OK) {
+         continue;   // removed since the list was taken
+      }
+      const auto values = record.values();
+      auto field = [&values](const char *name) {
+         const auto found = values.find(name);
+         return found != values.end() ? found->second : std::string();
+      };
+      Ipv6Binding &binding = state.bindings.emplace_back();
+      (void)parseCount(field("vlanId"), binding.vlan);
+      binding.mac = field("mac");
+      binding.ip = ipv6Text(field("addr"));
+      binding.method = field("method");
+      binding.timeRemaining = field("timeRemaining");
+   }
+   return state;
+}
+
 PortState ModuleSession::readState(uint32_t portID)
 {
    PortState state;
+   state.ipv6 = readIpv6State(portID);
    const std::string port = portPath(portID);
    host::NexoRecord summary;
    if (host_.nexo().get(port + "/featureSummary", &summary) == ORR_OK) {
@@ -299,6 +478,10 @@ std::vector<std::string> ModuleSession::finish()
       }
    }
    filters_.clear();
+   {
+      std::lock_guard ports(portsMutex_);
+      ports_.clear();
+   }
    const orr_Status unloaded = host_.unload();
    if (unloaded != ORR_OK) {
       report(std::string("the module did not unload: ") + orr_StatusToString(unloaded));

@@ -1,6 +1,8 @@
 // The shared output shapes.
 #include "session/serializer.h"
 
+#include <arpa/inet.h>
+
 #include <algorithm>
 #include <charconv>
 #include <cstdio>
@@ -18,6 +20,18 @@ std::string ipText(const uint8_t *ip)
 {
    return std::to_string(ip[0]) + "." + std::to_string(ip[1]) + "." + std::to_string(ip[2]) + "." +
           std::to_string(ip[3]);
+}
+
+std::string ipv6Text(const uint8_t *addr)
+{
+   char text[INET6_ADDRSTRLEN] = {};
+   return inet_ntop(AF_INET6, addr, text, sizeof text) != nullptr ? text : "";
+}
+
+std::string ipv6Text(const std::string &text)
+{
+   uint8_t addr[16];
+   return inet_pton(AF_INET6, text.c_str(), addr) == 1 ? ipv6Text(addr) : text;
 }
 
 nlohmann::json nodeValue(const std::string &text)
@@ -56,6 +70,31 @@ nlohmann::json notificationJson(const PortDbNotification &note)
            {"authoritative", note.authoritative}};
 }
 
+nlohmann::json ipv6BindingJson(const Ipv6Binding &binding)
+{
+   return {{"vlan", binding.vlan},
+           {"mac", binding.mac},
+           {"ip", binding.ip},
+           {"method", binding.method},
+           {"timeRemaining", binding.timeRemaining == "never" ? nlohmann::json(nullptr) : nodeValue(binding.timeRemaining)}};
+}
+
+nlohmann::json ipv6Json(const PortState &state)
+{
+   if (!state.ipv6) {
+      return nullptr;
+   }
+   nlohmann::json summary = nlohmann::json::object();
+   for (const auto &[name, value] : state.ipv6->summary) {
+      summary[name] = nodeValue(value);
+   }
+   nlohmann::json bindings = nlohmann::json::array();
+   for (const auto &binding : state.ipv6->bindings) {
+      bindings.push_back(ipv6BindingJson(binding));
+   }
+   return {{"summary", std::move(summary)}, {"counters", countersJson(state.ipv6->counters)}, {"bindings", std::move(bindings)}};
+}
+
 nlohmann::json featureSummaryJson(const PortState &state)
 {
    if (!state.featureSummary) {
@@ -75,6 +114,23 @@ nlohmann::json countersJson(const DropCounters &counters)
       doc[name] = value;
    }
    return doc;
+}
+
+std::string ipv6Text(const Ipv6PortState &state)
+{
+   std::string text = state.summaryText;
+   if (!text.empty() && text.back() != '\n') {
+      text += '\n';
+   }
+   text += "\nIPv6 bindings (" + std::to_string(state.bindings.size()) + ")\n";
+   if (!state.bindings.empty()) {
+      std::vector<std::vector<std::string>> rows{{"VLAN", "MAC", "IPv6", "method", "remaining"}};
+      for (const auto &b : state.bindings) {
+         rows.push_back({std::to_string(b.vlan), b.mac, b.ip, b.method, b.timeRemaining});
+      }
+      text += textTable(rows, "  ");
+   }
+   return text;
 }
 
 std::string textTable(const std::vector<std::vector<std::string>> &rows, const std::string &indent)

@@ -188,6 +188,32 @@ def ip_spoof():
     c.write()
 
 
+def unsolicited_reply():
+    """DHCPv6 Replies to the VM that answer no request of it: none pending, another transaction,
+    another client's DUID, another VLAN; then the matching one. Each offers an address."""
+    c = Capture("attack6-unsolicited-reply")
+    c.add(0.0, dad(VM_LL))
+    server = DHCP6OptServerId(duid=duid(GW_MAC))
+
+    def reply(trid, client_mac, addr, vlan=None):
+        l2 = Ether(src=GW_MAC, dst=VM_MAC)
+        if vlan is not None:
+            l2 = l2 / Dot1Q(vlan=vlan)
+        return l2 / IPv6(src=GW_LL, dst=VM_LL) / UDP(sport=547, dport=546) / DHCP6_Reply(trid=trid) / \
+            DHCP6OptClientId(duid=duid(client_mac)) / server / ia(addr)
+    c.add(1.0, reply(0x6c0001, VM_MAC, "2001:db8:1::61"))
+    c.add(2.0, from_vm(VM_LL, ALL_DHCP, UDP(sport=546, dport=547) / DHCP6_Request(trid=0x6c0002) /
+                       DHCP6OptClientId(duid=duid(VM_MAC)) / server / ia(VM_IP, 0, 0)))
+    c.add(2.001, reply(0x6c0003, VM_MAC, "2001:db8:1::62"))
+    c.add(2.002, reply(0x6c0002, HOST_MAC, "2001:db8:1::63"))
+    c.add(2.003, reply(0x6c0002, VM_MAC, "2001:db8:1::64", vlan=100))
+    c.add(2.004, reply(0x6c0002, VM_MAC, VM_IP))
+    udp = UDP(sport=40000, dport=40001) / Raw(b"payload")
+    for k, src in enumerate(["2001:db8:1::61", "2001:db8:1::62", "2001:db8:1::63", "2001:db8:1::64", VM_IP]):
+        c.add(3.0 + 0.1 * k, from_vm(src, HOST_IP, udp, dmac=HOST_MAC))
+    c.write()
+
+
 def address_flood(limit=64):
     """Claims for limit+2 addresses, 4 a second (under any ND rate limit): with the two
     bindings of the VM's start the port holds limit+4, so its 4 oldest go."""
@@ -219,5 +245,5 @@ def nd_flood():
 
 if __name__ == "__main__":
     os.makedirs(OUT, exist_ok=True)
-    for make in (ra_guard, dhcpv6_server, nd_spoof, ip_spoof, address_flood, nd_flood):
+    for make in (ra_guard, dhcpv6_server, nd_spoof, ip_spoof, unsolicited_reply, address_flood, nd_flood):
         make()

@@ -1,8 +1,9 @@
-// Every committed capture replayed under the two port settings of the
-// manifest (learning: a new port's defaults; enforcing: examples/enforcing.json),
+// Every committed capture replayed under the three port settings of the
+// manifest (learning: a new port's defaults; enforcing: examples/enforcing.json;
+// dual-stack: examples/dual-stack.json, the IPv6 agent behind the IPv4 one),
 // checked against the expectations an independent model computed from the
 // frames: which frames are dropped, the events in order, the final
-// database and the drop counters.
+// bindings and the drop counters.
 #include "replay_support.h"
 
 #include "replay/engine.h"
@@ -67,7 +68,17 @@ const json &settingFor(const json &entry, const std::string &setting)
 
 bool authoritativeMethod(const std::string &method)
 {
-   return method == "DHCP Snooping" || method == "Static";
+   return method == "DHCP Snooping" || method == "Static" || method == "DHCPv6";
+}
+
+// Both agents' drop counters, the IPv4 agent's first.
+session::DropCounters allCounters(const replay::PortResult &port)
+{
+   session::DropCounters counters = port.counters;
+   if (port.ipv6) {
+      counters.insert(port.ipv6->counters.begin(), port.ipv6->counters.end());
+   }
+   return counters;
 }
 
 using Event = std::tuple<uint64_t, std::string, uint16_t, std::string, std::string, bool>;
@@ -93,8 +104,8 @@ protected:
       options.capturePath = capture.string();
       options.batch = batch;
       options.reasons = reasons;
-      if (c.setting == "enforcing") {
-         options.config = session::loadConfigFile((sourceDir() / "examples/enforcing.json").string());
+      if (c.setting != "learning") {
+         options.config = session::loadConfigFile((sourceDir() / "examples" / (c.setting + ".json")).string());
       }
       return replay::runReplay(options);
    }
@@ -115,6 +126,15 @@ TEST(ManifestSettings, the_shipped_configurations_are_the_manifests_settings)
       EXPECT_EQ(config.errRateLimit, expected["errRateLimit"].get<uint32_t>()) << name;
       EXPECT_EQ(config.errRateLimitPeriod, expected["errRateLimitPeriod"].get<uint32_t>()) << name;
    }
+   const json &dual = settingFor(entry, "dual-stack");
+   const auto ipv6 = session::loadConfigFile((sourceDir() / "examples/dual-stack.json").string()).ipv6;
+   ASSERT_TRUE(ipv6.has_value());
+   EXPECT_EQ(ipv6->features, dual["ipv6"]["featuresEnabled"].get<uint32_t>());
+   EXPECT_EQ(ipv6->trusted, dual["ipv6"]["trusted"].get<int>() != 0);
+   EXPECT_EQ(ipv6->bindingLimit, dual["ipv6"]["bindingLimit"].get<uint32_t>());
+   EXPECT_EQ(ipv6->ndRateLimit, dual["ipv6"]["ndRateLimit"].get<uint32_t>());
+   EXPECT_EQ(ipv6->errRateLimit, dual["ipv6"]["errRateLimit"].get<uint32_t>());
+   EXPECT_EQ(ipv6->errRateLimitPeriod, dual["ipv6"]["errRateLimitPeriod"].get<uint32_t>());
    // Learning is what a new port starts with, so replays without --config match it too.
    EXPECT_EQ(session::configRecord(session::PortSecurityConfig{}),
              session::configRecord(session::loadConfigFile((sourceDir() / "examples/learning.json").string())));
@@ -155,16 +175,24 @@ TEST_P(ManifestReplay, verdicts_events_database_and_counters_match_the_manifest)
    for (const auto &b : result.ports[0].portDb) {
       bindings.emplace(b.vlan, b.mac, b.ip, b.method, b.method == "DHCP Snooping" ? b.leaseTime : "");
    }
+   if (result.ports[0].ipv6) {
+      for (const auto &b : result.ports[0].ipv6->bindings) {
+         bindings.emplace(b.vlan, b.mac, b.ip, b.method, "");
+      }
+   }
    std::multiset<Binding> expectedBindings;
    for (const auto &b : expected["bindings"]) {
       const std::string method = b["method"];
       expectedBindings.emplace(b["vlan"], b["mac"], b["ip"], method,
                                method == "DHCP Snooping" ? std::to_string(b["leaseSeconds"].get<int>()) : "");
    }
+   for (const auto &b : expected.value("ipv6Bindings", json::array())) {
+      expectedBindings.emplace(b["vlan"], b["mac"], b["ip"], b["method"], "");
+   }
    EXPECT_EQ(bindings, expectedBindings);
 
    std::map<std::string, uint64_t, std::less<>> counters;
-   for (const auto &[name, value] : result.ports[0].counters) {
+   for (const auto &[name, value] : allCounters(result.ports[0])) {
       if (value != 0) {
          counters[name] = value;
       }
@@ -213,6 +241,17 @@ TEST_P(ManifestReplay, every_dropped_frame_has_the_reason_the_manifest_names_and
        "DHCP snooping: chaddr mismatch"},
       {"DHCPACK answers no pending request of the port", "DHCP snooping: unanswered ACK"},
       {"IP source guard: source MAC/IP not bound on its VLAN (ipSrcGuardDropCnt)", "IP source guard"},
+      {"IPv6 header chain malformed, over its limits or not in the first fragment (headerChainDropCnt)",
+       "IPv6 header chain"},
+      {"fragmented ND or RA from the VM (fragmentedNdDropCnt)", "Fragmented ND or RA"},
+      {"RA guard: router advertisement or redirect from the VM (raGuardDropCnt)", "RA guard"},
+      {"DHCPv6 guard: server message from the VM (dhcpv6GuardDropCnt)", "DHCPv6 guard"},
+      {"IPv6 source guard: source MAC/address not bound on its VLAN (or unspecified outside DAD, MLD, RS) "
+       "(sourceGuardDropCnt)", "IPv6 source guard"},
+      {"ND inspection: source, target or link-layer address option not the VM's, or malformed "
+       "(ndInspectionDropCnt)", "ND inspection"},
+      {"ND rate limit exceeded, port enters the error-rate-limit state (ndRateLimitDropCnt)", "ND rate limit"},
+      {"ND error-rate-limit state (ndRateLimitDropCnt)", "ND rate limit: error state"},
    };
    const replay::ReplayResult result = replayCase(32, true);
    std::map<uint64_t, std::string> reasons;
@@ -230,15 +269,23 @@ TEST_P(ManifestReplay, every_dropped_frame_has_the_reason_the_manifest_names_and
    }
    EXPECT_EQ(reasons, expectedReasons);
 
-   auto counter = [&result](const char *name) {
-      const auto found = result.ports[0].counters.find(name);
-      return found != result.ports[0].counters.end() ? found->second : 0;
+   const session::DropCounters all = allCounters(result.ports[0]);
+   auto counter = [&all](const char *name) {
+      const auto found = all.find(name);
+      return found != all.end() ? found->second : 0;
    };
    EXPECT_EQ(perReason["DAI"], counter("daiDropCnt"));
    EXPECT_EQ(perReason["IP source guard"], counter("ipSrcGuardDropCnt"));
    EXPECT_EQ(perReason["DHCP snooping: chaddr mismatch"], counter("dhcpSnoopingDropCnt"));
    EXPECT_EQ(perReason["ARP rate limit"] + perReason["ARP rate limit: error state"],
              counter("txRateLimitDropCnt") + counter("rxRateLimitDropCnt"));
+   for (const auto &[reason, name] : {std::pair{"IPv6 header chain", "headerChainDropCnt"},
+                                      {"Fragmented ND or RA", "fragmentedNdDropCnt"}, {"RA guard", "raGuardDropCnt"},
+                                      {"DHCPv6 guard", "dhcpv6GuardDropCnt"}, {"IPv6 source guard", "sourceGuardDropCnt"},
+                                      {"ND inspection", "ndInspectionDropCnt"}}) {
+      EXPECT_EQ(perReason[reason], counter(name)) << reason;
+   }
+   EXPECT_EQ(perReason["ND rate limit"] + perReason["ND rate limit: error state"], counter("ndRateLimitDropCnt"));
 }
 
 std::string caseName(const ::testing::TestParamInfo<Case> &info)

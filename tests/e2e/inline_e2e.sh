@@ -177,7 +177,8 @@ grep -q "refused" "$work/config.out" || fail "refusal not shown: $(cat "$work/co
 echo '{"features": [' >"$work/vm1.json"
 kill -HUP "$inline_pid"
 wait_for 5 grep -q "vm1: .*keeps its configuration" "$work/inline.log" || fail "a bad file on SIGHUP was not reported"
-sw_ctl log --json | grep -q "keeps its configuration" || fail "ctl log lacks the SIGHUP report"
+# The daemon writes the line to stderr before its log ring: wait for the ring too.
+wait_for 5 bash -c 'sw_ctl log --json | grep -q "keeps its configuration"' || fail "ctl log lacks the SIGHUP report"
 sw_ctl summary vm1 --json | json "d['fields']['portMode']" | grep -qx Untrusted || fail "SIGHUP changed the port"
 in_ns "$vm1" ping -c 1 -W 2 192.0.2.1 >/dev/null || fail "vm1 lost traffic after SIGHUP"
 

@@ -529,9 +529,9 @@ def parse_dhcpv6(msg):
 
 
 FHS_FIRST = "First come first served"
-RULE_CHAIN = "IPv6 header chain malformed, over its limits or not in the first fragment"
-RULE_SOURCE = "IPv6 source guard: source MAC/address not bound on its VLAN (or unspecified outside DAD, MLD, RS)"
-RULE_ND = "ND inspection: source, target or link-layer address option not the VM's, or malformed"
+RULE_CHAIN = "IPv6 header chain malformed, too long or cut by a fragment"
+RULE_SOURCE = "IPv6 source guard: source not bound on its VLAN"
+RULE_ND = "ND inspection: an address or link-layer option not the VM's"
 
 
 class Fhs:

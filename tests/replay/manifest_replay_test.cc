@@ -241,15 +241,12 @@ TEST_P(ManifestReplay, every_dropped_frame_has_the_reason_the_manifest_names_and
        "DHCP snooping: chaddr mismatch"},
       {"DHCPACK answers no pending request of the port", "DHCP snooping: unanswered ACK"},
       {"IP source guard: source MAC/IP not bound on its VLAN (ipSrcGuardDropCnt)", "IP source guard"},
-      {"IPv6 header chain malformed, over its limits or not in the first fragment (headerChainDropCnt)",
-       "IPv6 header chain"},
+      {"IPv6 header chain malformed, too long or cut by a fragment (headerChainDropCnt)", "IPv6 header chain"},
       {"fragmented ND or RA from the VM (fragmentedNdDropCnt)", "Fragmented ND or RA"},
       {"RA guard: router advertisement or redirect from the VM (raGuardDropCnt)", "RA guard"},
       {"DHCPv6 guard: server message from the VM (dhcpv6GuardDropCnt)", "DHCPv6 guard"},
-      {"IPv6 source guard: source MAC/address not bound on its VLAN (or unspecified outside DAD, MLD, RS) "
-       "(sourceGuardDropCnt)", "IPv6 source guard"},
-      {"ND inspection: source, target or link-layer address option not the VM's, or malformed "
-       "(ndInspectionDropCnt)", "ND inspection"},
+      {"IPv6 source guard: source not bound on its VLAN (sourceGuardDropCnt)", "IPv6 source guard"},
+      {"ND inspection: an address or link-layer option not the VM's (ndInspectionDropCnt)", "ND inspection"},
       {"ND rate limit exceeded, port enters the error-rate-limit state (ndRateLimitDropCnt)", "ND rate limit"},
       {"ND error-rate-limit state (ndRateLimitDropCnt)", "ND rate limit: error state"},
    };

@@ -3,7 +3,8 @@
  * security property, the set-features ioctl and the saved state.
  *
  * A packed record in the host's byte order: a 26-byte header followed by
- * `numStatic` 12-byte static entries (SwSecVmiKey, vmi_key.h).
+ * `numStatic` 12-byte static entries (SwSecVmiKey, vmi_key.h), and in
+ * version 2 the 18-byte frame guard block.
  *
  * Wire contract: freestanding, shared by the module and the tools.
  */
@@ -65,4 +66,40 @@ static_assert(offsetof(SwSecConfig, errRateLimitPeriod) == 22);
 constexpr uint64_t SwSecConfigLength(uint32_t numStatic)
 {
    return sizeof(SwSecConfig) + sizeof(SwSecVmiKey) * static_cast<uint64_t>(numStatic);
+}
+
+/*
+ * Version 2 appends a frame guard block after the static entries: what a
+ * VM may send besides what the features check. A version-1 record means
+ * the block's defaults: tags the VM stacks inside its port's VLAN dropped,
+ * every ethertype allowed.
+ */
+constexpr uint8_t SWSEC_CONFIG_VERSION_FRAME_GUARD = 2;
+constexpr uint8_t SWSEC_CONFIG_VERSION_MAX = SWSEC_CONFIG_VERSION_FRAME_GUARD;
+constexpr uint32_t SWSEC_ETHERTYPES_MAX = 8;
+
+/* Frame guard flags. */
+constexpr uint8_t SwSecFrameGuardAllowTagged = 0x01u;   /* the VM may send tagged frames */
+
+struct __attribute__((packed)) SwSecFrameGuard {
+   uint8_t flags;
+   uint8_t numEtherTypes;                        /* 0: every ethertype; at most SWSEC_ETHERTYPES_MAX */
+   uint16_t etherTypes[SWSEC_ETHERTYPES_MAX];    /* host order; the first numEtherTypes are the list */
+};
+
+static_assert(sizeof(SwSecFrameGuard) == 18);
+static_assert(offsetof(SwSecFrameGuard, flags) == 0);
+static_assert(offsetof(SwSecFrameGuard, numEtherTypes) == 1);
+static_assert(offsetof(SwSecFrameGuard, etherTypes) == 2);
+
+/* Whether a record of `version` carries the frame guard block. */
+constexpr bool SwSecConfigHasFrameGuard(uint8_t version)
+{
+   return version == SWSEC_CONFIG_VERSION_FRAME_GUARD;
+}
+
+/* Bytes of a record of `version` with `numStatic` entries. */
+constexpr uint64_t SwSecConfigRecordLength(uint8_t version, uint32_t numStatic)
+{
+   return SwSecConfigLength(numStatic) + (SwSecConfigHasFrameGuard(version) ? sizeof(SwSecFrameGuard) : 0u);
 }

@@ -6,6 +6,7 @@
 
 #include "contract/config_record.h"
 
+#include <algorithm>
 #include <array>
 #include <cstdint>
 #include <cstring>
@@ -28,13 +29,18 @@ struct PortSecurityConfig {
    uint32_t errRateLimit = 0;
    uint32_t errRateLimitPeriod = 0;
    std::vector<StaticBinding> statics;
+   // The frame guard: tagged frames from the VM (dropped unless allowed)
+   // and the ethertypes it may send (empty: any; at most SWSEC_ETHERTYPES_MAX).
+   bool allowTagged = false;
+   std::vector<uint16_t> etherTypes;
 };
 
-// The packed record: header, then one 12-byte entry per static binding.
+// The packed record (version 2): header, one 12-byte entry per static
+// binding, then the frame guard block.
 inline std::vector<uint8_t> configRecord(const PortSecurityConfig &config)
 {
    SwSecConfig header{};
-   header.version = SWSEC_CONFIG_VERSION;
+   header.version = SWSEC_CONFIG_VERSION_FRAME_GUARD;
    header.featuresEnabled = config.features;
    header.trusted = config.trusted ? 1 : 0;
    header.portDbSize = config.portDbSize;
@@ -42,7 +48,7 @@ inline std::vector<uint8_t> configRecord(const PortSecurityConfig &config)
    header.arpRateLimit = config.arpRateLimit;
    header.errRateLimit = config.errRateLimit;
    header.errRateLimitPeriod = config.errRateLimitPeriod;
-   std::vector<uint8_t> bytes(SwSecConfigLength(header.numStatic));
+   std::vector<uint8_t> bytes(SwSecConfigRecordLength(header.version, header.numStatic));
    std::memcpy(bytes.data(), &header, sizeof header);
    uint8_t *entry = bytes.data() + sizeof header;
    for (const auto &binding : config.statics) {
@@ -55,6 +61,15 @@ inline std::vector<uint8_t> configRecord(const PortSecurityConfig &config)
       std::memcpy(entry, &key, sizeof key);
       entry += sizeof key;
    }
+   // A list longer than the block holds is written whole in its count, for
+   // the module to refuse, never cut short.
+   SwSecFrameGuard guard{};
+   guard.flags = config.allowTagged ? SwSecFrameGuardAllowTagged : 0;
+   guard.numEtherTypes = static_cast<uint8_t>(std::min<size_t>(config.etherTypes.size(), 0xff));
+   for (size_t i = 0; i < config.etherTypes.size() && i < SWSEC_ETHERTYPES_MAX; ++i) {
+      guard.etherTypes[i] = config.etherTypes[i];
+   }
+   std::memcpy(entry, &guard, sizeof guard);
    return bytes;
 }
 

@@ -6,8 +6,8 @@
  *
  * Packed and little-endian: a 96-byte fixed part, then `numSavedVmis`
  * 48-byte entries back to back, each DHCP Snooping entry followed by its
- * `clientIdLen` bytes of client identifier. The part sits in the blob of
- * contract/state_blob.h.
+ * `clientIdLen` bytes of client identifier, then the 40-byte frame guard
+ * block. The part sits in the blob of contract/state_blob.h.
  *
  * Wire contract: freestanding, shared by the module and the tools.
  */
@@ -86,6 +86,25 @@ static_assert(offsetof(SwSecSavedVmi, reserved3) == 32);
 static_assert(offsetof(SwSecSavedVmi, serverIp) == 40);
 static_assert(offsetof(SwSecSavedVmi, leaseTime) == 44);
 
-/* The largest part: 32 entries, each with a 255-byte client identifier. */
-constexpr uint64_t SWSEC_SAVED_STATE_MAX_LEN = sizeof(SwSecSavedState) + 32u * (sizeof(SwSecSavedVmi) + 255u);
-static_assert(SWSEC_SAVED_STATE_MAX_LEN == 9792);
+/*
+ * After the entries: the frame guard and its drop counters. A part that
+ * ends with the entries (saved before the block existed) restores the
+ * defaults, unless its configuration is version 2, which needs the block.
+ */
+struct __attribute__((packed)) SwSecSavedFrameGuard {
+   SwSecFrameGuard guard;
+   uint8_t reserved[6];
+   uint64_t taggedDropCnt;
+   uint64_t etherTypeDropCnt;
+};
+
+static_assert(sizeof(SwSecSavedFrameGuard) == 40);
+static_assert(offsetof(SwSecSavedFrameGuard, guard) == 0);
+static_assert(offsetof(SwSecSavedFrameGuard, reserved) == 18);
+static_assert(offsetof(SwSecSavedFrameGuard, taggedDropCnt) == 24);
+static_assert(offsetof(SwSecSavedFrameGuard, etherTypeDropCnt) == 32);
+
+/* The largest part: 32 entries, each with a 255-byte client identifier, and the frame guard. */
+constexpr uint64_t SWSEC_SAVED_STATE_MAX_LEN =
+   sizeof(SwSecSavedState) + 32u * (sizeof(SwSecSavedVmi) + 255u) + sizeof(SwSecSavedFrameGuard);
+static_assert(SWSEC_SAVED_STATE_MAX_LEN == 9832);

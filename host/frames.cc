@@ -27,7 +27,6 @@ namespace {
 constexpr uint64_t kFrameMagic = 0x7266'7473'6f68'6673ull;      // a live frame
 constexpr uint64_t kReleasedMagic = 0x6473'6172'6665'6c72ull;   // released, its list not yet given back
 constexpr uint64_t kIterMagic = 0x7265'7469'7473'6f68ull;       // a started iterator
-constexpr uint16_t kEtherVlan = 0x8100;
 // Poisoned bytes around every buffer of a list's arena.
 constexpr size_t kRedZone = 32;
 // Each element owns a 4 GiB slot of its list's machine address range.
@@ -366,11 +365,18 @@ std::unique_ptr<FrameList> FrameStore::build(std::span<const FrameInput> inputs,
       shape.bytes = input.bytes;
       shape.vlanId = input.vlanId;
       const auto &bytes = input.bytes;
-      if (input.untag && bytes.size() >= 18 && ((bytes[12] << 8) | bytes[13]) == kEtherVlan) {
-         shape.vlanId = static_cast<uint16_t>(((bytes[14] << 8) | bytes[15]) & 0x0fff);
-         auto &copy = untagged.emplace_back(bytes.begin(), bytes.begin() + 12);
-         copy.insert(copy.end(), bytes.begin() + 16, bytes.end());
-         shape.bytes = copy;
+      if (input.untag) {
+         const std::optional<uint16_t> outer = outerTagVlan(bytes);
+         const size_t untaggedLen = bytes.size() - (outer ? kVlanTagLen : 0);
+         if (outer || switchPaddedLength(untaggedLen) != untaggedLen) {
+            auto &copy = untagged.emplace_back(bytes.begin(), bytes.end());
+            if (outer) {
+               shape.vlanId = *outer;
+               copy.erase(copy.begin() + 12, copy.begin() + 12 + kVlanTagLen);
+            }
+            copy.resize(switchPaddedLength(copy.size()), 0);
+            shape.bytes = copy;
+         }
       }
       if (shape.bytes.size() > UINT32_MAX) {
          throw std::invalid_argument("frame too long");

@@ -1,17 +1,18 @@
 #include "host/header_lookup.h"
 
+#include "contract/frame_walk.h"
+
+#include <algorithm>
+
 namespace swsec::host {
 
 namespace {
 
 constexpr uint16_t kEtherIpv4 = 0x0800;
 constexpr uint16_t kEtherArp = 0x0806;
-constexpr uint16_t kEtherVlan = 0x8100;
 constexpr uint16_t kEtherIpv6 = 0x86dd;
 // Values up to this are an 802.3 length, not an ethertype.
 constexpr uint16_t kMax8023Length = 1500;
-constexpr uint32_t kEthernetLen = 14;
-constexpr uint32_t kVlanTagLen = 4;
 constexpr uint32_t kArpLen = 28;
 constexpr uint32_t kIpv6Len = 40;
 constexpr uint32_t kUdpLen = 8;
@@ -22,16 +23,6 @@ constexpr uint8_t kProtoUdp = 17;
 uint16_t loadBigEndian16(std::span<const uint8_t> frame, uint32_t offset)
 {
    return static_cast<uint16_t>((frame[offset] << 8) | frame[offset + 1]);
-}
-
-// The two bytes as a u16 read from memory: network order kept.
-uint16_t loadRaw16(std::span<const uint8_t> frame, uint32_t offset)
-{
-   uint16_t value = 0;
-   auto *out = reinterpret_cast<uint8_t *>(&value);
-   out[0] = frame[offset];
-   out[1] = frame[offset + 1];
-   return value;
 }
 
 orr_PktHeaderEntry entryOf(uint32_t offset, uint32_t length, uint16_t nextProto)
@@ -50,22 +41,18 @@ bool fits(std::span<const uint8_t> frame, uint32_t offset, uint32_t length)
 FrameHeaders findHeaders(std::span<const uint8_t> frame)
 {
    FrameHeaders headers;
-   if (!fits(frame, 0, kEthernetLen)) {
+   // The module's own walk: tags left in the bytes (beyond the one the
+   // switch took into the metadata) belong to the layer-2 header, and the
+   // ethertype is the one after them. A stack not walked to its end leaves
+   // a TPID there, and nothing further is found.
+   SwSecL2Walk walk{};
+   const auto walkable = static_cast<uint32_t>(std::min<size_t>(frame.size(), 0xffff));
+   if (!SwSecWalkL2(frame.data(), walkable, &walk)) {
       return headers;
    }
-   // A tag left in the bytes (the switch did not untag) is part of the
-   // layer-2 header; the ethertype is the one after it.
-   uint32_t l2Len = kEthernetLen;
-   uint32_t typeOffset = 12;
-   if (loadBigEndian16(frame, typeOffset) == kEtherVlan) {
-      if (!fits(frame, 0, kEthernetLen + kVlanTagLen)) {
-         return headers;
-      }
-      l2Len += kVlanTagLen;
-      typeOffset += kVlanTagLen;
-   }
-   const uint16_t etherType = loadBigEndian16(frame, typeOffset);
-   headers.entries[ORR_PKT_LAYER_2] = entryOf(0, l2Len, loadRaw16(frame, typeOffset));
+   const uint32_t l2Len = walk.hdrLen;
+   const uint16_t etherType = walk.etherType;
+   headers.entries[ORR_PKT_LAYER_2] = entryOf(0, l2Len, walk.rawType);
    if (etherType <= kMax8023Length) {
       return headers;
    }
@@ -119,6 +106,14 @@ FrameHeaders findHeaders(std::span<const uint8_t> frame)
       }
    }
    return headers;
+}
+
+std::optional<uint16_t> outerTagVlan(std::span<const uint8_t> frame)
+{
+   if (frame.size() < kEthernetHeaderLen + kVlanTagLen || !SwSecIsTagTpid(loadBigEndian16(frame, 12))) {
+      return std::nullopt;
+   }
+   return static_cast<uint16_t>(loadBigEndian16(frame, 14) & 0x0fffu);
 }
 
 }  // namespace swsec::host

@@ -167,8 +167,9 @@ struct FrameSpec {
    std::vector<uint8_t> bytes;
    // VLAN ID metadata (orr_PktVlanIDGet).
    uint16_t vlanId = 0;
-   // Untag as a virtual switch does: an 802.1Q tag in the bytes is removed
-   // and its VLAN ID becomes the metadata (split applies to the result).
+   // Present it as a virtual switch does: an outer tag in the bytes (any
+   // TPID) is removed and its VLAN ID becomes the metadata, and a runt is
+   // padded to 60 bytes (split applies to the result).
    bool untag = false;
    std::vector<uint32_t> split;
    // The mapped length. Default: the first element's length, raised to the
@@ -184,7 +185,7 @@ struct FrameSpec {
 struct FrameView {
    std::span<const uint8_t> bytes;
    uint16_t vlanId = 0;
-   bool untag = false;
+   bool untag = false;   // as FrameSpec::untag
 };
 
 // Frames the host made and handed out as one list (orr_PktList). Destroying

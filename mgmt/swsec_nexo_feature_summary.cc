@@ -94,6 +94,29 @@ static void SwSecNexoFillRateLimits(SwSec_FeatureSummary *summary, const SwSecCo
                         ctx->counters.rxRateLimitDropCnt);
 }
 
+/* What the VM may send besides the features' checks, and what was dropped for it. */
+static void SwSecNexoFillFrameGuard(SwSec_FeatureSummary *summary, const SwSecContext *ctx)
+{
+   const SwSecFrameGuard &guard = ctx->frameGuard;
+   SwSecNexoSetText(summary->allowTagged, (guard.flags & SwSecFrameGuardAllowTagged) != 0 ? "Allowed" : "Dropped");
+   if (guard.numEtherTypes == 0) {
+      SwSecNexoSetText(summary->etherTypes, "Any");
+   } else {
+      /* "0x%04x" and a comma each: the whole list always fits. */
+      static_assert(SWSEC_ETHERTYPES_MAX * 7 < sizeof(SwSec_FeatureSummary::etherTypes));
+      size_t used = 0;
+      for (uint32_t i = 0; i < guard.numEtherTypes && i < SWSEC_ETHERTYPES_MAX; i++) {
+         used += static_cast<size_t>(orr_Sprintf(summary->etherTypes + used, sizeof summary->etherTypes - used,
+                                                 i == 0 ? "0x%04x" : ",0x%04x",
+                                                 static_cast<unsigned>(guard.etherTypes[i])));
+      }
+   }
+   SwSecNexoFormatCount(summary->taggedDropCnt, sizeof summary->taggedDropCnt,
+                        ctx->frameGuardCounters.taggedDropCnt);
+   SwSecNexoFormatCount(summary->etherTypeDropCnt, sizeof summary->etherTypeDropCnt,
+                        ctx->frameGuardCounters.etherTypeDropCnt);
+}
+
 orr_Status SwSecNexoFeatureSummaryGet(const Nexo_NodeDef *, const Nexo_ParamList *instanceArgs, void *output)
 {
    uint32_t portId = 0;
@@ -106,11 +129,12 @@ orr_Status SwSecNexoFeatureSummaryGet(const Nexo_NodeDef *, const Nexo_ParamList
    const uint32_t features = ctx->config.featuresEnabled;
 
    summary->version = ctx->config.version;
-   summary->highestSupportedVersion = SWSEC_CONFIG_VERSION;
+   summary->highestSupportedVersion = SWSEC_CONFIG_VERSION_MAX;
    summary->lowestSupportedVersion = SWSEC_CONFIG_VERSION;
    SwSecNexoFormatFeatures(summary->featuresEnabled, sizeof summary->featuresEnabled, features);
    SwSecNexoFillDiscovery(summary, ctx);
    SwSecNexoFillRateLimits(summary, ctx);
+   SwSecNexoFillFrameGuard(summary, ctx);
    if ((features & SwSecFeatureDai) != 0) {
       SwSecNexoFormatCount(summary->daiDropCnt, sizeof summary->daiDropCnt, ctx->counters.daiDropCnt);
    } else {

@@ -30,9 +30,14 @@ struct __attribute__((packed)) SwSec_FeatureSummary {
    char txRateLimitErrEntryCnt[128];
    char rxRateLimitDropCnt[128];
    uint8_t unused;
+   /* The frame guard, after the original record. */
+   char allowTagged[64];
+   char etherTypes[128];
+   char taggedDropCnt[128];
+   char etherTypeDropCnt[128];
 };
 
-static_assert(sizeof(SwSec_FeatureSummary) == 2436);
+static_assert(sizeof(SwSec_FeatureSummary) == 2884);
 static_assert(offsetof(SwSec_FeatureSummary, version) == 0);
 static_assert(offsetof(SwSec_FeatureSummary, highestSupportedVersion) == 1);
 static_assert(offsetof(SwSec_FeatureSummary, lowestSupportedVersion) == 2);
@@ -54,6 +59,10 @@ static_assert(offsetof(SwSec_FeatureSummary, txRateLimitErr) == 2115);
 static_assert(offsetof(SwSec_FeatureSummary, txRateLimitErrEntryCnt) == 2179);
 static_assert(offsetof(SwSec_FeatureSummary, rxRateLimitDropCnt) == 2307);
 static_assert(offsetof(SwSec_FeatureSummary, unused) == 2435);
+static_assert(offsetof(SwSec_FeatureSummary, allowTagged) == 2436);
+static_assert(offsetof(SwSec_FeatureSummary, etherTypes) == 2500);
+static_assert(offsetof(SwSec_FeatureSummary, taggedDropCnt) == 2628);
+static_assert(offsetof(SwSec_FeatureSummary, etherTypeDropCnt) == 2756);
 
 /* "Vmi summary" of one port database entry. */
 struct __attribute__((packed)) SwSec_VmiSummary {

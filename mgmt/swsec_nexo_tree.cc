@@ -49,6 +49,10 @@ static constexpr Nexo_FieldDef swsecNexoFeatureSummaryFields[] = {
    SIFRAGENERIC_NEXO_CHARS(SwSec_FeatureSummary, txRateLimitErr, "In error rate limit state"),
    SIFRAGENERIC_NEXO_CHARS(SwSec_FeatureSummary, txRateLimitErrEntryCnt, "Error rate limit entered "),
    SIFRAGENERIC_NEXO_CHARS(SwSec_FeatureSummary, rxRateLimitDropCnt, "Rx rate limit drop count "),
+   SIFRAGENERIC_NEXO_CHARS(SwSec_FeatureSummary, allowTagged, "Tagged frames from VM    "),
+   SIFRAGENERIC_NEXO_CHARS(SwSec_FeatureSummary, etherTypes, "Ethertypes from VM       "),
+   SIFRAGENERIC_NEXO_CHARS(SwSec_FeatureSummary, taggedDropCnt, "Tagged drop count        "),
+   SIFRAGENERIC_NEXO_CHARS(SwSec_FeatureSummary, etherTypeDropCnt, "Ethertype drop count     "),
 };
 
 static constexpr Nexo_RecordDef swsecNexoFeatureSummaryRecord =
@@ -72,7 +76,7 @@ static constexpr Nexo_FieldDef swsecNexoVmiSummaryFields[] = {
 static constexpr Nexo_RecordDef swsecNexoVmiSummaryRecord =
    SIFRAGENERIC_NEXO_RECORD(SwSec_VmiSummary, "SwSec_VmiSummary", "Vmi summary", swsecNexoVmiSummaryFields);
 
-static_assert(SifraGenericCountOf(swsecNexoFeatureSummaryFields) == 20);
+static_assert(SifraGenericCountOf(swsecNexoFeatureSummaryFields) == 24);
 static_assert(SifraGenericCountOf(swsecNexoVmiSummaryFields) == 10);
 static_assert(sizeof(SwSec_VmiSummary::discoveryMethod) == 4);
 

@@ -29,7 +29,8 @@ RULES = {
     "fhs/": ["swsec/", "framework/", "platform/", "contract/"],
     "mgmt/": ["swsec/", "fhs/", "framework/", "platform/", "contract/"],
     "module/": MODULE + ["platform/", "contract/"],
-    "host/": ["platform/"],
+    # The host walks tags as the module does: one walk for both.
+    "host/": ["platform/", "contract/frame_walk.h"],
     "bpf/": ["contract/"],
     # The tool's wings, downward only.
     "tools/session/": ["contract/", "platform/", "host/"],

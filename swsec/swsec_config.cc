@@ -34,14 +34,37 @@ bool SwSecConfigIsValid(const SwSecContext *ctx, const SwSecConfig *config)
    return true;
 }
 
+bool SwSecFrameGuardIsValid(const SwSecContext *ctx, const SwSecFrameGuard *guard)
+{
+   if (guard->numEtherTypes > SWSEC_ETHERTYPES_MAX) {
+      SG_LOG(ORR_LOG_ERROR, "%s: Invalid frame guard config: %u ethertypes (at most %u)",
+             ctx->filter->name, static_cast<unsigned>(guard->numEtherTypes), SWSEC_ETHERTYPES_MAX);
+      return false;
+   }
+   return true;
+}
+
+SwSecFrameGuard SwSecConfigFrameGuard(const SwSecConfig *config)
+{
+   SwSecFrameGuard guard;
+   orr_Memset(&guard, 0, sizeof(guard));
+   if (SwSecConfigHasFrameGuard(config->version)) {
+      const auto *record = reinterpret_cast<const uint8_t *>(config);
+      orr_Memcpy(&guard, record + SwSecConfigLength(config->numStatic), sizeof(guard));
+   }
+   return guard;
+}
+
 static void SwSecClearDropCounters(SwSecContext *ctx)
 {
    orr_Memset(&ctx->counters, 0, sizeof(ctx->counters));
+   orr_Memset(&ctx->frameGuardCounters, 0, sizeof(ctx->frameGuardCounters));
 }
 
 orr_Status SwSecConfigFeatures(SwSecContext *ctx, const SwSecConfig *config)
 {
-   if (!SwSecConfigIsValid(ctx, config)) {
+   const SwSecFrameGuard guard = SwSecConfigFrameGuard(config);
+   if (!SwSecConfigIsValid(ctx, config) || !SwSecFrameGuardIsValid(ctx, &guard)) {
       return ORR_BAD_PARAM;
    }
    const orr_Status status = SwSecConfigPortDb(ctx, config);
@@ -54,6 +77,7 @@ orr_Status SwSecConfigFeatures(SwSecContext *ctx, const SwSecConfig *config)
    ctx->config.arpRateLimit = config->arpRateLimit;
    ctx->config.errRateLimit = config->errRateLimit;
    ctx->config.errRateLimitPeriod = config->errRateLimitPeriod;
+   ctx->frameGuard = guard;
 
    /*
     * No frame is judged while configLock is held exclusive, so the limiters

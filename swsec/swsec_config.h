@@ -12,9 +12,18 @@
  */
 bool SwSecConfigIsValid(const SwSecContext *ctx, const SwSecConfig *config);
 
+/* Checks a frame guard block (the length of its list); logs a refusal. */
+bool SwSecFrameGuardIsValid(const SwSecContext *ctx, const SwSecFrameGuard *guard);
+
 /*
- * Validates and applies a configuration record (header and its numStatic
- * static entries, all readable). ORR_BAD_PARAM for an invalid combination
+ * The frame guard block of a whole record: after the static entries in
+ * version 2; the defaults (all zero) for a record without one.
+ */
+SwSecFrameGuard SwSecConfigFrameGuard(const SwSecConfig *config);
+
+/*
+ * Validates and applies a configuration record (header, its numStatic
+ * static entries and, in version 2, the frame guard block, all readable). ORR_BAD_PARAM for an invalid combination
  * or range, or the port database's refusal; on any failure the active
  * configuration, database, limiters and counters are as they were. An
  * accepted record clears the drop counters. configLock held exclusive.

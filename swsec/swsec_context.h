@@ -38,6 +38,12 @@ struct SifraGenericRateLimit {
    uint32_t count;           /* events in the current interval */
 };
 
+/* Drops of the frame guard, beside the block above (saved after it, cleared with it). */
+struct SwSecFrameGuardCounters {
+   uint64_t taggedDropCnt;       /* a frame from the VM with a tag inside its port's VLAN */
+   uint64_t etherTypeDropCnt;    /* a frame from the VM whose ethertype is not in the list */
+};
+
 struct SwSecContext {
    SifraGenericFilter *filter;         /* owner; its agentData points back here */
    /* The active header; numStatic is the live count of static VMIs. */
@@ -64,6 +70,8 @@ struct SwSecContext {
 
    /* Cleared and saved whole; raised by frames judged in parallel, so with atomic adds. */
    SwSecDropCounters counters;
+   SwSecFrameGuard frameGuard;         /* the active frame guard (defaults for a version-1 record) */
+   SwSecFrameGuardCounters frameGuardCounters;
 
    orr_Timer portDbTimer;              /* periodic 10 s, SwSecTimerCb; 0 when none */
    uint8_t keepPortDbHash;             /* during a reconfiguration: park, don't free */

@@ -39,14 +39,16 @@ void SwSecIoctlSetFeatures(SifraGenericFilter *filter, SwSecContext *ctx, uint32
 
    /*
     * The record is read only as far as the payload holds it: a payload
-    * shorter than its header, or than the static entries its header
-    * announces (counted in 64 bits), is refused like an invalid record.
+    * shorter than its header, or than the static entries (and the frame
+    * guard block of a version-2 record) its header announces (counted in
+    * 64 bits), is refused like an invalid record.
     */
    uint32_t accepted = 0;
    const uint64_t recordRoom = payloadSize - SWSEC_IOCTL_TYPE_LEN;
    const uint8_t *record = payload + SWSEC_IOCTL_TYPE_LEN;
    if (recordRoom < sizeof(SwSecConfig) ||
-       recordRoom < SwSecConfigLength(SwSecLoadHost32(record + offsetof(SwSecConfig, numStatic)))) {
+       recordRoom < SwSecConfigRecordLength(record[offsetof(SwSecConfig, version)],
+                                            SwSecLoadHost32(record + offsetof(SwSecConfig, numStatic)))) {
       SG_LOG(ORR_LOG_ERROR, "%s: Set features payload of %lu bytes is shorter than its record",
              filter->name, static_cast<unsigned long>(payloadSize));
    } else {

@@ -1,6 +1,7 @@
 /* The per-packet security policy and the ARP rate limiter. */
 #include "swsec/swsec_policy.h"
 
+#include "contract/frame_walk.h"
 #include "swsec/swsec_ip_discovery.h"
 #include "swsec/swsec_port_db.h"
 #include "swsec/swsec_wire.h"
@@ -22,7 +23,6 @@ constexpr uint8_t kStpMac[6] = {0x01, 0x80, 0xc2, 0x00, 0x00, 0x00};
 constexpr uint8_t kPvstMac[6] = {0x01, 0x00, 0x0c, 0xcc, 0xcc, 0xcd};
 
 constexpr uint32_t kEthSrcMacOffset = 6;
-constexpr uint32_t kEthTypeOffset = 12;
 constexpr uint32_t kIpv4SrcOffset = 12;
 constexpr uint32_t kUdpSrcPortOffset = 0;
 constexpr uint32_t kUdpDstPortOffset = 2;
@@ -97,6 +97,34 @@ bool SwSecArpSenderUnknown(SwSecContext *ctx, const SwSecPktInfo *info)
    return SwSecFindVmi(ctx, info->vlanId, arp + kArpSenderMacOffset, senderIp) == nullptr;
 }
 
+/*
+ * The frame guard on a frame from the VM: true when it is dropped (and
+ * counted). A tag in the bytes sits inside the VLAN the switch gave the
+ * port; unless the port allows tagged frames it is dropped, and so is a
+ * stack the walk could not see the end of, allowed or not. With an
+ * ethertype list, the type after the tags must be in it: an 802.3 length
+ * (LLC/SNAP) or a type nobody listed does not get round the checks.
+ */
+bool SwSecFrameGuardDrops(SwSecContext *ctx, const SwSecPktInfo *info, uint16_t etherType)
+{
+   const SwSecFrameGuard &guard = ctx->frameGuard;
+   if (SwSecIsTagTpid(SwSecLoadBe16(info->ethHdr + SWSEC_ETH_TYPE_OFFSET)) &&
+       ((guard.flags & SwSecFrameGuardAllowTagged) == 0 || SwSecIsTagTpid(etherType))) {
+      SwSecCountDrop(&ctx->frameGuardCounters.taggedDropCnt);
+      return true;
+   }
+   if (guard.numEtherTypes == 0) {
+      return false;
+   }
+   for (uint32_t i = 0; i < guard.numEtherTypes && i < SWSEC_ETHERTYPES_MAX; i++) {
+      if (guard.etherTypes[i] == etherType) {
+         return false;
+      }
+   }
+   SwSecCountDrop(&ctx->frameGuardCounters.etherTypeDropCnt);
+   return true;
+}
+
 }  // namespace
 
 bool SifraGenericRateLimitReached(SifraGenericRateLimit *rateLimit)
@@ -116,8 +144,15 @@ orr_Status SwSecProcessPkt(SwSecContext *ctx, orr_Pkt *pkt, SwSecPktInfo *info,
 {
    const uint32_t features = ctx->config.featuresEnabled;
    const uint8_t *eth = info->ethHdr;
-   const bool isArp = SwSecLoadBe16(eth + kEthTypeOffset) == kEtherTypeArp;
+   /* The type after any tags, where the header lookup found the next header. */
+   const uint16_t etherType = SwSecNetToHost16(info->ethEntry->nextProto);
+   const bool isArp = etherType == kEtherTypeArp;
    *verdict = SwSecVerdictPass;
+
+   if (direction == SwSecDirectionTx && SwSecFrameGuardDrops(ctx, info, etherType)) {
+      *verdict = SwSecVerdictDrop;
+      return ORR_OK;
+   }
 
    if ((features & SwSecFeatureDai) != 0) {
       if (ctx->config.arpRateLimit != 0) {

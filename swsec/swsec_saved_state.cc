@@ -35,22 +35,23 @@ uint64_t SwSecGetSavedStateLen(SifraGenericFilter *filter)
       return 0;
    }
    orr_SpinlockReadLock(ctx->configLock);
-   /* At most 9792: the sum cannot overflow 32 bits. */
+   /* At most 9832: the sum cannot overflow 32 bits. */
    const uint32_t length = static_cast<uint32_t>(sizeof(SwSecSavedState)) +
                            static_cast<uint32_t>(sizeof(SwSecSavedVmi)) * ctx->numVmiEntries +
-                           ctx->totalClientIdLen;
+                           ctx->totalClientIdLen + static_cast<uint32_t>(sizeof(SwSecSavedFrameGuard));
    orr_SpinlockReadUnlock(ctx->configLock);
    return length;
 }
 
 /*
  * Writes the entries in list order after the fixed part, as many as fit
- * in `agentLen`; returns how many. configLock held shared.
+ * in `agentLen`; returns how many, and in `*end` where they end.
+ * configLock held shared.
  */
-static uint32_t SwSecSavePortDb(SwSecContext *ctx, uint8_t *part, uint64_t agentLen)
+static uint32_t SwSecSavePortDb(SwSecContext *ctx, uint8_t *part, uint64_t agentLen, uint64_t *end)
 {
    uint32_t numSaved = 0;
-   uint64_t position = sizeof(SwSecSavedState);
+   uint64_t &position = *end;
    for (orr_ListLinks *links = ctx->portDbList.next; links != &ctx->portDbList;
         links = links->next) {
       const SwSecVmi *vmi = SwSecVmiFromListLinks(links);
@@ -123,8 +124,20 @@ void SwSecSaveState(SifraGenericFilter *filter, void *agentPart, uint64_t agentL
    counters.rxRateLimitDropCnt = __atomic_load_n(&ctx->counters.rxRateLimitDropCnt, __ATOMIC_RELAXED);
    counters.ipSrcGuardDropCnt = __atomic_load_n(&ctx->counters.ipSrcGuardDropCnt, __ATOMIC_RELAXED);
    orr_Memcpy(&state.counters, &counters, sizeof(counters));
+   /* The frame guard block goes after the entries; they fit in what it leaves. */
+   const bool withGuard = agentLen >= sizeof(SwSecSavedState) + sizeof(SwSecSavedFrameGuard);
+   const uint64_t vmiRoom = withGuard ? agentLen - sizeof(SwSecSavedFrameGuard) : agentLen;
+   uint64_t position = sizeof(SwSecSavedState);
    if ((ctx->config.featuresEnabled & SwSecFeatureIpDiscovery) != 0) {
-      state.numSavedVmis = SwSecSavePortDb(ctx, part, agentLen);
+      state.numSavedVmis = SwSecSavePortDb(ctx, part, vmiRoom, &position);
+   }
+   if (withGuard) {
+      SwSecSavedFrameGuard saved;
+      orr_Memset(&saved, 0, sizeof(saved));
+      saved.guard = ctx->frameGuard;
+      saved.taggedDropCnt = __atomic_load_n(&ctx->frameGuardCounters.taggedDropCnt, __ATOMIC_RELAXED);
+      saved.etherTypeDropCnt = __atomic_load_n(&ctx->frameGuardCounters.etherTypeDropCnt, __ATOMIC_RELAXED);
+      orr_Memcpy(part + position, &saved, sizeof(saved));
    }
    orr_SpinlockReadUnlock(ctx->configLock);
 
@@ -150,7 +163,8 @@ static void SwSecFreeDecodedVmis(orr_ListLinks *head)
  * only with IP discovery on; logs a refusal. Reads nothing past agentLen.
  */
 static bool SwSecSavedStateIsWellFormed(const SifraGenericFilter *filter, const uint8_t *part,
-                                        uint64_t agentLen, const SwSecSavedState *state)
+                                        uint64_t agentLen, const SwSecSavedState *state,
+                                        uint64_t *entriesEnd)
 {
    /*
     * Entries in a part whose configuration has IP discovery off cannot
@@ -179,7 +193,29 @@ static bool SwSecSavedStateIsWellFormed(const SifraGenericFilter *filter, const 
       }
       position += entryLen;
    }
+   *entriesEnd = position;
    return true;
+}
+
+/*
+ * The frame guard block after the entries at `position`, into `saved`:
+ * zero (the defaults) when the part ends there and its configuration is
+ * version 1. False, logged, for a version-2 configuration without it or a
+ * block that is not valid.
+ */
+static bool SwSecSavedFrameGuardGet(SwSecContext *ctx, const uint8_t *part, uint64_t agentLen,
+                                    uint64_t position, const SwSecSavedState *state,
+                                    SwSecSavedFrameGuard *saved)
+{
+   orr_Memset(saved, 0, sizeof(*saved));
+   if (agentLen - position >= sizeof(*saved)) {
+      orr_Memcpy(saved, part + position, sizeof(*saved));
+   } else if (SwSecConfigHasFrameGuard(state->config.version)) {
+      SG_LOG(ORR_LOG_ERROR, "%s: Saved state of a version %u configuration lacks its frame guard",
+             ctx->filter->name, static_cast<unsigned>(state->config.version));
+      return false;
+   }
+   return SwSecFrameGuardIsValid(ctx, &saved->guard);
 }
 
 /*
@@ -306,7 +342,10 @@ orr_Status SwSecRestoreState(SifraGenericFilter *filter, const void *agentPart, 
    }
    SwSecSavedState state;
    orr_Memcpy(&state, part, sizeof(state));
-   if (!SwSecSavedStateIsWellFormed(filter, part, agentLen, &state)) {
+   uint64_t entriesEnd = 0;
+   SwSecSavedFrameGuard savedGuard;
+   if (!SwSecSavedStateIsWellFormed(filter, part, agentLen, &state, &entriesEnd) ||
+       !SwSecSavedFrameGuardGet(ctx, part, agentLen, entriesEnd, &state, &savedGuard)) {
       return ORR_FAILURE;
    }
    /*
@@ -345,6 +384,9 @@ orr_Status SwSecRestoreState(SifraGenericFilter *filter, const void *agentPart, 
       SifraGenericRateLimitInit(&ctx->rxRateLimit, state.config.arpRateLimit);
    }
    orr_Memcpy(&ctx->counters, &state.counters, sizeof(ctx->counters));
+   ctx->frameGuard = savedGuard.guard;
+   ctx->frameGuardCounters.taggedDropCnt = savedGuard.taggedDropCnt;
+   ctx->frameGuardCounters.etherTypeDropCnt = savedGuard.etherTypeDropCnt;
    orr_SpinlockWriteUnlock(ctx->configLock);
    return ORR_OK;
 }

@@ -79,9 +79,9 @@ orr_Status SWSecPropWrite(orr_SifraFilter filter, void * /* extra */, const void
    const auto *bytes = static_cast<const uint8_t *>(data);
 
    const uint8_t version = bytes[offsetof(SwSecConfig, version)];
-   if (version != SWSEC_CONFIG_VERSION) {
+   if (version < SWSEC_CONFIG_VERSION || version > SWSEC_CONFIG_VERSION_MAX) {
       SG_LOG(ORR_LOG_ERROR, "Invalid version. Got %d, expecting %d", version,
-             SWSEC_CONFIG_VERSION);
+             SWSEC_CONFIG_VERSION_MAX);
       return ORR_BAD_PARAM;
    }
 
@@ -93,10 +93,10 @@ orr_Status SWSecPropWrite(orr_SifraFilter filter, void * /* extra */, const void
    if (length >= offsetof(SwSecConfig, numStatic) + sizeof(numStatic)) {
       orr_Memcpy(&numStatic, bytes + offsetof(SwSecConfig, numStatic), sizeof(numStatic));
    }
-   const uint64_t expected = SwSecConfigLength(numStatic);
+   const uint64_t expected = SwSecConfigRecordLength(version, numStatic);
    if (length != expected) {
       SG_LOG(ORR_LOG_ERROR, "Invalid security config length for version %u. Got %u, expecting %lu",
-             static_cast<unsigned>(SWSEC_CONFIG_VERSION), length,
+             static_cast<unsigned>(version), length,
              static_cast<unsigned long>(expected));
       return ORR_BAD_PARAM;
    }
@@ -120,7 +120,7 @@ orr_Status SWSecPropRead(orr_SifraFilter filter, void * /* extra */, void *buffe
       return ORR_INVALID_HANDLE;
    }
    orr_SpinlockReadLock(ctx->configLock);
-   const uint64_t needed = SwSecConfigLength(ctx->config.numStatic);
+   const uint64_t needed = SwSecConfigRecordLength(ctx->config.version, ctx->config.numStatic);
    if (length < needed) {
       SG_LOG(ORR_LOG_INFO,
              "%s: Invalid security config read length for version %u. Got %u, expecting %lu",
@@ -134,6 +134,9 @@ orr_Status SWSecPropRead(orr_SifraFilter filter, void * /* extra */, void *buffe
    if (ctx->config.numStatic != 0) {
       SwSecQueryPortDb(ctx, out + sizeof(SwSecConfig), SWSEC_QUERY_KEY, SwSecDiscStatic);
    }
+   if (SwSecConfigHasFrameGuard(ctx->config.version)) {
+      orr_Memcpy(out + SwSecConfigLength(ctx->config.numStatic), &ctx->frameGuard, sizeof(ctx->frameGuard));
+   }
    orr_SpinlockReadUnlock(ctx->configLock);
    return ORR_OK;
 }
@@ -145,8 +148,8 @@ bool SWSecPropPoll(orr_SifraFilter filter, void * /* extra */, uint32_t *length)
       return false;
    }
    orr_SpinlockReadLock(ctx->configLock);
-   /* At most 32 static entries: the length fits in 32 bits. */
-   *length = static_cast<uint32_t>(SwSecConfigLength(ctx->config.numStatic));
+   /* At most 32 static entries and a frame guard block: the length fits in 32 bits. */
+   *length = static_cast<uint32_t>(SwSecConfigRecordLength(ctx->config.version, ctx->config.numStatic));
    orr_SpinlockReadUnlock(ctx->configLock);
    return true;
 }

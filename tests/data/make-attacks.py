@@ -22,7 +22,8 @@ import sys
 
 from scapy.all import (ARP, DHCP6_Advertise, DHCP6_Reply, DHCP6OptClientId,
                        DHCP6OptServerId, DUID_LL, ICMP, IP, IPv6, LLC, SNAP,
-                       STP, TCP, UDP, Dot1Q, Dot3, Ether, Raw, rdpcap, wrpcap)
+                       STP, TCP, UDP, Dot1AD, Dot1Q, Dot3, Ether, Raw, rdpcap,
+                       wrpcap)
 
 random.seed(20240101)  # nothing below draws from it; fixed in case it ever does
 
@@ -276,6 +277,24 @@ def vlan100():
     c.write()
 
 
+def stacked_tags():
+    """Spoofs wrapped in tags beyond the port's own VLAN, a runt cut inside its ARP header."""
+    c = Capture("attack-stacked-tags")
+    bind_vm(c, 0.0, 0x5e00000b)
+    claim = ARP(op=2, hwsrc=VM_MAC, psrc=SRV_IP, hwdst=HOST_MAC, pdst=HOST_IP)
+    c.add(1.0, Ether(src=VM_MAC, dst=HOST_MAC) / Dot1Q(vlan=0) / Dot1Q(vlan=0) / claim)
+    c.add(1.1, Ether(src=VM_MAC, dst=HOST_MAC, type=0x88a8) / Dot1AD(vlan=0) / Dot1Q(vlan=0) / claim)
+    c.add(1.2, Ether(src=VM_MAC, dst=HOST_MAC, type=0x88a8) / Dot1AD(vlan=0) / Dot1Q(vlan=0) / Dot1Q(vlan=0) / claim)
+    c.add(1.3, Ether(src=VM_MAC, dst=SRV_MAC, type=0x88a8) / Dot1AD(vlan=0) /
+          IP(src="192.0.2.66", dst=SRV_IP, id=next_id()) / ICMP(id=13, seq=1))
+    c.add(1.4, Ether(src=VM_MAC, dst=SRV_MAC, type=0x88a8) / Dot1AD(vlan=0) /
+          IP(src=VM_IP, dst=SRV_IP, id=next_id()) / ICMP(id=13, seq=2))
+    c.add(1.5, Ether(bytes(Ether(src=VM_MAC, dst=HOST_MAC) / claim)[:41]))
+    c.add(1.6, Ether(src=SRV_MAC, dst=VM_MAC) / Dot1Q(vlan=0) / Dot1Q(vlan=0) /
+          ARP(op=2, hwsrc=SRV_MAC, psrc=SRV_IP, hwdst=VM_MAC, pdst=VM_IP))
+    c.write()
+
+
 def example():
     """The real dhclient session (without its release) and then spoofing from the same VM."""
     real = rdpcap(os.path.join(HERE, "dhclient-lease-renew-release.pcap"))
@@ -303,5 +322,5 @@ def example():
 if __name__ == "__main__":
     os.makedirs(OUT, exist_ok=True)
     for make in (ip_spoof, arp_spoof, arp_flood, rogue_dhcp_server, bpdu, unsolicited_ack,
-                 chaddr_mismatch, malformed_dhcp, ip_fragments, vlan100, example):
+                 chaddr_mismatch, malformed_dhcp, ip_fragments, vlan100, stacked_tags, example):
         make()

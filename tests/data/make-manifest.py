@@ -83,6 +83,10 @@ CAPTURES = [
     ("attack-vlan100", "02:00:5e:c0:00:10", "crafted",
      "make-attacks.py: a DHCP exchange on 802.1Q VLAN 100, then ICMP and ARP from the VM on VLAN 100 and "
      "untagged."),
+    ("attack-stacked-tags", "02:00:5e:c0:00:10", "crafted",
+     "make-attacks.py: VM bound to 192.0.2.110; ARP replies claiming the server's address inside "
+     "802.1Q+802.1Q, 802.1ad+802.1Q and three tags; ICMP from a spoofed and from the leased address "
+     "under one 802.1ad tag; the ARP reply cut to 41 bytes; a double-tagged ARP reply to the VM."),
     ("example-dhcp-then-spoof", "02:00:5e:c0:00:01", "crafted",
      "make-attacks.py: dhclient-lease-renew-release.pcap without its DHCPRELEASE, then, 1 s after, "
      "ICMP from the leased address, spoofed IPv4 sources and ARP replies claiming the server's address."),
@@ -157,6 +161,7 @@ DHCPV6_MSG = {1: "DHCPv6 SOLICIT", 2: "DHCPv6 ADVERTISE", 3: "DHCPv6 REQUEST", 4
               12: "DHCPv6 RELAY-FORW", 13: "DHCPv6 RELAY-REPL"}
 ICMPV6_KIND = {128: "ICMPv6 echo request", 129: "ICMPv6 echo reply", 131: "MLD report", 133: "RS", 134: "RA",
                135: "NS", 136: "NA", 137: "Redirect", 143: "MLDv2 report"}
+TPIDS = {0x8100, 0x88A8, 0x9100}
 
 
 def read_pcap(path):
@@ -183,11 +188,15 @@ def ip(b):
 
 def parse(frame):
     """The fields the port's rules look at."""
-    p = {"len": len(frame), "dst": mac(frame[0:6]), "src": mac(frame[6:12]), "vlan": 0}
+    p = {"len": len(frame), "dst": mac(frame[0:6]), "src": mac(frame[6:12]), "vlan": 0, "tags": 0}
     etype, l3 = struct.unpack_from("!H", frame, 12)[0], 14
-    if etype == 0x8100:
+    if etype in TPIDS and len(frame) >= 18:  # the outer tag, any TPID, is the frame's VLAN
         p["vlan"] = struct.unpack_from("!H", frame, 14)[0] & 0xFFF
         etype, l3 = struct.unpack_from("!H", frame, 16)[0], 18
+    frame = frame.ljust(l3 + 46, b"\0")  # judged padded to 60 bytes untagged, as a switch pads it
+    while etype in TPIDS and p["tags"] < 4 and len(frame) >= l3 + 4:  # tags inside the VLAN
+        p["tags"] += 1
+        etype, l3 = struct.unpack_from("!H", frame, l3 + 2)[0], l3 + 4
     p["etype"], p["l3"] = etype, l3
     if etype == 0x0806 and len(frame) >= l3 + 28:
         a = frame[l3:l3 + 28]
@@ -294,7 +303,8 @@ class Port:
     def __init__(self, cfg, t_start):
         self.cfg, self.vmis, self.reqs, self.events = cfg, [], [], []
         self.counters = {k: 0 for k in ("daiDropCnt", "txRateLimitDropCnt", "txRateLimitErrEntryCnt",
-                                        "rxRateLimitDropCnt", "ipSrcGuardDropCnt", "dhcpSnoopingDropCnt")}
+                                        "rxRateLimitDropCnt", "ipSrcGuardDropCnt", "dhcpSnoopingDropCnt",
+                                        "taggedDropCnt")}
         self.tx = Limiter(cfg["arpRateLimit"], t_start)
         self.rx = Limiter(cfg["arpRateLimit"], t_start)
         self.err = False
@@ -319,6 +329,9 @@ class Port:
     def judge(self, idx, t, frame, p, from_vm):
         """Returns None (pass) or the rule that drops the frame."""
         f, c = self.cfg["featuresEnabled"], self.counters
+        if from_vm and p["tags"]:
+            c["taggedDropCnt"] += 1
+            return "tagged frame from the VM inside its VLAN (taggedDropCnt)"
         is_arp = p["etype"] == 0x0806
         if f & 0x8:
             if self.cfg["arpRateLimit"]:
@@ -984,6 +997,13 @@ NOTES = {
         "Bindings are per VLAN: the DHCP binding is on VLAN 100. Enforcing: the untagged ICMP and ARP "
         "from the same MAC and address (VLAN 0) are dropped, the tagged ones pass. Learning: the "
         "untagged ARP request creates a separate ARP Snooping entry on VLAN 0.",
+    "attack-stacked-tags":
+        "The outer tag, whatever its TPID, is the frame's VLAN (here 0); a tag inside it from the VM "
+        "is dropped before any feature looks (both settings: no port allows tagged frames), so ARP "
+        "inside two or three tags cannot pass as something other than ARP. Under one 802.1ad tag the "
+        "ICMP frames are plain VLAN 0 IPv4: enforcing drops the spoofed source and passes the leased "
+        "one. The 41-byte ARP reply is judged padded to 60 bytes, so its sender fields are read and "
+        "inspection drops it. Tagged frames to the VM pass.",
     "example-dhcp-then-spoof":
         "The README's example: a real dhclient lease (and renewal), then spoofing from the same VM. "
         "Enforcing: ICMP from the leased address passes; IPv4 from 192.0.2.66 and from the server's "
@@ -1006,8 +1026,11 @@ Regenerate (as root, about a minute):
 
 Directions: every capture is taken on (or stands for) the VM's port; "from VM"
 frames are the ones the VM sends (direction 2, transmit), "to VM" the ones
-delivered to it (direction 1, receive). Untagged frames are VLAN 0; tagged
-frames carry their 802.1Q VID. Frame numbers start at 1, as in tshark.
+delivered to it (direction 1, receive). Untagged frames are VLAN 0; a tagged
+frame's VLAN is the VID of its outer tag (TPID 0x8100, 0x88a8 or 0x9100), which
+the port sees as metadata, as a virtual switch hands frames over; a frame from
+the VM with a further tag is dropped first (taggedDropCnt). Frames shorter than
+60 bytes are judged padded with zeros. Frame numbers start at 1, as in tshark.
 
 The expectations below are computed by make-manifest.py from the frames with a
 reference model of the port's rules: the checks run in the order ARP rate limit

@@ -208,6 +208,12 @@ TEST_F(FramesTest, HeaderLookupByFrameKind)
       {"IPv4 options", options, E{0, 14, htons(0x0800), 14}, E{14, 24, 6, 38}, E{38, 24, 0, 62}},
       {"truncated IPv4", Bytes(whole.begin(), whole.begin() + 30), E{0, 14, htons(0x0800), 14}, {}, {}},
       {"runt", Bytes(13, 0), {}, {}, {}},
+      {"ARP behind 802.1ad and 802.1Q", pushTag(pushTag(arpFrame(kVm, kBroadcastMac, arp), 0x8100), 0x88a8),
+       E{0, 22, htons(0x0806), 22}, E{22, 28, 0, 50}, {}},
+      {"five tags: the walk stops at four", pushTag(pushTag(whole, 0x9100), 0x8100, 0, 4), E{0, 30, htons(0x9100), 30},
+       {}, {}},
+      {"a tag cut short", [&] { Bytes b = pushTag(whole, 0x8100); b.resize(17); return b; }(),
+       E{0, 14, htons(0x8100), 14}, {}, {}},
    };
    for (const Case &c : cases) {
       SCOPED_TRACE(c.what);

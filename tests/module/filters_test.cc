@@ -7,6 +7,7 @@
 
 #include <gmock/gmock.h>
 
+#include <array>
 #include <atomic>
 #include <chrono>
 #include <string>
@@ -231,14 +232,14 @@ TEST_F(FilterTest, the_security_property_reads_back_the_header_and_the_static_ke
    ASSERT_EQ(writeConfig(id, config), ORR_OK);
    ASSERT_TRUE(passes(id, kTx, arpFrom(kPeerMac, Ip4::parse("10.0.0.77"), 1)));   // a learned binding
    const char *property = "sifra-generic-tarlin-swsec.security";
-   EXPECT_EQ(host().sifra().pollProperty(property, id), 62u);
-   Bytes larger(62 + 12);
+   EXPECT_EQ(host().sifra().pollProperty(property, id), 80u);   // with the frame guard block
+   Bytes larger(80 + 12);
    EXPECT_EQ(host().sifra().readProperty(property, id, larger), ORR_OK);
-   EXPECT_EQ(larger, [&] { Bytes b = configRecord(config); b.resize(62 + 12); return b; }());
+   EXPECT_EQ(larger, [&] { Bytes b = configRecord(config); b.resize(80 + 12); return b; }());
 
-   Bytes cut(61);
+   Bytes cut(79);
    EXPECT_EQ(host().sifra().readProperty(property, id, cut), ORR_BAD_PARAM);
-   EXPECT_TRUE(logged("filter: Invalid security config read length for version 1. Got 61, expecting 62"));
+   EXPECT_TRUE(logged("filter: Invalid security config read length for version 2. Got 79, expecting 80"));
 }
 
 // ---------------------------------------------------------------- configuration
@@ -262,7 +263,7 @@ TEST_P(ConfigTest, validates_before_anything_changes)
    host().log().clear();
 
    EXPECT_EQ(setFeatures(id, c.config), c.accepted ? 1u : 0u);
-   EXPECT_TRUE(logged("Received set features via Sifra IOCTL, payloadSize: 30"));
+   EXPECT_TRUE(logged("Received set features via Sifra IOCTL, payloadSize: 48"));
    // A refusal keeps the configuration in force and its counters.
    EXPECT_EQ(+ctx->config.featuresEnabled, c.accepted ? c.config.features : SwSecFeatureIpDiscovery);
    EXPECT_EQ(ctx->counters.daiDropCnt, c.accepted ? 0u : 5u);
@@ -364,6 +365,60 @@ TEST_F(BoundPortTest, source_guard_admits_bound_addresses_and_dhcp_clients)
    EXPECT_TRUE(passes(id_, kTx, udp6Frame({.src = kPeerMac, .dst = kVmMac, .srcPort = 1000, .dstPort = 2000})));
    EXPECT_TRUE(passes(id_, kRx, udpFrom(kPeerIp)));
    EXPECT_EQ(context(id_)->counters.ipSrcGuardDropCnt, 2u);
+}
+
+// Frames from the VM beyond the features' checks: tags inside its VLAN, ethertypes outside a list.
+TEST_F(FilterTest, the_frame_guard_drops_stacked_tags_and_unlisted_ethertypes_from_the_vm)
+{
+   const PortConfig tags{.allowTagged = true};
+   const PortConfig listed{.etherTypes = {0x0800, 0x0806, 0x86dd}};
+   Bytes snap = udpFrom(kPeerIp);   // its IPv4 packet behind an 802.3 length and an LLC/SNAP header
+   snap.insert(snap.begin() + 14, {0xaa, 0xaa, 0x03, 0, 0, 0, 0x08, 0x00});
+   snap[12] = 0, snap[13] = static_cast<uint8_t>(snap.size() - 14);
+   Bytes rarp = arpFrom(kVmMac, kPeerIp, 3);
+   rarp[13] = 0x35;
+   const Bytes deep = pushTag(pushTag(arpFrom(kVmMac, kVmIp), 0x8100, 0, 4), 0x9100);
+   struct Case {
+      const char *name;
+      PortConfig guard;
+      Bytes frame;
+      uint32_t direction;
+      std::array<uint64_t, 3> drops;   // tagged, ethertype, DAI; none: the frame passes
+   };
+   const Case cases[] = {
+      {"tagged ARP to the VM", {}, pushTag(arpFrom(kPeerMac, kPeerIp), 0x8100), kRx, {0, 0, 0}},
+      {"allowed: the spoof behind the tag", tags, pushTag(arpFrom(kVmMac, kPeerIp), 0x9100), kTx, {0, 0, 1}},
+      {"allowed: a bound sender", tags, pushTag(arpFrom(kVmMac, kVmIp), 0x88a8), kTx, {0, 0, 0}},
+      {"allowed: deeper than the walk", tags, deep, kTx, {1, 0, 0}},
+      {"listed: LLC/SNAP IPv4", listed, snap, kTx, {0, 1, 0}},
+      {"listed: RARP", listed, rarp, kTx, {0, 1, 0}},
+      {"listed: IPv6", listed, udp6Frame({.src = kVmMac, .dst = kPeerMac}), kTx, {0, 0, 0}},
+      {"no list: RARP", {}, rarp, kTx, {0, 0, 0}},
+   };
+   const host::FilterId id = create();
+   for (const Case &c : cases) {
+      SCOPED_TRACE(c.name);
+      ASSERT_EQ(setFeatures(id, {kDai, false, 32, 0, 0, 0, {binding(0, kVmMac, kVmIp)}, c.guard.allowTagged,
+                                 c.guard.etherTypes}),
+                1u);
+      EXPECT_EQ(passes(id, c.direction, c.frame), (c.drops == std::array<uint64_t, 3>{}));
+      const SwSecContext *ctx = context(id);
+      EXPECT_EQ((std::array{ctx->frameGuardCounters.taggedDropCnt, ctx->frameGuardCounters.etherTypeDropCnt,
+                            ctx->counters.daiDropCnt}),
+                c.drops);
+   }
+}
+
+TEST_F(FilterTest, a_version_2_record_reads_back_with_its_frame_guard_and_a_list_of_nine_is_refused)
+{
+   const PortConfig config{.allowTagged = true, .etherTypes = {0x0800, 0x0806}};
+   const host::FilterId id = create();
+   Bytes read(26 + 18);
+   ASSERT_EQ(writeConfig(id, config), ORR_OK);
+   EXPECT_EQ(host().sifra().readProperty("sifra-generic-tarlin-swsec.security", id, read), ORR_OK);
+   EXPECT_EQ(read, configRecord(config));
+   EXPECT_EQ(setFeatures(id, {.etherTypes = std::vector<uint16_t>(9, 0x0800)}), 0u);
+   EXPECT_TRUE(logged("filter: Invalid frame guard config: 9 ethertypes (at most 8)"));
 }
 
 class RateLimitTest : public FilterTest {

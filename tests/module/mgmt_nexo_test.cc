@@ -94,12 +94,13 @@ TEST_F(NexoTest, feature_summary_of_an_untrusted_dai_port_with_rate_limits)
    const host::FilterId id = create();
    configure(id, {SwSecFeatureIpDiscovery | SwSecFeatureDai, 0, 16, 100, 10, 30, {binding(5, kVmMac, kVmIp)}});
    const std::map<std::string, std::string, std::less<>> expected = {
-      {"version", "1"}, {"highestSupportedVersion", "1"}, {"lowestSupportedVersion", "1"},
+      {"version", "2"}, {"highestSupportedVersion", "2"}, {"lowestSupportedVersion", "1"},
       {"featuresEnabled", "IP Discovery,DAI"}, {"portMode", "Untrusted"}, {"portDbSize", "16"},
       {"numStaticEntries", "1"}, {"numVmiEntries", "1"}, {"numAuthVmiEntries", "1"}, {"numNonAuthVmiEntries", "0"},
       {"dhcpSnoopingDropCnt", "0"}, {"daiDropCnt", "0"}, {"ipSrcGuardDropCnt", "N/A"}, {"arpRateLimit", "100 pps"},
       {"errRateLimit", "10 pps"}, {"errRateLimitPeriod", "30 sec"}, {"txRateLimitDropCnt", "0"},
-      {"txRateLimitErr", "No"}, {"txRateLimitErrEntryCnt", "0"}, {"rxRateLimitDropCnt", "0"}};
+      {"txRateLimitErr", "No"}, {"txRateLimitErrEntryCnt", "0"}, {"rxRateLimitDropCnt", "0"},
+      {"allowTagged", "Dropped"}, {"etherTypes", "Any"}, {"taggedDropCnt", "0"}, {"etherTypeDropCnt", "0"}};
    EXPECT_EQ(get(portPath(kPort, "featureSummary")).values(), expected);
    const std::string text = get(portPath(kPort, "featureSummary")).text();
    EXPECT_NE(text.find("Feature summary\n"), std::string::npos) << text;
@@ -244,7 +245,7 @@ TEST_P(ClearTest, clears_what_it_names_and_never_a_static_binding)
          const StaticBinding key = binding(static_cast<uint16_t>(std::stoi(c.args[1])), Mac::parse(c.args[2]),
                                            Ip4::parse(c.args[3]));
          const Bytes record = configRecord({.statics = {key}});
-         clear.insert(clear.end(), record.end() - 12, record.end());
+         clear.insert(clear.end(), record.begin() + 26, record.begin() + 38);
       }
       EXPECT_EQ(host().sifra().sendIoctl(id, 4, clear), ORR_OK);
       EXPECT_TRUE(host().sifra().ioctlReplies().empty());

@@ -55,7 +55,8 @@ Decoded decode(const Bytes &blob)
       at += idLen;
       out.vmis.push_back(vmi);
    }
-   EXPECT_EQ(at, out.header.slowPathOffset) << "the entries fill the agent's part exactly";
+   at += sizeof(SwSecSavedFrameGuard);
+   EXPECT_EQ(at, out.header.slowPathOffset) << "the entries and the frame guard fill the agent's part exactly";
    return out;
 }
 
@@ -122,7 +123,7 @@ TEST_F(SavedStateTest, the_blob_carries_the_configuration_counters_and_each_entr
    EXPECT_EQ(Bytes(blob.begin(), blob.begin() + 8), (Bytes{'s', 'i', 'f', 'g', 's', 'a', 'v', 'e'}));
    EXPECT_EQ(d.header.version, 1u);
    EXPECT_EQ(d.header.agentOffset, 48u);
-   EXPECT_EQ(d.header.agentLen, 96u + 2 * 48 + 3);
+   EXPECT_EQ(d.header.agentLen, 96u + 2 * 48 + 3 + 40);
    EXPECT_EQ(d.header.slowPathLen, 0u);
    EXPECT_EQ(blob.size(), 48 + d.header.agentLen);
    const Bytes header = configRecord(config);
@@ -187,7 +188,7 @@ TEST_F(SavedStateTest, a_port_without_ip_discovery_saves_a_bare_fixed_part_and_e
    const host::FilterId source = create();
    ASSERT_EQ(writeConfig(source, {.features = SwSecFeatureBpduFilter}), ORR_OK);
    const Bytes blob = save(source);
-   ASSERT_EQ(blob.size(), 48u + 96u);
+   ASSERT_EQ(blob.size(), 48u + 96u + 40u);
 
    const host::FilterId destination = create({}, kOtherPort);
    learnDhcp(destination, 1, 600);
@@ -215,7 +216,7 @@ TEST_F(SavedStateTest, a_learning_port_arrives_whole_and_in_order_hours_later)
    learnDhcp(source, 4, 86400, id255);
    ASSERT_TRUE(passes(source, kTx, arpRequest(macOf(9), ipOf(29))));
    const Bytes blob = save(source);
-   EXPECT_EQ(blob.size(), 48u + 96u + 5 * 48u + 1 + 255);
+   EXPECT_EQ(blob.size(), 48u + 96u + 5 * 48u + 1 + 255 + 40);
 
    host().clock().advance(3h + 17s);
    const host::FilterId destination = create({}, kOtherPort);
@@ -296,7 +297,7 @@ struct PhaseCase {
 
 class SavePhaseTest : public SavedStateTest, public ::testing::WithParamInterface<PhaseCase> {};
 
-constexpr uint64_t kOneEntryBlob = 48 + 96 + 48;
+constexpr uint64_t kOneEntryBlob = 48 + 96 + 48 + 40;
 
 TEST_P(SavePhaseTest, each_call_answers_as_its_phase_says)
 {
@@ -335,7 +336,7 @@ INSTANTIATE_TEST_SUITE_P(
       PhaseCase{"a_save_without_prefetch_is_refused", "s", ORR_INVALID_HANDLE, "Unexpected request to save state"},
       PhaseCase{"a_second_save_needs_a_new_prefetch", "pss", ORR_INVALID_HANDLE, "Unexpected request to save state"},
       PhaseCase{"a_buffer_one_byte_short_is_refused", "pt", ORR_BUFFER_TOO_SMALL,
-                "Buffer too short for saved state (requested 192, got 191)"},
+                "Buffer too short for saved state (requested 232, got 231)"},
       PhaseCase{"a_refused_save_spends_the_prefetch", "ptl", ORR_FAILURE, ""},
       PhaseCase{"a_cancel_returns_to_idle", "pcs", ORR_INVALID_HANDLE, "Unexpected request to save state"},
       PhaseCase{"a_save_without_buffer_cancels", "pnl", ORR_FAILURE, ""}),
@@ -435,6 +436,18 @@ INSTANTIATE_TEST_SUITE_P(
                   },
                   ORR_OK, "dest: Finished restoring state"}),
    [](const auto &testInfo) { return std::string(testInfo.param.name); });
+
+TEST_F(SavedStateTest, the_frame_guard_and_its_drops_travel)
+{
+   const host::FilterId source = create();
+   const SwSecFrameGuard guard{.flags = SwSecFrameGuardAllowTagged, .numEtherTypes = 1, .etherTypes = {0x0806}};
+   ASSERT_EQ(writeConfig(source, {.allowTagged = true, .etherTypes = {0x0806}}), ORR_OK);
+   EXPECT_FALSE(passes(source, kTx, udpFrame({.src = macOf(1)})));
+   const host::FilterId destination = create({.name = "dest"}, kOtherPort);
+   ASSERT_EQ(restore(destination, save(source)), ORR_OK);
+   EXPECT_EQ(std::memcmp(&context(destination)->frameGuard, &guard, sizeof guard), 0);
+   EXPECT_EQ(context(destination)->frameGuardCounters.etherTypeDropCnt, 1u);
+}
 
 TEST_F(SavedStateTest, a_slow_path_part_without_a_slow_path_is_dropped_under_another_policy)
 {

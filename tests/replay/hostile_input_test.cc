@@ -250,6 +250,8 @@ TEST(BadUsage, is_named_in_one_short_line_with_status_2_and_nothing_written)
       {config, "number overflow", R"({"portDbSize": 1e400})"},
       {config, "nested deeper than 64 levels",
        R"({"features": )" + std::string(100'000, '[') + "\"dai\"" + std::string(100'000, ']') + "}"},
+      {config, "etherTypes[1]: 1500 is not an ethertype", R"({"etherTypes": ["ipv4", 1500]})"},
+      {config, "must list 1 to 8 ethertypes", R"({"etherTypes": []})"},
       // The module's own rule: inspection on a trusted port is refused, in its words.
       {config, "Invalid config: featuresEnabled = 0xc trusted = 1",
        R"({"features": ["dai", "ip-discovery"], "trusted": true})", 1},

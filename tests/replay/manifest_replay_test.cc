@@ -249,6 +249,7 @@ TEST_P(ManifestReplay, every_dropped_frame_has_the_reason_the_manifest_names_and
       {"ND inspection: an address or link-layer option not the VM's (ndInspectionDropCnt)", "ND inspection"},
       {"ND rate limit exceeded, port enters the error-rate-limit state (ndRateLimitDropCnt)", "ND rate limit"},
       {"ND error-rate-limit state (ndRateLimitDropCnt)", "ND rate limit: error state"},
+      {"tagged frame from the VM inside its VLAN (taggedDropCnt)", "Tagged frame"},
    };
    const replay::ReplayResult result = replayCase(32, true);
    std::map<uint64_t, std::string> reasons;
@@ -274,6 +275,7 @@ TEST_P(ManifestReplay, every_dropped_frame_has_the_reason_the_manifest_names_and
    EXPECT_EQ(perReason["DAI"], counter("daiDropCnt"));
    EXPECT_EQ(perReason["IP source guard"], counter("ipSrcGuardDropCnt"));
    EXPECT_EQ(perReason["DHCP snooping: chaddr mismatch"], counter("dhcpSnoopingDropCnt"));
+   EXPECT_EQ(perReason["Tagged frame"], counter("taggedDropCnt"));
    EXPECT_EQ(perReason["ARP rate limit"] + perReason["ARP rate limit: error state"],
              counter("txRateLimitDropCnt") + counter("rxRateLimitDropCnt"));
    for (const auto &[reason, name] : {std::pair{"IPv6 header chain", "headerChainDropCnt"},

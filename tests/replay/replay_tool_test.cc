@@ -88,6 +88,13 @@ TEST(ReplayClock, the_lease_counts_down_on_capture_time)
 
 // ---------------------------------------------------------------- configuration
 
+TEST(ReplayConfig, the_frame_guard_keys_reach_the_record)
+{
+   EXPECT_EQ(session::configRecord(session::parseConfig(R"({"allowTagged":true,"etherTypes":["ipv4",2054,"0x86DD"]})",
+                                                        "inline")),
+             contract::configRecord({.allowTagged = true, .etherTypes = {0x0800, 0x0806, 0x86dd}}));
+}
+
 TEST(ReplayConfig, a_static_binding_lets_its_owner_pass_inspection_without_dhcp)
 {
    TempDir dir;

@@ -216,6 +216,15 @@ Bytes dhcpFrame(const DhcpFrame &frame)
                    l3);
 }
 
+Bytes pushTag(Bytes frame, uint16_t tpid, uint16_t vlanId, int count)
+{
+   const uint8_t tag[] = {uint8_t(tpid >> 8), uint8_t(tpid), uint8_t(vlanId >> 8), uint8_t(vlanId)};
+   for (int i = 0; i < count; i++) {
+      frame.insert(frame.begin() + 12, std::begin(tag), std::end(tag));
+   }
+   return frame;
+}
+
 Bytes arpFrame(const Mac &src, const Mac &dst, const Arp &arp, std::optional<uint16_t> vlanTag)
 {
    return ethernet({.dst = dst, .src = src, .etherType = kEtherArp, .vlanTag = vlanTag},

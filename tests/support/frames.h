@@ -135,6 +135,8 @@ Bytes dhcpFrame(const DhcpFrame &frame);
 
 Bytes arpFrame(const Mac &src, const Mac &dst, const Arp &arp,
                std::optional<uint16_t> vlanTag = std::nullopt);
+// The frame with `count` tags of `tpid` pushed outside any it has.
+Bytes pushTag(Bytes frame, uint16_t tpid, uint16_t vlanId = 0, int count = 1);
 
 struct UdpFrame {
    Mac src;

@@ -54,7 +54,9 @@ INSTANTIATE_TEST_SUITE_P(
    ::testing::Values(
       WriteCase{"empty", {}, "Invalid security config"},
       WriteCase{"one_byte", {1}, kLength + "Got 1, expecting 26"},
-      WriteCase{"version_2", record(2, 0, 26), "Invalid version. Got 2, expecting 1"},
+      WriteCase{"version_3", record(3, 0, 44), "Invalid version. Got 3, expecting 2"},
+      WriteCase{"version_2_without_frame_guard", record(2, 0, 26),
+                "Invalid security config length for version 2. Got 26, expecting 44"},
       WriteCase{"one_byte_too_many", record(1, 0, 27), kLength + "Got 27, expecting 26"},
       WriteCase{"one_byte_short", record(1, 2, 49), kLength + "Got 49, expecting 50"},
       WriteCase{"one_entry_too_many", record(1, 2, 62), kLength + "Got 62, expecting 50"},

@@ -5,6 +5,7 @@
 #include "live/netdev.h"
 #include "live/owner_lock.h"
 
+#include "host/header_lookup.h"
 #include "host/host.h"
 
 #include <net/if.h>
@@ -12,43 +13,31 @@
 #include <sys/eventfd.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
 #include <system_error>
 
 namespace swsec::live {
 
-namespace {
-
-constexpr uint16_t kEtherTypeVlan = 0x8100;
-constexpr size_t kAddressBytes = 12;
-
-bool carriesTag(std::span<const uint8_t> bytes)
+host::FrameView portView(ReceivedFrame &frame)
 {
-   return bytes.size() >= 14 && (bytes[12] << 8 | bytes[13]) == kEtherTypeVlan;
-}
-
-}  // namespace
-
-host::FrameView portView(const ReceivedFrame &frame, std::vector<uint8_t> &scratch)
-{
+   // A runt goes on padded, as a switch pads it, and the port judges the
+   // bytes that go on; the slot has room for them.
+   const size_t padded = host::switchPaddedLength(frame.bytes.size());
+   if (padded != frame.bytes.size()) {
+      std::fill(frame.bytes.data() + frame.bytes.size(), frame.bytes.data() + padded, uint8_t{0});
+      frame.bytes = {frame.bytes.data(), padded};
+   }
    host::FrameView view;
    view.bytes = frame.bytes;
-   if (!frame.tagged) {
-      // A tag the kernel left in the bytes becomes metadata as the virtual
-      // switch hands frames over.
-      view.untag = carriesTag(frame.bytes);
-   } else if (frame.tpid == kEtherTypeVlan) {
+   if (frame.tagged) {
+      // The kernel took the outer tag off, whatever its TPID: it is the VLAN.
       view.vlanId = frame.tci & 0x0fff;
-   } else if (frame.bytes.size() >= kAddressBytes) {
-      // Another tag (an 802.1ad service tag) is no 802.1Q VLAN: the port
-      // sees it in the bytes, where it was on the wire.
-      const uint8_t tag[] = {static_cast<uint8_t>(frame.tpid >> 8), static_cast<uint8_t>(frame.tpid),
-                             static_cast<uint8_t>(frame.tci >> 8), static_cast<uint8_t>(frame.tci)};
-      scratch.assign(frame.bytes.begin(), frame.bytes.begin() + kAddressBytes);
-      scratch.insert(scratch.end(), std::begin(tag), std::end(tag));
-      scratch.insert(scratch.end(), frame.bytes.begin() + kAddressBytes, frame.bytes.end());
-      view.bytes = scratch;
+   } else {
+      // An outer tag left in the bytes (any TPID) becomes the VLAN as the
+      // host presents the frame; tags inside it stay for the port to judge.
+      view.untag = true;
    }
    return view;
 }
@@ -203,7 +192,6 @@ void GuardedPort::forward(PacketSocket &from, PacketSocket &to, uint32_t directi
    passed.reserve(options_.batch);
    std::vector<size_t> judged;   // index in `frames` of each view
    judged.reserve(options_.batch);
-   std::vector<std::vector<uint8_t>> retagged(options_.batch);   // frames whose tag goes back in
    uint64_t sendErrors = 0;
 
    while (!vanished_.load(std::memory_order_acquire)) {
@@ -232,16 +220,13 @@ void GuardedPort::forward(PacketSocket &from, PacketSocket &to, uint32_t directi
       }
       views.clear();
       judged.clear();
-      if (retagged.size() < frames.size()) {
-         retagged.resize(frames.size());
-      }
       for (size_t i = 0; i < frames.size(); ++i) {
-         const ReceivedFrame &frame = frames[i];
+         ReceivedFrame &frame = frames[i];
          if (frame.truncated) {
             counters_.truncated.fetch_add(1, std::memory_order_relaxed);
             continue;
          }
-         views.push_back(portView(frame, retagged[i]));
+         views.push_back(portView(frame));
          judged.push_back(i);
       }
       if (views.empty()) {

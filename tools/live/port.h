@@ -61,11 +61,11 @@ struct PortCounters {
    std::atomic<uint64_t> overruns{0};      // dropped by the kernel: a socket's buffer was full
 };
 
-// The frame as the virtual switch hands it to the port: an 802.1Q tag
-// (taken off by the kernel or left in the bytes) becomes VLAN metadata; any
-// other tag the kernel took off goes back into the bytes, copied into
-// `scratch`, which the view then refers to.
-host::FrameView portView(const ReceivedFrame &frame, std::vector<uint8_t> &scratch);
+// The frame as the virtual switch hands it to the port: the outer tag, of
+// any TPID (taken off by the kernel or left in the bytes), becomes VLAN
+// metadata, and a runt is padded to 60 bytes in its buffer (which has room
+// for them), so that what goes on is what was judged.
+host::FrameView portView(ReceivedFrame &frame);
 
 class GuardedPort {
 public:

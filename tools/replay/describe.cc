@@ -2,6 +2,9 @@
 // the frame's length; a frame too short for a layer says so.
 #include "replay/describe.h"
 
+#include "contract/frame_walk.h"
+#include "host/header_lookup.h"
+
 #include <algorithm>
 #include <array>
 #include <cstdio>
@@ -10,7 +13,6 @@ namespace swsec::replay {
 
 namespace {
 
-constexpr uint16_t kEtherVlan = 0x8100;
 constexpr uint16_t kEtherIpv4 = 0x0800;
 constexpr uint16_t kEtherArp = 0x0806;
 constexpr uint16_t kEtherIpv6 = 0x86dd;
@@ -107,10 +109,7 @@ std::string describeArp(std::span<const uint8_t> arp)
 
 uint16_t frameVlan(std::span<const uint8_t> bytes)
 {
-   if (bytes.size() >= 18 && be16(bytes, 12) == kEtherVlan) {
-      return be16(bytes, 14) & 0x0fffu;
-   }
-   return 0;
+   return host::outerTagVlan(bytes).value_or(0);
 }
 
 FrameFacts frameFacts(std::span<const uint8_t> bytes)
@@ -124,7 +123,7 @@ FrameFacts frameFacts(std::span<const uint8_t> bytes)
    facts.bpduDestination = std::equal(kBpdu, kBpdu + 6, bytes.begin()) || std::equal(kPvst, kPvst + 6, bytes.begin());
    size_t at = 12;
    uint16_t type = be16(bytes, at);
-   if (type == kEtherVlan && bytes.size() >= 18) {
+   if (SwSecIsTagTpid(type) && bytes.size() >= 18) {
       at = 16;
       type = be16(bytes, at);
    }
@@ -157,9 +156,10 @@ std::string describeFrame(std::span<const uint8_t> bytes)
    std::string prefix = macText(&bytes[6]) + " > " + macText(&bytes[0]) + " ";
    size_t at = 12;
    uint16_t type = be16(bytes, at);
-   if (type == kEtherVlan && bytes.size() >= 18) {
-      prefix += "vlan " + std::to_string(be16(bytes, 14) & 0x0fffu) + " ";
-      at = 16;
+   // Every tag, as far as the port's walk goes.
+   for (uint32_t tags = 0; SwSecIsTagTpid(type) && tags < SWSEC_MAX_TAGS && bytes.size() >= at + 6; ++tags) {
+      prefix += "vlan " + std::to_string(be16(bytes, at + 2) & 0x0fffu) + " ";
+      at += 4;
       type = be16(bytes, at);
    }
    const auto payload = bytes.subspan(at + 2);

@@ -19,6 +19,8 @@ const char *dropReasonName(DropReason reason)
    case DropReason::arpRateLimitErrorState: return "ARP rate limit: error state";
    case DropReason::ipSourceGuard: return "IP source guard";
    case DropReason::dhcpChaddrMismatch: return "DHCP snooping: chaddr mismatch";
+   case DropReason::taggedFrame: return "Tagged frame";
+   case DropReason::etherType: return "Ethertype not allowed";
    case DropReason::bpduFilter: return "BPDU filter";
    case DropReason::dhcpServerBlock: return "DHCP server block";
    case DropReason::dhcpUnansweredAck: return "DHCP snooping: unanswered ACK";
@@ -49,6 +51,13 @@ bool moved(const DropCounters &before, const DropCounters &after, std::string_vi
 DropReason explainDrop(const DropCounters &before, const DropCounters &after, std::span<const uint8_t> frame,
                        uint8_t direction)
 {
+   // The frame guard judges before every feature.
+   if (moved(before, after, "taggedDropCnt")) {
+      return DropReason::taggedFrame;
+   }
+   if (moved(before, after, "etherTypeDropCnt")) {
+      return DropReason::etherType;
+   }
    if (moved(before, after, "txRateLimitDropCnt")) {
       return moved(before, after, "txRateLimitErrEntryCnt") ? DropReason::arpRateLimit
                                                              : DropReason::arpRateLimitErrorState;

@@ -21,6 +21,8 @@ enum class DropReason : uint8_t {
    arpRateLimitErrorState,// txRateLimitDropCnt while in the error-rate-limit state
    ipSourceGuard,         // ipSrcGuardDropCnt
    dhcpChaddrMismatch,    // dhcpSnoopingDropCnt
+   taggedFrame,           // taggedDropCnt
+   etherType,             // etherTypeDropCnt
    bpduFilter,
    dhcpServerBlock,
    dhcpUnansweredAck,

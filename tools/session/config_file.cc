@@ -10,6 +10,7 @@
 #include <arpa/inet.h>
 #include <nlohmann/json.hpp>
 
+#include <algorithm>
 #include <charconv>
 #include <cstring>
 #include <fstream>
@@ -86,6 +87,54 @@ void parseStatic(const json &entry, const std::string &what, PortSecurityConfig 
    }
    binding.ip = parseIp(ip, what);
    config.statics.push_back(binding);
+}
+
+// Names an ethertype list may use beside numbers ("0x0800" or 2048).
+constexpr std::pair<std::string_view, uint16_t> kEtherTypeNames[] = {
+   {"ipv4", 0x0800}, {"arp", 0x0806}, {"ipv6", 0x86dd}, {"rarp", 0x8035}, {"lldp", 0x88cc},
+};
+
+uint16_t parseEtherType(const json &value, const std::string &what)
+{
+   uint64_t number = 0;
+   bool ok = value.is_number_unsigned();
+   if (ok) {
+      number = value.get<uint64_t>();
+   } else if (value.is_string()) {
+      const std::string text = value.get<std::string>();
+      for (const auto &[name, type] : kEtherTypeNames) {
+         if (text == name) {
+            return type;
+         }
+      }
+      const char *first = text.data() + 2;
+      const auto [end, error] = std::from_chars(first, text.data() + text.size(), number, 16);
+      ok = text.size() > 2 && text.size() <= 6 && text.starts_with("0x") && error == std::errc{} &&
+           end == text.data() + text.size();
+   }
+   // Values below 0x0600 are an 802.3 length, not a type a frame can name.
+   if (!ok || number < 0x0600 || number > 0xffff) {
+      throw InputError(what + ": " + session::jsonText(value) +
+                        " is not an ethertype (0x0600 to 0xffff, or ipv4, arp, ipv6, rarp, lldp)");
+   }
+   return static_cast<uint16_t>(number);
+}
+
+std::vector<uint16_t> parseEtherTypes(const json &value, const std::string &origin)
+{
+   if (!value.is_array() || value.empty() || value.size() > SWSEC_ETHERTYPES_MAX) {
+      throw InputError(origin + ": \"etherTypes\" must list 1 to " + std::to_string(SWSEC_ETHERTYPES_MAX) +
+                        " ethertypes (leave it out to allow any)");
+   }
+   std::vector<uint16_t> types;
+   for (size_t i = 0; i < value.size(); ++i) {
+      const uint16_t type = parseEtherType(value[i], origin + ": etherTypes[" + std::to_string(i) + "]");
+      if (std::find(types.begin(), types.end(), type) != types.end()) {
+         throw InputError(origin + ": etherTypes[" + std::to_string(i) + "]: " + session::jsonText(value[i]) + " is listed twice");
+      }
+      types.push_back(type);
+   }
+   return types;
 }
 
 }  // namespace
@@ -168,6 +217,13 @@ PortSecurityConfig parseConfig(std::string_view text, const std::string &origin)
          config.errRateLimit = unsignedField(doc, "errRateLimit", origin);
       } else if (key == "errRateLimitPeriod") {
          config.errRateLimitPeriod = unsignedField(doc, "errRateLimitPeriod", origin);
+      } else if (key == "allowTagged") {
+         if (!value.is_boolean()) {
+            throw InputError(origin + ": \"allowTagged\" must be true or false");
+         }
+         config.allowTagged = value.get<bool>();
+      } else if (key == "etherTypes") {
+         config.etherTypes = parseEtherTypes(value, origin);
       } else if (key == "static") {
          if (!value.is_array()) {
             throw InputError(origin + ": \"static\" must be a list of {vlan, mac, ip}");

@@ -36,7 +36,8 @@ inline constexpr const char *kAgentCreationProperty = "com.tarlin.common.switch-
 // The six drop counters of the feature summary, in its order.
 inline constexpr const char *kDropCounterFields[] = {"dhcpSnoopingDropCnt", "daiDropCnt",
                                                      "ipSrcGuardDropCnt",   "txRateLimitDropCnt",
-                                                     "rxRateLimitDropCnt",  "txRateLimitErrEntryCnt"};
+                                                     "rxRateLimitDropCnt",  "txRateLimitErrEntryCnt",
+                                                     "taggedDropCnt",       "etherTypeDropCnt"};
 
 // The IPv6 agent's counters of its "summary" node: a drop counter per
 // reason and the bindings evicted for the cap.

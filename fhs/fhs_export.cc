@@ -11,7 +11,7 @@
 #include "framework/sifra_generic_filter.h"
 #include "framework/sifra_generic_list.h"
 #include "framework/sifra_generic_log.h"
-#include "platform/orr_module.h"
+#include "framework/sifra_generic_port.h"
 #include "platform/orr_text.h"
 #include "platform/orr_time.h"
 
@@ -157,24 +157,15 @@ extern "C" orr_Status Fhs_BindingsGetEntries(uint32_t portId, uint32_t selector,
    }
    FhsUnlockPort(agent, ctx, false);
 
-   status = orr_ModuleIncUseCount(sifraGenericModuleID);
-   if (status != ORR_OK) {
-      SG_LOG(ORR_LOG_ERROR, "%s: portId= %u: ModIncUseCnt() failed: %s", filterName, portId,
-             orr_StatusToString(status));
-      SifraGenericFree(block);
-      return ORR_FAILURE;
+   status = SifraGenericHandOutBlock(filterName, portId, block);
+   if (status == ORR_OK) {
+      *entries = block;
+      *buffer = block;
    }
-   *entries = block;
-   *buffer = block;
-   return ORR_OK;
+   return status;
 }
 
 extern "C" orr_Status Fhs_BindingsReleaseBuf(void *buffer)
 {
-   if (buffer == nullptr) {
-      return ORR_BAD_PARAM;
-   }
-   SifraGenericFree(buffer);
-   orr_ModuleDecUseCount(sifraGenericModuleID);
-   return ORR_OK;
+   return SifraGenericGiveBackBlock(buffer);
 }

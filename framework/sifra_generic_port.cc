@@ -1,7 +1,8 @@
-/* A filter's port: lookup, periodic timer and change messages. */
+/* A filter's port: lookup, periodic timer, blocks handed out and change messages. */
 #include "framework/sifra_generic_port.h"
 
 #include "framework/sifra_generic_log.h"
+#include "platform/orr_module.h"
 #include "platform/orr_text.h"
 
 /* Every port timer fires every 10 s with the same host options. */
@@ -44,6 +45,27 @@ void SifraGenericRemovePortTimer(orr_Timer *timer)
       (void)orr_TimerRemoveSync(*timer);
       *timer = 0;
    }
+}
+
+orr_Status SifraGenericHandOutBlock(const char *name, uint32_t portId, void *block)
+{
+   const orr_Status status = orr_ModuleIncUseCount(sifraGenericModuleID);
+   if (status != ORR_OK) {
+      SG_LOG(ORR_LOG_ERROR, "%s: portId= %u: ModIncUseCnt() failed: %s", name, portId, orr_StatusToString(status));
+      SifraGenericFree(block);
+      return ORR_FAILURE;
+   }
+   return ORR_OK;
+}
+
+orr_Status SifraGenericGiveBackBlock(void *block)
+{
+   if (block == nullptr) {
+      return ORR_BAD_PARAM;
+   }
+   SifraGenericFree(block);
+   orr_ModuleDecUseCount(sifraGenericModuleID);
+   return ORR_OK;
 }
 
 void SifraGenericPostPortMessage(const SifraGenericFilter *filter, orr_Portset *portset, uint32_t portId,

@@ -30,6 +30,16 @@ orr_Status SifraGenericAddPortTimer(const SifraGenericFilter *filter, orr_TimerC
 void SifraGenericRemovePortTimer(orr_Timer *timer);
 
 /*
+ * A block of a port's entries handed to another module holds the module
+ * (its use count) until it is given back. ORR_OK, or ORR_FAILURE with the
+ * block freed and the refusal logged with `name` and `portId`.
+ */
+orr_Status SifraGenericHandOutBlock(const char *name, uint32_t portId, void *block);
+
+/* A block handed out, given back: freed, and the module let go. ORR_BAD_PARAM for null. */
+orr_Status SifraGenericGiveBackBlock(void *block);
+
+/*
  * Posts a message of class `msgClass` for `portId` on `portset`: `header`
  * begins a record whose `payloadLength` bytes follow it; its name is set
  * to `msgName` here. The portset is locked shared for the post unless this

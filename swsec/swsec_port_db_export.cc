@@ -9,7 +9,7 @@
 #include "framework/sifra_generic.h"
 #include "framework/sifra_generic_filter.h"
 #include "framework/sifra_generic_log.h"
-#include "platform/orr_module.h"
+#include "framework/sifra_generic_port.h"
 #include "platform/orr_text.h"
 #include "swsec/swsec_context.h"
 #include "swsec/swsec_port_db.h"
@@ -102,24 +102,15 @@ extern "C" orr_Status SwSec_PortDBGetEntries(uint32_t portId, uint32_t selector,
    orr_SpinlockReadUnlock(ctx->configLock);
    SwSecReleasePortFilterMap(portId, ctx);
 
-   status = orr_ModuleIncUseCount(sifraGenericModuleID);
+   status = SifraGenericHandOutBlock(filterName, portId, block);
    if (status != ORR_OK) {
-      SG_LOG(ORR_LOG_ERROR, "%s: portId= %u: ModIncUseCnt() failed: %s", filterName, portId,
-             orr_StatusToString(status));
       *entries = nullptr;
       *buffer = nullptr;
-      SifraGenericFree(block);
-      return ORR_FAILURE;
    }
-   return ORR_OK;
+   return status;
 }
 
 extern "C" orr_Status SwSec_PortDBReleaseBuf(void *buffer)
 {
-   if (buffer == nullptr) {
-      return ORR_BAD_PARAM;
-   }
-   SifraGenericFree(buffer);
-   orr_ModuleDecUseCount(sifraGenericModuleID);
-   return ORR_OK;
+   return SifraGenericGiveBackBlock(buffer);
 }

@@ -200,38 +200,6 @@ TEST_F(SavedStateTest, a_port_without_ip_discovery_saves_a_bare_fixed_part_and_e
 
 // ---------------------------------------------------------------- round trips
 
-TEST_F(SavedStateTest, a_learning_port_arrives_whole_and_in_order_hours_later)
-{
-   const host::FilterId source = create();
-   ASSERT_EQ(writeConfig(source, {.features = SwSecFeatureIpDiscovery | SwSecFeatureBpduFilter,
-                                  .portDbSize = 16,
-                                  .statics = {binding(5, kStaticMac, kStaticIp)}}),
-             ORR_OK);
-   Bytes id255(255);
-   for (size_t i = 0; i < id255.size(); ++i) {
-      id255[i] = static_cast<uint8_t>(i);
-   }
-   learnDhcp(source, 1, 30);
-   learnDhcp(source, 2, 3600, Bytes{0x7f});
-   learnDhcp(source, 4, 86400, id255);
-   ASSERT_TRUE(passes(source, kTx, arpRequest(macOf(9), ipOf(29))));
-   const Bytes blob = save(source);
-   EXPECT_EQ(blob.size(), 48u + 96u + 5 * 48u + 1 + 255 + 40);
-
-   host().clock().advance(3h + 17s);
-   const host::FilterId destination = create({}, kOtherPort);
-   ASSERT_EQ(restore(destination, blob), ORR_OK);
-   EXPECT_TRUE(logged("filter: Finished restoring state"));
-   EXPECT_EQ(save(destination), blob) << "entries, order, lifetimes from the restore, counters";
-   EXPECT_EQ(posted(kOtherPort, "portdb.entry.added"), 5u);
-
-   // The 30-second lease ends 30 s after the restore, and not before.
-   host().clock().advance(30s);
-   EXPECT_EQ(context(destination)->numVmiEntries, 5u);
-   host().clock().advance(20s);
-   EXPECT_EQ(context(destination)->numVmiEntries, 4u);
-}
-
 TEST_F(SavedStateTest, the_error_rate_limit_state_keeps_its_remaining_seconds)
 {
    const host::FilterId source = create();

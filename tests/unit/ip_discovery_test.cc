@@ -230,24 +230,6 @@ TEST_F(IpDiscoveryTest, a_client_on_one_vlan_never_touches_its_binding_or_reques
    EXPECT_EQ(vmis()[0]->vlanId, 0);
 }
 
-TEST_F(IpDiscoveryTest, foreign_chaddr_is_dropped_on_an_untrusted_port_only)
-{
-   Dhcp spoofed = clientMsg(kDhcpRequest, 0x700);
-   spoofed.chaddr = kOtherMac;
-
-   ctx_.config.trusted = 0;
-   const Outcome untrusted = fromVm(spoofed);
-   EXPECT_EQ(untrusted.verdict, SwSecVerdictDrop);
-   EXPECT_EQ(ctx_.counters.dhcpSnoopingDropCnt, 1u);
-   EXPECT_EQ(ctx_.numDhcpReqs, 0u);
-
-   ctx_.config.trusted = 1;
-   const Outcome trusted = fromVm(spoofed);
-   EXPECT_EQ(trusted.verdict, SwSecVerdictPass);
-   EXPECT_EQ(ctx_.counters.dhcpSnoopingDropCnt, 1u);
-   EXPECT_EQ(ctx_.numDhcpReqs, 1u);
-}
-
 TEST_F(IpDiscoveryTest, client_with_an_identifier_and_without_one_are_two_clients)
 {
    bind(kLeased, 0x800, 3600, Bytes{1, 0xaa, 0xbb});
@@ -438,20 +420,6 @@ TEST_F(IpDiscoveryTest, traffic_refreshes_non_authoritative_entries_under_the_sh
                             SwSecDirectionTx);
    EXPECT_FALSE(ip.askedForWriteLock);
    EXPECT_EQ(vmis().at(0)->expiryTime, uptime() + 180);
-}
-
-TEST_F(IpDiscoveryTest, traffic_leaves_authoritative_entries_alone)
-{
-   bind(kLeased, 0x100, 500);
-   const int64_t expiry = vmis().at(0)->expiryTime;
-   advanceSeconds(100);
-   EXPECT_FALSE(judge(arp(1, kLeased, kPeerIp), SwSecDirectionTx).askedForWriteLock);
-   EXPECT_FALSE(judge(udpFrame({.src = kVmMac, .dst = kServerMac, .ipSrc = kLeased, .ipDst = kServerIp}),
-                      SwSecDirectionTx)
-                   .askedForWriteLock);
-   ASSERT_EQ(vmis().size(), 1u);
-   EXPECT_EQ(vmis()[0]->discoveryMethod, SwSecDiscDhcpSnooping);
-   EXPECT_EQ(vmis()[0]->expiryTime, expiry);
 }
 
 TEST_F(IpDiscoveryTest, untrusted_port_learns_and_refreshes_nothing)

@@ -4,6 +4,7 @@
 //
 //   seed_corpus OUT_DIR CAPTURE...
 // makes OUT_DIR/dhcp_parse_fuzz, OUT_DIR/frame_fuzz and OUT_DIR/control_fuzz.
+#include "replay/capture.h"
 #include "tests/support/security_config.h"
 
 #include <cstdint>
@@ -11,7 +12,6 @@
 #include <filesystem>
 #include <fstream>
 #include <iterator>
-#include <stdexcept>
 #include <string>
 #include <vector>
 
@@ -20,50 +20,13 @@ namespace {
 namespace fs = std::filesystem;
 using Bytes = std::vector<uint8_t>;
 
-constexpr uint32_t kLinkTypeEthernet = 1;
-constexpr size_t kGlobalHeaderLen = 24;
-constexpr size_t kRecordHeaderLen = 16;
-
-uint32_t readU32(const Bytes &bytes, size_t at, bool swapped)
-{
-   uint32_t value = 0;
-   for (size_t i = 0; i < 4; ++i) {
-      const size_t index = swapped ? at + i : at + 3 - i;
-      value = value << 8 | bytes[index];
-   }
-   return value;
-}
-
-// The frames of a classic capture file (either byte order, micro- or
-// nanosecond stamps), each record bounded by the file's length.
+// The frames of a capture file, read as `swsec replay` reads them.
 std::vector<Bytes> framesOf(const fs::path &path)
 {
-   std::ifstream file(path, std::ios::binary);
-   const Bytes bytes{std::istreambuf_iterator<char>(file), std::istreambuf_iterator<char>()};
-   if (bytes.size() < kGlobalHeaderLen) {
-      throw std::runtime_error(path.string() + ": too short for a capture");
-   }
-   const uint32_t magic = readU32(bytes, 0, false);
-   bool swapped = false;
-   if (magic == 0xd4c3b2a1u || magic == 0x4d3cb2a1u) {
-      swapped = true;
-   } else if (magic != 0xa1b2c3d4u && magic != 0xa1b23c4du) {
-      throw std::runtime_error(path.string() + ": not a capture file");
-   }
-   if (readU32(bytes, 20, swapped) != kLinkTypeEthernet) {
-      throw std::runtime_error(path.string() + ": not Ethernet");
-   }
+   swsec::replay::CaptureReader reader(path.string());
    std::vector<Bytes> frames;
-   size_t at = kGlobalHeaderLen;
-   while (bytes.size() - at >= kRecordHeaderLen) {
-      const uint32_t length = readU32(bytes, at + 8, swapped);
-      at += kRecordHeaderLen;
-      if (length > bytes.size() - at) {
-         throw std::runtime_error(path.string() + ": record past the end");
-      }
-      frames.emplace_back(bytes.begin() + static_cast<std::ptrdiff_t>(at),
-                          bytes.begin() + static_cast<std::ptrdiff_t>(at + length));
-      at += length;
+   for (swsec::replay::CaptureFrame frame; reader.next(frame);) {
+      frames.emplace_back(frame.bytes.begin(), frame.bytes.end());
    }
    return frames;
 }

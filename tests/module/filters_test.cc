@@ -294,15 +294,6 @@ INSTANTIATE_TEST_SUITE_P(
 
 // ---------------------------------------------------------------- policy
 
-TEST_F(FilterTest, the_spanning_tree_filter_drops_bpdus_both_ways)
-{
-   const host::FilterId id = port({.features = SwSecFeatureBpduFilter});
-   for (uint32_t direction : {kTx, kRx}) {
-      EXPECT_THAT(kept(id, direction, {bpduFrame(kVmMac), bpduFrame(kVmMac, kPvstMac), udpFrom(kVmIp)}),
-                  ElementsAre(2u));
-   }
-}
-
 TEST_F(FilterTest, server_block_drops_dhcp_server_frames_only_from_the_vm)
 {
    const host::FilterId id = port({.features = SwSecFeatureBlockDhcpServer});

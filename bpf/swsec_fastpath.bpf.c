@@ -53,6 +53,13 @@ struct {
    __uint(max_entries, SWSEC_FP_PUNT_RING_BYTES);
 } swsec_punts SEC(".maps");
 
+struct {
+   __uint(type, BPF_MAP_TYPE_ARRAY);
+   __uint(max_entries, 1);
+   __type(key, __u32);
+   __type(value, struct swsec_fp_arp_budget);
+} swsec_arp_budget SEC(".maps");
+
 /* A punt record is built here, then copied into the ring at its own size. */
 struct swsec_fp_punt_slot {
    struct swsec_fp_punt head;
@@ -173,6 +180,24 @@ static __always_inline int swsec_judge(struct __sk_buff *skb, __u32 direction)
    const __u16 ethertype = swsec_load_be16(type);
    const __u8 *l3 = type + 2;
 
+   /* A VM's ARP flood, and its frames in the error state, are cut here
+    * above the module's own limit: the VM cannot flood user space. */
+   if (direction == SWSEC_FP_DIR_FROM_VM && port->arp_punts != 0 &&
+       (ethertype == ETH_P_ARP || (port->flags & SWSEC_FP_PORT_ERR_STATE))) {
+      struct swsec_fp_arp_budget *budget = bpf_map_lookup_elem(&swsec_arp_budget, &zero);
+      if (budget) {
+         const __u64 second = bpf_ktime_get_ns() / 1000000000ull;
+         if (budget->second != second) {
+            budget->second = second;
+            budget->punts = 0;
+         }
+         /* Not atomic: CPUs racing may punt a few more, never fewer. */
+         if (budget->punts++ >= port->arp_punts) {
+            swsec_count(SWSEC_FP_DROP_ARP_BUDGET);
+            return TC_ACT_SHOT;
+         }
+      }
+   }
    if (direction == SWSEC_FP_DIR_FROM_VM && (port->flags & SWSEC_FP_PORT_ERR_STATE))
       return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_ERR_STATE);
    if ((features & SWSEC_FP_FEATURE_BPDU_FILTER) &&

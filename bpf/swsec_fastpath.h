@@ -50,11 +50,26 @@ struct swsec_fp_port {
    __u32 flags;    /* SWSEC_FP_PORT_* */
    __u32 port_id;  /* the switch port ID, copied into punt records */
    __u32 vm_ifindex; /* where the re-injection program sends frames the module passed */
+   __u32 arp_punts;  /* ARP frames, and frames in the error state, from the VM punted a second
+                        at most, the rest dropped; 0: all */
 };
-SWSEC_FP_STATIC_ASSERT(sizeof(struct swsec_fp_port) == 16, "swsec_fp_port layout");
+SWSEC_FP_STATIC_ASSERT(sizeof(struct swsec_fp_port) == 20, "swsec_fp_port layout");
 SWSEC_FP_STATIC_ASSERT(offsetof(struct swsec_fp_port, flags) == 4, "swsec_fp_port layout");
 SWSEC_FP_STATIC_ASSERT(offsetof(struct swsec_fp_port, port_id) == 8, "swsec_fp_port layout");
 SWSEC_FP_STATIC_ASSERT(offsetof(struct swsec_fp_port, vm_ifindex) == 12, "swsec_fp_port layout");
+SWSEC_FP_STATIC_ASSERT(offsetof(struct swsec_fp_port, arp_punts) == 16, "swsec_fp_port layout");
+
+/* The ARP and error-state punts of the current second (swsec_arp_budget, array of 1). */
+struct swsec_fp_arp_budget {
+   __u64 second; /* bpf_ktime_get_ns() / 1e9 of the count */
+   __u32 punts;
+   __u32 reserved;
+};
+SWSEC_FP_STATIC_ASSERT(sizeof(struct swsec_fp_arp_budget) == 16, "swsec_fp_arp_budget layout");
+
+/* The module's ARP rate limit times this, and at least the floor, is the punt budget. */
+#define SWSEC_FP_ARP_PUNT_FACTOR 4u
+#define SWSEC_FP_ARP_PUNT_FLOOR 1000u
 
 /* Feature bits of `features` that the program reads (the module's values). */
 #define SWSEC_FP_FEATURE_BPDU_FILTER 0x01u
@@ -100,7 +115,8 @@ SWSEC_FP_STATIC_ASSERT(sizeof(struct swsec_fp_binding) == 4, "swsec_fp_binding l
    X(SWSEC_FP_PUNT_UNPARSED, "punted: header not parsed")                     \
    X(SWSEC_FP_PUNT_ERR_STATE, "punted: error-rate-limit state")               \
    X(SWSEC_FP_PUNT_REFRESH, "punted: binding refresh")                        \
-   X(SWSEC_FP_PUNT_LOST, "lost: punt ring full")
+   X(SWSEC_FP_PUNT_LOST, "lost: punt ring full")                             \
+   X(SWSEC_FP_DROP_ARP_BUDGET, "dropped: over the punt budget")
 
 #define SWSEC_FP_REASON_ENUM(name, text) name,
 enum swsec_fp_reason { SWSEC_FP_REASON_LIST(SWSEC_FP_REASON_ENUM) SWSEC_FP_REASON_COUNT };

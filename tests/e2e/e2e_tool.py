@@ -9,6 +9,9 @@
   tcp-sink PORT                               takes one connection, prints the bytes received
   tcp-send HOST PORT BYTES                    sends BYTES bytes, exits 0 once all went
   junk SOCKET                                 junk and a stalled request to a control socket
+  arp-flood IFACE VM_MAC VM_IP COUNT          COUNT ARP requests from the VM as fast as it can
+  after-ack IFACE PORT SECONDS                waits for a DHCP ACK to IFACE's MAC and at once sends a
+                                              datagram from the address it gives to the server's PORT
 """
 import socket
 import sys
@@ -137,6 +140,57 @@ def junk(path):
     print("ok")
 
 
+def raw_socket(iface):
+    sock = socket.socket(socket.AF_PACKET, socket.SOCK_RAW, socket.htons(0x0003))
+    sock.bind((iface, 0))
+    return sock
+
+
+def mac_of(iface):
+    with open("/sys/class/net/%s/address" % iface) as f:
+        return bytes.fromhex(f.read().strip().replace(":", ""))
+
+
+def arp_flood(iface, vm_mac, vm_ip, count):
+    sock = raw_socket(iface)
+    mac = bytes.fromhex(vm_mac.replace(":", ""))
+    frame = (b"\xff" * 6 + mac + b"\x08\x06" + bytes.fromhex("0001080006040001") + mac + socket.inet_aton(vm_ip) +
+             b"\x00" * 6 + socket.inet_aton("192.0.2.1") + b"\x00" * 18)
+    for _ in range(count):
+        sock.send(frame)
+
+
+def ipv4_checksum(header):
+    total = sum(int.from_bytes(header[i:i + 2], "big") for i in range(0, len(header), 2))
+    while total >> 16:
+        total = (total & 0xffff) + (total >> 16)
+    return (~total & 0xffff).to_bytes(2, "big")
+
+
+def after_ack(iface, port, seconds):
+    sock = raw_socket(iface)
+    sock.settimeout(seconds)
+    mac = mac_of(iface)
+    while True:
+        frame = sock.recv(2048)
+        ip = frame[14:]
+        if frame[12:14] != b"\x08\x00" or ip[9] != 17:
+            continue
+        udp = ip[(ip[0] & 15) * 4:]
+        bootp = udp[8:]
+        if udp[0:4] != b"\x00\x43\x00\x44" or bootp[28:34] != mac or b"\x35\x01\x05" not in bootp[240:]:
+            continue
+        yiaddr = bootp[16:20]
+        payload = b"first"
+        header = bytearray(b"\x45\x00" + (28 + len(payload)).to_bytes(2, "big") + b"\x00\x00\x40\x00\x40\x11\x00\x00" +
+                           yiaddr + ip[12:16])
+        header[10:12] = ipv4_checksum(bytes(header))
+        datagram = (4000).to_bytes(2, "big") + port.to_bytes(2, "big") + (8 + len(payload)).to_bytes(2, "big") + b"\x00\x00"
+        sock.send(frame[6:12] + mac + b"\x08\x00" + bytes(header) + datagram + payload)
+        print(socket.inet_ntoa(yiaddr))
+        return
+
+
 def main():
     command, args = sys.argv[1], sys.argv[2:]
     if command == "attack":
@@ -151,6 +205,10 @@ def main():
         tcp_sink(int(args[0]))
     elif command == "tcp-send":
         tcp_send(args[0], int(args[1]), int(args[2]))
+    elif command == "arp-flood":
+        arp_flood(args[0], args[1], args[2], int(args[3]))
+    elif command == "after-ack":
+        after_ack(args[0], int(args[1]), float(args[2]))
     elif command == "junk":
         junk(args[0])
     else:

@@ -101,12 +101,22 @@ grep -q "vm2: .*saved state refused: .*the port starts empty" "$work/inline.log"
 sw_ctl ports --json | json "all(p['running'] for p in d)" | grep -qx True || fail "a port did not start"
 sw_ctl bindings vm2 --json | json "len(d)" | grep -qx 0 || fail "vm2 not empty: $(sw_ctl bindings vm2 --json)"
 binding vm1 "$vm1_ip" "$vm1_mac" | grep -q "DHCP Snooping" || fail "vm1's binding lost with vm2's file"
-# vm2 gets its lease again, as a VM would once its renewal failed.
+# vm2 gets its lease again, as a VM would once its renewal failed. A
+# datagram it sends from the leased address the moment the ACK arrives
+# passes: the binding is in force before the ACK reaches the VM.
 kill -TERM "$udhcpc_pid"; wait "$udhcpc_pid" 2>/dev/null
+spawn ip netns exec "$srv" "$python" "$tool" udp-listen 9998 20 "$vm2_ip" >"$work/first.out"
+listen_pid=$spawned
+wait_for 5 grep -q listening "$work/first.out" || fail "UDP listener did not start"
+spawn ip netns exec "$vm2" "$python" "$tool" after-ack eth0 9998 20 >"$work/after-ack.out"
+sleep 0.5
 spawn ip netns exec "$vm2" udhcpc -f -R -i eth0 -s "$work/udhcpc-script" -t 10 -T 1 >>"$work/udhcpc.log" 2>&1
 udhcpc_pid=$spawned
 wait_for 20 bash -c "binding vm2 $vm2_ip $vm2_mac | grep -q 'DHCP Snooping'" \
   || fail "vm2 not learned again: $(sw_ctl bindings --json)"
+wait "$listen_pid"
+grep -qx "$vm2_ip" "$work/first.out" \
+  || fail "vm2's first datagram after its ACK was dropped: $(cat "$work/after-ack.out" "$work/first.out")"
 spawn "$swsec" ctl --ctl "$ctl" watch --json >>"$work/watch.log" 2>&1
 
 # ---------------------------------------------------------------- own traffic
@@ -194,6 +204,15 @@ sw_ctl clear vm2 0 "$vm2_mac" "$vm2_ip" >/dev/null || fail "clearing one binding
 wait_for 5 bash -c "! sw_ctl bindings vm2 --json | grep -q '\"$vm2_ip\"'" || fail "the cleared binding is still there"
 out=$(sw_ctl clear vm2 0 not-a-mac 192.0.2.1 2>&1) && fail "a malformed MAC was accepted"
 grep -q "refused" <<<"$out" || fail "malformed clear not explained: $out"
+
+if [ "$datapath" = kernel ]; then
+  step "an ARP flood from vm2 is cut in the kernel, counted with the module's rate limit drops"
+  in_ns "$vm2" "$python" "$tool" arp-flood eth0 "$vm2_mac" "$vm2_ip" 5000
+  [ "$(counter vm2 "['kernel']['dropped: over the punt budget']")" -gt 0 ] || fail "the ARP flood was punted whole"
+  punted=$(( $(counter vm2 "['kernel']['punted: ARP']") + $(counter vm2 "['kernel']['punted: error-rate-limit state']") ))
+  [ "$punted" -lt 4500 ] || fail "the ARP flood reached swsec: $punted frames punted"
+  [ "$(counter vm2 "['drops']['txRateLimitDropCnt']")" -gt 3000 ] || fail "the flood's drops not counted"
+fi
 
 # ---------------------------------------------------------------- a port goes
 step "a port whose interface disappears stops alone"

@@ -64,7 +64,8 @@ std::string labelValue(const std::string &value)
 std::string humanText(const std::string &command, const nlohmann::json &result)
 {
    if (command == "ports") {
-      std::vector<std::vector<std::string>> rows{{"PORT", "INTERFACE", "BRIDGE", "ID", "STATE", "FAIL", "CONFIG"}};
+      std::vector<std::vector<std::string>> rows{
+         {"PORT", "INTERFACE", "BRIDGE", "ID", "STATE", "FAIL", "DATA PATH", "CONFIG"}};
       for (const auto &port : result) {
          std::string state = port.value("running", false) ? "guarding" : "stopped";
          const std::string reason = port.value("stopReason", "");
@@ -73,7 +74,9 @@ std::string humanText(const std::string &command, const nlohmann::json &result)
          }
          const std::string config = port.value("config", "");
          rows.push_back({field(port, "name"), field(port, "interface"), field(port, "bridge"), field(port, "portId"),
-                         state, field(port, "failMode"), config.empty() ? "(defaults)" : config});
+                         state, field(port, "failMode"),
+                         field(port, "datapath") + (port.contains("datapathReason") ? " (" + field(port, "datapathReason") + ")" : ""),
+                         config.empty() ? "(defaults)" : config});
       }
       return textTable(rows);
    }
@@ -92,14 +95,19 @@ std::string humanText(const std::string &command, const nlohmann::json &result)
    }
    if (command == "counters") {
       std::vector<std::vector<std::string>> rows{
-         {"PORT", "TO-VM PASSED", "TO-VM DROPPED", "FROM-VM PASSED", "FROM-VM DROPPED", "LOST", "DROP COUNTERS"}};
+         {"PORT", "DATA PATH", "TO-VM PASSED", "TO-VM DROPPED", "FROM-VM PASSED", "FROM-VM DROPPED", "LOST", "DROP COUNTERS"}};
+      std::string kernel;
       for (const auto &port : result) {
+         // What the kernel's program did itself, by reason, under the table.
+         for (const auto &[reason, count] : member(port, "kernel").items()) {
+            kernel += field(port, "port") + " kernel: " + reason + " " + count.dump() + "\n";
+         }
          const nlohmann::json &frames = member(port, "frames");
          std::string drops;
          for (const auto &[name, count] : member(port, "drops").items()) {
             drops += (drops.empty() ? "" : " ") + name + "=" + count.dump();
          }
-         rows.push_back({field(port, "port"), field(member(frames, "to-vm"), "passed"),
+         rows.push_back({field(port, "port"), field(port, "datapath"), field(member(frames, "to-vm"), "passed"),
                          field(member(frames, "to-vm"), "dropped"),
                          field(member(frames, "from-vm"), "passed"),
                          field(member(frames, "from-vm"), "dropped"),
@@ -107,7 +115,7 @@ std::string humanText(const std::string &command, const nlohmann::json &result)
                                         port.value("sendErrors", 0ULL)),
                          drops.empty() ? "-" : drops});
       }
-      return textTable(rows);
+      return textTable(rows) + kernel;
    }
    if (command == "clear") {
       return "cleared " + std::string(result.value("cleared", "") == "one" ? "the binding" : "every binding") +
@@ -152,6 +160,22 @@ std::string metricsText(const nlohmann::json &counters)
    for (const auto &port : counters) {
       out << "swsec_port_up{port=\"" << labelValue(field(port, "port")) << "\"} "
           << (port.value("running", false) ? 1 : 0) << "\n";
+   }
+   out << "# HELP swsec_port_datapath 1 for the data path that carries the port's frames.\n"
+          "# TYPE swsec_port_datapath gauge\n";
+   for (const auto &port : counters) {
+      if (port.contains("datapath")) {
+         out << "swsec_port_datapath{port=\"" << labelValue(field(port, "port")) << "\",datapath=\""
+             << labelValue(field(port, "datapath")) << "\"} 1\n";
+      }
+   }
+   out << "# HELP swsec_kernel_frames_total Frames the kernel fast path decided or punted, by reason.\n"
+          "# TYPE swsec_kernel_frames_total counter\n";
+   for (const auto &port : counters) {
+      for (const auto &[reason, count] : member(port, "kernel").items()) {
+         out << "swsec_kernel_frames_total{port=\"" << labelValue(field(port, "port")) << "\",reason=\""
+             << labelValue(reason) << "\"} " << count.get<uint64_t>() << "\n";
+      }
    }
    out << "# HELP swsec_frames_total Frames the port judged, by direction and verdict.\n"
           "# TYPE swsec_frames_total counter\n";

@@ -331,6 +331,8 @@ void Program::describe(const PortDescription &description)
    value.features = description.features;
    value.port_id = description.portId;
    value.vm_ifindex = before.vm_ifindex;
+   const uint64_t punts = std::max<uint64_t>(SWSEC_FP_ARP_PUNT_FLOOR, uint64_t{description.arpRateLimit} * SWSEC_FP_ARP_PUNT_FACTOR);
+   value.arp_punts = description.arpRateLimit == 0 ? 0 : static_cast<uint32_t>(std::min<uint64_t>(punts, UINT32_MAX));
    value.flags = (before.flags & SWSEC_FP_PORT_OWN_QDISC) | SWSEC_FP_PORT_READY | (description.trusted ? SWSEC_FP_PORT_TRUSTED : 0u) |
                  (description.errorState ? SWSEC_FP_PORT_ERR_STATE : 0u);
    const uint32_t zero = 0;

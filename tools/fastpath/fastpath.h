@@ -63,6 +63,7 @@ struct PortDescription {
    uint32_t features = 0;        // featuresEnabled
    bool trusted = false;
    bool errorState = false;      // in the error-rate-limit state
+   uint32_t arpRateLimit = 0;    // ARP frames a second; 0: none
    std::vector<Binding> bindings;
 };
 

@@ -95,6 +95,7 @@ PortDescription readPort(host::Host &host, host::FilterId filter, uint32_t portI
    }
    std::memcpy(&port.features, config.data() + kConfigFeaturesOffset, sizeof port.features);
    port.trusted = config[kConfigTrustedOffset] != 0;
+   std::memcpy(&port.arpRateLimit, config.data() + offsetof(SwSecConfig, arpRateLimit), sizeof port.arpRateLimit);
    port.errorState = readErrorState(host, portId, port.features);
 
    std::vector<int64_t> instances;

@@ -648,8 +648,8 @@ nlohmann::json InlineDaemon::countersJson(Port &port)
       entry["kernel"] = byReason;
       frames["from-vm"]["passed"] = frames["from-vm"]["passed"].get<uint64_t>() + counts[SWSEC_FP_PASSED];
       frames["to-vm"]["passed"] = frames["to-vm"]["passed"].get<uint64_t>() + counts[SWSEC_FP_PASSED_TO_VM];
-      frames["from-vm"]["dropped"] =
-         frames["from-vm"]["dropped"].get<uint64_t>() + counts[SWSEC_FP_DROP_IP_SOURCE_GUARD];
+      frames["from-vm"]["dropped"] = frames["from-vm"]["dropped"].get<uint64_t>() +
+                                     counts[SWSEC_FP_DROP_IP_SOURCE_GUARD] + counts[SWSEC_FP_DROP_ARP_BUDGET];
    }
    entry["frames"] = frames;
    entry["truncated"] = counters.truncated.load();
@@ -660,9 +660,12 @@ nlohmann::json InlineDaemon::countersJson(Port &port)
    }
    const session::PortState state = session_.readState(port.guarded->options().portID);
    entry["drops"] = state.counters;
-   if (kernel != nullptr && entry["drops"].contains("ipSrcGuardDropCnt")) {
-      entry["drops"]["ipSrcGuardDropCnt"] =
-         entry["drops"]["ipSrcGuardDropCnt"].get<uint64_t>() + kernel->guardDropsSinceConfigured();
+   if (kernel != nullptr) {
+      for (const auto &[name, drops] : kernel->dropsSinceConfigured()) {
+         if (entry["drops"].contains(name)) {
+            entry["drops"][name] = entry["drops"][name].get<uint64_t>() + drops;
+         }
+      }
    }
    nlohmann::json methods = {{"DHCP Snooping", 0}, {"Static", 0}, {"TOFU", 0}, {"ARP Snooping", 0}};
    for (const auto &binding : state.portDb) {
@@ -705,14 +708,15 @@ nlohmann::json InlineDaemon::handle(const nlohmann::json &request)
       nlohmann::json fields = session::featureSummaryJson(state);
       std::string text = state.featureSummaryText;
       if (KernelPath *kernel = port.guarded->kernel()) {
-         // The module's summary with the program's source guard drops added.
-         const uint64_t drops = kernel->guardDropsSinceConfigured();
-         if (fields.contains("ipSrcGuardDropCnt") && fields["ipSrcGuardDropCnt"].is_string()) {
-            fields["ipSrcGuardDropCnt"] = std::to_string(std::stoull(fields["ipSrcGuardDropCnt"].get<std::string>()) + drops);
-         } else if (fields.contains("ipSrcGuardDropCnt") && fields["ipSrcGuardDropCnt"].is_number()) {
-            fields["ipSrcGuardDropCnt"] = fields["ipSrcGuardDropCnt"].get<uint64_t>() + drops;
+         // The module's summary with the program's drops added.
+         uint64_t inKernel = 0;
+         for (const auto &[name, drops] : kernel->dropsSinceConfigured()) {
+            if (fields.contains(name) && fields[name].is_number()) {
+               fields[name] = fields[name].get<uint64_t>() + drops;
+            }
+            inKernel += drops;
          }
-         text += "Data path: kernel (" + std::to_string(drops) + " of the IP source guard drops in the kernel)\n";
+         text += "Data path: kernel (" + std::to_string(inKernel) + " of the drops above made in the kernel)\n";
       } else {
          text += "Data path: user\n";
       }

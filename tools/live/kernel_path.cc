@@ -182,7 +182,7 @@ void KernelPath::start(host::FilterId filter)
    mirror_.emplace(*program_, session_.host(), filter_, options_.portID);
    feed_.follow(options_.portID, &*mirror_);
    feed_.restart(options_.portID);
-   guardBase_ = program_->counters()[SWSEC_FP_DROP_IP_SOURCE_GUARD];
+   configured();
 
    injectIfindex_ = static_cast<int>(if_nametoindex(options_.injectEnd.c_str()));
    const int programIfindex = static_cast<int>(if_nametoindex(options_.programEnd.c_str()));
@@ -206,7 +206,8 @@ void KernelPath::start(host::FilterId filter)
 void KernelPath::configured()
 {
    feed_.restart(options_.portID);
-   guardBase_ = program_->counters()[SWSEC_FP_DROP_IP_SOURCE_GUARD];
+   std::lock_guard guard(baseMutex_);
+   base_ = program_->counters();
 }
 
 fastpath::Counters KernelPath::counters() const
@@ -214,9 +215,15 @@ fastpath::Counters KernelPath::counters() const
    return program_ ? program_->counters() : fastpath::Counters{};
 }
 
-uint64_t KernelPath::guardDropsSinceConfigured() const
+std::map<std::string, uint64_t> KernelPath::dropsSinceConfigured() const
 {
-   return program_ ? program_->counters()[SWSEC_FP_DROP_IP_SOURCE_GUARD] - guardBase_ : 0;
+   if (!program_) {
+      return {};
+   }
+   const fastpath::Counters now = program_->counters();
+   std::lock_guard guard(baseMutex_);
+   return {{"ipSrcGuardDropCnt", now[SWSEC_FP_DROP_IP_SOURCE_GUARD] - base_[SWSEC_FP_DROP_IP_SOURCE_GUARD]},
+           {"txRateLimitDropCnt", now[SWSEC_FP_DROP_ARP_BUDGET] - base_[SWSEC_FP_DROP_ARP_BUDGET]}};
 }
 
 void KernelPath::inject(fastpath::Punt &punt)

@@ -84,7 +84,9 @@ public:
    // The module's counters restarted (a new configuration): the program's
    // drops counted so far are no longer to be added to them.
    void configured();
-   uint64_t guardDropsSinceConfigured() const;
+   // The program's drops since then, by the module's drop counter they add
+   // to (IP source guard; ARP over the punt budget to the rate limit's).
+   std::map<std::string, uint64_t> dropsSinceConfigured() const;
 
 private:
    void inject(fastpath::Punt &punt);
@@ -100,7 +102,8 @@ private:
    std::unique_ptr<fastpath::Attachment> vmHooks_;
    int sockets_[3] = {-1, -1, -1};   // by direction: the marked sockets on the injection end
    int injectIfindex_ = 0;
-   std::atomic<uint64_t> guardBase_{0};
+   fastpath::Counters base_;   // at the last configuration
+   mutable std::mutex baseMutex_;
 };
 
 // Completes the TCP or UDP checksum of an IPv4 frame whose checksum field

@@ -89,12 +89,15 @@ int takePunt(void *context, void *data, size_t size)
    punt.reason = head.reason;
    punt.frameLen = head.frame_len;
    punt.truncated = head.captured < head.frame_len;
-   if ((head.flags & SWSEC_FP_PUNT_TAG_IN_BYTES) != 0 && head.captured >= 18) {
-      punt.bytes.assign(bytes, bytes + 12);
-      punt.bytes.insert(punt.bytes.end(), bytes + 16, bytes + head.captured);
-   } else {
-      punt.bytes.assign(bytes, bytes + head.captured);
+   // One copy around the tag: the addresses, then what follows it.
+   const size_t tag = (head.flags & SWSEC_FP_PUNT_TAG_IN_BYTES) != 0 && head.captured >= 18 ? 4 : 0;
+   const size_t addresses = tag != 0 ? 12 : 0;
+   punt.bytes.resize(head.captured - tag);
+   if (punt.bytes.empty()) {
+      return 0;   // the program punts no empty frame
    }
+   std::memcpy(punt.bytes.data(), bytes, addresses);
+   std::memcpy(punt.bytes.data() + addresses, bytes + addresses + tag, head.captured - tag - addresses);
    if (*sink) {
       (*sink)(std::move(punt));
    }

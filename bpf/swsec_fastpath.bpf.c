@@ -157,7 +157,7 @@ static __always_inline int swsec_judge(struct __sk_buff *skb, __u32 direction)
       frame.vlan = skb->vlan_tci & 0x0fff;
    } else if (data + 18 <= end) {
       const __u16 tpid = swsec_load_be16(data + 12);
-      if (tpid == ETH_P_8021Q || tpid == ETH_P_8021AD_) {
+      if (tpid == ETH_P_8021Q || tpid == ETH_P_8021AD_ || tpid == ETH_P_QINQ_) {
          frame.vlan = swsec_load_be16(data + 14) & 0x0fff;
          frame.tag_in_bytes = 1;
          l2 = 16;
@@ -206,6 +206,16 @@ static __always_inline int swsec_judge(struct __sk_buff *skb, __u32 direction)
       return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_BPDU);
    if (ethertype == ETH_P_8021Q || ethertype == ETH_P_8021AD_ || ethertype == ETH_P_QINQ_)
       return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_TAGGED);
+   /* The frame guard's ethertype list, as the module checks it first on frames from the VM. */
+   if (direction == SWSEC_FP_DIR_FROM_VM && port->num_ether_types != 0) {
+      int listed = 0;
+      for (__u32 i = 0; i < SWSEC_FP_MAX_ETHER_TYPES; i++)
+         listed |= i < port->num_ether_types && port->ether_types[i] == ethertype;
+      if (!listed) {
+         swsec_count(SWSEC_FP_DROP_ETHER_TYPE);
+         return TC_ACT_SHOT;
+      }
+   }
    if (ethertype == ETH_P_ARP)
       return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_ARP);
 

@@ -44,6 +44,9 @@
 #define SWSEC_FP_MARK_TO_VM 0x53570001u
 #define SWSEC_FP_MARK_FROM_VM 0x53570002u
 
+/* The ethertypes a port's frame guard lists at most (the module's). */
+#define SWSEC_FP_MAX_ETHER_TYPES 8
+
 /* The port's configuration and error state, as the module has them. */
 struct swsec_fp_port {
    __u32 features; /* the module's featuresEnabled bits */
@@ -52,8 +55,12 @@ struct swsec_fp_port {
    __u32 vm_ifindex; /* where the re-injection program sends frames the module passed */
    __u32 arp_punts;  /* ARP frames, and frames in the error state, from the VM punted a second
                         at most, the rest dropped; 0: all */
+   __u32 num_ether_types; /* 0: the VM may send every ethertype; else only the first these of: */
+   __u16 ether_types[SWSEC_FP_MAX_ETHER_TYPES]; /* host order */
 };
-SWSEC_FP_STATIC_ASSERT(sizeof(struct swsec_fp_port) == 20, "swsec_fp_port layout");
+SWSEC_FP_STATIC_ASSERT(sizeof(struct swsec_fp_port) == 40, "swsec_fp_port layout");
+SWSEC_FP_STATIC_ASSERT(offsetof(struct swsec_fp_port, num_ether_types) == 20, "swsec_fp_port layout");
+SWSEC_FP_STATIC_ASSERT(offsetof(struct swsec_fp_port, ether_types) == 24, "swsec_fp_port layout");
 SWSEC_FP_STATIC_ASSERT(offsetof(struct swsec_fp_port, flags) == 4, "swsec_fp_port layout");
 SWSEC_FP_STATIC_ASSERT(offsetof(struct swsec_fp_port, port_id) == 8, "swsec_fp_port layout");
 SWSEC_FP_STATIC_ASSERT(offsetof(struct swsec_fp_port, vm_ifindex) == 12, "swsec_fp_port layout");
@@ -116,7 +123,8 @@ SWSEC_FP_STATIC_ASSERT(sizeof(struct swsec_fp_binding) == 4, "swsec_fp_binding l
    X(SWSEC_FP_PUNT_ERR_STATE, "punted: error-rate-limit state")               \
    X(SWSEC_FP_PUNT_REFRESH, "punted: binding refresh")                        \
    X(SWSEC_FP_PUNT_LOST, "lost: punt ring full")                             \
-   X(SWSEC_FP_DROP_ARP_BUDGET, "dropped: over the punt budget")
+   X(SWSEC_FP_DROP_ARP_BUDGET, "dropped: over the punt budget")              \
+   X(SWSEC_FP_DROP_ETHER_TYPE, "dropped: ethertype not listed")
 
 #define SWSEC_FP_REASON_ENUM(name, text) name,
 enum swsec_fp_reason { SWSEC_FP_REASON_LIST(SWSEC_FP_REASON_ENUM) SWSEC_FP_REASON_COUNT };

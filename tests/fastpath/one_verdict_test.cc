@@ -32,6 +32,8 @@ std::vector<Case> allCases()
             cases.emplace_back(entry, file.path());
          }
       }
+      // Every capture, and the stacked tags above all, under a frame guard with an ethertype list.
+      cases.emplace_back(entry, kSource / "tests/fastpath/frame-guard.json");
    }
    return cases;
 }

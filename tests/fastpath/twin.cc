@@ -74,7 +74,7 @@ bool Twin::configure(std::span<const uint8_t> record)
    // As the daemon does on a new configuration: start the mirror over.
    (void)host_.portsets().takePosted();
    mirror_->start();
-   guardBase_ = program_.counters()[SWSEC_FP_DROP_IP_SOURCE_GUARD];   // the module's counters restart
+   base_ = program_.counters();   // the module's counters restart
    return taken;
 }
 
@@ -124,8 +124,12 @@ std::string Twin::counters()
 {
    const auto alone = node(host_, "/security/" + std::to_string(alonePort_) + "/featureSummary");
    auto kernel = node(host_, "/security/" + std::to_string(kernelPort_) + "/featureSummary");
-   if (const uint64_t drops = program_.counters()[SWSEC_FP_DROP_IP_SOURCE_GUARD] - guardBase_; drops != 0) {
-      kernel["ipSrcGuardDropCnt"] = std::to_string(std::stoull(kernel["ipSrcGuardDropCnt"]) + drops);
+   const fastpath::Counters now = program_.counters();
+   for (const auto &[reason, field] : {std::pair{SWSEC_FP_DROP_IP_SOURCE_GUARD, "ipSrcGuardDropCnt"},
+                                      std::pair{SWSEC_FP_DROP_ETHER_TYPE, "etherTypeDropCnt"}}) {
+      if (const uint64_t drops = now[reason] - base_[reason]; drops != 0) {
+         kernel[field] = std::to_string(std::stoull(kernel[field]) + drops);
+      }
    }
    for (const auto &[name, value] : alone) {
       if (kernel[name] != value) {

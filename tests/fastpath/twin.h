@@ -39,7 +39,7 @@ private:
    host::FilterId alone_ = 0;
    host::FilterId kernel_ = 0;
    std::optional<fastpath::Mirror> mirror_;
-   uint64_t guardBase_ = 0;   // the program's source guard drops when the module's counters were cleared
+   fastpath::Counters base_;   // the program's counts when the module's counters were cleared
 };
 
 }  // namespace swsec::testing

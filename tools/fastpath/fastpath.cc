@@ -179,7 +179,7 @@ Untagged takeOuterTag(std::span<const uint8_t> frame)
    Untagged out;
    if (frame.size() >= 18) {
       const uint16_t tpid = static_cast<uint16_t>(frame[12] << 8 | frame[13]);
-      if (tpid == 0x8100 || tpid == 0x88a8) {
+      if (tpid == 0x8100 || tpid == 0x88a8 || tpid == 0x9100) {
          out.vlan = static_cast<uint16_t>((frame[14] << 8 | frame[15]) & 0x0fff);
          out.bytes.assign(frame.begin(), frame.begin() + 12);
          out.bytes.insert(out.bytes.end(), frame.begin() + 16, frame.end());
@@ -314,6 +314,9 @@ swsec_fp_port Program::port() const
 
 void Program::describe(const PortDescription &description)
 {
+   if (description.etherTypes.size() > SWSEC_FP_MAX_ETHER_TYPES) {
+      throw Error("a list of " + std::to_string(description.etherTypes.size()) + " ethertypes", E2BIG);
+   }
    if (description.bindings.size() > SWSEC_FP_MAX_BINDINGS) {
       throw Error("a port of " + std::to_string(description.bindings.size()) + " bindings (at most " +
                      std::to_string(SWSEC_FP_MAX_BINDINGS) + ")",
@@ -334,6 +337,8 @@ void Program::describe(const PortDescription &description)
    value.features = description.features;
    value.port_id = description.portId;
    value.vm_ifindex = before.vm_ifindex;
+   value.num_ether_types = static_cast<uint32_t>(description.etherTypes.size());
+   std::copy(description.etherTypes.begin(), description.etherTypes.end(), value.ether_types);
    const uint64_t punts = std::max<uint64_t>(SWSEC_FP_ARP_PUNT_FLOOR, uint64_t{description.arpRateLimit} * SWSEC_FP_ARP_PUNT_FACTOR);
    value.arp_punts = description.arpRateLimit == 0 ? 0 : static_cast<uint32_t>(std::min<uint64_t>(punts, UINT32_MAX));
    value.flags = (before.flags & SWSEC_FP_PORT_OWN_QDISC) | SWSEC_FP_PORT_READY | (description.trusted ? SWSEC_FP_PORT_TRUSTED : 0u) |

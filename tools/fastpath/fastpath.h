@@ -64,6 +64,7 @@ struct PortDescription {
    bool trusted = false;
    bool errorState = false;      // in the error-rate-limit state
    uint32_t arpRateLimit = 0;    // ARP frames a second; 0: none
+   std::vector<uint16_t> etherTypes;   // the frame guard's list; empty: every ethertype
    std::vector<Binding> bindings;
 };
 

@@ -96,6 +96,17 @@ PortDescription readPort(host::Host &host, host::FilterId filter, uint32_t portI
    std::memcpy(&port.features, config.data() + kConfigFeaturesOffset, sizeof port.features);
    port.trusted = config[kConfigTrustedOffset] != 0;
    std::memcpy(&port.arpRateLimit, config.data() + offsetof(SwSecConfig, arpRateLimit), sizeof port.arpRateLimit);
+   // The frame guard block after the static entries (a version 2 record).
+   uint32_t numStatic = 0;
+   std::memcpy(&numStatic, config.data() + offsetof(SwSecConfig, numStatic), sizeof numStatic);
+   const uint64_t guardAt = SwSecConfigLength(numStatic);
+   if (SwSecConfigHasFrameGuard(config[offsetof(SwSecConfig, version)]) && guardAt + sizeof(SwSecFrameGuard) <= config.size()) {
+      SwSecFrameGuard guard{};
+      std::memcpy(&guard, config.data() + guardAt, sizeof guard);
+      for (uint32_t i = 0; i < guard.numEtherTypes && i < SWSEC_ETHERTYPES_MAX; ++i) {
+         port.etherTypes.push_back(guard.etherTypes[i]);
+      }
+   }
    port.errorState = readErrorState(host, portId, port.features);
 
    std::vector<int64_t> instances;

@@ -648,8 +648,8 @@ nlohmann::json InlineDaemon::countersJson(Port &port)
       entry["kernel"] = byReason;
       frames["from-vm"]["passed"] = frames["from-vm"]["passed"].get<uint64_t>() + counts[SWSEC_FP_PASSED];
       frames["to-vm"]["passed"] = frames["to-vm"]["passed"].get<uint64_t>() + counts[SWSEC_FP_PASSED_TO_VM];
-      frames["from-vm"]["dropped"] = frames["from-vm"]["dropped"].get<uint64_t>() +
-                                     counts[SWSEC_FP_DROP_IP_SOURCE_GUARD] + counts[SWSEC_FP_DROP_ARP_BUDGET];
+      frames["from-vm"]["dropped"] = frames["from-vm"]["dropped"].get<uint64_t>() + counts[SWSEC_FP_DROP_IP_SOURCE_GUARD] +
+                                     counts[SWSEC_FP_DROP_ARP_BUDGET] + counts[SWSEC_FP_DROP_ETHER_TYPE];
    }
    entry["frames"] = frames;
    entry["truncated"] = counters.truncated.load();

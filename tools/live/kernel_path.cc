@@ -223,7 +223,8 @@ std::map<std::string, uint64_t> KernelPath::dropsSinceConfigured() const
    const fastpath::Counters now = program_->counters();
    std::lock_guard guard(baseMutex_);
    return {{"ipSrcGuardDropCnt", now[SWSEC_FP_DROP_IP_SOURCE_GUARD] - base_[SWSEC_FP_DROP_IP_SOURCE_GUARD]},
-           {"txRateLimitDropCnt", now[SWSEC_FP_DROP_ARP_BUDGET] - base_[SWSEC_FP_DROP_ARP_BUDGET]}};
+           {"txRateLimitDropCnt", now[SWSEC_FP_DROP_ARP_BUDGET] - base_[SWSEC_FP_DROP_ARP_BUDGET]},
+           {"etherTypeDropCnt", now[SWSEC_FP_DROP_ETHER_TYPE] - base_[SWSEC_FP_DROP_ETHER_TYPE]}};
 }
 
 void KernelPath::inject(fastpath::Punt &punt)

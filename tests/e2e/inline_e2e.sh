@@ -175,9 +175,12 @@ sw_ctl bindings --json | grep -q 192.0.2.77 && fail "the unsolicited ACK made a 
 # ---------------------------------------------------------------- control
 step "ctl: summary, metrics, bad requests, a refused configuration, SIGHUP"
 sw_ctl summary vm1 --json | json "d['fields']['portMode']" | grep -qx Untrusted || fail "summary"
-sw_ctl metrics | grep -q '^swsec_frames_total{port="vm1",direction="from-vm",verdict="dropped"} [1-9]' \
-  || fail "metrics: $(sw_ctl metrics)"
-sw_ctl metrics | grep -q '^swsec_bindings{port="vm1",method="DHCP Snooping"} 1$' || fail "metrics bindings"
+# Read whole first: grep -q stops reading at its match, and the writer's SIGPIPE would fail the pipe.
+metrics=$(sw_ctl metrics)
+grep -q '^swsec_frames_total{port="vm1",direction="from-vm",verdict="dropped"} [1-9]' <<<"$metrics" \
+  || fail "metrics: $metrics"
+grep -q '^swsec_bindings{port="vm1",method="DHCP Snooping"} 1$' <<<"$metrics" || fail "metrics bindings"
+grep -q "^swsec_port_datapath{port=\"vm1\",datapath=\"$datapath\"} 1$" <<<"$metrics" || fail "metrics data path"
 "$python" "$tool" junk "$ctl" >/dev/null || fail "junk or a stalled client disturbed the control socket"
 out=$(sw_ctl summary nosuchport 2>&1) && fail "an unknown port was accepted"
 grep -q "no port named 'nosuchport'" <<<"$out" || fail "unknown port not named: $out"

@@ -262,7 +262,7 @@ TEST(CtlMetrics, every_series_of_every_port_with_escaped_labels)
       {"port": "vm1", "running": true, "truncated": 0, "sendErrors": 2, "overruns": 4,
        "frames": {"to-vm": {"passed": 5, "dropped": 1}, "from-vm": {"passed": 7, "dropped": 3}},
        "drops": {"daiDropCnt": 2, "ipSrcGuardDropCnt": 1},
-       "bindings": {"DHCP Snooping": 1, "Static": 0}},
+       "bindings": {"DHCP Snooping": 1, "Static": 0}, "ipv6Bindings": {"DHCPv6": 2}},
       {"port": "we\"ird", "running": false, "truncated": 0, "sendErrors": 0,
        "frames": {"to-vm": {"passed": 0, "dropped": 0}, "from-vm": {"passed": 0, "dropped": 0}}}])");
    const std::string text = ctl::metricsText(counters);
@@ -273,6 +273,7 @@ TEST(CtlMetrics, every_series_of_every_port_with_escaped_labels)
            "swsec_frames_total{port=\"vm1\",direction=\"to-vm\",verdict=\"passed\"} 5\n",
            "swsec_module_drops_total{port=\"vm1\",counter=\"daiDropCnt\"} 2\n",
            "swsec_bindings{port=\"vm1\",method=\"DHCP Snooping\"} 1\n",
+           "swsec_ipv6_bindings{port=\"vm1\",method=\"DHCPv6\"} 2\n",
            "swsec_frames_lost_total{port=\"vm1\",reason=\"send-error\"} 2\n",
            "swsec_frames_lost_total{port=\"vm1\",reason=\"overrun\"} 4\n",
            "# TYPE swsec_frames_total counter\n",

@@ -6,6 +6,7 @@
 #include "replay/engine.h"
 #include "session/config_file.h"
 #include "session/error.h"
+#include "session/serializer.h"
 #include "support/ipv6_frames.h"
 
 #include <gtest/gtest.h>
@@ -187,9 +188,20 @@ TEST(ReplayIpv6, dual_stack_attacks_are_dropped_with_their_reasons_and_the_bindi
       EXPECT_EQ(doc["frames"][i].value("reason", ""), script[i].reason ? script[i].reason : "") << i;
    }
    const auto &ipv6 = doc["ports"][0]["ipv6"];
-   EXPECT_EQ(ipv6["bindings"], nlohmann::json::parse(R"([
-      {"vlan": 0, "mac": "02:00:5e:c0:00:01", "ip": "fe80::7", "method": "First come first served", "timeRemaining": 600},
-      {"vlan": 0, "mac": "02:00:5e:c0:00:01", "ip": "2001:db8::7", "method": "DHCPv6", "timeRemaining": 7200}])"));
+   const auto dhcpFields = R"(, "chaddr": null, "clientIdLen": null, "serverIp": null, "leaseTime": null})";
+   EXPECT_EQ(ipv6["bindings"], nlohmann::json::parse(std::string(R"([
+      {"vlan": 0, "mac": "02:00:5e:c0:00:01", "ip": "fe80::7", "method": "First come first served", "timeRemaining": 600)") +
+      dhcpFields + R"(, {"vlan": 0, "mac": "02:00:5e:c0:00:01", "ip": "2001:db8::7", "method": "DHCPv6", "timeRemaining": 7200)" +
+      dhcpFields + "]"));
+   std::vector<std::string> keys, ipv6Keys;
+   const nlohmann::json ipv4Shape = session::bindingJson(session::PortDbEntry{});
+   for (const auto &[key, value] : ipv4Shape.items()) {
+      keys.push_back(key);
+   }
+   for (const auto &[key, value] : ipv6["bindings"][0].items()) {
+      ipv6Keys.push_back(key);
+   }
+   EXPECT_EQ(ipv6Keys, keys) << "one shape for every binding";
    EXPECT_EQ(ipv6["counters"]["raGuardDropCnt"], 1);
    EXPECT_EQ(ipv6["summary"]["numBindings"], 2);
    EXPECT_EQ(doc["ports"][0]["notifications"][1]["name"], "fhs.binding.added");

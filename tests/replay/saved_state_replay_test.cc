@@ -8,6 +8,7 @@
 #include "replay/engine.h"
 #include "session/atomic_file.h"
 #include "session/error.h"
+#include "session/ipv6_saved_state.h"
 #include "session/saved_state_format.h"
 #include "session/state_file.h"
 
@@ -274,6 +275,51 @@ TEST_F(StateTool, time_since_the_save_is_taken_from_each_lifetime_and_what_ran_o
    const ToolRun shown = runTool({"state", "show", "--json", saved});
    EXPECT_EQ(json::parse(shown.out)["savedAt"], 1'700'000'000.0) << shown.err;
    EXPECT_EQ(runTool({"replay", "--vm-mac", kVm, "--restore-state", saved, example()}).status, 0);
+}
+
+// The IPv6 agent's state goes beside the port's (FILE6): shown, aged binding
+// by binding, refused when damaged, and restored with its lifetimes.
+TEST_F(StateTool, ipv6_bindings_are_saved_beside_the_ports_state_aged_and_restored)
+{
+   const std::string saved = (dir_.path() / "port.state").string();
+   const std::string capture = (sourceDir() / "tests/data/attack6-ra-guard.pcap").string();
+   const std::string dualStack = (sourceDir() / "examples/dual-stack.json").string();
+   const std::string vm = "02:00:5e:c0:00:10";
+   ASSERT_EQ(runTool({"replay", "--vm-mac", vm, "--config", dualStack, "--save-state", saved, capture}).status, 0);
+   const ToolRun shown = runTool({"state", "show", "--json", saved + "6"});
+   ASSERT_EQ(shown.status, 0) << shown.err;
+   const json bindings = json::parse(shown.out)["ipv6"]["bindings"];
+   ASSERT_EQ(bindings.size(), 2u);
+   EXPECT_EQ(bindings[1]["ip"], "2001:db8:1::110");
+   EXPECT_EQ(bindings[1]["method"], "DHCPv6");
+
+   const std::vector<uint8_t> blob = session::readStateFile(saved + "6");
+   const uint32_t fcfs = bindings[0]["timeRemaining"], dhcpv6 = bindings[1]["timeRemaining"];
+   const struct {
+      int64_t elapsed;
+      std::vector<uint32_t> left;
+   } ages[] = {{0, {fcfs, dhcpv6}}, {100, {fcfs - 100, dhcpv6 - 100}}, {dhcpv6, {fcfs - dhcpv6}}, {fcfs, {}}};
+   for (const auto &age : ages) {
+      std::vector<uint32_t> left;
+      for (const auto &binding : session::decodeIpv6SavedState(session::ageIpv6SavedState(blob, age.elapsed)).bindings) {
+         left.push_back(binding.remaining);
+      }
+      EXPECT_EQ(left, age.left) << age.elapsed;
+   }
+
+   const ToolRun restored = runTool({"replay", "--json", "--vm-mac", vm, "--restore-state", saved, capture});
+   ASSERT_EQ(restored.status, 0) << restored.err;
+   const json notes = json::parse(restored.out)["ports"][0]["notifications"];
+   ASSERT_GE(notes.size(), 2u);
+   EXPECT_EQ(notes[1]["afterFrame"], 0);
+   EXPECT_EQ(notes[1]["ip"], "2001:db8:1::110");
+
+   std::string damaged(blob.begin(), blob.end());
+   damaged[48 + 104 + 7] = 0x7f;   // a binding limit past the most a port may hold
+   writeFile(saved + "6", damaged);
+   const ToolRun refused = runTool({"state", "show", saved + "6"});
+   EXPECT_EQ(refused.status, 2);
+   EXPECT_NE(refused.err.find("IPv6 configuration refused"), std::string::npos) << refused.err;
 }
 
 // The one writer of state files and capture outputs: a link at the target is

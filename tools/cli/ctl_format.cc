@@ -204,6 +204,15 @@ std::string metricsText(const nlohmann::json &counters)
              << count.get<uint64_t>() << "\n";
       }
    }
+   out << "# HELP swsec_ipv6_bindings IPv6 bindings by how they were learned (ports with the IPv6 agent).\n"
+          "# TYPE swsec_ipv6_bindings gauge\n";
+   for (const auto &port : counters) {
+      const std::string name = labelValue(field(port, "port"));
+      for (const auto &[method, count] : member(port, "ipv6Bindings").items()) {
+         out << "swsec_ipv6_bindings{port=\"" << name << "\",method=\"" << labelValue(method) << "\"} "
+             << count.get<uint64_t>() << "\n";
+      }
+   }
    out << "# HELP swsec_frames_lost_total Frames lost outside the module: the reader fell behind (overrun), too long "
           "for a slot (truncated), refused on send.\n"
           "# TYPE swsec_frames_lost_total counter\n";

@@ -2,6 +2,7 @@
 // --json, a program) without loading a port.
 #include "cli/commands.h"
 
+#include "session/ipv6_saved_state.h"
 #include "session/saved_state_format.h"
 #include "session/json_text.h"
 #include "session/state_file.h"
@@ -26,9 +27,13 @@ int runStateShow(const StateShowOptions &options)
 {
    try {
       const session::StoredState stored = session::readStoredState(options.file);
-      const session::SavedPortState state = session::decodeSavedState(stored.blob);
+      // An IPv6 agent's state (swsec inline keeps it in NAME.state6) or a switch-security one.
+      const bool ipv6 = session::isIpv6SavedState(stored.blob);
+      const session::SavedIpv6State ipv6State =
+         ipv6 ? session::decodeIpv6SavedState(stored.blob) : session::SavedIpv6State{};
+      const session::SavedPortState state = ipv6 ? ipv6State.header : session::decodeSavedState(stored.blob);
       if (options.json) {
-         nlohmann::json doc = session::savedStateJson(state);
+         nlohmann::json doc = ipv6 ? session::ipv6SavedStateJson(ipv6State) : session::savedStateJson(state);
          // Seconds since 1970 of the save, null for a bare blob.
          doc["savedAt"] = stored.savedAtUs ? nlohmann::json(static_cast<double>(*stored.savedAtUs) / 1e6) : nullptr;
          std::cout << session::jsonText(doc, 1) << "\n";
@@ -39,7 +44,11 @@ int runStateShow(const StateShowOptions &options)
             std::strftime(text, sizeof text, "%Y-%m-%d %H:%M:%S UTC", std::gmtime(&seconds));
             std::cout << "Saved at " << text << "\n";
          }
-         session::printSavedState(std::cout, state);
+         if (ipv6) {
+            session::printIpv6SavedState(std::cout, ipv6State);
+         } else {
+            session::printSavedState(std::cout, state);
+         }
       }
       return kExitOk;
    } catch (const session::StateFileError &e) {

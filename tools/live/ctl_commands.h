@@ -20,9 +20,9 @@ struct CtlCommand {
 inline constexpr CtlCommand kCtlCommands[] = {
    {"ports", "", 0, 0, "each port: interface, bridge, port ID, guarding or stopped (and why), fail mode, configuration",
     false},
-   {"bindings", "[PORT]", 0, 1, "the port database: VLAN, MAC, IP, method, remaining lifetime, DHCP server and lease",
+   {"bindings", "[PORT]", 0, 1, "IPv4 and IPv6 bindings: VLAN, MAC, IP, method, remaining lifetime, DHCP server and lease",
     false},
-   {"summary", "PORT", 1, 1, "the port's feature summary", false},
+   {"summary", "PORT", 1, 1, "the port's feature summary and IPv6 summary", false},
    {"counters", "", 0, 0, "frames passed and dropped in each direction, the module's drop counters, bindings by method",
     false},
    {"metrics", "", 0, 0, "the counters in the Prometheus text format", true},

@@ -6,6 +6,7 @@
 #include "live/netdev.h"
 
 #include "session/error.h"
+#include "session/ipv6_saved_state.h"
 #include "session/port_state.h"
 #include "session/saved_state_format.h"
 #include "session/serializer.h"
@@ -21,6 +22,7 @@
 #include <cstdlib>
 #include <fstream>
 #include <sstream>
+#include <system_error>
 
 namespace swsec::live {
 
@@ -76,9 +78,32 @@ std::string InlineDaemon::statePath(const PortSpec &portSpec) const
 // The time since the save is taken from every lifetime, so that a lease
 // that ran out meanwhile (or that the VM gave back and the server gave
 // to another) does not come back.
+//
+// The IPv6 agent's state sits beside it in NAME.state6 (no port's own file
+// ends so); found, it gives the port the IPv6 agent before its restore.
 void InlineDaemon::restoreState(const PortSpec &portSpec, host::FilterId filter)
 {
-   const std::string path = statePath(portSpec);
+   restoreFile(portSpec, statePath(portSpec), [filter] { return filter; });
+   const std::string ipv6Path = statePath(portSpec) + "6";
+   struct stat info {};
+   if (::lstat(ipv6Path.c_str(), &info) == 0 || errno != ENOENT) {
+      restoreFile(portSpec, ipv6Path, [this, filter] { return session_.ipv6Filter(filter); });
+   }
+}
+
+namespace {
+
+size_t savedBindings(std::span<const uint8_t> blob)
+{
+   return session::isIpv6SavedState(blob) ? session::decodeIpv6SavedState(blob).bindings.size()
+                                          : session::decodeSavedState(blob).bindings.size();
+}
+
+}  // namespace
+
+void InlineDaemon::restoreFile(const PortSpec &portSpec, const std::string &path,
+                               const std::function<host::FilterId()> &filterOf)
+{
    struct stat info {};
    if (::lstat(path.c_str(), &info) != 0 && errno == ENOENT) {
       events_.log("info", "inline", portSpec.name + ": no saved state in " + path + "; the port starts empty");
@@ -96,13 +121,14 @@ void InlineDaemon::restoreState(const PortSpec &portSpec, host::FilterId filter)
          }
          // Whole seconds, rounded up: a binding is never given time it did not have.
          const int64_t elapsed = elapsedUs <= 0 ? 0 : (elapsedUs + 999'999) / 1'000'000;
-         const size_t saved = session::decodeSavedState(stored.blob).bindings.size();
-         stored.blob = session::ageSavedState(stored.blob, elapsed);
-         const size_t kept = session::decodeSavedState(stored.blob).bindings.size();
+         const size_t saved = savedBindings(stored.blob);
+         stored.blob = session::isIpv6SavedState(stored.blob) ? session::ageIpv6SavedState(stored.blob, elapsed)
+                                                              : session::ageSavedState(stored.blob, elapsed);
+         const size_t kept = savedBindings(stored.blob);
          age = " (saved " + std::to_string(elapsed) + " s ago; " + std::to_string(saved - kept) +
                " of its " + std::to_string(saved) + " bindings ran out meanwhile)";
       }
-      session::restorePortState(session_.host(), filter, stored.blob);
+      session::restorePortState(session_.host(), filterOf(), stored.blob);
       events_.log("info", "inline", portSpec.name + ": state restored from " + path + age);
    } catch (const session::StateFileError &e) {
       events_.log("error", "inline", portSpec.name + ": " + e.what() + "; the port starts empty");
@@ -112,6 +138,8 @@ void InlineDaemon::restoreState(const PortSpec &portSpec, host::FilterId filter)
    } catch (const session::StateRefused &e) {
       events_.log("error", "inline", portSpec.name + ": " + path + ": saved state refused: " + e.what() +
                                          "; the port starts empty");
+   } catch (const std::runtime_error &e) {
+      events_.log("error", "inline", portSpec.name + ": " + path + ": " + e.what() + "; the port starts empty");
    }
 }
 
@@ -123,7 +151,15 @@ bool InlineDaemon::saveState(Port &port, host::FilterId filter)
    port.lastSave = std::chrono::steady_clock::now();
    try {
       const std::vector<uint8_t> blob = session::savePortState(session_.host(), filter);
-      session::writeStateFile(path, session::wrapState(blob, static_cast<int64_t>(wallClock() * 1e6)), 0600);
+      const int64_t savedAtUs = static_cast<int64_t>(wallClock() * 1e6);
+      session::writeStateFile(path, session::wrapState(blob, savedAtUs), 0600);
+      // The IPv6 agent's state beside it; none left behind for a port that no longer has the agent.
+      if (const std::optional<host::FilterId> ipv6 = session_.findIpv6Filter(filter)) {
+         session::writeStateFile(path + "6", session::wrapState(session::savePortState(session_.host(), *ipv6), savedAtUs),
+                                 0600);
+      } else if (::unlink((path + "6").c_str()) != 0 && errno != ENOENT) {
+         throw std::system_error(errno, std::generic_category(), "cannot remove " + path + "6");
+      }
       if (port.saveFailing) {
          events_.log("info", "inline", port.portSpec.name + ": state saved to " + path + " again");
       }
@@ -616,6 +652,11 @@ nlohmann::json bindingsReply(const std::string &port, const session::PortState &
       binding["port"] = port;
       list.push_back(std::move(binding));
    }
+   for (const auto &entry : state.ipv6 ? state.ipv6->bindings : std::vector<session::Ipv6Binding>{}) {
+      nlohmann::json binding = session::ipv6BindingJson(entry);
+      binding["port"] = port;
+      list.push_back(std::move(binding));
+   }
    return list;
 }
 
@@ -672,6 +713,14 @@ nlohmann::json InlineDaemon::countersJson(Port &port)
       methods[binding.method] = methods.value(binding.method, 0) + 1;
    }
    entry["bindings"] = methods;
+   if (state.ipv6) {
+      entry["drops"].update(state.ipv6->counters);
+      nlohmann::json ipv6 = {{"DHCPv6", 0}, {"Static", 0}, {"First come first served", 0}};
+      for (const auto &binding : state.ipv6->bindings) {
+         ipv6[binding.method] = ipv6.value(binding.method, 0) + 1;
+      }
+      entry["ipv6Bindings"] = ipv6;
+   }
    return entry;
 }
 
@@ -702,8 +751,13 @@ nlohmann::json InlineDaemon::handle(const nlohmann::json &request)
    if (command == "summary") {
       Port &port = runningPort(request);
       const session::PortState state = session_.readState(port.guarded->options().portID);
+      const nlohmann::json ipv6 = session::ipv6Json(state);
+      const std::string ipv6Text = state.ipv6 ? "\n" + session::ipv6Text(*state.ipv6) : "";
       if (!state.featureSummary) {
-         return {{"port", port.portSpec.name}, {"fields", nullptr}, {"text", "(the port has no IP discovery)\n"}};
+         return {{"port", port.portSpec.name},
+                 {"fields", nullptr},
+                 {"ipv6", ipv6.is_null() ? ipv6 : ipv6["summary"]},
+                 {"text", "(the port has no IP discovery)\n" + ipv6Text}};
       }
       nlohmann::json fields = session::featureSummaryJson(state);
       std::string text = state.featureSummaryText;
@@ -723,7 +777,8 @@ nlohmann::json InlineDaemon::handle(const nlohmann::json &request)
       return {{"port", port.portSpec.name},
               {"datapath", datapathName(port.guarded->options().datapath)},
               {"fields", fields},
-              {"text", text}};
+              {"ipv6", ipv6.is_null() ? ipv6 : ipv6["summary"]},
+              {"text", text + ipv6Text}};
    }
    if (command == "counters") {
       nlohmann::json list = nlohmann::json::array();

@@ -10,6 +10,7 @@
 #include "session/ports_session.h"
 
 #include <chrono>
+#include <functional>
 #include <map>
 #include <memory>
 #include <mutex>
@@ -109,6 +110,8 @@ private:
    session::PortSecurityConfig checkedFor(const Port &port, session::PortSecurityConfig config);
    std::string statePath(const PortSpec &portSpec) const;
    void restoreState(const PortSpec &portSpec, host::FilterId filter);
+   // Restores one state file into the filter `filterOf` gives, aged by the time since its save.
+   void restoreFile(const PortSpec &portSpec, const std::string &path, const std::function<host::FilterId()> &filterOf);
    bool saveState(Port &port, host::FilterId filter);
 
    InlineOptions options_;

@@ -22,6 +22,7 @@
 #include <cmath>
 #include <cstdio>
 #include <cstring>
+#include <filesystem>
 
 namespace swsec::replay {
 
@@ -101,6 +102,9 @@ private:
    std::vector<Port> ports_;
    std::vector<uint8_t> restoreState_;   // the state file's bytes, read before the port is made
    std::vector<uint8_t> savedState_;     // the port's state at the end, to write
+   // The IPv6 agent's, kept beside them in FILE6.
+   std::vector<uint8_t> restoreIpv6State_;
+   std::vector<uint8_t> savedIpv6State_;
    std::optional<FrameRouter> router_;
    Route route_;
    std::optional<PcapWriter> passed_;
@@ -165,6 +169,13 @@ void Run::startPort(Port &port)
          session::restorePortState(session_->host(), port.filter, restoreState_);
       } catch (const session::StateRefused &e) {
          throw session::InputError(options_.restoreStatePath + ": saved state refused: " + e.what());
+      }
+      try {
+         if (!restoreIpv6State_.empty()) {
+            session::restorePortState(session_->host(), session_->ipv6Filter(port.filter), restoreIpv6State_);
+         }
+      } catch (const session::StateRefused &e) {
+         throw session::InputError(options_.restoreStatePath + "6: saved state refused: " + e.what());
       }
    }
    const std::optional<session::PortSecurityConfig> &config =
@@ -474,6 +485,10 @@ void Run::readRestoreState()
    }
    try {
       restoreState_ = session::readStoredState(options_.restoreStatePath).blob;
+      const std::string ipv6Path = options_.restoreStatePath + "6";
+      if (std::error_code error; std::filesystem::exists(std::filesystem::symlink_status(ipv6Path, error))) {
+         restoreIpv6State_ = session::readStoredState(ipv6Path).blob;
+      }
    } catch (const session::StateFileError &e) {
       throw session::InputError(e.what());
    }
@@ -534,6 +549,9 @@ void Run::execute()
       // Saving only reads the port; it comes after the report's reads so
       // that the report is the same with or without it.
       savedState_ = session::savePortState(session_->host(), ports_.front().filter);
+      if (const std::optional<host::FilterId> ipv6 = session_->findIpv6Filter(ports_.front().filter)) {
+         savedIpv6State_ = session::savePortState(session_->host(), *ipv6);
+      }
    }
 
    (void)session_->finish();   // its findings went to the violation handler
@@ -546,6 +564,9 @@ void Run::execute()
    }
    if (!options_.saveStatePath.empty()) {
       session::writeStateFile(options_.saveStatePath, savedState_);
+      if (!savedIpv6State_.empty()) {
+         session::writeStateFile(options_.saveStatePath + "6", savedIpv6State_);
+      }
    }
 }
 

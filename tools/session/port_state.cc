@@ -2,6 +2,7 @@
 // with the module's log lines as the message of a refusal.
 #include "session/port_state.h"
 
+#include "session/ipv6_saved_state.h"
 #include "session/saved_state_format.h"
 
 #include <regex>
@@ -58,7 +59,11 @@ void restorePortState(host::Host &host, host::FilterId port, std::span<const uin
    // One judgement for `state show` and a restore: what the decoder
    // refuses never reaches the module.
    try {
-      (void)decodeSavedState(blob);
+      if (isIpv6SavedState(blob)) {
+         (void)decodeIpv6SavedState(blob);
+      } else {
+         (void)decodeSavedState(blob);
+      }
    } catch (const BadSavedState &e) {
       throw StateRefused(e.what());
    }

@@ -301,11 +301,25 @@ void ModuleSession::clear(uint32_t portID, const std::optional<std::vector<std::
    std::lock_guard guard(mutex_);
    drainLogLocked();
    const size_t mark = logTail_.size();
-   std::vector<std::string> args{key ? "one" : "all"};
-   if (key) {
-      args.insert(args.end(), key->begin(), key->end());
+   // An IPv6 address is the IPv6 agent's to clear (every binding of it on
+   // the port); clearing all clears both agents' learned bindings.
+   const bool ipv6Key = key && key->size() == 3 && (*key)[2].find(':') != std::string::npos;
+   std::vector<int64_t> ipv6Ports;
+   const bool hasIpv6 = host_.nexo().list("/ipv6", &ipv6Ports) == ORR_OK &&
+                        std::find(ipv6Ports.begin(), ipv6Ports.end(), int64_t{portID}) != ipv6Ports.end();
+   orr_Status status = ORR_OK;
+   if (ipv6Key) {
+      status = host_.nexo().set(ipv6Path(portID) + "/clear", {(*key)[2]});
+   } else {
+      std::vector<std::string> args{key ? "one" : "all"};
+      if (key) {
+         args.insert(args.end(), key->begin(), key->end());
+      }
+      status = host_.nexo().set(portPath(portID) + "/clearVmi", args);
+      if (!key && hasIpv6 && (status == ORR_OK || status == ORR_NOT_FOUND)) {
+         status = host_.nexo().set(ipv6Path(portID) + "/clear", {});
+      }
    }
-   const orr_Status status = host_.nexo().set(portPath(portID) + "/clearVmi", args);
    if (status != ORR_OK) {
       std::string message = errorsSince(mark);
       throw Refused("clear refused: " + (message.empty() ? orr_StatusToString(status) : message));

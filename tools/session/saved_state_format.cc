@@ -204,6 +204,13 @@ SavedPortState decodeSavedState(std::span<const uint8_t> blob)
    return state;
 }
 
+SavedPortState decodeSavedStateHeader(std::span<const uint8_t> blob)
+{
+   SavedPortState state;
+   decodeHeader(blob, state);
+   return state;
+}
+
 std::vector<uint8_t> ageSavedState(std::span<const uint8_t> blob, int64_t elapsedSeconds)
 {
    const SavedPortState state = decodeSavedState(blob);

@@ -76,6 +76,8 @@ inline constexpr std::array<const char *, 6> kSavedCounterNames = {
 // part, a configuration a new port would refuse, an unknown discovery
 // method, a remaining time outside 32 bits).
 SavedPortState decodeSavedState(std::span<const uint8_t> blob);
+// The blob's header alone, checked as decodeSavedState checks it (any agent).
+SavedPortState decodeSavedStateHeader(std::span<const uint8_t> blob);
 
 // The blob as it stands `elapsedSeconds` after its save: every lifetime
 // and the error-rate-limit state shortened by that much, the bindings

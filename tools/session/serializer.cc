@@ -72,11 +72,16 @@ nlohmann::json notificationJson(const PortDbNotification &note)
 
 nlohmann::json ipv6BindingJson(const Ipv6Binding &binding)
 {
+   // The port database entry's shape; the DHCP details are the IPv4 agent's alone.
    return {{"vlan", binding.vlan},
            {"mac", binding.mac},
            {"ip", binding.ip},
            {"method", binding.method},
-           {"timeRemaining", binding.timeRemaining == "never" ? nlohmann::json(nullptr) : nodeValue(binding.timeRemaining)}};
+           {"timeRemaining", binding.timeRemaining == "never" ? nlohmann::json(nullptr) : nodeValue(binding.timeRemaining)},
+           {"chaddr", nullptr},
+           {"clientIdLen", nullptr},
+           {"serverIp", nullptr},
+           {"leaseTime", nullptr}};
 }
 
 nlohmann::json ipv6Json(const PortState &state)

@@ -32,8 +32,9 @@ nlohmann::json bindingJson(const PortDbEntry &entry);
 // {"name": "portdb.entry.added" or "portdb.entry.removed", "vlan", "mac",
 //  "ip", "authoritative"}.
 nlohmann::json notificationJson(const PortDbNotification &note);
-// {"vlan", "mac", "ip" (IPv6), "method", "timeRemaining" (seconds, null
-//  for a static binding, which never expires)}.
+// A port database entry's shape with an IPv6 "ip": "timeRemaining" in
+// seconds (null for a static binding, which never expires), the DHCP
+// fields null.
 nlohmann::json ipv6BindingJson(const Ipv6Binding &binding);
 // The IPv6 agent's part of a port: {"summary": every field of its
 // "summary" node, "counters": drop counters by reason and bindings

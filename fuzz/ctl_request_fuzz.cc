@@ -6,6 +6,7 @@
 #include "fuzz_input.h"
 
 #include "live/inline.h"
+#include "session/ipv6_saved_state.h"
 #include "session/saved_state_format.h"
 #include "session/state_file.h"
 
@@ -39,14 +40,21 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size)
    }
    session::StoredState stored;
    size_t before = 0;
+   bool ipv6 = false;
+   // Either agent's state, as the daemon restores NAME.state and NAME.state6.
+   const auto bindings = [&ipv6](std::span<const uint8_t> blob) {
+      return ipv6 ? session::decodeIpv6SavedState(blob).bindings.size() : session::decodeSavedState(blob).bindings.size();
+   };
    try {
       stored = session::unwrapState(rest, "fuzz");
-      before = session::decodeSavedState(stored.blob).bindings.size();
+      ipv6 = session::isIpv6SavedState(stored.blob);
+      before = bindings(stored.blob);
    } catch (const std::runtime_error &) {
       return 0;
    }
    const int64_t elapsed = stored.savedAtUs ? (*stored.savedAtUs & 0xffffff) : 0;
-   if (session::decodeSavedState(session::ageSavedState(stored.blob, elapsed)).bindings.size() > before) {
+   if (bindings(ipv6 ? session::ageIpv6SavedState(stored.blob, elapsed) : session::ageSavedState(stored.blob, elapsed)) >
+       before) {
       std::abort();
    }
    return 0;

@@ -4,6 +4,7 @@
 // decode too, or be refused for content the module takes and drops: the
 // decoder is never stricter than the module about shape.
 #include "loaded_module.h"
+#include "session/ipv6_saved_state.h"
 #include "session/saved_state_format.h"
 
 #include <cstdint>
@@ -29,9 +30,16 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size)
    swsec::fuzz::LoadedModule &module = swsec::fuzz::loadedModule();
    const std::span<const uint8_t> blob(data, size);
 
+   // A part with the IPv6 agent's magic goes to a port of that agent, as
+   // its state file's does.
+   const bool ipv6 = swsec::session::isIpv6SavedState(blob);
    bool shapeTaken = true;
    try {
-      (void)swsec::session::decodeSavedState(blob);
+      if (ipv6) {
+         (void)swsec::session::decodeIpv6SavedState(blob);
+      } else {
+         (void)swsec::session::decodeSavedState(blob);
+      }
    } catch (const swsec::session::BadSavedState &refusal) {
       shapeTaken = !refusal.shape;
    }
@@ -42,7 +50,8 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size)
    config.name = "restored.eth0";
    config.failurePolicy = 1;
    swsec::host::FilterId port = 0;
-   if (module.host.sifra().createFilter(swsec::fuzz::kAgent, kRestoredPort, config, &port) != ORR_OK) {
+   if (module.host.sifra().createFilter(ipv6 ? swsec::fuzz::kFhsAgent : swsec::fuzz::kAgent, kRestoredPort, config,
+                                        &port) != ORR_OK) {
       std::fprintf(stderr, "restore_state_fuzz: createFilter failed\n");
       std::abort();
    }

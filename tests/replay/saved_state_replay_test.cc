@@ -302,7 +302,7 @@ TEST_F(StateTool, ipv6_bindings_are_saved_beside_the_ports_state_aged_and_restor
    for (const auto &age : ages) {
       std::vector<uint32_t> left;
       for (const auto &binding : session::decodeIpv6SavedState(session::ageIpv6SavedState(blob, age.elapsed)).bindings) {
-         left.push_back(binding.remaining);
+         left.push_back(uint32_t{binding.remaining});
       }
       EXPECT_EQ(left, age.left) << age.elapsed;
    }

@@ -77,7 +77,8 @@ bool isIpv6SavedState(std::span<const uint8_t> blob)
    }
    const auto header = recordAt<SifraGenericStateHeader>(blob.data());
    uint64_t end = 0;
-   return !__builtin_add_overflow(header.agentOffset, uint64_t{sizeof(uint32_t)}, &end) && end <= blob.size() &&
+   return header.agentLen >= sizeof(uint32_t) &&
+          !__builtin_add_overflow(header.agentOffset, uint64_t{sizeof(uint32_t)}, &end) && end <= blob.size() &&
           recordAt<uint32_t>(blob.data() + header.agentOffset) == FHS_SAVED_MAGIC;
 }
 
@@ -176,7 +177,7 @@ nlohmann::json ipv6SavedStateJson(const SavedIpv6State &state)
       add(key, FhsBindStatic, std::nullopt);
    }
    for (const FhsSavedBinding &binding : state.bindings) {
-      add(binding.key, binding.method, binding.remaining);
+      add(binding.key, binding.method, uint32_t{binding.remaining});
    }
    const FhsConfig &c = state.config;
    return {{"header",
@@ -187,15 +188,15 @@ nlohmann::json ipv6SavedStateJson(const SavedIpv6State &state)
              {"slowPathLen", h.slowPathLen}}},
            {"ipv6",
             {{"config",
-              {{"featuresEnabled", c.featuresEnabled},
-               {"features", ipv6FeatureNames(c.featuresEnabled)},
+              {{"featuresEnabled", uint32_t{c.featuresEnabled}},
+               {"features", ipv6FeatureNames(uint32_t{c.featuresEnabled})},
                {"trusted", c.trusted != 0},
-               {"bindingLimit", c.bindingLimit},
-               {"numStatic", c.numStatic},
-               {"ndRateLimit", c.ndRateLimit},
-               {"errRateLimit", c.errRateLimit},
-               {"errRateLimitPeriod", c.errRateLimitPeriod},
-               {"fcfsLifetime", c.fcfsLifetime}}},
+               {"bindingLimit", uint32_t{c.bindingLimit}},
+               {"numStatic", uint32_t{c.numStatic}},
+               {"ndRateLimit", uint32_t{c.ndRateLimit}},
+               {"errRateLimit", uint32_t{c.errRateLimit}},
+               {"errRateLimitPeriod", uint32_t{c.errRateLimitPeriod}},
+               {"fcfsLifetime", uint32_t{c.fcfsLifetime}}}},
              {"ndErrorState", {{"active", state.ndRateLimitErr}, {"remainingSeconds", state.ndRateLimitErrRemaining}}},
              {"counters", std::move(counters)},
              {"bindings", std::move(bindings)}}}};

@@ -28,7 +28,8 @@ struct SavedIpv6State {
 };
 
 // Whether the blob's agent part is the IPv6 agent's (its magic), whatever
-// else it holds; false for anything too short to say.
+// else it holds; false for anything too short to say, and for a blob
+// without an agent part.
 bool isIpv6SavedState(std::span<const uint8_t> blob);
 
 // Throws BadSavedState for anything the module's restore refuses: the

@@ -249,7 +249,13 @@ fi
 in_ns "$vm1" ping -c 1 -W 1 192.0.2.1 >/dev/null && fail "vm1 reaches the server after a kill"
 
 step "fail open: restarted on a port left closed, stopped, vm1 back on the bridge"
-inline_start --bridge br0 --port vm1=vm1p --fail open
+# After a killed kernel-path run, on the user path: the program left behind must go.
+if [ "$datapath" = kernel ]; then
+  datapath=user inline_start --bridge br0 --port vm1=vm1p --fail open
+  grep -q "removed the fast path program a killed run left" "$work/inline.log" || fail "the killed run's program stayed"
+else
+  inline_start --bridge br0 --port vm1=vm1p --fail open
+fi
 grep -q "left by an earlier run" "$work/inline.log" || fail "the killed run's pair was not replaced"
 # The failed pings above left the server's address unresolved (FAILED),
 # which the kernel does not probe again for a while.

@@ -497,6 +497,27 @@ Attachment::Attachment(int ifindex, const Hooks &hooks) : ifindex_(ifindex)
    }
 }
 
+bool Attachment::removeLeftover(int ifindex, uint32_t priority)
+{
+   installLibbpfLog();
+   bool found = false;
+   for (const bpf_tc_attach_point point : {BPF_TC_INGRESS, BPF_TC_EGRESS}) {
+      auto hook = optionsOf<bpf_tc_hook>();
+      hook.ifindex = ifindex;
+      hook.attach_point = point;
+      auto options = optionsOf<bpf_tc_opts>();
+      options.handle = 1;
+      options.priority = priority;
+      const int result = bpf_tc_detach(&hook, &options);
+      if (result == 0) {
+         found = true;
+      } else if (result != -ENOENT && result != -EINVAL && result != -ENODEV) {
+         check(result, "cannot remove a filter from interface " + std::to_string(ifindex));
+      }
+   }
+   return found;
+}
+
 Attachment::~Attachment()
 {
    try {

@@ -191,6 +191,9 @@ public:
    bool madeQdisc() const { return madeQdisc_; }
    // A qdisc found here was made by an earlier run: detach removes it.
    void adoptQdisc() { madeQdisc_ = true; }
+   // Removes the filters at `priority` (handle 1) from both hooks of the
+   // interface, as a run that was killed left them; true when there were any.
+   static bool removeLeftover(int ifindex, uint32_t priority);
 
 private:
    struct Hook {

@@ -96,6 +96,15 @@ void completeChecksum(std::vector<uint8_t> &frame)
    frame[l4 + checkAt + 1] = static_cast<uint8_t>(check);
 }
 
+bool removeLeftoverProgram(int vmIfindex)
+{
+   try {
+      return fastpath::Attachment::removeLeftover(vmIfindex, kHookPriority);
+   } catch (const fastpath::Error &) {
+      return false;   // no clsact qdisc, or no BPF here: nothing of ours can be there
+   }
+}
+
 const char *datapathName(Datapath datapath)
 {
    return datapath == Datapath::kernel ? "kernel" : "user";

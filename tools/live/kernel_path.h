@@ -106,6 +106,10 @@ private:
    mutable std::mutex baseMutex_;
 };
 
+// Removes the fast path program a killed kernel-path run left on the VM
+// interface (its hooks at the kernel path's priority); true when it did.
+bool removeLeftoverProgram(int vmIfindex);
+
 // Completes the TCP or UDP checksum of an IPv4 frame whose checksum field
 // holds the pseudo-header's sum alone (its stack left the rest to the device).
 void completeChecksum(std::vector<uint8_t> &frame);

@@ -110,6 +110,10 @@ void GuardedPort::start(const session::PortSecurityConfig &config, const std::fu
       runIp({"link", "set", guardEnd_, "up"});
       runIp({"link", "set", bridgeEnd_, "up"});
       const bool kernel = options_.datapath == Datapath::kernel;
+      if (!kernel && removeLeftoverProgram(vm->ifindex)) {
+         // It would punt the VM's frames to a ring nobody reads.
+         log_(name + ": removed the fast path program a killed run left on " + options_.vmIface);
+      }
       if (!kernel) {
          vmSocket_ = std::make_unique<PacketSocket>(options_.vmIface, options_.batch);
          guardSocket_ = std::make_unique<PacketSocket>(guardEnd_, options_.batch);

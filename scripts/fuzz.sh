@@ -9,7 +9,7 @@ cd "$(dirname "$0")/.."
 
 seconds=${1:-30}
 dir=build/asan
-targets=(dhcp_parse_fuzz frame_fuzz control_fuzz capture_fuzz restore_state_fuzz link_message_fuzz ctl_request_fuzz)
+targets=(dhcp_parse_fuzz frame_fuzz control_fuzz capture_fuzz restore_state_fuzz link_message_fuzz ctl_request_fuzz punt_checksum_fuzz)
 targets+=(fhs_parse_fuzz)
 # The kernel fast path's target loads a BPF program: root only.
 if [ "$(id -u)" -eq 0 ]; then

@@ -161,16 +161,17 @@ TEST(ReplayIpv6, dual_stack_attacks_are_dropped_with_their_reasons_and_the_bindi
       Bytes bytes;
       uint8_t direction;
       const char *reason;   // null: passes
+      const char *description = "";
    } script[] = {
       {fromVm(Addr6{}, 58, nd(135, linkLocal)), replay::kDirFromVm, nullptr},
       {fromVm(linkLocal, 17, udp6(546, 547, dhcp6(3, 0x42, duid))), replay::kDirFromVm, nullptr},
       {frame6(router, gateway, linkLocal, 17, udp6(547, 546, dhcp6(7, 0x42, duid, {{leased, 7200}}))), replay::kDirToVm, nullptr},
       {fromVm(leased, 17, udp6(5000, 53, Bytes(8, 1))), replay::kDirFromVm, nullptr},
-      {fromVm(linkLocal, 58, icmp6(134, Bytes(12, 0))), replay::kDirFromVm, "RA guard"},
-      {fromVm(a6("2001:db8::66"), 17, udp6(5000, 53, Bytes(8, 1))), replay::kDirFromVm, "IPv6 source guard"},
-      {fromVm(linkLocal, 58, nd(136, gateway, vm)), replay::kDirFromVm, "ND inspection"},
-      {fromVm(linkLocal, 44, cat(frag(60, 0, true), ext(58))), replay::kDirFromVm, "IPv6 header chain"},
-      {fromVm(linkLocal, 17, udp6(546, 546, dhcp6(7, 1, duid))), replay::kDirFromVm, "DHCPv6 guard"},
+      {fromVm(linkLocal, 58, icmp6(134, Bytes(12, 0))), replay::kDirFromVm, "RA guard", "IPv6 fe80::7 > ff02::1 ICMPv6 router advertisement"},
+      {fromVm(a6("2001:db8::66"), 17, udp6(5000, 53, Bytes(8, 1))), replay::kDirFromVm, "IPv6 source guard", "IPv6 2001:db8::66 > ff02::1 UDP 5000 > 53"},
+      {fromVm(linkLocal, 58, nd(136, gateway, vm)), replay::kDirFromVm, "ND inspection", "ICMPv6 neighbour advertisement for fe80::1"},
+      {fromVm(linkLocal, 44, cat(frag(60, 0, true), ext(58))), replay::kDirFromVm, "IPv6 header chain", "[first fragment, destination options] ICMPv6"},
+      {fromVm(linkLocal, 17, udp6(546, 546, dhcp6(7, 1, duid))), replay::kDirFromVm, "DHCPv6 guard", "DHCPv6 Reply"},
    };
    TempDir dir;
    std::vector<CapturedFrame> frames;
@@ -186,6 +187,7 @@ TEST(ReplayIpv6, dual_stack_attacks_are_dropped_with_their_reasons_and_the_bindi
    for (size_t i = 0; i < std::size(script); ++i) {
       EXPECT_EQ(doc["frames"][i]["verdict"], script[i].reason ? "dropped" : "passed") << i;
       EXPECT_EQ(doc["frames"][i].value("reason", ""), script[i].reason ? script[i].reason : "") << i;
+      EXPECT_NE(doc["frames"][i].value("description", "").find(script[i].description), std::string::npos) << i;
    }
    const auto &ipv6 = doc["ports"][0]["ipv6"];
    const auto dhcpFields = R"(, "chaddr": null, "clientIdLen": null, "serverIp": null, "leaseTime": null})";

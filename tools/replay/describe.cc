@@ -88,6 +88,82 @@ std::string describeIpv4(std::span<const uint8_t> ip)
    return "IPv4 " + addresses + " proto " + std::to_string(protocol);
 }
 
+const char *dhcpv6TypeName(uint8_t type)
+{
+   static constexpr std::array<const char *, 14> kNames = {
+      "DHCPv6",  "DHCPv6 Solicit", "DHCPv6 Advertise",   "DHCPv6 Request",     "DHCPv6 Confirm",
+      "DHCPv6 Renew", "DHCPv6 Rebind", "DHCPv6 Reply", "DHCPv6 Release", "DHCPv6 Decline",
+      "DHCPv6 Reconfigure", "DHCPv6 Information-request", "DHCPv6 Relay-forward", "DHCPv6 Relay-reply"};
+   return type < kNames.size() ? kNames[type] : "DHCPv6";
+}
+
+std::string icmpv6Text(std::span<const uint8_t> icmp)
+{
+   if (icmp.size() < 4) {
+      return "ICMPv6 (truncated)";
+   }
+   const bool nd = icmp[0] == 135 || icmp[0] == 136;
+   const std::string target = nd && icmp.size() >= 24 ? " for " + session::ipv6Text(&icmp[8]) : "";
+   switch (icmp[0]) {
+   case 133: return "ICMPv6 router solicitation";
+   case 134: return "ICMPv6 router advertisement";
+   case 135: return "ICMPv6 neighbour solicitation" + target;
+   case 136: return "ICMPv6 neighbour advertisement" + target;
+   case 137: return "ICMPv6 redirect";
+   case 143: return "ICMPv6 MLDv2 report";
+   default: return "ICMPv6 type " + std::to_string(icmp[0]);
+   }
+}
+
+// The fixed header, then up to eight extension headers walked within the
+// bytes given, as the port walks them; what follows them named.
+std::string describeIpv6(std::span<const uint8_t> ip)
+{
+   if (ip.size() < 40 || (ip[0] >> 4) != 6) {
+      return "IPv6 (truncated)";
+   }
+   const std::string addresses = session::ipv6Text(&ip[8]) + " > " + session::ipv6Text(&ip[24]);
+   uint8_t next = ip[6];
+   size_t at = 40;
+   std::string chain;   // the extension headers, ", "-separated
+   for (int headers = 0; headers < 8 && (next == 0 || next == 43 || next == 44 || next == 60); ++headers) {
+      if (ip.size() < at + 8) {
+         return "IPv6 " + addresses + " [" + chain + "] (truncated)";
+      }
+      if (next == 44) {
+         const uint16_t offset = be16(ip, at + 2) >> 3;
+         const bool more = (ip[at + 3] & 1) != 0;
+         chain += (chain.empty() ? "" : ", ") +
+                  (offset != 0 ? "fragment at " + std::to_string(offset * 8) : more ? "first fragment" : "atomic fragment");
+         if (offset != 0) {
+            return "IPv6 " + addresses + " [" + chain + "]";
+         }
+         next = ip[at];
+         at += 8;
+         continue;
+      }
+      chain += std::string(chain.empty() ? "" : ", ") + (next == 0 ? "hop-by-hop" : next == 43 ? "routing" : "destination options");
+      next = ip[at];
+      at += (size_t{ip[at + 1]} + 1) * 8;
+   }
+   const auto rest = ip.size() > at ? ip.subspan(at) : std::span<const uint8_t>{};
+   std::string what;
+   if (next == 58) {
+      what = icmpv6Text(rest);
+   } else if (next == 17 && rest.size() >= 8) {
+      const uint16_t src = be16(rest, 0);
+      const uint16_t dst = be16(rest, 2);
+      what = (src == 546 || src == 547) && (dst == 546 || dst == 547) && rest.size() > 8
+                ? dhcpv6TypeName(rest[8])
+                : "UDP " + std::to_string(src) + " > " + std::to_string(dst);
+   } else if (next == 6) {
+      what = "TCP";
+   } else {
+      what = "next header " + std::to_string(next);
+   }
+   return "IPv6 " + addresses + (chain.empty() ? "" : " [" + chain + "]") + " " + what;
+}
+
 std::string describeArp(std::span<const uint8_t> arp)
 {
    if (arp.size() < 28) {
@@ -170,7 +246,7 @@ std::string describeFrame(std::span<const uint8_t> bytes)
    switch (type) {
    case kEtherIpv4: return prefix + describeIpv4(payload);
    case kEtherArp: return prefix + describeArp(payload);
-   case kEtherIpv6: return prefix + "IPv6";
+   case kEtherIpv6: return prefix + describeIpv6(payload);
    default: break;
    }
    std::array<char, 24> text{};

@@ -290,6 +290,16 @@ TEST(BadUsage, is_named_in_one_short_line_with_status_2_and_nothing_written)
    }
 }
 
+TEST(BadUsage, a_fifo_as_the_configuration_is_refused_without_waiting_for_a_writer)
+{
+   TempDir dir;
+   const std::string fifo = (dir.path() / "port.json").string();
+   ASSERT_EQ(mkfifo(fifo.c_str(), 0600), 0);
+   const ToolRun run = runTool({"replay", "--vm-mac", kVmMac, "--config", fifo, example()}, "timeout 10");
+   EXPECT_EQ(run.status, 2);
+   EXPECT_NE(run.err.find(fifo + ": not a regular file"), std::string::npos) << run.err;
+}
+
 TEST(Help, every_subcommand_says_its_exit_status_and_examples)
 {
    for (const char *command : {"info", "replay", "inline", "ctl", "state"}) {

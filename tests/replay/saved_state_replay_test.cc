@@ -4,6 +4,7 @@
 // the tool writes, shows and refuses them.
 #include "replay_support.h"
 
+#include "contract/saved_state_layout.h"
 #include "live/inline.h"
 #include "replay/engine.h"
 #include "session/atomic_file.h"
@@ -165,7 +166,11 @@ protected:
 TEST_F(StateTool, a_saved_state_is_shown_and_restored_by_the_tool)
 {
    const std::string state = (dir_.path() / "port.state").string();
-   const ToolRun saved = runTool({"replay", "--json", "--vm-mac", "02:00:5e:c0:00:01", "--config", enforcing(),
+   // Enforcing, with a frame guard that drops every type but IPv4 and ARP.
+   const std::string config = (dir_.path() / "port.json").string();
+   std::string text = session::readConfigText(enforcing());
+   writeFile(config, text.insert(text.rfind('}'), R"(, "allowTagged": true, "etherTypes": ["arp", "ipv4"])"));
+   const ToolRun saved = runTool({"replay", "--json", "--vm-mac", "02:00:5e:c0:00:01", "--config", config,
                                   "--save-state", state, example()});
    ASSERT_EQ(saved.status, 0) << saved.err;
 
@@ -178,6 +183,8 @@ TEST_F(StateTool, a_saved_state_is_shown_and_restored_by_the_tool)
    EXPECT_EQ(doc["bindings"][0]["method"], "DHCP Snooping");
    EXPECT_EQ(doc["bindings"][0]["ip"], "192.0.2.101");
    EXPECT_EQ(doc["counters"]["ipSrcGuardDropCnt"], 2);
+   EXPECT_EQ(doc["frameGuard"], json::parse(R"({"allowTagged": true, "etherTypes": [2054, 2048]})"));
+   EXPECT_EQ(doc["counters"]["etherTypeDropCnt"], json::parse(saved.out)["ports"][0]["counters"]["etherTypeDropCnt"]);
 
    // One binding, one shape: in replay's port database, in the saved state
    // shown, and in ctl's reply for the same port state (each may add its own).
@@ -195,9 +202,11 @@ TEST_F(StateTool, a_saved_state_is_shown_and_restored_by_the_tool)
    EXPECT_EQ(ctl, shownBinding);
    EXPECT_TRUE(shownBinding["timeRemaining"].is_number() && shownBinding["clientIdLen"].is_number());
 
-   const ToolRun text = runTool({"state", "show", state});
-   EXPECT_EQ(text.status, 0);
-   EXPECT_NE(text.out.find("192.0.2.101  DHCP Snooping"), std::string::npos) << text.out;
+   const ToolRun shownText = runTool({"state", "show", state});
+   EXPECT_EQ(shownText.status, 0);
+   EXPECT_NE(shownText.out.find("192.0.2.101  DHCP Snooping"), std::string::npos) << shownText.out;
+   EXPECT_NE(shownText.out.find("tagged frames:       allowed\n   ethertypes:          0x0806,0x0800\n"),
+             std::string::npos) << shownText.out;
 
    // The restored binding is reported like a learned one, before the first frame.
    const ToolRun restored =
@@ -215,7 +224,10 @@ TEST_F(StateTool, bad_state_files_are_refused_alike_by_show_and_restore_with_one
    const std::string good = (dir_.path() / "good.state").string();
    ASSERT_EQ(runTool({"replay", "--vm-mac", kVm, "--config", enforcing(), "--save-state", good, example()}).status, 0);
    const std::vector<uint8_t> blob = session::readStateFile(good);
-   // Offsets in the blob: the agent's part at 48, its first binding at 144.
+   // Offsets in the blob: the agent's part at 48, its first binding at 144,
+   // its frame guard the part's last 40 bytes.
+   const session::SavedPortState shape = session::decodeSavedState(blob);
+   const size_t guard = static_cast<size_t>(shape.agentOffset + shape.agentLen) - sizeof(SwSecSavedFrameGuard);
    auto changed = [&blob](size_t at, std::initializer_list<uint8_t> bytes) {
       std::string out(blob.begin(), blob.end());
       std::copy(bytes.begin(), bytes.end(), out.begin() + static_cast<std::ptrdiff_t>(at));
@@ -235,6 +247,7 @@ TEST_F(StateTool, bad_state_files_are_refused_alike_by_show_and_restore_with_one
       {"unknown_method", changed(144 + 12, {3}), "discovery method 3"},
       {"time_past_32_bits", changed(144 + 16, {0, 0, 0, 0, 1}), "outside 0 to 4294967295"},
       {"inspection_on_a_trusted_port", changed(48 + 5, {1}), "configuration refused"},
+      {"nine_ethertypes", changed(guard + 1, {9}), "frame guard of 9 ethertypes (at most 8)"},
       {"cut_envelope", "swsecenv\1", "envelope is cut short"},
       {"fifo", "", "not a regular file", true},
    };

@@ -29,6 +29,14 @@ struct PortSecurityConfig : contract::PortSecurityConfig {
 PortSecurityConfig parseConfig(std::string_view text, const std::string &origin);
 PortSecurityConfig loadConfigFile(const std::string &path);
 
+// The largest file taken as a configuration (32 static bindings are 3 KiB).
+inline constexpr uint64_t kMaxConfigFileBytes = uint64_t{1} << 20;
+
+// A configuration file's text, bounded by kMaxConfigFileBytes before it is
+// read; anything but a regular file (a FIFO, a device, a directory) is
+// refused without waiting on it. Throws InputError naming `path`.
+std::string readConfigText(const std::string &path);
+
 // The packed record: header then one 12-byte entry per static binding.
 using contract::configRecord;
 

@@ -134,6 +134,43 @@ SavedBinding decodeBinding(const SwSecSavedVmi &entry)
    return binding;
 }
 
+// The frame guard block after the entries at `position`, as the module's
+// restore reads it: whole, or absent from a version-1 configuration.
+void decodeFrameGuard(std::span<const uint8_t> part, uint64_t position, SavedPortState &state)
+{
+   if (part.size() - position < sizeof(SwSecSavedFrameGuard)) {
+      if (SwSecConfigHasFrameGuard(state.configVersion)) {
+         throw BadSavedState("a version " + number(state.configVersion) + " configuration without its " +
+                             number(sizeof(SwSecSavedFrameGuard)) + "-byte frame guard after the bindings");
+      }
+      return;
+   }
+   const auto saved = recordAt<SwSecSavedFrameGuard>(part.data() + position);
+   const SwSecFrameGuard guard = saved.guard;
+   if (guard.numEtherTypes > SWSEC_ETHERTYPES_MAX) {
+      throw BadSavedState("frame guard of " + number(guard.numEtherTypes) + " ethertypes (at most " +
+                          number(SWSEC_ETHERTYPES_MAX) + ")");
+   }
+   state.allowTagged = (guard.flags & SwSecFrameGuardAllowTagged) != 0;
+   for (uint32_t i = 0; i < guard.numEtherTypes; ++i) {
+      state.etherTypes.push_back(guard.etherTypes[i]);
+   }
+   state.taggedDropCnt = saved.taggedDropCnt;
+   state.etherTypeDropCnt = saved.etherTypeDropCnt;
+}
+
+// "0x0800,0x0806", or "any" for no list.
+std::string etherTypeText(const std::vector<uint16_t> &types)
+{
+   std::string text;
+   for (const uint16_t type : types) {
+      char one[8];
+      std::snprintf(one, sizeof one, "0x%04x", static_cast<unsigned>(type));
+      text += (text.empty() ? "" : ",") + std::string(one);
+   }
+   return text.empty() ? "any" : text;
+}
+
 void decodeAgentPart(std::span<const uint8_t> part, SavedPortState &state)
 {
    if (part.size() < kFixedLen) {
@@ -190,6 +227,7 @@ void decodeAgentPart(std::span<const uint8_t> part, SavedPortState &state)
       state.bindings.push_back(std::move(binding));
       position += kEntryLen + clientIdLen;
    }
+   decodeFrameGuard(part, position, state);
 }
 
 }  // namespace
@@ -302,6 +340,7 @@ nlohmann::json savedStateJson(const SavedPortState &state)
    if (state.agentLen == 0) {
       doc["config"] = nullptr;
       doc["errorRateLimit"] = nullptr;
+      doc["frameGuard"] = nullptr;
       doc["counters"] = nullptr;
       doc["bindings"] = json::array();
       return doc;
@@ -316,10 +355,14 @@ nlohmann::json savedStateJson(const SavedPortState &state)
                     {"errRateLimit", state.errRateLimit},
                     {"errRateLimitPeriod", state.errRateLimitPeriod}};
    doc["errorRateLimit"] = {{"active", state.txRateLimitErr}, {"remainingSeconds", state.txRateLimitErrRemaining}};
+   // An empty list allows any ethertype.
+   doc["frameGuard"] = {{"allowTagged", state.allowTagged}, {"etherTypes", state.etherTypes}};
    json counters = json::object();
    for (size_t i = 0; i < state.counters.size(); ++i) {
       counters[kSavedCounterNames[i]] = state.counters[i];
    }
+   counters["taggedDropCnt"] = state.taggedDropCnt;
+   counters["etherTypeDropCnt"] = state.etherTypeDropCnt;
    doc["counters"] = std::move(counters);
    json bindings = json::array();
    for (const SavedBinding &b : state.bindings) {
@@ -358,7 +401,9 @@ void printSavedState(std::ostream &out, const SavedPortState &state)
        << "   port mode:           " << (state.trusted != 0 ? "trusted" : "untrusted") << "\n"
        << "   port database size:  " << state.portDbSize << " (" << state.numStatic << " static)\n"
        << "   ARP rate limit:      " << state.arpRateLimit << "/s, " << state.errRateLimit << "/s for "
-       << state.errRateLimitPeriod << " s after a burst\n";
+       << state.errRateLimitPeriod << " s after a burst\n"
+       << "   tagged frames:       " << (state.allowTagged ? "allowed" : "dropped") << "\n"
+       << "   ethertypes:          " << etherTypeText(state.etherTypes) << "\n";
    out << "   error rate limit:    ";
    if (state.txRateLimitErr) {
       out << "active, " << state.txRateLimitErrRemaining << " s left\n";
@@ -369,6 +414,8 @@ void printSavedState(std::ostream &out, const SavedPortState &state)
    for (size_t i = 0; i < state.counters.size(); ++i) {
       out << "   " << kSavedCounterNames[i] << ": " << state.counters[i] << "\n";
    }
+   out << "   taggedDropCnt: " << state.taggedDropCnt << "\n"
+       << "   etherTypeDropCnt: " << state.etherTypeDropCnt << "\n";
    out << "\nBindings (" << state.bindings.size() << ")\n";
    for (const SavedBinding &b : state.bindings) {
       out << "   vlan " << b.vlan << "  " << macText(b.mac.data()) << "  " << ipText(b.ip.data()) << "  " << methodName(b.method);

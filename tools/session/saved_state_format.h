@@ -63,6 +63,12 @@ struct SavedPortState {
    // Counters, in the blob's order.
    std::array<uint64_t, 6> counters{};
    std::vector<SavedBinding> bindings;
+   // The frame guard after the bindings; a part saved without it restores
+   // these defaults (tagged frames dropped, any ethertype).
+   bool allowTagged = false;
+   std::vector<uint16_t> etherTypes;   // empty: any
+   uint64_t taggedDropCnt = 0;
+   uint64_t etherTypeDropCnt = 0;
 };
 
 // The counters' names, in the blob's order.
@@ -74,7 +80,8 @@ inline constexpr std::array<const char *, 6> kSavedCounterNames = {
 // mishandle on the blob's own evidence (short, foreign, another version,
 // parts outside the blob or overlapping, counts running past the agent's
 // part, a configuration a new port would refuse, an unknown discovery
-// method, a remaining time outside 32 bits).
+// method, a remaining time outside 32 bits, a frame guard missing from a
+// version-2 configuration or listing more ethertypes than it holds).
 SavedPortState decodeSavedState(std::span<const uint8_t> blob);
 // The blob's header alone, checked as decodeSavedState checks it (any agent).
 SavedPortState decodeSavedStateHeader(std::span<const uint8_t> blob);

@@ -2,6 +2,8 @@
 // the module's own management nodes and notifications.
 #include "live/inline.h"
 
+#include "contract/fhs_binding.h"
+#include "contract/notification.h"
 #include "live/ctl_commands.h"
 #include "live/netdev.h"
 
@@ -148,6 +150,7 @@ bool InlineDaemon::saveState(Port &port, host::FilterId filter)
 {
    const std::string path = statePath(port.portSpec);
    port.stateDirty = false;
+   port.removalUnsaved = false;
    port.lastSave = std::chrono::steady_clock::now();
    try {
       const std::vector<uint8_t> blob = session::savePortState(session_.host(), filter);
@@ -517,6 +520,8 @@ void InlineDaemon::pump()
          if (port->guarded && port->guarded->options().portID == note.portID) {
             name = port->portSpec.name;
             port->stateDirty = true;
+            port->removalUnsaved = port->removalUnsaved || note.name == SWSEC_PORTDB_MSG_REMOVED ||
+                                   note.name == FHS_MSG_REMOVED;
          }
       }
       nlohmann::json event = session::notificationJson(note);
@@ -538,11 +543,14 @@ void InlineDaemon::pump()
    for (const auto &name : gone) {
       removePort(name, "its interface disappeared");
    }
-   // A binding change is on disk within a second, a burst of them in one save.
+   // A binding added or renewed is on disk within a second, a burst of them
+   // in one save; a removal at the next pump, so that a binding the VM
+   // released (and the server may give to another) never comes back after
+   // a crash. Removals are rare: at most one save a pump (10 a second).
    const auto now = std::chrono::steady_clock::now();
    for (auto &port : ports_) {
       if (!options_.stateDir.empty() && port->stateDirty && port->guarded && port->guarded->running() &&
-          now - port->lastSave >= std::chrono::seconds(1)) {
+          (port->removalUnsaved || now - port->lastSave >= std::chrono::seconds(1))) {
          (void)saveState(*port, port->guarded->filter());
       }
    }

@@ -78,6 +78,7 @@ private:
       std::string configSource;   // where its configuration came from last
       bool watched = false;       // guarded by --watch: let go when its interface leaves
       bool stateDirty = false;    // bindings changed since the last save
+      bool removalUnsaved = false;   // one of them a removal: saved at once, not coalesced
       bool saveFailing = false;   // the last save failed (said once)
       std::chrono::steady_clock::time_point lastSave{};
    };

@@ -12,6 +12,8 @@
   arp-flood IFACE VM_MAC VM_IP COUNT          COUNT ARP requests from the VM as fast as it can
   after-ack IFACE PORT SECONDS                waits for a DHCP ACK to IFACE's MAC and at once sends a
                                               datagram from the address it gives to the server's PORT
+  runt IFACE DST_MAC                          one 20-byte frame (ethertype 0x88b5)
+  runt-length IFACE SECONDS                   prints the length of the first 0x88b5 frame it gets
 """
 import socket
 import sys
@@ -42,6 +44,24 @@ def attack(name, iface, vm_mac, vm_ip, gateway_ip):
     elif name == "bpdu":
         frame = s.Dot3(src=vm_mac, dst="01:80:c2:00:00:00") / s.LLC(dsap=0x42, ssap=0x42, ctrl=3) / s.STP(
             rootid=0, rootmac=vm_mac, bridgeid=0, bridgemac=vm_mac)
+    elif name in ("arp-two-8021q", "arp-8021ad-8021q"):
+        # ARP claiming the gateway behind a tag inside the port's VLAN (the outer one).
+        outer = s.Ether(src=vm_mac, dst="ff:ff:ff:ff:ff:ff", type=0x8100 if name == "arp-two-8021q" else 0x88a8)
+        frame = outer / s.Dot1Q(vlan=0, type=0x8100) / s.Dot1Q(vlan=0) / s.ARP(
+            op=2, hwsrc=vm_mac, psrc=gateway_ip, hwdst="ff:ff:ff:ff:ff:ff", pdst=gateway_ip)
+    elif name == "ip-8021ad":
+        frame = s.Ether(src=vm_mac, dst="ff:ff:ff:ff:ff:ff", type=0x88a8) / s.Dot1Q(vlan=0) / s.IP(
+            src="192.0.2.68", dst=gateway_ip) / s.UDP(sport=4000, dport=9999) / b"802.1ad spoof"
+    elif name == "llc-snap-ip":
+        frame = s.Dot3(src=vm_mac, dst="ff:ff:ff:ff:ff:ff") / s.LLC(dsap=0xaa, ssap=0xaa, ctrl=3) / s.SNAP(
+            OUI=0, code=0x0800) / s.IP(src="192.0.2.69", dst=gateway_ip) / s.UDP(sport=4000, dport=9999)
+    elif name == "rarp":
+        frame = s.Ether(src=vm_mac, dst="ff:ff:ff:ff:ff:ff", type=0x8035) / s.ARP(
+            op=3, hwsrc=vm_mac, psrc=gateway_ip, hwdst=vm_mac, pdst=gateway_ip)
+    elif name == "tagged-own":
+        # The VM's own address behind a tag of its own: passes where the port allows tagged frames.
+        frame = s.Ether(src=vm_mac, dst="ff:ff:ff:ff:ff:ff") / s.Dot1Q(vlan=0) / s.Dot1Q(vlan=5) / s.IP(
+            src=vm_ip, dst=gateway_ip) / s.UDP(sport=4000, dport=9999) / b"tagged"
     elif name == "vlan-spoof":
         frame = s.Ether(src=vm_mac, dst="ff:ff:ff:ff:ff:ff") / s.Dot1Q(vlan=100) / s.IP(
             src="192.0.2.67", dst=gateway_ip) / s.UDP(sport=4000, dport=9999) / b"tagged spoof"
@@ -191,6 +211,18 @@ def after_ack(iface, port, seconds):
         return
 
 
+def runt(iface, dst_mac):
+    raw_socket(iface).send(bytes.fromhex(dst_mac.replace(":", "")) + mac_of(iface) + b"\x88\xb5runt!!")
+
+
+def runt_length(iface, seconds):
+    sock = socket.socket(socket.AF_PACKET, socket.SOCK_RAW, socket.htons(0x88b5))
+    sock.bind((iface, 0))
+    sock.settimeout(seconds)
+    print("listening", flush=True)
+    print(len(sock.recv(2048)))
+
+
 def main():
     command, args = sys.argv[1], sys.argv[2:]
     if command == "attack":
@@ -209,6 +241,10 @@ def main():
         arp_flood(args[0], args[1], args[2], int(args[3]))
     elif command == "after-ack":
         after_ack(args[0], int(args[1]), float(args[2]))
+    elif command == "runt":
+        runt(args[0], args[1])
+    elif command == "runt-length":
+        runt_length(args[0], float(args[1]))
     elif command == "junk":
         junk(args[0])
     else:

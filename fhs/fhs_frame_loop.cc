@@ -343,8 +343,12 @@ void LearnDhcpv6(FhsContext *ctx, const FhsFrame *frame, const FhsDhcpv6Msg *msg
    pending->expiry = 0;
 }
 
-/* A UDP datagram: the DHCPv6 guard from the VM, then learning either way. */
-Judgement JudgeUdp(FhsContext *ctx, FhsFrame *frame, uint32_t direction, bool readLocked, bool enforce)
+/*
+ * A UDP datagram from the VM: the DHCPv6 guard. Sets `learn` when the
+ * datagram is a DHCPv6 message to learn from, which waits until the frame
+ * has passed the source guard.
+ */
+Judgement GuardUdp(FhsContext *ctx, FhsFrame *frame, uint32_t direction, bool enforce, bool *learn)
 {
    const uint32_t features = ctx->config.featuresEnabled;
    const uint8_t *udp = frame->ip6 + frame->chain.upperOffset;
@@ -352,11 +356,8 @@ Judgement JudgeUdp(FhsContext *ctx, FhsFrame *frame, uint32_t direction, bool re
    const uint16_t dstPort = LoadBe16(udp + 2);
    const bool dhcp = dstPort == FHS_DHCPV6_CLIENT_PORT || dstPort == FHS_DHCPV6_SERVER_PORT ||
                      srcPort == FHS_DHCPV6_SERVER_PORT;
-   if (!dhcp) {
-      return kPass;
-   }
    const uint32_t payloadOffset = frame->chain.upperOffset + kUdpHeaderLen;
-   if (payloadOffset >= frame->chain.packetLen) {
+   if (!dhcp || payloadOffset >= frame->chain.packetLen) {
       return kPass;
    }
    if (enforce && (features & FhsFeatureDhcpv6Guard) != 0) {
@@ -375,9 +376,17 @@ Judgement JudgeUdp(FhsContext *ctx, FhsFrame *frame, uint32_t direction, bool re
    const bool learnable = direction == SwSecDirectionTx ? dstPort == FHS_DHCPV6_SERVER_PORT
                                                          : srcPort == FHS_DHCPV6_SERVER_PORT &&
                                                               dstPort == FHS_DHCPV6_CLIENT_PORT;
-   if ((features & FhsFeatureDhcpv6Snoop) == 0 || !learnable || frame->chain.fragmented != 0) {
-      return kPass;
-   }
+   *learn = (features & FhsFeatureDhcpv6Snoop) != 0 && learnable && frame->chain.fragmented == 0;
+   return kPass;
+}
+
+/*
+ * DHCPv6 learning from a datagram that passed. Run after the source guard,
+ * so that a Release sent from the address it gives back is judged while
+ * that address is still bound, and reaches the server.
+ */
+Judgement LearnFromUdp(FhsContext *ctx, FhsFrame *frame, uint32_t direction, bool readLocked)
+{
    if (readLocked) {
       return kNeedWrite;
    }
@@ -385,6 +394,7 @@ Judgement JudgeUdp(FhsContext *ctx, FhsFrame *frame, uint32_t direction, bool re
    if (ip6 == nullptr) {
       return kPass;
    }
+   const uint32_t payloadOffset = frame->chain.upperOffset + kUdpHeaderLen;
    const uint32_t udpLen = LoadBe16(ip6 + frame->chain.upperOffset + 4);
    if (udpLen < kUdpHeaderLen || udpLen > frame->chain.packetLen - frame->chain.upperOffset) {
       return kPass;
@@ -443,6 +453,7 @@ Judgement JudgeFrame(FhsContext *ctx, FhsFrame *frame, uint32_t direction, bool 
 
    const FhsIpv6Chain &chain = frame->chain;
    uint8_t icmpType = 0;
+   bool learnDhcpv6 = false;
    if (chain.laterFragment == 0 && chain.upperProto == FHS_PROTO_ICMPV6) {
       icmpType = frame->ip6[chain.upperOffset];
       const bool isNd = icmpType >= kIcmpRouterSolicit && icmpType <= kIcmpRedirect;
@@ -468,7 +479,7 @@ Judgement JudgeFrame(FhsContext *ctx, FhsFrame *frame, uint32_t direction, bool 
          return kDrop;
       }
       if (chain.laterFragment == 0 && chain.upperProto == FHS_PROTO_UDP) {
-         const Judgement judgement = JudgeUdp(ctx, frame, direction, readLocked, enforce);
+         const Judgement judgement = GuardUdp(ctx, frame, direction, enforce, &learnDhcpv6);
          if (judgement.status != ORR_OK || judgement.verdict != SwSecVerdictPass) {
             return judgement;
          }
@@ -481,17 +492,20 @@ Judgement JudgeFrame(FhsContext *ctx, FhsFrame *frame, uint32_t direction, bool 
          /* Only duplicate-address detection, MLD reports and router solicitations come from no address. */
          const bool allowed = icmpType == kIcmpNeighborSolicit || icmpType == kIcmpMldReport ||
                               icmpType == kIcmpMldv2Report || icmpType == kIcmpRouterSolicit;
-         return allowed ? kPass : Drop(&ctx->counters.sourceGuardDropCnt);
-      }
-      FhsBinding *binding = FhsFindBinding(ctx, frame->vlanId, frame->bytes + kEthSrcOffset, src);
-      if (binding == nullptr) {
-         return Drop(&ctx->counters.sourceGuardDropCnt);
-      }
-      if (binding->method == FhsBindFcfs && __atomic_load_n(&binding->seen, __ATOMIC_RELAXED) == 0) {
-         __atomic_store_n(&binding->seen, 1, __ATOMIC_RELAXED);
+         if (!allowed) {
+            return Drop(&ctx->counters.sourceGuardDropCnt);
+         }
+      } else {
+         FhsBinding *binding = FhsFindBinding(ctx, frame->vlanId, frame->bytes + kEthSrcOffset, src);
+         if (binding == nullptr) {
+            return Drop(&ctx->counters.sourceGuardDropCnt);
+         }
+         if (binding->method == FhsBindFcfs && __atomic_load_n(&binding->seen, __ATOMIC_RELAXED) == 0) {
+            __atomic_store_n(&binding->seen, 1, __ATOMIC_RELAXED);
+         }
       }
    }
-   return kPass;
+   return learnDhcpv6 ? LearnFromUdp(ctx, frame, direction, readLocked) : kPass;
 }
 
 }  // namespace

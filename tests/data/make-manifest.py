@@ -603,7 +603,7 @@ class Fhs:
         why, c = walk6(frame, p["l3"])
         if why:
             return self.drop("headerChainDropCnt", RULE_CHAIN) if enforce and f & 0x01 else None
-        ip6, icmp = c["ip6"], None
+        ip6, icmp, learn = c["ip6"], None, None
         if not c["later"] and c["proto"] == 58:
             icmp = ip6[c["off"]]
             is_nd = 133 <= icmp <= 137
@@ -623,14 +623,19 @@ class Fhs:
             if why:
                 return why
             if not c["later"] and c["proto"] == 17:
-                why = self.udp(idx, p, c, from_vm, enforce)
+                why, learn = self.udp(p, c, from_vm, enforce)
                 if why:
                     return why
         if enforce and f & 0x20:
             if c["src"] == "::":
-                return None if icmp in (135, 131, 143, 133) else self.drop("sourceGuardDropCnt", RULE_SOURCE)
-            if not self.find(p["vlan"], p["src"], c["src"]):
+                if icmp not in (135, 131, 143, 133):
+                    return self.drop("sourceGuardDropCnt", RULE_SOURCE)
+            elif not self.find(p["vlan"], p["src"], c["src"]):
                 return self.drop("sourceGuardDropCnt", RULE_SOURCE)
+        # DHCPv6 learning only from a datagram that passed: a Release sent from
+        # the address it gives back reaches the server.
+        if learn:
+            self.learn_dhcpv6(idx, p, c, from_vm)
         return None
 
     def neighbor(self, idx, p, c, enforce):
@@ -662,15 +667,21 @@ class Fhs:
             return self.drop("ndInspectionDropCnt", RULE_ND)
         return None
 
-    def udp(self, idx, p, c, from_vm, enforce):
+    def udp(self, p, c, from_vm, enforce):
+        """The DHCPv6 guard: (drop reason or None, whether to learn once passed)."""
         f, ip6, off = self.cfg["featuresEnabled"], c["ip6"], c["off"]
-        sp, dp, ulen = struct.unpack_from("!HHH", ip6, off)
+        sp, dp = struct.unpack_from("!HH", ip6, off)
         if not (dp in (546, 547) or sp == 547) or off + 8 >= len(ip6):
-            return None
+            return None, False
         if enforce and f & 0x04 and ip6[off + 8] in (2, 7, 10, 13):
-            return self.drop("dhcpv6GuardDropCnt", "DHCPv6 guard: server message from the VM")
+            return self.drop("dhcpv6GuardDropCnt", "DHCPv6 guard: server message from the VM"), False
         learnable = dp == 547 if from_vm else sp == 547 and dp == 546
-        if not f & 0x08 or not learnable or c["frag"] or ulen < 8 or ulen > len(ip6) - off:
+        return None, bool(f & 0x08) and learnable and not c["frag"]
+
+    def learn_dhcpv6(self, idx, p, c, from_vm):
+        ip6, off = c["ip6"], c["off"]
+        ulen = struct.unpack_from("!H", ip6, off + 4)[0]
+        if ulen < 8 or ulen > len(ip6) - off:
             return None
         m = parse_dhcpv6(ip6[off + 8:off + ulen])
         if not m or m[2] is None:
@@ -875,10 +886,9 @@ NOTES = {
         "port unreachable (from a bound address: they pass). Dual-stack: the Reply to the Request binds "
         "2001:db8:1::147 (DHCPv6, 120 s); the renewal is a Request from the leased address with the same "
         "transaction ID, pending again, and its Reply (from the server's global address) only extends "
-        "the binding. The Release, sent from the leased address, removes the binding first and is then "
-        "dropped by source guard on the address it has just unbound: the server never sees it and keeps "
-        "the lease until it expires (dhclient sends its Release from the link-local address, which "
-        "stays bound).",
+        "the binding. The Release, sent from the leased address, is judged by source guard while that "
+        "address is still bound, passes, and only then removes the binding, so the server frees the "
+        "lease (dhclient sends its Release from the link-local address instead).",
     "slaac-privacy-dad":
         "Dual-stack: each DAD solicitation from the unspecified address binds its target first come "
         "first served (link-local, stable and temporary address); every later frame of the VM is from "

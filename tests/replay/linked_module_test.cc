@@ -36,15 +36,13 @@ std::string withoutAddresses(const std::string &text)
 TEST(LinkedModule, reports_what_the_module_image_reports_on_every_bundled_capture)
 {
    ASSERT_FALSE(moduleImage().empty()) << "SWSEC_MODULE_PATH names the built image";
-   std::ifstream in(sourceDir() / "tests/data/manifest.json");
-   const json manifest = json::parse(in);
    // Every capture, one after another (an idle hour between two, so that
    // leases and requests age out), with the manifest's directions so that
    // no frame depends on a MAC guess: one run a module and a setting keeps
    // the test quick under the sanitizers.
    std::vector<CapturedFrame> all;
    int64_t base = 0;
-   for (const auto &entry : manifest) {
+   for (const auto &entry : manifest()) {
       const std::string file = entry["file"];
       auto frames = readCapture(sourceDir() / "tests/data" / file);
       ASSERT_EQ(frames.size(), entry["frames"].size()) << file;

@@ -21,15 +21,6 @@ namespace {
 
 using nlohmann::json;
 
-const json &manifest()
-{
-   static const json doc = [] {
-      std::ifstream in(sourceDir() / "tests/data/manifest.json");
-      return json::parse(in);
-   }();
-   return doc;
-}
-
 struct Case {
    std::string capture;
    std::string setting;

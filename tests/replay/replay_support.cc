@@ -2,6 +2,8 @@
 
 #include <sys/wait.h>
 
+#include <fstream>
+
 #include <algorithm>
 #include <cstdlib>
 #include <cstring>
@@ -10,6 +12,15 @@
 #include <stdexcept>
 
 namespace swsec::testing {
+
+const nlohmann::json &manifest()
+{
+   static const nlohmann::json doc = [] {
+      std::ifstream in(sourceDir() / "tests/data/manifest.json");
+      return nlohmann::json::parse(in);
+   }();
+   return doc;
+}
 
 std::filesystem::path sourceDir()
 {

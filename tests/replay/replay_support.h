@@ -4,6 +4,8 @@
 
 #include "replay/capture.h"
 
+#include <nlohmann/json.hpp>
+
 #include <cstdint>
 #include <filesystem>
 #include <string>
@@ -13,6 +15,9 @@ namespace swsec::testing {
 
 std::filesystem::path sourceDir();
 std::filesystem::path toolPath();
+
+// tests/data/manifest.json: every bundled capture with its expected outcome.
+const nlohmann::json &manifest();
 
 // The example capture, its VM's MAC and the enforcing port configuration.
 inline const std::string kVmMac = "02:00:5e:c0:00:01";

@@ -27,15 +27,6 @@ namespace {
 
 using nlohmann::json;
 
-const json &manifest()
-{
-   static const json doc = [] {
-      std::ifstream in(sourceDir() / "tests/data/manifest.json");
-      return json::parse(in);
-   }();
-   return doc;
-}
-
 // The cut after frame k (1-based) where no DHCP request waits for its
 // answer, with the longest pause before the next frame; none when every
 // gap has a request pending.

@@ -148,9 +148,6 @@ INSTANTIATE_TEST_SUITE_P(Settings, SplitReplay, ::testing::Values("learning", "e
 
 class StateTool : public ::testing::Test {
 protected:
-   static constexpr const char *kVm = "02:00:5e:c0:00:01";
-   std::string example() const { return (sourceDir() / "examples/example-dhcp-then-spoof.pcap").string(); }
-   std::string enforcing() const { return (sourceDir() / "examples/enforcing.json").string(); }
    TempDir dir_;
 };
 
@@ -161,7 +158,7 @@ TEST_F(StateTool, a_saved_state_is_shown_and_restored_by_the_tool)
    const std::string config = (dir_.path() / "port.json").string();
    std::string text = session::readConfigText(enforcing());
    writeFile(config, text.insert(text.rfind('}'), R"(, "allowTagged": true, "etherTypes": ["arp", "ipv4"])"));
-   const ToolRun saved = runTool({"replay", "--json", "--vm-mac", "02:00:5e:c0:00:01", "--config", config,
+   const ToolRun saved = runTool({"replay", "--json", "--vm-mac", kVmMac, "--config", config,
                                   "--save-state", state, example()});
    ASSERT_EQ(saved.status, 0) << saved.err;
 
@@ -181,7 +178,7 @@ TEST_F(StateTool, a_saved_state_is_shown_and_restored_by_the_tool)
    // shown, and in ctl's reply for the same port state (each may add its own).
    replay::ReplayOptions options;
    options.capturePath = example();
-   options.vmMac = session::parseMac("02:00:5e:c0:00:01", "test");
+   options.vmMac = session::parseMac(kVmMac, "test");
    options.config = session::loadConfigFile(enforcing());
    json ctl = live::bindingsReply("vm", replay::runReplay(options).ports[0])[0];
    json shownBinding = doc["bindings"][0];
@@ -201,7 +198,7 @@ TEST_F(StateTool, a_saved_state_is_shown_and_restored_by_the_tool)
 
    // The restored binding is reported like a learned one, before the first frame.
    const ToolRun restored =
-      runTool({"replay", "--json", "--vm-mac", "02:00:5e:c0:00:01", "--restore-state", state, example()});
+      runTool({"replay", "--json", "--vm-mac", kVmMac, "--restore-state", state, example()});
    ASSERT_EQ(restored.status, 0) << restored.err;
    const json result = json::parse(restored.out);
    ASSERT_FALSE(result["ports"][0]["notifications"].empty());
@@ -213,7 +210,7 @@ TEST_F(StateTool, a_saved_state_is_shown_and_restored_by_the_tool)
 TEST_F(StateTool, bad_state_files_are_refused_alike_by_show_and_restore_with_one_line_and_nothing_written)
 {
    const std::string good = (dir_.path() / "good.state").string();
-   ASSERT_EQ(runTool({"replay", "--vm-mac", kVm, "--config", enforcing(), "--save-state", good, example()}).status, 0);
+   ASSERT_EQ(runTool({"replay", "--vm-mac", kVmMac, "--config", enforcing(), "--save-state", good, example()}).status, 0);
    const std::vector<uint8_t> blob = session::readStateFile(good);
    // Offsets in the blob: the agent's part at 48, its first binding at 144,
    // its frame guard the part's last 40 bytes.
@@ -251,7 +248,7 @@ TEST_F(StateTool, bad_state_files_are_refused_alike_by_show_and_restore_with_one
          writeFile(path, bad.bytes);
       }
       const auto written = (dir_.path() / "passed.pcap").string();
-      const ToolRun replayed = runTool({"replay", "--vm-mac", "02:00:5e:c0:00:01", "--restore-state", path.string(),
+      const ToolRun replayed = runTool({"replay", "--vm-mac", kVmMac, "--restore-state", path.string(),
                                         "--write-passed", written, example()});
       const ToolRun shown = runTool({"state", "show", path.string()});
       for (const ToolRun *run : {&replayed, &shown}) {
@@ -267,7 +264,7 @@ TEST_F(StateTool, bad_state_files_are_refused_alike_by_show_and_restore_with_one
 TEST_F(StateTool, time_since_the_save_is_taken_from_each_lifetime_and_what_ran_out_is_left_out)
 {
    const std::string saved = (dir_.path() / "port.state").string();
-   ASSERT_EQ(runTool({"replay", "--vm-mac", kVm, "--config", enforcing(), "--save-state", saved, example()}).status, 0);
+   ASSERT_EQ(runTool({"replay", "--vm-mac", kVmMac, "--config", enforcing(), "--save-state", saved, example()}).status, 0);
    const std::vector<uint8_t> blob = session::readStateFile(saved);
    const int64_t left = session::decodeSavedState(blob).bindings.at(0).timeRemaining;
    EXPECT_EQ(session::decodeSavedState(session::ageSavedState(blob, 10)).bindings.at(0).timeRemaining, left - 10);
@@ -278,7 +275,7 @@ TEST_F(StateTool, time_since_the_save_is_taken_from_each_lifetime_and_what_ran_o
    writeFile(saved, std::string(wrapped.begin(), wrapped.end()));
    const ToolRun shown = runTool({"state", "show", "--json", saved});
    EXPECT_EQ(json::parse(shown.out)["savedAt"], 1'700'000'000.0) << shown.err;
-   EXPECT_EQ(runTool({"replay", "--vm-mac", kVm, "--restore-state", saved, example()}).status, 0);
+   EXPECT_EQ(runTool({"replay", "--vm-mac", kVmMac, "--restore-state", saved, example()}).status, 0);
 }
 
 // The IPv6 agent's state goes beside the port's (FILE6): shown, aged binding

@@ -189,6 +189,7 @@ session::PortSecurityConfig InlineDaemon::checkedFor(const Port &port, session::
 
 void InlineDaemon::startPort(Port &port)
 {
+   port.datapathReason.clear();
    PortOptions options;
    options.name = port.portSpec.name;
    options.vmIface = port.portSpec.vmIface;
@@ -210,6 +211,7 @@ void InlineDaemon::startPort(Port &port)
       }
       events_.log("info", "inline", port.portSpec.name + ": IPv6 keys: the port uses the user data path");
       options.datapath = Datapath::user;
+      port.datapathReason = "IPv6 keys";
    }
    const auto log = [this](const std::string &line) { events_.log("info", "inline", line); };
    port.guarded = std::make_unique<GuardedPort>(session_, options, log, nullptr);
@@ -224,6 +226,7 @@ void InlineDaemon::startPort(Port &port)
       events_.log("error", "inline", port.portSpec.name + ": the kernel data path failed (" + e.what() +
                                          "); the port uses the user data path");
       options.datapath = Datapath::user;
+      port.datapathReason = std::string("the kernel data path failed: ") + e.what();
       port.guarded = std::make_unique<GuardedPort>(session_, options, log, nullptr);
       try {
          port.guarded->start(config, restore);
@@ -637,8 +640,9 @@ nlohmann::json InlineDaemon::portJson(const Port &port)
    }
    if (port.guarded) {
       entry["datapath"] = datapathName(port.guarded->options().datapath);
-      if (port.guarded->options().datapath == Datapath::user && !userReason_.empty()) {
-         entry["datapathReason"] = userReason_;
+      const std::string &reason = port.datapathReason.empty() ? userReason_ : port.datapathReason;
+      if (port.guarded->options().datapath == Datapath::user && !reason.empty()) {
+         entry["datapathReason"] = reason;
       }
       entry["portId"] = port.guarded->options().portID;
       entry["running"] = port.guarded->running();

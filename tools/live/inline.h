@@ -77,6 +77,7 @@ private:
       std::unique_ptr<GuardedPort> guarded;
       std::string configSource;   // where its configuration came from last
       bool watched = false;       // guarded by --watch: let go when its interface leaves
+      std::string datapathReason; // why it is on the user path, "" when that is the daemon's choice
       bool stateDirty = false;    // bindings changed since the last save
       bool removalUnsaved = false;   // one of them a removal: saved at once, not coalesced
       bool saveFailing = false;   // the last save failed (said once)

@@ -295,9 +295,13 @@ TEST(BadUsage, a_fifo_as_the_configuration_is_refused_without_waiting_for_a_writ
    TempDir dir;
    const std::string fifo = (dir.path() / "port.json").string();
    ASSERT_EQ(mkfifo(fifo.c_str(), 0600), 0);
-   const ToolRun run = runTool({"replay", "--vm-mac", kVmMac, "--config", fifo, example()}, "timeout 10");
-   EXPECT_EQ(run.status, 2);
-   EXPECT_NE(run.err.find(fifo + ": not a regular file"), std::string::npos) << run.err;
+   const std::string ctl = (dir.path() / "ctl.sock").string();
+   for (const auto &args : {std::vector<std::string>{"replay", "--vm-mac", kVmMac, "--config", fifo, example()},
+                            std::vector<std::string>{"ctl", "--ctl", ctl, "config", "vm1", fifo}}) {
+      const ToolRun run = runTool(args, "timeout 10");
+      EXPECT_EQ(run.status, 2) << args[0];
+      EXPECT_NE(run.err.find(fifo + ": not a regular file"), std::string::npos) << run.err;
+   }
 }
 
 TEST(Help, every_subcommand_says_its_exit_status_and_examples)

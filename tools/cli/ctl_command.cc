@@ -5,6 +5,7 @@
 
 #include "cli/ctl_format.h"
 #include "live/ctl_commands.h"
+#include "session/config_file.h"
 #include "session/error.h"
 #include "session/json_text.h"
 
@@ -20,9 +21,7 @@
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
-#include <fstream>
 #include <iostream>
-#include <sstream>
 
 namespace swsec::tools {
 
@@ -52,13 +51,11 @@ public:
 // Read here, with the caller's own rights; the daemon gets the text.
 std::string fileText(const std::string &path)
 {
-   std::ifstream file(path, std::ios::binary);
-   if (!file) {
-      throw UsageError(path + ": " + std::strerror(errno));
+   try {
+      return session::readConfigText(path);
+   } catch (const session::InputError &e) {
+      throw UsageError(e.what());
    }
-   std::ostringstream text;
-   text << file.rdbuf();
-   return text.str();
 }
 
 nlohmann::json buildRequest(const CtlCommandOptions &options)

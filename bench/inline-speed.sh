@@ -11,6 +11,7 @@
 # trip, a TCP transfer's throughput (iperf3) and the time a DHCP lease takes
 # (udhcpc against dnsmasq). The medians of the ratios to the bridge of the
 # same round are then held against the targets, each stated met or missed.
+# Rounds run ABBA (bridge, kernel, user; then user, kernel, bridge).
 # Not a test; needs root, iperf3, ping, dnsmasq and udhcpc (scripts/setup.sh).
 #
 #   bench/inline-speed.sh [SECONDS [ROUNDS]]     (default 5 a measurement, 3 rounds)
@@ -142,10 +143,14 @@ unguard() {
 echo "inline-speed: $rounds rounds, $seconds s a measurement; 60-byte frames; lossless check at 0.8x the bridge's frames/s"
 printf "%-6s %-8s %12s %9s %11s %12s %12s %10s %12s\n" round path frames/s loss "loss@0.8x" "ns CPU/frame" "ping rtt" "TCP Mb/s" "DHCP lease"
 for round in $(seq "$rounds"); do
-  # The bridge first (it sets the paced rate), then the two paths in turn.
-  measure bridge
-  if [ $((round % 2)) -eq 1 ]; then order="kernel user"; else order="user kernel"; fi
+  # ABBA: bridge, kernel, user, then user, kernel, bridge. The bridge sets
+  # the paced rate; a round that measures it last uses the round before's.
+  if [ $((round % 2)) -eq 1 ]; then order="bridge kernel user"; else order="user kernel bridge"; fi
   for path in $order; do
+    if [ "$path" = bridge ]; then
+      measure bridge
+      continue
+    fi
     guard "$path"
     measure "$path"
     [ "$round" -eq "$rounds" ] && "$swsec" ctl --ctl "$work/ctl.sock" counters >"$work/counters.$path"

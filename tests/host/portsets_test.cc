@@ -67,22 +67,6 @@ public:
    orr_Portset *vswitch = nullptr;
 };
 
-TEST_F(PortsetsTest, AcquireByPortFindsThePortsetAndCountsHolds)
-{
-   orr_PortsetHandle handle{};
-   EXPECT_EQ(orr_PortsetAcquireByPortID(99, ORR_PORTSET_ACQUIRE_SHARED, &handle), ORR_NOT_FOUND);
-   EXPECT_EQ(orr_PortsetAcquireByPortID(10, 0, &handle), ORR_BAD_PARAM);
-   ASSERT_EQ(orr_PortsetAcquireByPortID(11, ORR_PORTSET_ACQUIRE_SHARED, &handle), ORR_OK);
-   EXPECT_EQ(handle.portset, vswitch);
-   EXPECT_EQ(host.portsets().outstandingAcquisitions(), 1u);
-   orr_PortsetRelease(&handle);
-   EXPECT_EQ(host.portsets().outstandingAcquisitions(), 0u);
-   host.faults().failOnce("orr_PortsetAcquireByPortID", ORR_NO_MEMORY);
-   EXPECT_EQ(orr_PortsetAcquireByPortID(10, ORR_PORTSET_ACQUIRE_SHARED, &handle), ORR_NO_MEMORY);
-   orr_PortsetRelease(&handle);   // released twice
-   EXPECT_EQ(takeViolations().size(), 1u);
-}
-
 TEST_F(PortsetsTest, MessagesWaitUntilThePosterLetsGoOfItsLocks)
 {
    const orr_PortsetMessageCBHandle listener = listen(vswitch, 0);

@@ -7,7 +7,6 @@
 #include <gmock/gmock.h>
 
 #include <atomic>
-#include <cctype>
 #include <cstring>
 #include <functional>
 #include <thread>
@@ -294,7 +293,7 @@ void restoreFrom(const uint8_t *state, uint64_t length, orr_Status expected = OR
 }
 
 const Breach breaches[] = {
-   {"slow path request under a spinlock",
+   {"SlowPathRequestUnderASpinlock",
     [](SifraTest &t, host::FilterId) {
        const orr_Spinlock lock = t.makeLock(t.makeDomain(), "test.lock", 2);
        orr_SpinlockLock(lock);
@@ -302,14 +301,14 @@ const Breach breaches[] = {
        orr_SpinlockUnlock(lock);
     },
     "orr_SifraClearSlowPath: request made while holding spinlock 'test.lock'"},
-   {"second slow path reply owed",
+   {"SecondSlowPathReplyOwed",
     [](SifraTest &t, host::FilterId) {
        EXPECT_EQ(orr_SifraSetSlowPath(agent.handle, 9, onReply, &t.cookie, 10), ORR_OK);
        EXPECT_EQ(orr_SifraSetSlowPath(agent.handle, 9, onReply, &t.cookie, 10), ORR_OK);
        EXPECT_EQ(t.slowPaths().deliverReplies(), 2u);
     },
     "a second set request for filter 1 while its reply is owed"},
-   {"slow path replies delivered under a lock",
+   {"SlowPathRepliesDeliveredUnderALock",
     [](SifraTest &t, host::FilterId) {
        EXPECT_EQ(orr_SifraSetSlowPath(agent.handle, 9, onReply, &t.cookie, 10), ORR_OK);
        const orr_Spinlock lock = t.makeLock(t.makeDomain("test.other"), "test.lock", 2);
@@ -319,31 +318,31 @@ const Breach breaches[] = {
        EXPECT_EQ(t.slowPaths().deliverReplies(), 1u);
     },
     "slow path replies delivered from a context that holds a spinlock"},
-   {"unknown filter handle",
+   {"UnknownFilterHandle",
     [](SifraTest &, host::FilterId) { EXPECT_EQ(orr_SifraClearSlowPath(nullptr), ORR_INVALID_HANDLE); },
     "orr_SifraClearSlowPath: unknown filter handle"},
-   {"slow path reply lost with its filter",
+   {"SlowPathReplyLostWithItsFilter",
     [](SifraTest &t, host::FilterId id) {
        EXPECT_EQ(orr_SifraSetSlowPath(agent.handle, 9, onReply, &t.cookie, 10), ORR_OK);
        EXPECT_EQ(t.host.sifra().destroyFilter(id), ORR_OK);
        EXPECT_THAT(t.slowPaths().pendingReplies(), IsEmpty());
     },
     "filter 1 destroyed while 1 slow path reply(s) were owed to it"},
-   {"save writes past its buffer",
+   {"SaveWritesPastItsBuffer",
     [](SifraTest &t, host::FilterId id) {
        agent.save = [](uint8_t *buffer, uint64_t *length) { buffer[*length] = 0; };
        std::vector<uint8_t> blob;
        EXPECT_EQ(t.host.migration().saveAsHypervisor(id, &blob), ORR_OK);
     },
     "saveState: the module wrote up to 1 byte(s) past the buffer's 16", true},
-   {"save writes before its buffer",
+   {"SaveWritesBeforeItsBuffer",
     [](SifraTest &t, host::FilterId id) {
        agent.save = [](uint8_t *buffer, uint64_t *) { buffer[-3] = 0; };
        std::vector<uint8_t> blob;
        EXPECT_EQ(t.host.migration().save(id, 16, &blob), ORR_OK);
     },
     "saveState: the module wrote 3 byte(s) before the buffer", true},
-   {"save claims more than its buffer",
+   {"SaveClaimsMoreThanItsBuffer",
     [](SifraTest &t, host::FilterId id) {
        agent.save = [](uint8_t *, uint64_t *length) { *length += 1; };
        std::vector<uint8_t> blob;
@@ -351,19 +350,19 @@ const Breach breaches[] = {
        EXPECT_EQ(blob.size(), 16u);
     },
     "saveState: the module says it wrote 17 bytes into a buffer of 16"},
-   {"restore writes past the blob",
+   {"RestoreWritesPastTheBlob",
     [](SifraTest &t, host::FilterId id) {
        agent.restore = [](const uint8_t *blob, uint64_t length) { const_cast<uint8_t *>(blob)[length + 7] = 0; };
        EXPECT_EQ(t.host.migration().restore(id, std::vector<uint8_t>(8, 1)), ORR_OK);
     },
     "restoreState: the module wrote up to 8 byte(s) past the buffer's 8", true},
-   {"restore hands the slow path bytes outside the blob",
+   {"RestoreHandsTheSlowPathBytesOutsideTheBlob",
     [](SifraTest &t, host::FilterId id) {
        agent.restore = [](const uint8_t *blob, uint64_t length) { restoreFrom(blob + 1, length, ORR_BAD_PARAM); };
        EXPECT_EQ(t.host.migration().restore(id, std::vector<uint8_t>(8, 1)), ORR_OK);
     },
     "the state lies outside the blob being restored"},
-   {"the blob lives until the restore's reply, still fenced",
+   {"TheBlobLivesUntilTheRestoresReplyStillFenced",
     [](SifraTest &t, host::FilterId id) {
        static const uint8_t *kept = nullptr;
        agent.restore = [](const uint8_t *blob, uint64_t length) {
@@ -394,15 +393,8 @@ TEST_P(SifraBreachTest, IsReported)
    EXPECT_THAT(takeViolations(), ElementsAre(HasSubstr(GetParam().violation)));
 }
 
-INSTANTIATE_TEST_SUITE_P(Contract, SifraBreachTest, ::testing::ValuesIn(breaches), [](const auto &param) {
-   std::string name;
-   for (const char *c = param.param.name; *c != '\0'; ++c) {
-      if (std::isalpha(static_cast<unsigned char>(*c))) {
-         name += (c == param.param.name || c[-1] == ' ') ? static_cast<char>(std::toupper(*c)) : *c;
-      }
-   }
-   return name;
-});
+INSTANTIATE_TEST_SUITE_P(Contract, SifraBreachTest, ::testing::ValuesIn(breaches),
+                         [](const auto &param) { return std::string(param.param.name); });
 
 }  // namespace
 }  // namespace swsec::testing

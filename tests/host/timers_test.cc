@@ -5,9 +5,7 @@
 
 #include <gmock/gmock.h>
 
-
 using ::testing::ElementsAre;
-using ::testing::FieldsAre;
 using ::testing::HasSubstr;
 using namespace std::chrono_literals;
 
@@ -58,22 +56,6 @@ public:
    orr_TimerQueue queue;
    int64_t start;
 };
-
-TEST_F(TimerTest, UptimeAndCyclesDeriveFromOneVirtualClock)
-{
-   EXPECT_EQ(start, 1000 * 1'000'000) << "time starts at a non-zero uptime";
-   const uint64_t cyclesPerSecond = orr_TimerCyclesPerSecond();
-   const uint64_t cyclesBefore = orr_GetTimerCycles();
-   EXPECT_EQ(cyclesBefore, 1000 * cyclesPerSecond);
-   EXPECT_EQ(uptimeUs(), start) << "virtual time stands still on its own";
-
-   host.clock().advance(2'500'000us);
-   orr_TimeVal now{};
-   orr_GetUptime(&now);
-   EXPECT_THAT(now, FieldsAre(1002, 500'000));
-   EXPECT_EQ(orr_GetTimerCycles() - cyclesBefore, cyclesPerSecond * 5 / 2);
-   EXPECT_EQ(host.clock().now(), 2'500'000us);
-}
 
 TEST_F(TimerTest, DueTimersFireInDueOrderThenInAddingOrderAtTheirDueTimes)
 {

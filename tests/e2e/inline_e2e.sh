@@ -248,6 +248,10 @@ if [ "$datapath" = kernel ]; then
   punted=$(( $(counter vm2 "['kernel']['punted: ARP']") + $(counter vm2 "['kernel']['punted: error-rate-limit state']") ))
   [ "$punted" -lt 4500 ] || fail "the ARP flood reached swsec: $punted frames punted"
   [ "$(counter vm2 "['drops']['txRateLimitDropCnt']")" -gt 3000 ] || fail "the flood's drops not counted"
+  # The error state the flood caused is in the map: in the next second the VM's frames go to the module.
+  sleep 1.1
+  in_ns "$vm2" ping -c 2 -i 0.2 -W 1 192.0.2.1 >/dev/null
+  [ "$(counter vm2 "['kernel']['punted: error-rate-limit state']")" -gt 0 ] || fail "the error state is not in the map"
 fi
 
 # ---------------------------------------------------------------- a port goes

@@ -135,9 +135,12 @@ static __always_inline int swsec_punt(struct __sk_buff *skb, const struct swsec_
    return TC_ACT_STOLEN;
 }
 
-static __always_inline int swsec_pass(__u32 direction)
+static __always_inline int swsec_pass(struct __sk_buff *skb, __u32 direction)
 {
    swsec_count(direction == SWSEC_FP_DIR_FROM_VM ? SWSEC_FP_PASSED : SWSEC_FP_PASSED_TO_VM);
+   /* A runt goes on padded to 60 bytes, as a switch pads it. */
+   if (skb->len < 60)
+      bpf_skb_change_tail(skb, 60, 0);
    return TC_ACT_OK;
 }
 
@@ -170,10 +173,10 @@ static __always_inline int swsec_judge(struct __sk_buff *skb, __u32 direction)
    const __u32 features = port->features;
    /* A port with every feature off passes every frame untouched. */
    if (features == 0)
-      return swsec_pass(direction);
+      return swsec_pass(skb, direction);
    /* A frame without an Ethernet header passes unexamined, as in the module. */
    if (data + ETH_HLEN > end)
-      return swsec_pass(direction);
+      return swsec_pass(skb, direction);
    const __u8 *type = data + l2;
    if (type + 2 > end)
       return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_UNPARSED);
@@ -221,19 +224,19 @@ static __always_inline int swsec_judge(struct __sk_buff *skb, __u32 direction)
 
    if (ethertype == ETH_P_IPV6) {
       if (direction != SWSEC_FP_DIR_FROM_VM || !(features & SWSEC_FP_FEATURE_BLOCK_DHCP_SERVER))
-         return swsec_pass(direction);
+         return swsec_pass(skb, direction);
       if (l3 + 40 > end)
          return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_UNPARSED);
       if (l3[6] != IPPROTO_UDP_)
-         return swsec_pass(direction); /* the module looks at a UDP header right after IPv6 only */
+         return swsec_pass(skb, direction); /* the module looks at a UDP header right after IPv6 only */
       if (l3 + 48 > end)
          return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_UNPARSED);
       if (swsec_load_be16(l3 + 40) == DHCPV6_SERVER_PORT)
          return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_DHCP);
-      return swsec_pass(direction);
+      return swsec_pass(skb, direction);
    }
    if (ethertype != ETH_P_IP)
-      return swsec_pass(direction);
+      return swsec_pass(skb, direction);
 
    /* IPv4: a plain 20-byte header, not a fragment, else the module decides. */
    if (l3 + 20 > end || l3[0] != 0x45)
@@ -250,12 +253,12 @@ static __always_inline int swsec_judge(struct __sk_buff *skb, __u32 direction)
          return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_DHCP);
    }
    if (direction != SWSEC_FP_DIR_FROM_VM)
-      return swsec_pass(direction);
+      return swsec_pass(skb, direction);
 
    const int guard = (features & SWSEC_FP_FEATURE_IP_SOURCE_GUARD) != 0;
    const int refresh = (features & SWSEC_FP_FEATURE_IP_DISCOVERY) && (port->flags & SWSEC_FP_PORT_TRUSTED);
    if (!guard && !refresh)
-      return swsec_pass(direction);
+      return swsec_pass(skb, direction);
    struct swsec_fp_binding_key key = {.vlan = frame.vlan};
    __builtin_memcpy(key.mac, data + 6, 6);
    __builtin_memcpy(&key.ip, l3 + 12, 4);
@@ -267,7 +270,7 @@ static __always_inline int swsec_judge(struct __sk_buff *skb, __u32 direction)
       swsec_count(SWSEC_FP_DROP_IP_SOURCE_GUARD);
       return TC_ACT_SHOT;
    }
-   return swsec_pass(direction);
+   return swsec_pass(skb, direction);
 }
 
 SEC("tc")

@@ -170,16 +170,13 @@ attack arp-two-8021q taggedDropCnt
 attack arp-8021ad-8021q taggedDropCnt
 attack ip-8021ad ipSrcGuardDropCnt
 
-# The kernel data path does not pad yet: there a runt never reaches the server.
-if [ "$datapath" = user ]; then
-  step "a 20-byte runt from the VM reaches the server padded to 60 bytes"
-  spawn ip netns exec "$srv" "$python" "$tool" runt-length eth0 10 >"$work/runt.out"
-  runt_pid=$spawned
-  wait_for 5 grep -q listening "$work/runt.out" || fail "the runt listener did not start"
-  in_ns "$vm1" "$python" "$tool" runt eth0 "$srv_mac"
-  wait "$runt_pid"
-  [ "$(tail -1 "$work/runt.out")" = 60 ] || fail "the runt arrived as: $(cat "$work/runt.out")"
-fi
+step "a 20-byte runt from the VM reaches the server padded to 60 bytes"
+spawn ip netns exec "$srv" "$python" "$tool" runt-length eth0 10 >"$work/runt.out"
+runt_pid=$spawned
+wait_for 5 grep -q listening "$work/runt.out" || fail "the runt listener did not start"
+in_ns "$vm1" "$python" "$tool" runt eth0 "$srv_mac"
+wait "$runt_pid"
+[ "$(tail -1 "$work/runt.out")" = 60 ] || fail "the runt arrived as: $(cat "$work/runt.out")"
 
 step "an ethertype list drops LLC/SNAP-wrapped IPv4 and RARP, not IPv4 and ARP; allowTagged passes an inner tag"
 # config_with KEYS: enforcing.json with KEYS added, for ctl config vm1.

@@ -2,6 +2,8 @@
 // the thread that judges the frames it punts.
 #include "live/kernel_path.h"
 
+#include "host/header_lookup.h"
+
 #include <linux/if_packet.h>
 #include <net/if.h>
 #include <poll.h>
@@ -284,6 +286,8 @@ void KernelPath::run(int stopEvent, PortCounters &counters, const std::function<
             counters.truncated.fetch_add(1, std::memory_order_relaxed);
             continue;
          }
+         // A runt is judged and goes on padded, as on the user path.
+         punt.bytes.resize(host::switchPaddedLength(punt.bytes.size()), 0);
          const host::FrameView view{.bytes = punt.bytes, .vlanId = punt.vlan};
          const bool kept = sifra.processPackets(filter_, punt.direction, std::span(&view, 1)).kept.size() == 1;
          (kept ? counters.passed : counters.dropped)[punt.direction].fetch_add(1, std::memory_order_relaxed);

@@ -16,12 +16,6 @@
 #include <cstdint>
 #include <vector>
 
-extern "C" int LLVMFuzzerInitialize(int *, char ***)
-{
-   (void)swsec::fuzz::loadedModule();
-   return 0;
-}
-
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size)
 {
    swsec::fuzz::LoadedModule &module = swsec::fuzz::loadedModule();

@@ -49,6 +49,7 @@ LoadedModule *make()
    module->host.portsets().addPortset("vs0");
    module->host.portsets().addPort("vs0", kEnforcingPort);
    module->host.portsets().addPort("vs0", kLearningPort);
+   module->host.portsets().addPort("vs0", kRestoredPort);
    // The VM of the test captures, bound statically so that source checks pass for it.
    const testing::StaticBinding vm{.vlan = 0, .mac = {0x02, 0x00, 0x5e, 0xc0, 0x00, 0x01}, .ip = {192, 0, 2, 101}};
    module->enforcing = createPort(module->host, kEnforcingPort, testing::enforcingConfig({vm}));
@@ -79,3 +80,10 @@ LoadedModule &loadedModule()
 }
 
 }  // namespace swsec::fuzz
+
+// Every target that drives the loaded module loads it before its first input.
+extern "C" int LLVMFuzzerInitialize(int *, char ***)
+{
+   (void)swsec::fuzz::loadedModule();
+   return 0;
+}

@@ -17,6 +17,7 @@ inline constexpr std::string_view kAgentProperty = "com.tarlin.common.switch-sec
 inline constexpr std::string_view kFhsAgent = "sifra-generic-tarlin-fhs";
 inline constexpr uint32_t kEnforcingPort = 7;
 inline constexpr uint32_t kLearningPort = 8;
+inline constexpr uint32_t kRestoredPort = 9;   // no filter: a target makes its own there
 
 struct LoadedModule {
    host::Host host;
@@ -28,8 +29,9 @@ struct LoadedModule {
    void forgetRecords();
 };
 
-// Made on first use and kept until exit: unloading would only repeat what
-// the test suite checks, and a fresh load per input is too slow to fuzz.
+// Made before the first input (LLVMFuzzerInitialize is defined with it) and
+// kept until exit: unloading would only repeat what the test suite checks,
+// and a fresh load per input is too slow to fuzz.
 LoadedModule &loadedModule();
 
 }  // namespace swsec::fuzz

@@ -12,19 +12,6 @@
 #include <cstdlib>
 #include <span>
 
-namespace {
-
-constexpr uint32_t kRestoredPort = 9;
-
-}  // namespace
-
-extern "C" int LLVMFuzzerInitialize(int *, char ***)
-{
-   swsec::fuzz::LoadedModule &module = swsec::fuzz::loadedModule();
-   module.host.portsets().addPort("vs0", kRestoredPort);
-   return 0;
-}
-
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size)
 {
    swsec::fuzz::LoadedModule &module = swsec::fuzz::loadedModule();
@@ -50,7 +37,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size)
    config.name = "restored.eth0";
    config.failurePolicy = 1;
    swsec::host::FilterId port = 0;
-   if (module.host.sifra().createFilter(ipv6 ? swsec::fuzz::kFhsAgent : swsec::fuzz::kAgent, kRestoredPort, config,
+   if (module.host.sifra().createFilter(ipv6 ? swsec::fuzz::kFhsAgent : swsec::fuzz::kAgent, swsec::fuzz::kRestoredPort, config,
                                         &port) != ORR_OK) {
       std::fprintf(stderr, "restore_state_fuzz: createFilter failed\n");
       std::abort();

@@ -101,6 +101,8 @@ struct swsec_fp_frame {
    __u32 direction;
    __u16 vlan;
    __u8 tag_in_bytes;
+   __u8 tag_flags;  /* SWSEC_FP_PUNT_HAS_TAG and the TPID's */
+   __u8 tag_high;
 };
 
 static __always_inline int swsec_punt(struct __sk_buff *skb, const struct swsec_fp_port *port,
@@ -124,9 +126,10 @@ static __always_inline int swsec_punt(struct __sk_buff *skb, const struct swsec_
    slot->head.captured = len;
    slot->head.vlan = frame->vlan;
    slot->head.direction = (__u8)frame->direction;
-   slot->head.flags = frame->tag_in_bytes ? SWSEC_FP_PUNT_TAG_IN_BYTES : 0;
+   slot->head.flags = (frame->tag_in_bytes ? SWSEC_FP_PUNT_TAG_IN_BYTES : 0) | frame->tag_flags;
    slot->head.reason = (__u8)reason;
-   slot->head.reserved[0] = slot->head.reserved[1] = slot->head.reserved[2] = 0;
+   slot->head.tag_high = frame->tag_high;
+   slot->head.reserved[0] = slot->head.reserved[1] = 0;
    if (bpf_ringbuf_output(&swsec_punts, slot, sizeof(slot->head) + len, 0) != 0) {
       swsec_count(SWSEC_FP_PUNT_LOST);
       return TC_ACT_SHOT;
@@ -156,15 +159,25 @@ static __always_inline int swsec_judge(struct __sk_buff *skb, __u32 direction)
    const __u8 *end = (const __u8 *)(long)skb->data_end;
    /* The outer tag: metadata on tc, or still in the bytes where nothing took it off. */
    __u32 l2 = 12; /* where the ethertype after the outer tag is */
+   __u16 tpid = 0;
+   __u16 tci = 0;
    if (skb->vlan_present) {
-      frame.vlan = skb->vlan_tci & 0x0fff;
+      tpid = bpf_ntohs(skb->vlan_proto);
+      tci = (__u16)skb->vlan_tci;
    } else if (data + 18 <= end) {
-      const __u16 tpid = swsec_load_be16(data + 12);
-      if (tpid == ETH_P_8021Q || tpid == ETH_P_8021AD_ || tpid == ETH_P_QINQ_) {
-         frame.vlan = swsec_load_be16(data + 14) & 0x0fff;
+      const __u16 type = swsec_load_be16(data + 12);
+      if (type == ETH_P_8021Q || type == ETH_P_8021AD_ || type == ETH_P_QINQ_) {
+         tpid = type;
+         tci = swsec_load_be16(data + 14);
          frame.tag_in_bytes = 1;
          l2 = 16;
       }
+   }
+   if (tpid != 0) {
+      frame.vlan = tci & 0x0fff;
+      frame.tag_high = (__u8)(tci >> 12);
+      frame.tag_flags = SWSEC_FP_PUNT_HAS_TAG | (tpid == ETH_P_8021AD_ ? SWSEC_FP_PUNT_TPID_8021AD : 0) |
+                        (tpid == ETH_P_QINQ_ ? SWSEC_FP_PUNT_TPID_9100 : 0);
    }
    __u32 zero = 0;
    const struct swsec_fp_port *port = bpf_map_lookup_elem(&swsec_port, &zero);

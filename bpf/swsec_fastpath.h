@@ -132,6 +132,9 @@ enum swsec_fp_reason { SWSEC_FP_REASON_LIST(SWSEC_FP_REASON_ENUM) SWSEC_FP_REASO
 
 /* swsec_fp_punt.flags */
 #define SWSEC_FP_PUNT_TAG_IN_BYTES 0x1u /* the outer tag (the VLAN below) is still in the bytes */
+#define SWSEC_FP_PUNT_HAS_TAG 0x2u      /* the frame had an outer tag (VLAN 0 included) */
+#define SWSEC_FP_PUNT_TPID_8021AD 0x4u  /* its TPID was 0x88a8 (else 0x8100 ... */
+#define SWSEC_FP_PUNT_TPID_9100 0x8u    /* ... or 0x9100) */
 
 /* A punted frame in the ring buffer: this header, then `captured` bytes of the frame. */
 struct swsec_fp_punt {
@@ -142,7 +145,8 @@ struct swsec_fp_punt {
    __u8 direction;  /* SWSEC_FP_DIR_* */
    __u8 flags;      /* SWSEC_FP_PUNT_* */
    __u8 reason;     /* enum swsec_fp_reason */
-   __u8 reserved[3];
+   __u8 tag_high;   /* the outer tag's priority and DEI (its TCI's top 4 bits) */
+   __u8 reserved[2];
 };
 SWSEC_FP_STATIC_ASSERT(sizeof(struct swsec_fp_punt) == 20, "swsec_fp_punt layout");
 SWSEC_FP_STATIC_ASSERT(offsetof(struct swsec_fp_punt, frame_len) == 4, "swsec_fp_punt layout");
@@ -150,6 +154,7 @@ SWSEC_FP_STATIC_ASSERT(offsetof(struct swsec_fp_punt, captured) == 8, "swsec_fp_
 SWSEC_FP_STATIC_ASSERT(offsetof(struct swsec_fp_punt, vlan) == 12, "swsec_fp_punt layout");
 SWSEC_FP_STATIC_ASSERT(offsetof(struct swsec_fp_punt, direction) == 14, "swsec_fp_punt layout");
 SWSEC_FP_STATIC_ASSERT(offsetof(struct swsec_fp_punt, reason) == 16, "swsec_fp_punt layout");
+SWSEC_FP_STATIC_ASSERT(offsetof(struct swsec_fp_punt, tag_high) == 17, "swsec_fp_punt layout");
 
 /* Frame bytes a punt record carries at most (a jumbo frame and its tag). */
 #define SWSEC_FP_PUNT_MAX_BYTES 9220u

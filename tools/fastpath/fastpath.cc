@@ -87,6 +87,10 @@ int takePunt(void *context, void *data, size_t size)
    punt.direction = head.direction;
    punt.vlan = head.vlan;
    punt.reason = head.reason;
+   if ((head.flags & SWSEC_FP_PUNT_HAS_TAG) != 0) {
+      punt.tpid = (head.flags & SWSEC_FP_PUNT_TPID_8021AD) != 0 ? 0x88a8 : (head.flags & SWSEC_FP_PUNT_TPID_9100) != 0 ? 0x9100 : 0x8100;
+      punt.tagHigh = head.tag_high;
+   }
    punt.frameLen = head.frame_len;
    punt.truncated = head.captured < head.frame_len;
    // One copy around the tag: the addresses, then what follows it.

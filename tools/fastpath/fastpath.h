@@ -79,6 +79,8 @@ struct Punt {
    uint32_t portId = 0;
    uint32_t direction = 0;       // SWSEC_FP_DIR_*
    uint16_t vlan = 0;
+   std::optional<uint16_t> tpid; // the outer tag's, none when the frame had none
+   uint8_t tagHigh = 0;          // its priority and DEI (the TCI's top 4 bits)
    uint8_t reason = 0;           // enum swsec_fp_reason
    uint32_t frameLen = 0;        // as the program saw it (outer tag included when in the bytes)
    bool truncated = false;       // longer than a punt record carries

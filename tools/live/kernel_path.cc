@@ -241,13 +241,16 @@ std::map<std::string, uint64_t> KernelPath::dropsSinceConfigured() const
 void KernelPath::inject(fastpath::Punt &punt)
 {
    completeChecksum(punt.bytes);
-   // The outer tag back into the bytes: the receiving end takes it off into
-   // metadata again before the redirect.
+   // The outer tag back into the bytes, as it came (TPID, priority, VLAN):
+   // the receiving end takes an 802.1Q or 802.1ad one off into metadata
+   // again before the redirect.
    std::vector<uint8_t> frame;
    std::span<const uint8_t> bytes = punt.bytes;
-   if (punt.vlan != 0 && punt.bytes.size() >= 12) {
+   if (punt.tpid && punt.bytes.size() >= 12) {
+      const uint16_t tci = static_cast<uint16_t>(punt.tagHigh << 12 | punt.vlan);
       frame.assign(punt.bytes.begin(), punt.bytes.begin() + 12);
-      frame.insert(frame.end(), {0x81, 0x00, static_cast<uint8_t>(punt.vlan >> 8), static_cast<uint8_t>(punt.vlan)});
+      frame.insert(frame.end(), {static_cast<uint8_t>(*punt.tpid >> 8), static_cast<uint8_t>(*punt.tpid),
+                                 static_cast<uint8_t>(tci >> 8), static_cast<uint8_t>(tci)});
       frame.insert(frame.end(), punt.bytes.begin() + 12, punt.bytes.end());
       bytes = frame;
    }

@@ -97,8 +97,16 @@ protected:
    EchoHandler handler_;
 };
 
-TEST_F(CtlServerTest, the_socket_is_the_owners_alone_and_goes_with_the_server)
+TEST_F(CtlServerTest, the_socket_replaces_a_stale_one_is_the_owners_alone_and_goes_with_the_server)
 {
+   {
+      const int fd = socket(AF_UNIX, SOCK_STREAM, 0);
+      sockaddr_un address{};
+      address.sun_family = AF_UNIX;
+      std::snprintf(address.sun_path, sizeof address.sun_path, "%s", path_.c_str());
+      ASSERT_EQ(bind(fd, reinterpret_cast<const sockaddr *>(&address), sizeof address), 0);
+      close(fd);   // bound, never listening: what a killed daemon leaves
+   }
    {
       CtlServer server(path_, events_, handler_);
       struct stat info{};
@@ -112,22 +120,9 @@ TEST_F(CtlServerTest, the_socket_is_the_owners_alone_and_goes_with_the_server)
       EXPECT_EQ(nlohmann::json::parse(client.line())["result"]["echo"], "ports");
    }
    EXPECT_FALSE(std::filesystem::exists(path_));
-}
-
-TEST_F(CtlServerTest, a_stale_socket_is_replaced_and_any_other_file_is_left_alone)
-{
-   {
-      const int fd = socket(AF_UNIX, SOCK_STREAM, 0);
-      sockaddr_un address{};
-      address.sun_family = AF_UNIX;
-      std::snprintf(address.sun_path, sizeof address.sun_path, "%s", path_.c_str());
-      ASSERT_EQ(bind(fd, reinterpret_cast<const sockaddr *>(&address), sizeof address), 0);
-      close(fd);   // bound, never listening: what a killed daemon leaves
-   }
-   { CtlServer server(path_, events_, handler_); }
+   // Any other file is left alone.
    const std::string plain = (dir_ / "plain").string();
-   std::FILE *file = std::fopen(plain.c_str(), "w");
-   std::fclose(file);
+   std::fclose(std::fopen(plain.c_str(), "w"));
    EXPECT_THROW(CtlServer(plain, events_, handler_), std::runtime_error);
    EXPECT_TRUE(std::filesystem::exists(plain));
 }

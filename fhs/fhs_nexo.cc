@@ -27,6 +27,7 @@ static constexpr Nexo_FieldDef fhsNexoSummaryFields[] = {
 #define FHS_NEXO_DROP_DEF(field, text) FHS_NEXO_TEXT(field, "Dropped: " text),
    FHS_DROP_LIST(FHS_NEXO_DROP_DEF)
 #undef FHS_NEXO_DROP_DEF
+   FHS_NEXO_TEXT(ndRateLimitErrEntryCnt, "ND error state entered"),
    FHS_NEXO_TEXT(bindingsEvictedCnt, "Bindings evicted"),
 };
 
@@ -219,6 +220,8 @@ orr_Status FhsNexoFillSummary(const FhsContext *ctx, const Nexo_ParamList *, voi
    Number(summary->name, sizeof(summary->name), __atomic_load_n(&ctx->counters.name, __ATOMIC_RELAXED));
    FHS_DROP_LIST(FHS_NEXO_DROP_FILL)
 #undef FHS_NEXO_DROP_FILL
+   Number(summary->ndRateLimitErrEntryCnt, sizeof(summary->ndRateLimitErrEntryCnt),
+          __atomic_load_n(&ctx->counters.ndRateLimitErrEntryCnt, __ATOMIC_RELAXED));
    Number(summary->bindingsEvictedCnt, sizeof(summary->bindingsEvictedCnt), ctx->counters.bindingsEvictedCnt);
    return ORR_OK;
 }

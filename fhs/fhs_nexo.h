@@ -8,6 +8,8 @@
 #include "fhs/fhs_context.h"
 #include "platform/orr_nexo.h"
 
+#include <cstddef>
+
 struct FhsNexo_Summary {
    char featuresEnabled[200];
    char portMode[12];
@@ -21,8 +23,12 @@ struct FhsNexo_Summary {
 #define FHS_NEXO_DROP_FIELD(name, text) char name[24];
    FHS_DROP_LIST(FHS_NEXO_DROP_FIELD)
 #undef FHS_NEXO_DROP_FIELD
+   char ndRateLimitErrEntryCnt[24];
    char bindingsEvictedCnt[24];
 };
+static_assert(offsetof(FhsNexo_Summary, headerChainDropCnt) == 320);
+static_assert(offsetof(FhsNexo_Summary, ndRateLimitErrEntryCnt) == 512);
+static_assert(sizeof(FhsNexo_Summary) == 560);
 
 struct FhsNexo_Binding {
    char vlanId[8];

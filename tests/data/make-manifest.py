@@ -554,7 +554,7 @@ class Fhs:
 
     DROPS = ("headerChainDropCnt", "fragmentedNdDropCnt", "raGuardDropCnt", "dhcpv6GuardDropCnt",
              "sourceGuardDropCnt", "ndInspectionDropCnt", "claimRefusedDropCnt", "ndRateLimitDropCnt",
-             "bindingsEvictedCnt")
+             "ndRateLimitErrEntryCnt", "bindingsEvictedCnt")
 
     def __init__(self, cfg, t_start):
         self.cfg, self.bindings, self.pending, self.events = cfg, [], [], []
@@ -592,6 +592,7 @@ class Fhs:
                 return self.drop("ndRateLimitDropCnt", "ND error-rate-limit state")
         elif is_nd and self.nd.reached(t):
             self.nd, self.err = Limiter(self.cfg["errRateLimit"], t), True
+            self.counters["ndRateLimitErrEntryCnt"] += 1
             return self.drop("ndRateLimitDropCnt", "ND rate limit exceeded, port enters the error-rate-limit state")
         return None
 

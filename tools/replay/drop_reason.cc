@@ -76,9 +76,8 @@ DropReason explainDrop(const DropCounters &before, const DropCounters &after, st
    }
    // The IPv6 agent judges what the IPv4 agent passed.
    if (moved(before, after, "ndRateLimitDropCnt")) {
-      const auto inError = before.find("ndRateLimitErr");
-      return inError != before.end() && inError->second != 0 ? DropReason::ndRateLimitErrorState
-                                                             : DropReason::ndRateLimit;
+      return moved(before, after, "ndRateLimitErrEntryCnt") ? DropReason::ndRateLimit
+                                                            : DropReason::ndRateLimitErrorState;
    }
    static constexpr std::pair<std::string_view, DropReason> kIpv6Counters[] = {
       {"headerChainDropCnt", DropReason::ipv6HeaderChain}, {"fragmentedNdDropCnt", DropReason::fragmentedNd},

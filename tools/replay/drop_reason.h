@@ -34,8 +34,8 @@ enum class DropReason : uint8_t {
    ipv6SourceGuard,       // sourceGuardDropCnt
    ndInspection,          // ndInspectionDropCnt
    claimRefused,          // claimRefusedDropCnt
-   ndRateLimit,           // ndRateLimitDropCnt as the error state is entered
-   ndRateLimitErrorState, // ndRateLimitDropCnt while in the error state (ndRateLimitErr 1 before)
+   ndRateLimit,           // ndRateLimitDropCnt with ndRateLimitErrEntryCnt
+   ndRateLimitErrorState, // ndRateLimitDropCnt alone: in the error state
 };
 
 // The names the port's feature summary uses for the checks.

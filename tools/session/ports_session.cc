@@ -48,7 +48,7 @@ std::string ipv6Path(uint32_t portID)
    return "/ipv6/" + std::to_string(portID);
 }
 
-// The IPv6 counters, and the ND error state as a number for telling drops apart.
+// The IPv6 counters of a "summary" node's fields.
 DropCounters ipv6CountersOf(const std::map<std::string, std::string, std::less<>> &values)
 {
    DropCounters counters;
@@ -335,10 +335,7 @@ DropCounters ModuleSession::dropCounters(uint32_t portID)
    }
    host::NexoRecord ipv6;
    if (host_.nexo().get(ipv6Path(portID) + "/summary", &ipv6) == ORR_OK) {
-      const auto values = ipv6.values();
-      counters.merge(ipv6CountersOf(values));
-      const auto inError = values.find("ndRateLimitErr");
-      counters["ndRateLimitErr"] = inError != values.end() && inError->second == "yes" ? 1 : 0;
+      counters.merge(ipv6CountersOf(ipv6.values()));
    }
    return counters;
 }

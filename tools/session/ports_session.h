@@ -40,12 +40,13 @@ inline constexpr const char *kDropCounterFields[] = {"dhcpSnoopingDropCnt", "dai
                                                      "taggedDropCnt",       "etherTypeDropCnt"};
 
 // The IPv6 agent's counters of its "summary" node: a drop counter per
-// reason and the bindings evicted for the cap.
+// reason, the times the port entered the ND error state and the bindings
+// evicted for the cap.
 inline constexpr const char *kIpv6CounterFields[] = {
 #define SWSEC_SESSION_IPV6_FIELD(name, text) #name,
    FHS_DROP_LIST(SWSEC_SESSION_IPV6_FIELD)
 #undef SWSEC_SESSION_IPV6_FIELD
-   "bindingsEvictedCnt"};
+   "ndRateLimitErrEntryCnt", "bindingsEvictedCnt"};
 
 // One port database entry as the "vmi" node renders it ("N/A" where a field
 // does not apply).
@@ -163,7 +164,7 @@ public:
    // The IPv6 agent's nodes of the port; none when it has no IPv6 agent.
    std::optional<Ipv6PortState> readIpv6State(uint32_t portID);
    // The drop counters alone (none without IP discovery), with the IPv6
-   // agent's beside them and its error state as "ndRateLimitErr" (0 or 1).
+   // agent's beside them.
    DropCounters dropCounters(uint32_t portID);
    // The time left to the binding that expires first (none: no binding
    // expires); 0 when a node cannot be read.

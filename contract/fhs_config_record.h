@@ -75,6 +75,41 @@ static_assert(offsetof(FhsBindingKey, vlanId) == 0);
 static_assert(offsetof(FhsBindingKey, mac) == 2);
 static_assert(offsetof(FhsBindingKey, addr) == 8);
 
+/*
+ * What makes a record's header one a port cannot take, checked before any
+ * of it is applied, by the agent and by the tool before it writes either
+ * agent's record of a port.
+ */
+enum FhsConfigFault : uint8_t {
+   FhsConfigFine = 0,
+   FhsConfigBadBindingLimit,    /* over FHS_BINDING_LIMIT_MAX, or below numStatic */
+   FhsConfigBadNdRateLimit,     /* a limit over its maximum, errRateLimit not below it, a period too short */
+};
+
+constexpr FhsConfigFault FhsCheckConfig(const FhsConfig &config)
+{
+   const uint32_t limit = config.bindingLimit == 0 ? FHS_DEFAULT_BINDING_LIMIT : config.bindingLimit;
+   if (limit > FHS_BINDING_LIMIT_MAX || config.numStatic > limit) {
+      return FhsConfigBadBindingLimit;
+   }
+   if (config.ndRateLimit != 0 &&
+       (config.ndRateLimit > FHS_ND_RATE_LIMIT_MAX || config.errRateLimit >= config.ndRateLimit ||
+        config.errRateLimit > FHS_ERR_RATE_LIMIT_MAX || config.errRateLimitPeriod < FHS_ERR_RATE_LIMIT_PERIOD_MIN)) {
+      return FhsConfigBadNdRateLimit;
+   }
+   return FhsConfigFine;
+}
+
+/* A static binding must be of a unicast address (not multicast, not unspecified) on a VLAN. */
+constexpr bool FhsStaticKeyUsable(const FhsBindingKey &key)
+{
+   bool specified = false;
+   for (uint8_t byte : key.addr) {
+      specified = specified || byte != 0;
+   }
+   return specified && key.addr[0] != 0xff && key.vlanId <= 4095;
+}
+
 /* Bytes of a record with `numStatic` entries; 64-bit so that no count overflows it. */
 constexpr uint64_t FhsConfigLength(uint32_t numStatic)
 {

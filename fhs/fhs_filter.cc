@@ -30,24 +30,16 @@ FhsContext *FhsContextOf(const void *filter)
 
 namespace {
 
-bool IsUnusableAddr(const uint8_t *addr)
-{
-   static constexpr uint8_t kZero[16] = {};
-   return addr[0] == 0xff || __builtin_memcmp(addr, kZero, sizeof(kZero)) == 0;
-}
-
 bool ConfigIsValid(const FhsContext *ctx, const FhsConfig *config, const uint8_t *statics)
 {
    const char *name = ctx->filter->name;
-   const uint32_t limit = config->bindingLimit == 0 ? FHS_DEFAULT_BINDING_LIMIT : config->bindingLimit;
-   if (limit > FHS_BINDING_LIMIT_MAX || config->numStatic > limit) {
+   const FhsConfigFault fault = FhsCheckConfig(*config);
+   if (fault == FhsConfigBadBindingLimit) {
       SG_LOG(ORR_LOG_ERROR, "%s: Invalid IPv6 config: bindingLimit = %u numStatic = %u", name,
              config->bindingLimit, config->numStatic);
       return false;
    }
-   if (config->ndRateLimit != 0 &&
-       (config->ndRateLimit > FHS_ND_RATE_LIMIT_MAX || config->errRateLimit >= config->ndRateLimit ||
-        config->errRateLimit > FHS_ERR_RATE_LIMIT_MAX || config->errRateLimitPeriod < FHS_ERR_RATE_LIMIT_PERIOD_MIN)) {
+   if (fault == FhsConfigBadNdRateLimit) {
       SG_LOG(ORR_LOG_ERROR, "%s: Invalid ND rate limit config: %u %u %u", name, config->ndRateLimit,
              config->errRateLimit, config->errRateLimitPeriod);
       return false;
@@ -55,7 +47,7 @@ bool ConfigIsValid(const FhsContext *ctx, const FhsConfig *config, const uint8_t
    for (uint32_t i = 0; i < config->numStatic; i++) {
       FhsBindingKey key;
       orr_Memcpy(&key, statics + i * sizeof(FhsBindingKey), sizeof(key));
-      if (IsUnusableAddr(key.addr) || key.vlanId > 4095) {
+      if (!FhsStaticKeyUsable(key)) {
          SG_LOG(ORR_LOG_ERROR, "%s: Invalid static IPv6 binding %u", name, i);
          return false;
       }

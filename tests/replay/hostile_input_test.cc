@@ -10,6 +10,7 @@
 #include "replay/json.h"
 #include "session/config_file.h"
 #include "session/error.h"
+#include "session/ports_session.h"
 
 #include <gtest/gtest.h>
 #include <nlohmann/json.hpp>
@@ -19,11 +20,13 @@
 #include <unistd.h>
 
 #include <chrono>
+#include <cstdlib>
 #include <cstring>
 #include <functional>
 #include <optional>
 #include <fstream>
 #include <sstream>
+#include <tuple>
 
 namespace swsec::testing {
 namespace {
@@ -255,7 +258,7 @@ TEST(BadUsage, is_named_in_one_short_line_with_status_2_and_nothing_written)
       // The module's own rule: inspection on a trusted port is refused, in its words.
       {config, "Invalid config: featuresEnabled = 0xc trusted = 1",
        R"({"features": ["dai", "ip-discovery"], "trusted": true})", 1},
-      {config, "Invalid ND rate limit config: 4 4 10", R"({"ndRateLimit": 4, "errRateLimit": 4, "errRateLimitPeriod": 10})", 1},
+      {config, "\"ndRateLimit\" 4 with \"errRateLimit\" 4", R"({"ndRateLimit": 4, "errRateLimit": 4, "errRateLimitPeriod": 10})", 1},
       // Captures.
       {capture, "cannot read capture", "hello, this is text\n"},
       {capture, "cannot read capture", ""},
@@ -287,6 +290,33 @@ TEST(BadUsage, is_named_in_one_short_line_with_status_2_and_nothing_written)
       EXPECT_EQ(std::count(run.err.begin(), run.err.end(), '\n'), 1);
       EXPECT_LT(run.err.size(), c.file ? 300u : 200u);
       EXPECT_EQ(dir.files(), c.file ? std::vector<std::string>{"in"} : std::vector<std::string>{});
+   }
+}
+
+// A port takes both agents' records or neither: an IPv6 half refused by
+// the tool's check or by the module leaves the IPv4 half as it was.
+TEST(ConfigRefusal, a_refused_ipv6_half_leaves_the_ipv4_half_and_no_ipv6_agent)
+{
+   const std::tuple<const char *, const char *, const char *> cases[] = {
+      {R"({"features": ["ip-discovery", "dai"], "trusted": false, "ipv6BindingLimit": 2000})", "", "\"ipv6BindingLimit\" 2000"},
+      {R"({"features": ["ip-discovery", "dai", "ra-guard"], "trusted": false})", "orr_SifraRegisterFastPath",
+       "previous IPv4 configuration is applied again"},
+   };
+   for (const auto &[config, failing, message] : cases) {
+      session::ModuleSession module(std::getenv("SWSEC_MODULE_PATH"), nullptr, [](const std::string &v) { ADD_FAILURE() << v; });
+      const host::FilterId port = module.addPort(1, "vm1", "");
+      const auto before = module.readState(1).featureSummary;
+      if (*failing != '\0') {
+         module.host().faults().failOnce(failing, ORR_NO_MEMORY);
+      }
+      try {
+         module.configure(port, session::parseConfig(config, "after"));
+         ADD_FAILURE() << "taken: " << config;
+      } catch (const session::Refused &e) {
+         EXPECT_NE(std::string(e.what()).find(message), std::string::npos) << e.what();
+      }
+      EXPECT_EQ(module.readState(1).featureSummary, before) << config;
+      EXPECT_FALSE(module.readState(1).ipv6) << config;
    }
 }
 

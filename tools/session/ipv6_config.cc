@@ -8,6 +8,7 @@
 
 #include <cstring>
 #include <limits>
+#include <vector>
 
 namespace swsec::session {
 
@@ -52,6 +53,34 @@ bool parseIpv6Number(std::string_view key, const nlohmann::json &value, contract
    }
    *field = value.get<uint32_t>();
    return true;
+}
+
+std::optional<std::string> ipv6ConfigRefusal(const contract::Ipv6SecurityConfig &config)
+{
+   const std::vector<uint8_t> record = contract::fhsConfigRecord(config);
+   FhsConfig header{};
+   std::memcpy(&header, record.data(), sizeof header);
+   const auto number = [](uint32_t value) { return std::to_string(value); };
+   switch (FhsCheckConfig(header)) {
+   case FhsConfigBadBindingLimit:
+      return "\"ipv6BindingLimit\" " + number(config.bindingLimit) + " must be at most " +
+             number(FHS_BINDING_LIMIT_MAX) + " and cover the " + number(header.numStatic) + " IPv6 static bindings";
+   case FhsConfigBadNdRateLimit:
+      return "\"ndRateLimit\" " + number(config.ndRateLimit) + " with \"errRateLimit\" " + number(config.errRateLimit) +
+             " and \"errRateLimitPeriod\" " + number(config.errRateLimitPeriod) + ": ndRateLimit must be at most " +
+             number(FHS_ND_RATE_LIMIT_MAX) + " and above errRateLimit, errRateLimit at most " +
+             number(FHS_ERR_RATE_LIMIT_MAX) + ", errRateLimitPeriod at least " + number(FHS_ERR_RATE_LIMIT_PERIOD_MIN);
+   case FhsConfigFine:
+      break;
+   }
+   for (const FhsBindingKey &key : config.statics) {
+      if (!FhsStaticKeyUsable(key)) {
+         char text[INET6_ADDRSTRLEN] = {};
+         inet_ntop(AF_INET6, key.addr, text, sizeof text);
+         return std::string("static IPv6 binding ") + text + " is not a unicast address";
+      }
+   }
+   return std::nullopt;
 }
 
 FhsBindingKey ipv6StaticKey(uint16_t vlan, const std::array<uint8_t, 6> &mac, const nlohmann::json &ip,

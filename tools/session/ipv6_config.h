@@ -8,6 +8,7 @@
 #include <nlohmann/json.hpp>
 
 #include <cstdint>
+#include <optional>
 #include <string>
 #include <string_view>
 
@@ -26,6 +27,10 @@ uint32_t ipv6FeatureBit(std::string_view name);
 // integer.
 bool parseIpv6Number(std::string_view key, const nlohmann::json &value, contract::Ipv6SecurityConfig &config,
                      const std::string &origin);
+
+// Why the IPv6 agent would refuse the configuration (the checks it makes
+// before applying a record), naming the keys; none when it would take it.
+std::optional<std::string> ipv6ConfigRefusal(const contract::Ipv6SecurityConfig &config);
 
 // A static entry whose "ip" is an IPv6 address, as the agent's key; throws
 // InputError naming `what` for a malformed address.

@@ -3,6 +3,7 @@
 #include "session/ports_session.h"
 
 #include "session/error.h"
+#include "session/ipv6_config.h"
 #include "session/serializer.h"
 
 #include "contract/notification.h"
@@ -226,9 +227,8 @@ host::PacketsResult ModuleSession::judge(host::FilterId filter, uint32_t directi
    return result;
 }
 
-orr_Status ModuleSession::removePort(host::FilterId filter)
+orr_Status ModuleSession::removeIpv6FilterLocked(host::FilterId filter)
 {
-   std::lock_guard guard(mutex_);
    if (const std::optional<host::FilterId> ipv6 = findIpv6Filter(filter)) {
       const host::DestroyResult destroyed = host_.sifra().destroyFilterAsHypervisor(*ipv6);
       if (destroyed.status != ORR_OK) {
@@ -237,6 +237,15 @@ orr_Status ModuleSession::removePort(host::FilterId filter)
       std::erase(filters_, *ipv6);
       std::lock_guard ports(portsMutex_);
       ports_[filter].ipv6 = 0;
+   }
+   return ORR_OK;
+}
+
+orr_Status ModuleSession::removePort(host::FilterId filter)
+{
+   std::lock_guard guard(mutex_);
+   if (const orr_Status status = removeIpv6FilterLocked(filter); status != ORR_OK) {
+      return status;
    }
    const host::DestroyResult destroyed = host_.sifra().destroyFilterAsHypervisor(filter);
    if (destroyed.status == ORR_OK) {
@@ -288,11 +297,35 @@ void ModuleSession::configure(host::FilterId filter, const std::vector<uint8_t> 
 void ModuleSession::configure(host::FilterId filter, const PortSecurityConfig &config)
 {
    std::lock_guard guard(mutex_);
-   writeProperty(kSecurityProperty, filter, configRecord(config));
+   // A port takes both agents' records or neither: the IPv6 one is checked
+   // as its agent checks it before the IPv4 one is written.
    if (config.ipv6) {
-      writeProperty(kIpv6SecurityProperty, ipv6FilterLocked(filter), contract::fhsConfigRecord(*config.ipv6));
-   } else if (const std::optional<host::FilterId> ipv6 = findIpv6Filter(filter)) {
-      writeProperty(kIpv6SecurityProperty, *ipv6, contract::fhsConfigRecord({}));
+      if (const std::optional<std::string> refusal = ipv6ConfigRefusal(*config.ipv6)) {
+         throw Refused("configuration refused: " + *refusal);
+      }
+   }
+   const std::optional<uint32_t> length = host_.sifra().pollProperty(kSecurityProperty, filter);
+   std::vector<uint8_t> previous(length.value_or(0));
+   if (previous.empty() || host_.sifra().readProperty(kSecurityProperty, filter, previous) != ORR_OK) {
+      previous.clear();
+   }
+   writeProperty(kSecurityProperty, filter, configRecord(config));
+   const std::optional<host::FilterId> hadIpv6 = findIpv6Filter(filter);
+   try {
+      if (config.ipv6) {
+         writeProperty(kIpv6SecurityProperty, ipv6FilterLocked(filter), contract::fhsConfigRecord(*config.ipv6));
+      } else if (hadIpv6) {
+         writeProperty(kIpv6SecurityProperty, *hadIpv6, contract::fhsConfigRecord({}));
+      }
+   } catch (const std::runtime_error &e) {
+      // Refused where only the module could tell: the IPv4 half goes back,
+      // and an IPv6 agent made for this configuration goes.
+      if (!hadIpv6) {
+         (void)removeIpv6FilterLocked(filter);
+      }
+      const bool restored = !previous.empty() && host_.sifra().writeProperty(kSecurityProperty, filter, previous) == ORR_OK;
+      throw Refused(std::string(e.what()) + (restored ? "; the port's previous IPv4 configuration is applied again"
+                                                      : "; the port's previous IPv4 configuration could not be applied again"));
    }
 }
 

@@ -147,6 +147,10 @@ public:
    // configuration has IPv6 keys, the IPv6 agent's record, giving the port
    // the IPv6 agent first if it has none. A port that has the agent and a
    // configuration without IPv6 keys gets a new IPv6 port's defaults.
+   // All or nothing: an IPv6 record its agent would refuse is refused
+   // before anything is written; when the module refuses the IPv6 half,
+   // the port's IPv4 record from before is written back (and an IPv6
+   // agent made for it removed), which the message says.
    // Throws Refused with the module's words.
    void configure(host::FilterId filter, const PortSecurityConfig &config);
    // The port's IPv6 filter, made if it has none; throws std::runtime_error
@@ -184,6 +188,7 @@ private:
    void drainLogLocked();
    void writeProperty(const char *property, host::FilterId filter, const std::vector<uint8_t> &record);
    host::FilterId ipv6FilterLocked(host::FilterId filter);
+   orr_Status removeIpv6FilterLocked(host::FilterId filter);
 
    struct PortInfo {
       uint32_t portID = 0;

@@ -14,7 +14,12 @@
                                               datagram from the address it gives to the server's PORT
   runt IFACE DST_MAC                          one 20-byte frame (ethertype 0x88b5)
   runt-length IFACE SECONDS                   prints the length of the first 0x88b5 frame it gets
+  vlan-arp IFACE VID SENDER_IP TARGET_IP      one ARP request tagged with VID (raw socket: no 802.1Q
+                                              module needed)
+  vlan-listen IFACE SENDER_IP SECONDS         prints the VLAN of the first ARP frame from SENDER_IP,
+                                              from the tag in its bytes or in its metadata, or "none"
 """
+import struct
 import socket
 import sys
 import time
@@ -223,6 +228,37 @@ def runt_length(iface, seconds):
     print(len(sock.recv(2048)))
 
 
+def vlan_arp(iface, vid, sender_ip, target_ip):
+    mac = mac_of(iface)
+    tag = b"\x81\x00" + int(vid).to_bytes(2, "big")
+    arp = bytes.fromhex("0001080006040001") + mac + socket.inet_aton(sender_ip) + b"\x00" * 6 + socket.inet_aton(target_ip)
+    raw_socket(iface).send(b"\xff" * 6 + mac + tag + b"\x08\x06" + arp + b"\x00" * 14)
+
+
+def vlan_listen(iface, sender_ip, seconds):
+    # A received tag usually arrives as metadata (PACKET_AUXDATA), not in the bytes.
+    sol_packet, packet_auxdata, tp_status_vlan_valid = 263, 8, 0x10
+    sock = raw_socket(iface)
+    sock.setsockopt(sol_packet, packet_auxdata, 1)
+    sock.settimeout(seconds)
+    want = socket.inet_aton(sender_ip)
+    print("listening", flush=True)
+    while True:
+        frame, ancillary, _, _ = sock.recvmsg(2048, socket.CMSG_SPACE(32))
+        vid = None
+        for level, kind, data in ancillary:
+            if level == sol_packet and kind == packet_auxdata and len(data) >= 20:
+                status, _, _, _, _, tci, _ = struct.unpack_from("=IIIHHHH", data)
+                if status & tp_status_vlan_valid:
+                    vid = tci & 0xfff
+        body = frame[12:]
+        if body[0:2] in (b"\x81\x00", b"\x88\xa8"):
+            vid, body = int.from_bytes(body[2:4], "big") & 0xfff, body[4:]
+        if body[0:2] == b"\x08\x06" and body[16:20] == want:
+            print("none" if vid is None else vid)
+            return
+
+
 def main():
     command, args = sys.argv[1], sys.argv[2:]
     if command == "attack":
@@ -245,6 +281,10 @@ def main():
         runt(args[0], args[1])
     elif command == "runt-length":
         runt_length(args[0], float(args[1]))
+    elif command == "vlan-arp":
+        vlan_arp(*args)
+    elif command == "vlan-listen":
+        vlan_listen(args[0], args[1], float(args[2]))
     elif command == "junk":
         junk(args[0])
     else:

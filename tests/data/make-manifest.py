@@ -357,7 +357,7 @@ class Port:
             return "BPDU filter"
         u = p.get("udp")
         if f & 0x2 and from_vm and u and u["sport"] == (547 if "ipv6" in p else 67):
-            return "DHCP server block"
+            return "DHCP server block: DHCPv6 server message" if "ipv6" in p else "DHCP server block"
         if f & 0x4:
             why = self.discover(idx, t, frame, p, from_vm)
             if why:

@@ -228,6 +228,7 @@ TEST_P(ManifestReplay, every_dropped_frame_has_the_reason_the_manifest_names_and
       {"error-rate-limit state (txRateLimitDropCnt)", "ARP rate limit: error state"},
       {"BPDU filter", "BPDU filter"},
       {"DHCP server block", "DHCP server block"},
+      {"DHCP server block: DHCPv6 server message", "DHCP server block: DHCPv6 server message"},
       {"DHCP from the VM with chaddr not its source MAC, untrusted port (dhcpSnoopingDropCnt)",
        "DHCP snooping: chaddr mismatch"},
       {"DHCPACK answers no pending request of the port", "DHCP snooping: unanswered ACK"},

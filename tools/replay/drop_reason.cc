@@ -23,6 +23,7 @@ const char *dropReasonName(DropReason reason)
    case DropReason::etherType: return "Ethertype not allowed";
    case DropReason::bpduFilter: return "BPDU filter";
    case DropReason::dhcpServerBlock: return "DHCP server block";
+   case DropReason::dhcpv6ServerBlock: return "DHCP server block: DHCPv6 server message";
    case DropReason::dhcpUnansweredAck: return "DHCP snooping: unanswered ACK";
    case DropReason::ipv6HeaderChain: return "IPv6 header chain";
    case DropReason::fragmentedNd: return "Fragmented ND or RA";
@@ -95,7 +96,7 @@ DropReason explainDrop(const DropCounters &before, const DropCounters &after, st
       return DropReason::bpduFilter;
    }
    if (direction == kDirFromVm && (facts.udpSourcePort == 67 || facts.udpSourcePort == 547)) {
-      return DropReason::dhcpServerBlock;
+      return facts.udpSourcePort == 67 ? DropReason::dhcpServerBlock : DropReason::dhcpv6ServerBlock;
    }
    if (direction == kDirToVm && facts.dhcpMessageType == kDhcpAck) {
       return DropReason::dhcpUnansweredAck;

@@ -25,6 +25,7 @@ enum class DropReason : uint8_t {
    etherType,             // etherTypeDropCnt
    bpduFilter,
    dhcpServerBlock,
+   dhcpv6ServerBlock,      // the same rule on UDP from port 547, before the IPv6 agent sees it
    dhcpUnansweredAck,
    // The IPv6 agent's checks, each by its counter.
    ipv6HeaderChain,       // headerChainDropCnt

@@ -262,10 +262,34 @@ void KernelPath::inject(fastpath::Punt &punt)
    (void)sendto(sockets_[punt.direction], bytes.data(), bytes.size(), 0, reinterpret_cast<sockaddr *>(&to), sizeof to);
 }
 
+void judgePunts(host::Sifra &sifra, host::FilterId filter, PostedFeed &feed, std::span<fastpath::Punt> punts,
+                PortCounters &counters, const std::function<void(fastpath::Punt &)> &pass)
+{
+   std::vector<fastpath::Punt *> passed;
+   for (fastpath::Punt &punt : punts) {
+      if (punt.truncated || (punt.direction != SWSEC_FP_DIR_TO_VM && punt.direction != SWSEC_FP_DIR_FROM_VM)) {
+         counters.truncated.fetch_add(1, std::memory_order_relaxed);
+         continue;
+      }
+      // A runt is judged and goes on padded, as on the user path.
+      punt.bytes.resize(host::switchPaddedLength(punt.bytes.size()), 0);
+      const host::FrameView view{.bytes = punt.bytes, .vlanId = punt.vlan};
+      const bool kept = sifra.processPackets(filter, punt.direction, std::span(&view, 1)).kept.size() == 1;
+      (kept ? counters.passed : counters.dropped)[punt.direction].fetch_add(1, std::memory_order_relaxed);
+      if (kept) {
+         passed.push_back(&punt);
+      }
+   }
+   // A binding the module just learned is in the map before its frame goes on.
+   feed.take();
+   for (fastpath::Punt *punt : passed) {
+      pass(*punt);
+   }
+}
+
 void KernelPath::run(int stopEvent, PortCounters &counters, const std::function<void(const std::string &)> &vanish)
 {
    std::vector<fastpath::Punt> punts;
-   std::vector<fastpath::Punt *> passed;
    host::Sifra &sifra = session_.host().sifra();
    for (;;) {
       pollfd fds[2] = {{program_->puntFd(), POLLIN, 0}, {stopEvent, POLLIN, 0}};
@@ -283,26 +307,7 @@ void KernelPath::run(int stopEvent, PortCounters &counters, const std::function<
       }
       punts.clear();
       program_->drainPunts([&punts](fastpath::Punt &&punt) { punts.push_back(std::move(punt)); });
-      passed.clear();
-      for (fastpath::Punt &punt : punts) {
-         if (punt.truncated || (punt.direction != SWSEC_FP_DIR_TO_VM && punt.direction != SWSEC_FP_DIR_FROM_VM)) {
-            counters.truncated.fetch_add(1, std::memory_order_relaxed);
-            continue;
-         }
-         // A runt is judged and goes on padded, as on the user path.
-         punt.bytes.resize(host::switchPaddedLength(punt.bytes.size()), 0);
-         const host::FrameView view{.bytes = punt.bytes, .vlanId = punt.vlan};
-         const bool kept = sifra.processPackets(filter_, punt.direction, std::span(&view, 1)).kept.size() == 1;
-         (kept ? counters.passed : counters.dropped)[punt.direction].fetch_add(1, std::memory_order_relaxed);
-         if (kept) {
-            passed.push_back(&punt);
-         }
-      }
-      // A binding the module just learned is in the map before its frame goes on.
-      feed_.take();
-      for (fastpath::Punt *punt : passed) {
-         inject(*punt);
-      }
+      judgePunts(sifra, filter_, feed_, punts, counters, [this](fastpath::Punt &punt) { inject(punt); });
    }
 }
 

@@ -23,6 +23,7 @@
 #include <memory>
 #include <mutex>
 #include <optional>
+#include <span>
 #include <string>
 #include <vector>
 
@@ -49,6 +50,12 @@ private:
    std::map<uint32_t, fastpath::Mirror *> mirrors_;
    std::vector<host::PostedMessage> kept_;
 };
+
+// Judges punted frames with the module's port `filter`, brings every mirror
+// of `feed` up to date with what they taught it, and only then hands each
+// passed frame to `pass`, in order.
+void judgePunts(host::Sifra &sifra, host::FilterId filter, PostedFeed &feed, std::span<fastpath::Punt> punts,
+                PortCounters &counters, const std::function<void(fastpath::Punt &)> &pass);
 
 class KernelPath {
 public:

@@ -3,6 +3,8 @@
 
   attack NAME IFACE VM_MAC VM_IP GATEWAY_IP   one attack frame from the guarded VM
   unsolicited-ack IFACE VM_MAC SERVER_IP      a DHCP ACK from the network that answers no request
+  release IFACE CLIENT_IP SERVER_IP           a DHCP RELEASE of CLIENT_IP from IFACE's MAC (client
+                                              ID 01+MAC, as udhcpc and dhclient send it)
   udp-listen PORT SECONDS LAST_SOURCE         prints the sources of the datagrams it gets, one a line,
                                               until one from LAST_SOURCE or SECONDS
   udp-send SRC_IP DST_IP DST_MAC PORT IFACE   one datagram from SRC_IP (spoofed when not ours)
@@ -85,6 +87,20 @@ def unsolicited_ack(iface, vm_mac, server_ip):
              s.DHCP(options=[("message-type", "ack"), ("server_id", server_ip), ("lease_time", 600),
                              ("subnet_mask", "255.255.255.0"), "end"]))
     s.sendp(frame, iface=iface)
+
+
+def release(iface, client_ip, server_ip):
+    # Made by hand, not with scapy: sent at once, within the second the test needs.
+    mac = mac_of(iface)
+    options = (b"\x63\x82\x53\x63" + b"\x35\x01\x07" + b"\x36\x04" + socket.inet_aton(server_ip) +
+               b"\x3d\x07\x01" + mac + b"\xff")
+    bootp = (b"\x01\x01\x06\x00" + (0x5e1ea5e).to_bytes(4, "big") + b"\x00" * 4 + socket.inet_aton(client_ip) +
+             b"\x00" * 12 + mac + b"\x00" * 10 + b"\x00" * 192 + options)
+    udp = (68).to_bytes(2, "big") + (67).to_bytes(2, "big") + (8 + len(bootp)).to_bytes(2, "big") + b"\x00\x00" + bootp
+    header = bytearray(b"\x45\x00" + (20 + len(udp)).to_bytes(2, "big") + b"\x00\x00\x40\x00\x40\x11\x00\x00" +
+                       socket.inet_aton(client_ip) + socket.inet_aton(server_ip))
+    header[10:12] = ipv4_checksum(bytes(header))
+    raw_socket(iface).send(b"\xff" * 6 + mac + b"\x08\x00" + bytes(header) + udp)
 
 
 def udp_listen(port, seconds, last_source):
@@ -265,6 +281,8 @@ def main():
         attack(*args)
     elif command == "unsolicited-ack":
         unsolicited_ack(*args)
+    elif command == "release":
+        release(*args)
     elif command == "udp-listen":
         udp_listen(int(args[0]), float(args[1]), args[2])
     elif command == "udp-send":

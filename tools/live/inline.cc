@@ -149,9 +149,7 @@ void InlineDaemon::restoreFile(const PortSpec &portSpec, const std::string &path
 bool InlineDaemon::saveState(Port &port, host::FilterId filter)
 {
    const std::string path = statePath(port.portSpec);
-   port.stateDirty = false;
-   port.removalUnsaved = false;
-   port.lastSave = std::chrono::steady_clock::now();
+   port.saving.saved(std::chrono::steady_clock::now());
    try {
       const std::vector<uint8_t> blob = session::savePortState(session_.host(), filter);
       const int64_t savedAtUs = static_cast<int64_t>(wallClock() * 1e6);
@@ -522,9 +520,7 @@ void InlineDaemon::pump()
       for (const auto &port : ports_) {
          if (port->guarded && port->guarded->options().portID == note.portID) {
             name = port->portSpec.name;
-            port->stateDirty = true;
-            port->removalUnsaved = port->removalUnsaved || note.name == SWSEC_PORTDB_MSG_REMOVED ||
-                                   note.name == FHS_MSG_REMOVED;
+            port->saving.changed(note.name == SWSEC_PORTDB_MSG_REMOVED || note.name == FHS_MSG_REMOVED);
          }
       }
       nlohmann::json event = session::notificationJson(note);
@@ -546,14 +542,9 @@ void InlineDaemon::pump()
    for (const auto &name : gone) {
       removePort(name, "its interface disappeared");
    }
-   // A binding added or renewed is on disk within a second, a burst of them
-   // in one save; a removal at the next pump, so that a binding the VM
-   // released (and the server may give to another) never comes back after
-   // a crash. Removals are rare: at most one save a pump (10 a second).
    const auto now = std::chrono::steady_clock::now();
    for (auto &port : ports_) {
-      if (!options_.stateDir.empty() && port->stateDirty && port->guarded && port->guarded->running() &&
-          (port->removalUnsaved || now - port->lastSave >= std::chrono::seconds(1))) {
+      if (!options_.stateDir.empty() && port->saving.due(now) && port->guarded && port->guarded->running()) {
          (void)saveState(*port, port->guarded->filter());
       }
    }

@@ -47,6 +47,35 @@ struct InlineOptions {
 // A port's "bindings" reply: its port database entries, each with "port".
 nlohmann::json bindingsReply(const std::string &port, const session::PortState &state);
 
+// When a port's bindings go to disk: a change is saved at the latest a
+// second after the last save, a burst of them in one save; a removal at the
+// next pump, so that a binding the VM released (and the server may give to
+// another) never comes back after a crash. Removals are rare: at most one
+// save a pump (10 a second).
+class SaveSchedule {
+public:
+   using Clock = std::chrono::steady_clock;
+   void changed(bool removal)
+   {
+      dirty_ = true;
+      removal_ = removal_ || removal;
+   }
+   bool due(Clock::time_point now) const
+   {
+      return dirty_ && (removal_ || now - lastSave_ >= std::chrono::seconds(1));
+   }
+   void saved(Clock::time_point now)
+   {
+      dirty_ = removal_ = false;
+      lastSave_ = now;
+   }
+
+private:
+   bool dirty_ = false;
+   bool removal_ = false;
+   Clock::time_point lastSave_{};
+};
+
 // The ports and the control handler over them; the daemon's main loop
 // owns one.
 class InlineDaemon final : public CtlHandler {
@@ -78,10 +107,8 @@ private:
       std::string configSource;   // where its configuration came from last
       bool watched = false;       // guarded by --watch: let go when its interface leaves
       std::string datapathReason; // why it is on the user path, "" when that is the daemon's choice
-      bool stateDirty = false;    // bindings changed since the last save
-      bool removalUnsaved = false;   // one of them a removal: saved at once, not coalesced
+      SaveSchedule saving;
       bool saveFailing = false;   // the last save failed (said once)
-      std::chrono::steady_clock::time_point lastSave{};
    };
 
    void startPort(Port &port);

@@ -104,8 +104,10 @@ def release(iface, client_ip, server_ip):
 
 
 def udp_listen(port, seconds, last_source):
-    sock = socket.socket(socket.AF_INET, socket.SOCK_DGRAM)
-    sock.bind(("0.0.0.0", port))
+    # IPv4 or IPv6, as the last source awaited is written.
+    ipv6 = ":" in last_source
+    sock = socket.socket(socket.AF_INET6 if ipv6 else socket.AF_INET, socket.SOCK_DGRAM)
+    sock.bind(("::" if ipv6 else "0.0.0.0", port))
     deadline = time.monotonic() + seconds
     print("listening", flush=True)
     while True:
@@ -114,11 +116,11 @@ def udp_listen(port, seconds, last_source):
             return
         sock.settimeout(left)
         try:
-            _, (source, _) = sock.recvfrom(2048)
+            _, address = sock.recvfrom(2048)
         except socket.timeout:
             return
-        print(source, flush=True)
-        if source == last_source:
+        print(address[0], flush=True)
+        if address[0] == last_source:
             return
 
 

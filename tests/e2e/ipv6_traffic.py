@@ -11,9 +11,10 @@ Attacks (ARG: the address the attack names, where it needs one):
   global address), ns-foreign-mac, dad-claim (ARG: the address claimed), claim-flood (ARG:
   how many addresses, claimed from 2001:db8:1::e:0 on, 4 a second)
 """
-import socket
 import sys
 import time
+
+from e2e_tool import udp_listen  # the udp-listen command, shared with the IPv4 test
 
 
 def scapy():
@@ -76,25 +77,6 @@ def attack(name, iface, vm_ll, router_ll, arg):
     else:
         sys.exit("unknown attack " + name)
     s.sendp(frames, iface=iface)
-
-
-def udp_listen(port, seconds, last_source):
-    sock = socket.socket(socket.AF_INET6, socket.SOCK_DGRAM)
-    sock.bind(("::", port))
-    deadline = time.monotonic() + seconds
-    print("listening", flush=True)
-    while True:
-        left = deadline - time.monotonic()
-        if left <= 0:
-            return
-        sock.settimeout(left)
-        try:
-            _, address = sock.recvfrom(2048)
-        except socket.timeout:
-            return
-        print(address[0], flush=True)
-        if address[0] == last_source:
-            return
 
 
 def udp_send(src, dst, dst_mac, port, iface):

@@ -69,6 +69,12 @@ vm2_ip=$(ipv4_of "$vm2")
 wait_for 5 has_binding vm1 "$vm1_ip" || fail "no binding for vm1"
 wait_for 5 has_binding vm2 "$vm2_ip" || fail "no binding for vm2"
 
+step "a lease renewed in place (no notification) is saved within a second"
+sleep 1.5   # the learning saves are done
+saved=$(md5sum <"$state/vm2.state")
+kill -USR1 "$udhcpc_pid"
+wait_for 3 sh -c "[ \"\$(md5sum <'$state/vm2.state')\" != '$saved' ]" || fail "vm2's renewal was not saved"
+
 step "a second daemon on vm1's interface is refused; the first keeps guarding"
 out=$(timeout 20 ip netns exec "$sw" "$swsec" inline --bridge br0 --port vm1=vm1p --ctl "$work/second.sock" 2>&1)
 [ $? -eq 1 ] || fail "the second daemon did not exit 1: $out"

@@ -20,6 +20,8 @@ TEST(SaveSchedule, a_removal_is_due_at_once_other_changes_a_second_after_the_las
       {true, false, 200ms, false},  // an addition waits out the second
       {true, false, 1s, true},
       {true, true, 200ms, true},    // a removal does not wait
+      {false, false, 59s, false},   // lifetimes extended by traffic: a checkpoint a minute
+      {false, false, 60s, true},
    };
    for (const Case &c : cases) {
       SaveSchedule schedule;

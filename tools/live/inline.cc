@@ -544,6 +544,14 @@ void InlineDaemon::pump()
    }
    const auto now = std::chrono::steady_clock::now();
    for (auto &port : ports_) {
+      // A lease may have been renewed in place: no notification says so.
+      if (port->guarded) {
+         const uint64_t replies = port->guarded->counters().leaseReplies.load(std::memory_order_relaxed);
+         if (replies != port->leaseRepliesSeen) {
+            port->leaseRepliesSeen = replies;
+            port->saving.changed(false);
+         }
+      }
       if (!options_.stateDir.empty() && port->saving.due(now) && port->guarded && port->guarded->running()) {
          (void)saveState(*port, port->guarded->filter());
       }

@@ -51,10 +51,14 @@ nlohmann::json bindingsReply(const std::string &port, const session::PortState &
 // second after the last save, a burst of them in one save; a removal at the
 // next pump, so that a binding the VM released (and the server may give to
 // another) never comes back after a crash. Removals are rare: at most one
-// save a pump (10 a second).
+// save a pump (10 a second). Lifetimes that the VM's own traffic extends
+// (first-come bindings, ARP-learned ones on a trusted port) move without a
+// notification: a checkpoint a minute keeps what a restart restores within
+// a minute of their true end, at one small write a port a minute.
 class SaveSchedule {
 public:
    using Clock = std::chrono::steady_clock;
+   static constexpr std::chrono::seconds kCheckpoint{60};
    void changed(bool removal)
    {
       dirty_ = true;
@@ -62,7 +66,8 @@ public:
    }
    bool due(Clock::time_point now) const
    {
-      return dirty_ && (removal_ || now - lastSave_ >= std::chrono::seconds(1));
+      const auto since = now - lastSave_;
+      return (dirty_ && (removal_ || since >= std::chrono::seconds(1))) || since >= kCheckpoint;
    }
    void saved(Clock::time_point now)
    {
@@ -73,7 +78,7 @@ public:
 private:
    bool dirty_ = false;
    bool removal_ = false;
-   Clock::time_point lastSave_{};
+   Clock::time_point lastSave_ = Clock::now();
 };
 
 // The ports and the control handler over them; the daemon's main loop
@@ -108,6 +113,7 @@ private:
       bool watched = false;       // guarded by --watch: let go when its interface leaves
       std::string datapathReason; // why it is on the user path, "" when that is the daemon's choice
       SaveSchedule saving;
+      uint64_t leaseRepliesSeen = 0;   // the port's leaseReplies at the last pump
       bool saveFailing = false;   // the last save failed (said once)
    };
 

@@ -1,6 +1,7 @@
 // A guarded port's kernel data path: the program, its maps and hooks, and
 // the thread that judges the frames it punts.
 #include "live/kernel_path.h"
+#include "live/lease_reply.h"
 
 #include "host/header_lookup.h"
 
@@ -278,6 +279,9 @@ void judgePunts(host::Sifra &sifra, host::FilterId filter, PostedFeed &feed, std
       (kept ? counters.passed : counters.dropped)[punt.direction].fetch_add(1, std::memory_order_relaxed);
       if (kept) {
          passed.push_back(&punt);
+         if (punt.direction == SWSEC_FP_DIR_TO_VM && fromDhcpServer(punt.bytes)) {
+            counters.leaseReplies.fetch_add(1, std::memory_order_relaxed);
+         }
       }
    }
    // A binding the module just learned is in the map before its frame goes on.

@@ -2,6 +2,7 @@
 #include "live/port.h"
 
 #include "live/kernel_path.h"
+#include "live/lease_reply.h"
 #include "live/netdev.h"
 #include "live/owner_lock.h"
 
@@ -244,6 +245,13 @@ void GuardedPort::forward(PacketSocket &from, PacketSocket &to, uint32_t directi
          }
       }
       counters_.passed[direction].fetch_add(passed.size(), std::memory_order_relaxed);
+      if (direction == ORR_SIFRA_DIR_RX) {
+         for (const ReceivedFrame *frame : passed) {
+            if (fromDhcpServer(frame->bytes)) {
+               counters_.leaseReplies.fetch_add(1, std::memory_order_relaxed);
+            }
+         }
+      }
       counters_.dropped[direction].fetch_add(views.size() - passed.size(), std::memory_order_relaxed);
       if (!passed.empty()) {
          const uint64_t before = sendErrors;

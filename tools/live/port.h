@@ -59,6 +59,7 @@ struct PortCounters {
    std::atomic<uint64_t> truncated{0};     // longer than a slot, never sent on
    std::atomic<uint64_t> sendErrors{0};    // refused by the outgoing interface
    std::atomic<uint64_t> overruns{0};      // dropped by the kernel: a socket's buffer was full
+   std::atomic<uint64_t> leaseReplies{0};  // DHCP server frames passed to the VM (see lease_reply.h)
 };
 
 // The frame as the virtual switch hands it to the port: the outer tag, of

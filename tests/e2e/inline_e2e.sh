@@ -252,10 +252,13 @@ if [ "$datapath" = kernel ]; then
 fi
 
 # ---------------------------------------------------------------- a port goes
-step "a port whose interface disappears stops alone"
+step "a port whose interface disappears stops alone, its state saved"
 kill -TERM "$udhcpc_pid"; wait "$udhcpc_pid" 2>/dev/null
+sleep 1.1   # any save still due is done
+saved=$(md5sum <"$state/vm2.state")
 ip netns del "$vm2"
 wait_for 5 sh -c "$swsec ctl --ctl $ctl ports --json | grep -q 'disappeared'" || fail "vm2 did not stop"
+wait_for 2 sh -c "[ \"\$(md5sum <'$state/vm2.state')\" != '$saved' ]" || fail "vm2's state was not saved as it stopped"
 sw_ctl ports --json | json "[p['running'] for p in d if p['name']=='vm1'][0]" | grep -qx True || fail "vm1 stopped too"
 ip -n "$sw" link show swsec"$(ip -n "$sw" -j link show dev vm1p | json "d[0]['ifindex']")"b >/dev/null || fail "vm1's pair went"
 ip -n "$vm1" addr add 192.0.2.10/24 dev eth0

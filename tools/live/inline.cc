@@ -535,7 +535,8 @@ void InlineDaemon::pump()
             // Its state is kept by its VM's MAC: the VM may come back on a new interface.
             gone.push_back(port->portSpec.name);
          } else {
-            port->guarded->stop();
+            // Saved as it stops: what it learned since the last save is not lost with it.
+            stopPort(*port);
          }
       }
    }

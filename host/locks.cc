@@ -239,6 +239,9 @@ void LockRegistry::destroySpinlock(orr_Spinlock lock)
          heaps_.detach(record.heap, &record);
          record.magic.store(kDestroyedLock, std::memory_order_relaxed);
          destroyedLocks_.push_back(std::move(found->second));
+         if (destroyedLocks_.size() > kDestroyedLocksKept) {
+            destroyedLocks_.pop_front();
+         }
          locks_.erase(found);
       }
    }

@@ -19,6 +19,7 @@
 #include "host/violations.h"
 
 #include <atomic>
+#include <deque>
 #include <functional>
 #include <map>
 #include <memory>
@@ -121,8 +122,12 @@ private:
    orr_LockDomainID nextDomain_ = 0x100;
    std::map<orr_LockDomainID, std::unique_ptr<Domain>> domains_;
    std::map<const orr_SpinlockOpaque *, std::unique_ptr<Spinlock>> locks_;
-   // Destroyed locks' records, kept so that a stale handle is recognised.
-   std::vector<std::unique_ptr<Spinlock>> destroyedLocks_;
+   // Destroyed locks' records, kept so that a stale handle is recognised:
+   // the latest kDestroyedLocksKept, as a quarantine, so that a daemon whose
+   // ports come and go for months does not grow by a record each time. A
+   // handle used after that many later destroys is no longer told apart.
+   static constexpr size_t kDestroyedLocksKept = 4096;
+   std::deque<std::unique_ptr<Spinlock>> destroyedLocks_;
 
    std::mutex mutexTableMutex_;
    std::unordered_map<const orr_Mutex *, std::unique_ptr<MutexEntry>> mutexes_;

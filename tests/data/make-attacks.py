@@ -53,7 +53,7 @@ def ip_bytes(ip):
 
 def dhcp(msgtype, xid, chaddr, *, op=None, ciaddr="0.0.0.0", yiaddr="0.0.0.0",
          siaddr="0.0.0.0", lease=None, server_id=None, requested=None,
-         htype=1, hlen=6, cookie=COOKIE, end=True):
+         htype=1, hlen=6, cookie=COOKIE, end=True, cid=None):
     """A DHCP message (fixed header and options) as raw bytes."""
     if op is None:
         op = 2 if msgtype in (OFFER, ACK, NAK) else 1
@@ -65,6 +65,8 @@ def dhcp(msgtype, xid, chaddr, *, op=None, ciaddr="0.0.0.0", yiaddr="0.0.0.0",
         opts += bytes([54, 4]) + ip_bytes(server_id)
     if requested:
         opts += bytes([50, 4]) + ip_bytes(requested)
+    if cid:
+        opts += bytes([61, len(cid)]) + cid
     if lease is not None:
         opts += bytes([51, 4]) + struct.pack("!I", lease)
         opts += bytes([1, 4]) + ip_bytes("255.255.255.0")
@@ -112,10 +114,10 @@ def to_vm_udp(dst_ip, payload, dmac=VM_MAC, vlan=None):
     return l2 / IP(src=SRV_IP, dst=dst_ip, id=next_id(), ttl=64) / UDP(sport=67, dport=68) / Raw(payload)
 
 
-def bind_vm(cap, t, xid, vlan=None):
+def bind_vm(cap, t, xid, vlan=None, cid=None):
     """REQUEST from the VM and the server's ACK: the VM holds VM_IP for LEASE s."""
     cap.add(t, from_vm_udp("0.0.0.0", "255.255.255.255", 68, 67,
-                           dhcp(REQUEST, xid, VM_MAC, requested=VM_IP, server_id=SRV_IP), vlan=vlan))
+                           dhcp(REQUEST, xid, VM_MAC, requested=VM_IP, server_id=SRV_IP, cid=cid), vlan=vlan))
     cap.add(t + 0.001, to_vm_udp(VM_IP, dhcp(ACK, xid, VM_MAC, yiaddr=VM_IP, lease=LEASE,
                                              server_id=SRV_IP), vlan=vlan))
 
@@ -295,6 +297,75 @@ def stacked_tags():
     c.write()
 
 
+def arp_raw(head, op=1, sha=HOST_MAC, spa=HOST_IP, tpa=SRV_IP):
+    """An ARP frame from the VM whose fixed part (hardware and protocol types and lengths) is `head`."""
+    body = head + struct.pack("!H", op) + mac_bytes(sha) + ip_bytes(spa) + bytes(6) + ip_bytes(tpa)
+    return Ether(src=VM_MAC, dst=BCAST, type=0x0806) / Raw(body)
+
+
+def policy_edges():
+    """Frames each rule must leave alone, beside the ones it drops."""
+    c = Capture("attack-policy-edges")
+    bind_vm(c, 0.0, 0x5e000041)
+    vm_ll, host_ll = "fe80::5eff:fec0:10", "fe80::5eff:fec0:20"
+    c.add(1.0, Ether(src=HOST_MAC, dst=VM_MAC) / IPv6(src=host_ll, dst=vm_ll) / UDP(sport=547, dport=546) /
+          DHCP6_Reply(trid=0x123457))                                                  # a v6 server message to the VM
+    c.add(1.1, from_vm_udp(VM_IP, HOST_IP, 547, 546, b"v6-port-over-v4", dmac=HOST_MAC))
+    c.add(1.2, Ether(src=VM_MAC, dst=HOST_MAC) / IPv6(src=vm_ll, dst=host_ll) / UDP(sport=67, dport=68) /
+          Raw(b"v4-port-over-v6"))
+    c.add(1.3, from_vm_udp(VM_IP, HOST_IP, 68, 5353, b"client-port", dmac=HOST_MAC))
+    for k, head in enumerate((bytes([0, 6, 8, 0, 6, 4]), bytes([0, 1, 0x86, 0xdd, 6, 4]),
+                              bytes([0, 1, 8, 0, 8, 4]), bytes([0, 1, 8, 0, 6, 16]))):
+        c.add(2.0 + 0.1 * k, arp_raw(head))                                            # not Ethernet/IPv4: not inspected
+    for k in range(11):  # 11 ARP requests to the VM within 0.2 s, then IPv4 to it, which is not counted
+        c.add(3.0 + 0.02 * k, arp(1, SRV_MAC, SRV_IP, "00:00:00:00:00:00", VM_IP))
+    for k in range(3):
+        c.add(3.3 + 0.01 * k, Ether(src=SRV_MAC, dst=VM_MAC) / IP(src=SRV_IP, dst=VM_IP, id=next_id()) / ICMP(id=20, seq=k))
+    for k in range(11):  # the next interval, opened 1.25 s after the first: 10 pass, the 11th does not
+        c.add(4.25 + 0.09 * k, arp(1, SRV_MAC, SRV_IP, "00:00:00:00:00:00", VM_IP))
+    c.add(5.3, arp(1, SRV_MAC, SRV_IP, "00:00:00:00:00:00", VM_IP))                   # a third interval
+    c.add(6.0, arp(2, VM_MAC, "192.0.2.112", BCAST, "192.0.2.112"))                    # gratuitous reply: learned
+    c.add(6.1, arp(3, VM_MAC, "192.0.2.113", BCAST, "192.0.2.113"))                    # another operation: not
+    c.write()
+
+
+def client_edges():
+    """DHCP client messages that end bindings and pending requests, and the ones that must not."""
+    c = Capture("attack-dhcp-client-edges")
+    renew = lambda xid, **kw: from_vm_udp(VM_IP, SRV_IP, 68, 67, dhcp(REQUEST, xid, VM_MAC, ciaddr=VM_IP, **kw),
+                                          dmac=SRV_MAC)
+    ack = lambda xid, vlan=None: to_vm_udp(VM_IP, dhcp(ACK, xid, VM_MAC, yiaddr=VM_IP, lease=LEASE, server_id=SRV_IP),
+                                           vlan=vlan)
+    nak = lambda xid: to_vm_udp("255.255.255.255", dhcp(NAK, xid, VM_MAC, server_id=SRV_IP), dmac=BCAST)
+    client = lambda t, xid, vlan=None, **kw: from_vm_udp("0.0.0.0", "255.255.255.255", 68, 67,
+                                                         dhcp(t, xid, VM_MAC, **kw), vlan=vlan)
+    bind_vm(c, 0.0, 0x5e000051)
+    c.add(1.0, nak(0x5e0000ff))                                # answers no request: passes, changes nothing
+    c.add(2.0, client(REQUEST, 0x5e000052, vlan=5))            # selecting on VLAN 5 ends nothing on VLAN 0
+    c.add(2.1, ack(0x5e000052))                                # VLAN 0 has no such request: dropped
+    c.add(2.2, nak(0x5e000052))
+    c.add(2.3, client(DISCOVER, 0x5e000053, vlan=5))           # ends VLAN 5's request ...
+    c.add(2.4, ack(0x5e000052, vlan=5))                        # ... so its ACK is dropped
+    for t, xid, end in ((3.0, 0x5e000054, client(DECLINE, 0x5e000054, ciaddr=VM_IP)),
+                        (5.0, 0x5e000056, nak(0x5e000056)),
+                        (7.0, 0x5e000058, client(DISCOVER, 0x5e000058))):
+        c.add(t, renew(xid))                                   # a pending renewal, then a message that ends
+        c.add(t + 0.1, end)                                    # the binding and the request
+        c.add(t + 0.2, ack(xid))
+        bind_vm(c, t + 1.0, xid + 1)
+    cid = bytes([1, 0xaa, 0xbb])
+    c.add(9.0, client(RELEASE, 0x5e000060, ciaddr=VM_IP))      # ends the binding made without an identifier
+    bind_vm(c, 10.0, 0x5e000061, cid=cid)
+    c.add(11.0, renew(0x5e000062))                             # without the identifier: another client
+    c.add(11.1, client(RELEASE, 0x5e000063, ciaddr=VM_IP))     # ends that one's request, not the binding
+    c.add(11.2, ack(0x5e000062))
+    c.add(12.0, client(RELEASE, 0x5e000064, ciaddr=VM_IP, cid=cid))
+    bind_vm(c, 13.0, 0x5e000065)
+    c.add(14.0, client(REQUEST, 0x5e000066, ciaddr=VM_IP))    # rebinding, broadcast: keeps the binding
+    c.add(15.0, client(REQUEST, 0x5e000067))                   # selecting, broadcast without ciaddr: ends it
+    c.write()
+
+
 def example():
     """The real dhclient session (without its release) and then spoofing from the same VM."""
     real = rdpcap(os.path.join(HERE, "dhclient-lease-renew-release.pcap"))
@@ -322,5 +393,6 @@ def example():
 if __name__ == "__main__":
     os.makedirs(OUT, exist_ok=True)
     for make in (ip_spoof, arp_spoof, arp_flood, rogue_dhcp_server, bpdu, unsolicited_ack,
-                 chaddr_mismatch, malformed_dhcp, ip_fragments, vlan100, stacked_tags, example):
+                 chaddr_mismatch, malformed_dhcp, ip_fragments, vlan100, stacked_tags, policy_edges,
+                 client_edges, example):
         make()

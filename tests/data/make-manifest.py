@@ -87,6 +87,18 @@ CAPTURES = [
      "make-attacks.py: VM bound to 192.0.2.110; ARP replies claiming the server's address inside "
      "802.1Q+802.1Q, 802.1ad+802.1Q and three tags; ICMP from a spoofed and from the leased address "
      "under one 802.1ad tag; the ARP reply cut to 41 bytes; a double-tagged ARP reply to the VM."),
+    ("attack-policy-edges", "02:00:5e:c0:00:10", "crafted",
+     "make-attacks.py: VM bound to 192.0.2.110; UDP that only looks like a server's (a DHCPv6 server "
+     "message to the VM, port 547 over IPv4 and 67 over IPv6 from the VM, port 68 from the VM); ARP from "
+     "the VM with other hardware or protocol types or lengths; 11 ARP requests to the VM in 0.2 s, ICMP "
+     "to it, 11 more in the next interval and one in a third; a gratuitous ARP reply and an ARP of "
+     "operation 3 from the VM for addresses of their own."),
+    ("attack-dhcp-client-edges", "02:00:5e:c0:00:10", "crafted",
+     "make-attacks.py: VM bound to 192.0.2.110; a NAK that answers no request; a REQUEST and a DISCOVER "
+     "on VLAN 5 with ACKs and a NAK for its xid; renewals ended by a DECLINE, a NAK and a DISCOVER, each "
+     "followed by the renewal's ACK and a new binding; a binding made with client identifier 01aabb, a "
+     "renewal and a RELEASE without the identifier, the renewal's ACK, the RELEASE with it; a new binding, "
+     "a broadcast REQUEST with ciaddr set (rebinding), one without (selecting)."),
     ("example-dhcp-then-spoof", "02:00:5e:c0:00:01", "crafted",
      "make-attacks.py: dhclient-lease-renew-release.pcap without its DHCPRELEASE, then, 1 s after, "
      "ICMP from the leased address, spoofed IPv4 sources and ARP replies claiming the server's address."),
@@ -985,6 +997,23 @@ NOTES = {
     "attack-bpdu":
         "IEEE 802.3 frames with LLC (STP) or LLC/SNAP (PVST+). The BPDU filter drops them in both "
         "directions; nothing else looks at them.",
+    "attack-policy-edges":
+        "Enforcing: the DHCP server block drops only UDP from the server port of the frame's own family "
+        "sent by the VM, so all four UDP frames pass the IPv4 agent. ARP inspection reads only "
+        "Ethernet/IPv4 ARP: the four other headers pass although their sender is not bound (and teach the "
+        "learning port nothing). To the VM, ARP is limited per interval of one second opened by the "
+        "first counted frame: the 11th of each burst is dropped (rxRateLimitDropCnt 2), the ICMP is not "
+        "counted, and the last ARP opens a new interval. ARP snooping (learning) learns the gratuitous "
+        "reply's address and nothing from operation 3; enforcing drops both by ARP inspection.",
+    "attack-dhcp-client-edges":
+        "A NAK that answers no request of the port (by VLAN, xid and chaddr) passes and changes nothing. "
+        "VLANs are kept apart: the VLAN 5 REQUEST neither ends the VLAN 0 binding nor is answered by the "
+        "untagged ACK (dropped), and the VLAN 5 DISCOVER ends its request, so the VLAN 5 ACK is dropped "
+        "too. A DECLINE or DISCOVER from the VM, or a NAK answering the pending renewal, ends both the "
+        "binding and the renewal: its ACK is dropped. A client with an identifier and one without are "
+        "two clients: the RELEASE without it ends only the request made without it, whose ACK is then "
+        "dropped; the RELEASE with it ends the binding. A broadcast REQUEST ends the binding at once only "
+        "without ciaddr (a client selecting or rebooting), not while rebinding.",
     "attack-unsolicited-ack":
         "An ACK must match a pending request by VLAN, xid and chaddr: the ACK without any request, the "
         "one with another xid and the one with another chaddr are dropped in both configurations; the "

@@ -178,16 +178,6 @@ TEST_F(DhcpParseTest, options_are_found_and_the_last_occurrence_wins)
              (Bytes{0, 0, 0x0e, 0x10}));
 }
 
-TEST_F(DhcpParseTest, client_identifier_of_length_zero_means_no_identifier)
-{
-   Dhcp dhcp = request();
-   dhcp.clientId = Bytes{};
-   auto frame = wrap(frameOf(dhcp));
-   ASSERT_EQ(parse(*frame), 0);
-   EXPECT_EQ(frame->info.dhcpClientIdLen, 0u);
-   EXPECT_EQ(frame->info.dhcpClientId, nullptr);
-}
-
 TEST_F(DhcpParseTest, a_new_parse_clears_what_the_last_one_found)
 {
    Dhcp dhcp = ackWithout51();

@@ -215,18 +215,5 @@ TEST_F(PortDbRecordsTest, ageing_keeps_an_entry_until_the_pass_after_its_expiry)
    expectCountersAgree();
 }
 
-TEST_F(PortDbRecordsTest, clear_does_nothing_on_a_disabled_database)
-{
-   ASSERT_EQ(add({1, 1, 1}, kArp), 0);
-   ctx_.config.featuresEnabled = 0;
-   const SwSecVmiKey key = Key{1, 1, 1}.raw();
-
-   EXPECT_EQ(SwSecClearVmi(&ctx_, true, 0, nullptr), ORR_OK);
-   EXPECT_EQ(SwSecClearVmi(&ctx_, false, 1, &key), ORR_OK);
-
-   EXPECT_EQ(ctx_.numVmiEntries, 1u);
-   ctx_.config.featuresEnabled = SwSecFeatureIpDiscovery;
-}
-
 }  // namespace
 }  // namespace swsec::testing

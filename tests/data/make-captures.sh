@@ -9,13 +9,9 @@
 # SCENARIO: dhclient dhclient_nak udhcpc_no_clientid udhcpc_custom_clientid
 # udhcpc_renew_nak arp bridge.
 #
-# Network, made fresh for every run and removed on exit:
-#
-#   ns SRV: srv0 192.0.2.1/24, dnsmasq
-#      |  veth
-#   ns SW:  bridge br0 = sw-srv + sw-vm    <- tcpdump -i sw-vm (the VM's port)
-#      |  veth
-#   ns VM:  vm0 (MAC set per scenario), dhclient / udhcpc / arping / ping
+# Network: capture-lib.sh's, made fresh for every run and removed on exit,
+# with srv0 192.0.2.1/24 running dnsmasq and vm0 (MAC set per scenario)
+# running dhclient / udhcpc / arping / ping.
 #
 # Addresses are from 192.0.2.0/24 (documentation range) and exist only in these
 # namespaces. IPv6 is disabled in all three so that router solicitations and
@@ -23,102 +19,29 @@
 # and ICMP frames.
 set -euo pipefail
 
-[ "$(id -u)" -eq 0 ] || { echo "make-captures: run as root" >&2; exit 1; }
-for tool in ip dnsmasq dhclient udhcpc busybox tcpdump tshark unshare; do
-  command -v "$tool" >/dev/null || { echo "make-captures: missing $tool (bash scripts/setup.sh --capture-tools)" >&2; exit 1; }
-done
-
 here=$(cd "$(dirname "$0")" && pwd)
-out=$(mkdir -p "${1:-$here}" && cd "${1:-$here}" && pwd)
-tag="swcap$$"
-NS_SW="$tag-sw" NS_SRV="$tag-srv" NS_VM="$tag-vm" NS_VM2="$tag-vm2" NS_VM3="$tag-vm3"
-work=$(mktemp -d "/tmp/$tag.XXXXXX")
-pids=()
-started=$(date +%s)
+. "$here/capture-lib.sh"
+capture_start make-captures swcap "${1:-$here}" udhcpc busybox unshare
+NS_VM2="$tag-vm2" NS_VM3="$tag-vm3"
 
 SRV_IP=192.0.2.1
 LEASE=2m        # dnsmasq's shortest lease
 T1=10 T2=20     # renew quickly instead of after half the lease
 
-log() { printf 'make-captures: %s\n' "$*" >&2; }
-
-cleanup() {
-  local rc=$?
-  set +e
-  for pid in "${pids[@]}"; do kill "$pid" 2>/dev/null; done
-  for pid in "${pids[@]}"; do wait "$pid" 2>/dev/null; done
-  for ns in "$NS_VM3" "$NS_VM2" "$NS_VM" "$NS_SRV" "$NS_SW"; do
-    ip netns pids "$ns" 2>/dev/null | xargs -r kill 2>/dev/null
-    ip netns del "$ns" 2>/dev/null
-  done
-  rm -rf "$work"
-  [ $rc -eq 0 ] || log "failed (exit $rc); namespaces and processes removed"
-  exit $rc
-}
-trap cleanup EXIT
-trap 'exit 130' INT TERM
-
-# wait_for SECONDS COMMAND...: polls COMMAND every 0.2 s until it succeeds.
-wait_for() {
-  local limit=$(( $1 * 5 )); shift
-  for ((i = 0; i < limit; i++)); do "$@" && return 0; sleep 0.2; done
-  log "timed out waiting for: $*"; return 1
-}
-
-in_vm() { ip netns exec "$NS_VM" "$@"; }
+# Drop anything that is neither DHCP, ARP nor ICMP (none expected with IPv6 off).
+capture_filter='arp or (ip and (udp port 67 or udp port 68 or icmp))'
+keep_filter='dhcp or arp or icmp'
 
 # ---------------------------------------------------------------- network ---
 make_network() {
-  for ns in "$NS_SW" "$NS_SRV" "$NS_VM"; do
-    ip netns add "$ns"
-    ip netns exec "$ns" sysctl -qw net.ipv6.conf.all.disable_ipv6=1 net.ipv6.conf.default.disable_ipv6=1
-    ip -n "$ns" link set lo up
-  done
-  ip -n "$NS_SW" link add br0 type bridge stp_state 0 forward_delay 0
-  ip -n "$NS_SW" link add sw-srv type veth peer name srv0 netns "$NS_SRV"
-  ip -n "$NS_SW" link add sw-vm type veth peer name vm0 netns "$NS_VM"
-  ip -n "$NS_SW" link set sw-srv master br0
-  ip -n "$NS_SW" link set sw-vm master br0
-  for l in br0 sw-srv sw-vm; do ip -n "$NS_SW" link set "$l" up; done
-  ip -n "$NS_SRV" link set srv0 address 02:00:5e:c0:00:fe
+  make_base_network v6off 02:00:5e:c0:00:fe
   ip -n "$NS_SRV" addr add "$SRV_IP/24" dev srv0
   ip -n "$NS_SRV" link set srv0 up
 }
 
-# ---------------------------------------------------------------- dnsmasq ---
-dnsmasq_pid=""
 start_dnsmasq() {  # extra dnsmasq options
-  ip netns exec "$NS_SRV" dnsmasq --keep-in-foreground --conf-file=/dev/null \
-    --user=root --group=root --port=0 --interface=srv0 --bind-interfaces \
-    --dhcp-range=192.0.2.100,192.0.2.150,255.255.255.0,$LEASE \
-    --dhcp-option=58,$T1 --dhcp-option=59,$T2 \
-    --dhcp-authoritative --no-ping --log-dhcp \
-    --dhcp-leasefile="$work/dnsmasq.leases" --pid-file="$work/dnsmasq.pid" \
-    --log-facility="$work/dnsmasq.log" "$@" &
-  dnsmasq_pid=$!; pids+=("$dnsmasq_pid")
-  wait_for 5 grep -qs "DHCP, IP range" "$work/dnsmasq.log"
-}
-stop_dnsmasq() {
-  kill "$dnsmasq_pid"; wait "$dnsmasq_pid" 2>/dev/null || true
-  : > "$work/dnsmasq.log"
-}
-
-# ---------------------------------------------------------------- capture ---
-cap_pid=""
-start_capture() {  # NAME
-  cap_name=$1
-  ip netns exec "$NS_SW" tcpdump -i sw-vm -s 0 -U --immediate-mode -Z root \
-    -w "$work/$1.raw.pcap" 'arp or (ip and (udp port 67 or udp port 68 or icmp))' \
-    2>"$work/$1.tcpdump.log" &
-  cap_pid=$!; pids+=("$cap_pid")
-  wait_for 5 grep -qs "listening on" "$work/$1.tcpdump.log"
-}
-stop_capture() {
-  sleep 0.5
-  kill -INT "$cap_pid"; wait "$cap_pid" 2>/dev/null || true
-  # Drop anything that is neither DHCP, ARP nor ICMP (none expected with IPv6 off).
-  tshark -r "$work/$cap_name.raw.pcap" -Y 'dhcp or arp or icmp' -w "$out/$cap_name.pcap" -F pcap 2>/dev/null
-  log "$cap_name: $(tshark -r "$out/$cap_name.pcap" 2>/dev/null | wc -l) frames"
+  run_dnsmasq "DHCP, IP range" --dhcp-range=192.0.2.100,192.0.2.150,255.255.255.0,$LEASE \
+    --dhcp-option=58,$T1 --dhcp-option=59,$T2 --no-ping "$@"
 }
 
 set_vm_mac() {
@@ -157,9 +80,6 @@ esac
 exit 0
 SCRIPT
 chmod +x "$work/udhcpc.script" "$work/dhclient.script"
-
-events_count() { grep -c "^$1" "$work/events" 2>/dev/null || true; }
-has_events() { [ "$(events_count "$1")" -ge "$2" ]; }
 
 # ------------------------------------------------------------- scenarios ---
 # dhclient with Debian's default configuration (no client identifier, sends
@@ -286,9 +206,7 @@ scenario_bridge() {
   set_vm_mac 02:00:5e:c0:00:11
   local n=2
   for ns in "$NS_VM2" "$NS_VM3"; do
-    ip netns add "$ns"
-    ip netns exec "$ns" sysctl -qw net.ipv6.conf.all.disable_ipv6=1 net.ipv6.conf.default.disable_ipv6=1
-    ip -n "$ns" link set lo up
+    add_netns "$ns" v6off
     ip -n "$NS_SW" link add "sw-vm$n" type veth peer name vm0 netns "$ns"
     ip -n "$NS_SW" link set "sw-vm$n" master br0
     ip -n "$NS_SW" link set "sw-vm$n" up
@@ -298,12 +216,7 @@ scenario_bridge() {
   done
   start_dnsmasq --dhcp-host=02:00:5e:c0:00:11,192.0.2.111 --dhcp-host=02:00:5e:c0:00:12,192.0.2.112 \
     --dhcp-host=02:00:5e:c0:00:13,192.0.2.113
-  cap_name=$name
-  ip netns exec "$NS_SW" tcpdump -i sw-srv -s 0 -U --immediate-mode -Z root \
-    -w "$work/$name.raw.pcap" 'arp or (ip and (udp port 67 or udp port 68 or icmp))' \
-    2>"$work/$name.tcpdump.log" &
-  cap_pid=$!; pids+=("$cap_pid")
-  wait_for 5 grep -qs "listening on" "$work/$name.tcpdump.log"
+  start_capture $name sw-srv
   local count=1
   for ns in "$NS_VM" "$NS_VM2" "$NS_VM3"; do
     ip netns exec "$ns" udhcpc -q -f -i vm0 -s "$work/udhcpc.script" -t 5 -T 1 -A 1 -C \
@@ -328,4 +241,4 @@ for scenario in "${scenarios[@]}"; do
     *) log "unknown scenario $scenario"; exit 2 ;;
   esac
 done
-log "done in $(( $(date +%s) - started )) s; captures in $out"
+capture_done

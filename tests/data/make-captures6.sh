@@ -14,62 +14,26 @@
 # binary in UDHCPC6 (default: udhcpc6 on the PATH). Without it that scenario
 # is skipped.
 #
-# Network, made fresh for every run and removed on exit:
-#
-#   ns SRV: srv0 2001:db8:1::1/64, dnsmasq (router advertisements, DHCPv6)
-#      |  veth
-#   ns SW:  bridge br0 = sw-srv + sw-vm    <- tcpdump -i sw-vm (the VM's port)
-#      |  veth
-#   ns VM:  vm0 (MAC set per scenario), dhclient -6 / the kernel's SLAAC
+# Network: capture-lib.sh's, made fresh for every run and removed on exit,
+# with srv0 2001:db8:1::1/64 running dnsmasq (router advertisements, DHCPv6)
+# and vm0 (MAC set per scenario) running dhclient -6 / the kernel's SLAAC.
 #
 # Addresses are from 2001:db8::/32 (documentation range) and exist only in
 # these namespaces. The switch namespace has IPv6 off, so the bridge itself
 # sends nothing. Each capture keeps only ICMPv6 and DHCPv6 frames.
 set -euo pipefail
 
-[ "$(id -u)" -eq 0 ] || { echo "make-captures6: run as root" >&2; exit 1; }
-for tool in ip dnsmasq dhclient ping tcpdump tshark; do
-  command -v "$tool" >/dev/null || { echo "make-captures6: missing $tool (bash scripts/setup.sh --capture-tools)" >&2; exit 1; }
-done
-
 here=$(cd "$(dirname "$0")" && pwd)
-out=$(mkdir -p "${1:-$here}" && cd "${1:-$here}" && pwd)
-tag="sw6cap$$"
-NS_SW="$tag-sw" NS_SRV="$tag-srv" NS_VM="$tag-vm"
-work=$(mktemp -d "/tmp/$tag.XXXXXX")
-pids=()
-started=$(date +%s)
+. "$here/capture-lib.sh"
+capture_start make-captures6 sw6cap "${1:-$here}" ping
 
-SRV_MAC=02:00:5e:c0:00:fe
 SRV_IP=2001:db8:1::1
 LEASE=2m        # dnsmasq's shortest lease: T1 (renewal) at 60 s
 
-log() { printf 'make-captures6: %s\n' "$*" >&2; }
-
-cleanup() {
-  local rc=$?
-  set +e
-  for pid in "${pids[@]}"; do kill "$pid" 2>/dev/null; done
-  for pid in "${pids[@]}"; do wait "$pid" 2>/dev/null; done
-  for ns in "$NS_VM" "$NS_SRV" "$NS_SW"; do
-    ip netns pids "$ns" 2>/dev/null | xargs -r kill 2>/dev/null
-    ip netns del "$ns" 2>/dev/null
-  done
-  rm -rf "$work"
-  [ $rc -eq 0 ] || log "failed (exit $rc); namespaces and processes removed"
-  exit $rc
-}
-trap cleanup EXIT
-trap 'exit 130' INT TERM
-
-# wait_for SECONDS COMMAND...: polls COMMAND every 0.2 s until it succeeds.
-wait_for() {
-  local limit=$(( $1 * 5 )); shift
-  for ((i = 0; i < limit; i++)); do "$@" && return 0; sleep 0.2; done
-  log "timed out waiting for: $*"; return 1
-}
-
-in_vm() { ip netns exec "$NS_VM" "$@"; }
+# tcpdump's filter cannot see ICMPv6 behind extension headers (MLD's
+# hop-by-hop): tshark keeps every ICMPv6 and DHCPv6 frame.
+capture_filter=ip6
+keep_filter='icmpv6 or dhcpv6'
 
 # An address of vm0 whose duplicate-address detection is over ($1: ip -6 addr filter words).
 vm_addr() { in_vm ip -6 -o addr show dev vm0 "$@" | grep -v tentative | awk '{print $4}' | cut -d/ -f1 | head -n1; }
@@ -77,59 +41,19 @@ has_vm_addr() { [ -n "$(vm_addr "$@")" ]; }
 
 # ---------------------------------------------------------------- network ---
 make_network() {
-  for ns in "$NS_SW" "$NS_SRV" "$NS_VM"; do
-    ip netns add "$ns"
-    ip -n "$ns" link set lo up
-  done
-  ip netns exec "$NS_SW" sysctl -qw net.ipv6.conf.all.disable_ipv6=1 net.ipv6.conf.default.disable_ipv6=1
-  ip -n "$NS_SW" link add br0 type bridge stp_state 0 forward_delay 0 mcast_snooping 0
-  ip -n "$NS_SW" link add sw-srv type veth peer name srv0 netns "$NS_SRV"
-  ip -n "$NS_SW" link add sw-vm type veth peer name vm0 netns "$NS_VM"
-  ip -n "$NS_SW" link set sw-srv master br0
-  ip -n "$NS_SW" link set sw-vm master br0
-  for l in br0 sw-srv sw-vm; do ip -n "$NS_SW" link set "$l" up; done
+  make_base_network v6on 02:00:5e:c0:00:fe mcast_snooping 0
   # The server's link is up before any capture: its own DAD and reports are not in them.
   ip netns exec "$NS_SRV" sysctl -qw net.ipv6.conf.all.forwarding=1 net.ipv6.conf.default.accept_dad=0 \
     net.ipv6.conf.all.accept_dad=0
-  ip -n "$NS_SRV" link set srv0 address $SRV_MAC
   ip -n "$NS_SRV" addr add "$SRV_IP/64" dev srv0 nodad
   ip -n "$NS_SRV" link set srv0 up
   wait_for 5 sh -c "ip -n $NS_SRV -6 -o addr show dev srv0 scope link | grep -qv tentative"
 }
 
-# ---------------------------------------------------------------- dnsmasq ---
-dnsmasq_pid=""
+# Each run of dnsmasq starts with no leases.
 start_dnsmasq() {  # dnsmasq options of the scenario
-  ip netns exec "$NS_SRV" dnsmasq --keep-in-foreground --conf-file=/dev/null \
-    --user=root --group=root --port=0 --interface=srv0 --bind-interfaces \
-    --enable-ra --ra-param=srv0,30,600 --dhcp-authoritative --log-dhcp \
-    --dhcp-leasefile="$work/dnsmasq.leases" --pid-file="$work/dnsmasq.pid" \
-    --log-facility="$work/dnsmasq.log" "$@" &
-  dnsmasq_pid=$!; pids+=("$dnsmasq_pid")
-  wait_for 5 grep -qs "router advertisement on" "$work/dnsmasq.log"
-}
-stop_dnsmasq() {
-  kill "$dnsmasq_pid"; wait "$dnsmasq_pid" 2>/dev/null || true
-  : > "$work/dnsmasq.log"; rm -f "$work/dnsmasq.leases"
-}
-
-# ---------------------------------------------------------------- capture ---
-cap_pid=""
-start_capture() {  # NAME
-  cap_name=$1
-  ip netns exec "$NS_SW" tcpdump -i sw-vm -s 0 -U --immediate-mode -Z root \
-    -w "$work/$1.raw.pcap" ip6 \
-    2>"$work/$1.tcpdump.log" &
-  cap_pid=$!; pids+=("$cap_pid")
-  wait_for 5 grep -qs "listening on" "$work/$1.tcpdump.log"
-}
-stop_capture() {
-  sleep 0.5
-  kill -INT "$cap_pid"; wait "$cap_pid" 2>/dev/null || true
-  # tcpdump's filter cannot see ICMPv6 behind extension headers (MLD's
-  # hop-by-hop): tshark keeps every ICMPv6 and DHCPv6 frame.
-  tshark -r "$work/$cap_name.raw.pcap" -Y 'icmpv6 or dhcpv6' -w "$out/$cap_name.pcap" -F pcap 2>/dev/null
-  log "$cap_name: $(tshark -r "$out/$cap_name.pcap" 2>/dev/null | wc -l) frames"
+  rm -f "$work/dnsmasq.leases"
+  run_dnsmasq "router advertisement on" --enable-ra --ra-param=srv0,30,600 "$@"
 }
 
 # The VM's link comes up inside the capture, so its own duplicate-address
@@ -168,9 +92,6 @@ esac
 exit 0
 SCRIPT
 chmod +x "$work/dhclient6.script" "$work/udhcpc6.script"
-
-events_count() { grep -c "^$1" "$work/events" 2>/dev/null || true; }
-has_events() { [ "$(events_count "$1")" -ge "$2" ]; }
 
 # ------------------------------------------------------------- scenarios ---
 # dhclient -6 (DUID-LL) against dnsmasq's stateful DHCPv6 with router
@@ -254,4 +175,4 @@ for scenario in "${scenarios[@]}"; do
     *) log "unknown scenario $scenario"; exit 2 ;;
   esac
 done
-log "done in $(( $(date +%s) - started )) s; captures in $out"
+capture_done

@@ -1,6 +1,7 @@
 // The IPv6 agent's saved part, through the contract's layout records.
 #include "session/ipv6_saved_state.h"
 
+#include "session/blob_record.h"
 #include "session/ipv6_config.h"
 #include "session/serializer.h"
 
@@ -12,19 +13,6 @@
 namespace swsec::session {
 
 namespace {
-
-template <typename Record>
-Record recordAt(const uint8_t *bytes)
-{
-   Record record;
-   std::memcpy(&record, bytes, sizeof record);
-   return record;
-}
-
-std::string number(uint64_t value)
-{
-   return std::to_string(value);
-}
 
 const char *ipv6MethodName(uint8_t method)
 {

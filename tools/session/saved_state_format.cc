@@ -3,6 +3,7 @@
 #include "session/saved_state_format.h"
 
 #include "contract/saved_state_layout.h"
+#include "session/blob_record.h"
 #include "session/serializer.h"
 
 #include <algorithm>
@@ -18,20 +19,6 @@ constexpr uint64_t kFixedLen = sizeof(SwSecSavedState);
 constexpr uint64_t kEntryLen = sizeof(SwSecSavedVmi);
 constexpr uint8_t kDhcpSnooping = SwSecDiscDhcpSnooping;
 constexpr uint8_t kStatic = SwSecDiscStatic;
-
-// A record copied out of bytes already checked to hold it.
-template <typename Record>
-Record recordAt(const uint8_t *bytes)
-{
-   Record record;
-   std::memcpy(&record, bytes, sizeof record);
-   return record;
-}
-
-std::string number(uint64_t value)
-{
-   return std::to_string(value);
-}
 
 std::string hexText(const std::vector<uint8_t> &bytes)
 {

@@ -31,10 +31,12 @@ bool parseCount(const std::string &text, Number &value)
    return error == std::errc{} && stop == end;
 }
 
-DropCounters countersOf(const std::map<std::string, std::string, std::less<>> &values)
+// The counters named in `fields` that a node's values hold as counts.
+DropCounters countersOf(std::span<const char *const> fields,
+                        const std::map<std::string, std::string, std::less<>> &values)
 {
    DropCounters counters;
-   for (const char *field : kDropCounterFields) {
+   for (const char *field : fields) {
       const auto found = values.find(field);
       uint64_t value = 0;
       if (found != values.end() && parseCount(found->second, value)) {
@@ -47,20 +49,6 @@ DropCounters countersOf(const std::map<std::string, std::string, std::less<>> &v
 std::string ipv6Path(uint32_t portID)
 {
    return "/ipv6/" + std::to_string(portID);
-}
-
-// The IPv6 counters of a "summary" node's fields.
-DropCounters ipv6CountersOf(const std::map<std::string, std::string, std::less<>> &values)
-{
-   DropCounters counters;
-   for (const char *field : kIpv6CounterFields) {
-      const auto found = values.find(field);
-      uint64_t value = 0;
-      if (found != values.end() && parseCount(found->second, value)) {
-         counters[field] = value;
-      }
-   }
-   return counters;
 }
 
 }  // namespace
@@ -364,11 +352,11 @@ DropCounters ModuleSession::dropCounters(uint32_t portID)
    host::NexoRecord summary;
    DropCounters counters;
    if (host_.nexo().get(portPath(portID) + "/featureSummary", &summary) == ORR_OK) {
-      counters = countersOf(summary.values());
+      counters = countersOf(kDropCounterFields, summary.values());
    }
    host::NexoRecord ipv6;
    if (host_.nexo().get(ipv6Path(portID) + "/summary", &ipv6) == ORR_OK) {
-      counters.merge(ipv6CountersOf(ipv6.values()));
+      counters.merge(countersOf(kIpv6CounterFields, ipv6.values()));
    }
    return counters;
 }
@@ -412,7 +400,7 @@ std::optional<Ipv6PortState> ModuleSession::readIpv6State(uint32_t portID)
    Ipv6PortState state;
    state.summary = summary.values();
    state.summaryText = summary.text();
-   state.counters = ipv6CountersOf(state.summary);
+   state.counters = countersOf(kIpv6CounterFields, state.summary);
    std::vector<int64_t> instances;
    if (host_.nexo().list(port + "/bindings", &instances) != ORR_OK) {
       return state;
@@ -446,7 +434,7 @@ PortState ModuleSession::readState(uint32_t portID)
    if (host_.nexo().get(port + "/featureSummary", &summary) == ORR_OK) {
       state.featureSummary = summary.values();
       state.featureSummaryText = summary.text();
-      state.counters = countersOf(*state.featureSummary);
+      state.counters = countersOf(kDropCounterFields, *state.featureSummary);
    }
    std::vector<int64_t> instances;
    if (host_.nexo().list(port + "/vmi", &instances) != ORR_OK) {

@@ -6,11 +6,10 @@
 #include "session/error.h"
 #include "session/ipv6_config.h"
 #include "session/json_text.h"
+#include "session/whole_file.h"
 
 #include <arpa/inet.h>
 #include <fcntl.h>
-#include <sys/stat.h>
-#include <unistd.h>
 #include <nlohmann/json.hpp>
 
 #include <algorithm>
@@ -251,42 +250,16 @@ PortSecurityConfig parseConfig(std::string_view text, const std::string &origin)
 std::string readConfigText(const std::string &path)
 {
    // Non-blocking so that a FIFO does not wait for a writer before the
-   // check below refuses it; a link is followed to its file.
+   // reader refuses it; a link is followed to its file.
    const int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK);
    if (fd < 0) {
       throw InputError(path + ": cannot open: " + std::strerror(errno));
    }
-   const struct Closer {
-      int fd;
-      ~Closer() { ::close(fd); }
-   } closer{fd};
-   struct stat info {};
-   if (::fstat(fd, &info) != 0) {
-      throw InputError(path + ": cannot read: " + std::strerror(errno));
+   std::vector<uint8_t> bytes;
+   if (const auto refusal = readWholeFile(fd, path, kMaxConfigFileBytes, "a configuration", bytes)) {
+      throw InputError(*refusal);
    }
-   if (!S_ISREG(info.st_mode)) {
-      throw InputError(path + ": not a regular file");
-   }
-   if (static_cast<uint64_t>(info.st_size) > kMaxConfigFileBytes) {
-      throw InputError(path + ": " + std::to_string(info.st_size) + " bytes is too large for a configuration");
-   }
-   std::string text(static_cast<size_t>(info.st_size), '\0');
-   size_t done = 0;
-   while (done < text.size()) {
-      const ssize_t got = ::read(fd, text.data() + done, text.size() - done);
-      if (got < 0 && errno == EINTR) {
-         continue;
-      }
-      if (got < 0) {
-         throw InputError(path + ": cannot read: " + std::strerror(errno));
-      }
-      if (got == 0) {
-         break;   // it shrank while read: what is there is the document
-      }
-      done += static_cast<size_t>(got);
-   }
-   text.resize(done);
-   return text;
+   return std::string(bytes.begin(), bytes.end());
 }
 
 PortSecurityConfig loadConfigFile(const std::string &path)

@@ -2,10 +2,10 @@
 #include "session/state_file.h"
 
 #include "session/atomic_file.h"
+#include "session/whole_file.h"
 
 #include <fcntl.h>
 #include <sys/stat.h>
-#include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
@@ -22,18 +22,12 @@ std::string systemError()
    return std::strerror(errno);
 }
 
-// Closes a descriptor on every way out.
-struct FdCloser {
-   int fd;
-   ~FdCloser() { ::close(fd); }
-};
-
 }  // namespace
 
 std::vector<uint8_t> readStateFile(const std::string &path)
 {
    // Non-blocking so that a FIFO does not wait for a writer before the
-   // check below refuses it.
+   // reader refuses it.
    const int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOFOLLOW);
    if (fd < 0 && errno == ELOOP) {
       throw StateFileError(path + ": a symbolic link, not a saved state");
@@ -41,33 +35,9 @@ std::vector<uint8_t> readStateFile(const std::string &path)
    if (fd < 0) {
       throw StateFileError(path + ": cannot read: " + systemError());
    }
-   const FdCloser closer{fd};
-   struct stat info {};
-   if (::fstat(fd, &info) != 0) {
-      throw StateFileError(path + ": cannot read: " + systemError());
-   }
-   if (!S_ISREG(info.st_mode)) {
-      throw StateFileError(path + ": not a regular file");
-   }
-   if (static_cast<uint64_t>(info.st_size) > kMaxStateFileBytes) {
-      throw StateFileError(path + ": " + std::to_string(info.st_size) + " bytes is too large for a saved state");
-   }
-   std::vector<uint8_t> bytes(static_cast<size_t>(info.st_size));
-   size_t done = 0;
-   while (done < bytes.size()) {
-      const ssize_t got = ::read(fd, bytes.data() + done, bytes.size() - done);
-      if (got < 0 && errno == EINTR) {
-         continue;
-      }
-      if (got < 0) {
-         throw StateFileError(path + ": cannot read: " + systemError());
-      }
-      if (got == 0) {
-         // The file shrank while it was read: keep what is there.
-         bytes.resize(done);
-         break;
-      }
-      done += static_cast<size_t>(got);
+   std::vector<uint8_t> bytes;
+   if (const auto refusal = readWholeFile(fd, path, kMaxStateFileBytes, "a saved state", bytes)) {
+      throw StateFileError(*refusal);
    }
    return bytes;
 }

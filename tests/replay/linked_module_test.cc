@@ -78,12 +78,5 @@ TEST(LinkedModule, reports_what_the_module_image_reports_on_every_bundled_captur
    }
 }
 
-TEST(LinkedModule, a_named_image_is_really_opened)
-{
-   const ToolRun run = runTool({"info", "--module", "/nonexistent/swsec.so"});
-   EXPECT_NE(run.status, 0);
-   EXPECT_NE((run.out + run.err).find("/nonexistent/swsec.so"), std::string::npos) << run.err;
-}
-
 }  // namespace
 }  // namespace swsec::testing

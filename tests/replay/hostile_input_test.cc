@@ -30,20 +30,6 @@
 namespace swsec::testing {
 namespace {
 
-
-std::string slurp(const std::filesystem::path &path)
-{
-   std::ifstream in(path, std::ios::binary);
-   std::ostringstream text;
-   text << in.rdbuf();
-   return text.str();
-}
-
-void put32(std::string &out, uint32_t v)
-{
-   out.append(reinterpret_cast<const char *>(&v), 4);
-}
-
 // A pcap file of one link type with records (seconds, bytes).
 std::string pcapFile(uint32_t linkType, const std::vector<std::pair<uint32_t, std::vector<uint8_t>>> &records)
 {
@@ -60,33 +46,6 @@ std::string pcapFile(uint32_t linkType, const std::vector<std::pair<uint32_t, st
    return out;
 }
 
-// A pcapng section (microsecond timestamps) with one EPB per (timestamp
-// in microseconds, direction flag) over the same frame.
-std::string pcapngFile(const std::vector<uint8_t> &frame, const std::vector<std::pair<uint64_t, uint32_t>> &packets)
-{
-   std::string out;
-   for (uint32_t word : {0x0A0D0D0Au, 28u, 0x1A2B3C4Du, 0x00000001u, 0xffffffffu, 0xffffffffu, 28u}) {
-      put32(out, word);
-   }
-   for (uint32_t word : {1u, 20u, 1u, 262144u, 20u}) {
-      put32(out, word);
-   }
-   const uint32_t padded = (static_cast<uint32_t>(frame.size()) + 3u) & ~3u;
-   for (const auto &[micros, flags] : packets) {
-      const uint32_t length = 32 + padded + 12;
-      for (uint32_t word : {6u, length, 0u, static_cast<uint32_t>(micros >> 32), static_cast<uint32_t>(micros),
-                            static_cast<uint32_t>(frame.size()), static_cast<uint32_t>(frame.size())}) {
-         put32(out, word);
-      }
-      out.append(frame.begin(), frame.end());
-      out.append(padded - frame.size(), '\0');
-      for (uint32_t word : {0x00040002u, flags, 0u, length}) {
-         put32(out, word);
-      }
-   }
-   return out;
-}
-
 std::vector<uint8_t> firstExampleFrame()
 {
    return readCapture(example()).front().bytes;
@@ -99,7 +58,7 @@ TEST(HostileCapture, a_pcapng_block_longer_than_the_file_is_refused_before_anyth
    TempDir dir;
    // 248 bytes: a section, an interface and a packet block that says it is
    // 0xFFFFFFF0 bytes long.
-   std::string bytes = pcapngFile(std::vector<uint8_t>(156, 0x11), {{1, 2}});
+   std::string bytes = pcapngBytes({{.timeNs = 1000, .bytes = std::vector<uint8_t>(156, 0x11), .direction = replay::kDirFromVm}});
    ASSERT_EQ(bytes.size(), 248u);
    const size_t packetBlock = 28 + 20;
    const uint32_t huge = 0xFFFFFFF0u;
@@ -125,10 +84,16 @@ TEST(HostileCapture, timestamps_that_overflow_go_back_or_lie_before_1970_are_war
 {
    TempDir dir;
    const auto frame = firstExampleFrame();
-   // Frame 2's timestamp (2^62 microseconds) overflows nanoseconds; frame 4
-   // goes back 2 s.
-   writeFile(dir.path() / "times.pcapng",
-             pcapngFile(frame, {{10'000'000, 2}, {uint64_t{1} << 62, 2}, {13'000'000, 2}, {11'000'000, 2}}));
+   // Frame 2's timestamp (2^62 microseconds, its high word set in the
+   // bytes) overflows nanoseconds; frame 4 goes back 2 s.
+   std::vector<CapturedFrame> frames;
+   for (int64_t seconds : {10, 0, 13, 11}) {
+      frames.push_back({.timeNs = seconds * 1'000'000'000, .bytes = frame, .direction = replay::kDirFromVm});
+   }
+   std::string bytes = pcapngBytes(frames);
+   const uint32_t high = 1u << 30;
+   std::memcpy(bytes.data() + 48 + (bytes.size() - 48) / 4 + 12, &high, 4);
+   writeFile(dir.path() / "times.pcapng", bytes);
    ToolRun run = runTool({"replay", (dir.path() / "times.pcapng").string()});
    EXPECT_EQ(run.status, 0) << run.err;
    EXPECT_NE(run.err.find("times.pcapng: frame 2: timestamp out of range"), std::string::npos) << run.err;

@@ -2,8 +2,6 @@
 
 #include <sys/wait.h>
 
-#include <fstream>
-
 #include <algorithm>
 #include <cstdlib>
 #include <cstring>
@@ -81,68 +79,58 @@ std::vector<CapturedFrame> readCapture(const std::filesystem::path &path)
    return frames;
 }
 
-namespace {
-
 void put32(std::string &out, uint32_t v)
 {
    out.append(reinterpret_cast<const char *>(&v), 4);
 }
 
-void put16(std::string &out, uint16_t v)
-{
-   out.append(reinterpret_cast<const char *>(&v), 2);
-}
-
-}  // namespace
-
-void writePcapng(const std::filesystem::path &path, const std::vector<CapturedFrame> &frames)
+std::string pcapngBytes(const std::vector<CapturedFrame> &frames)
 {
    std::string out;
-   // Section header: byte-order magic, version 1.0, unknown section length.
-   put32(out, 0x0A0D0D0A);
-   put32(out, 28);
-   put32(out, 0x1A2B3C4D);
-   put16(out, 1);
-   put16(out, 0);
-   put32(out, 0xffffffff);
-   put32(out, 0xffffffff);
-   put32(out, 28);
-   // Interface: Ethernet, microsecond timestamps (the default).
-   put32(out, 1);
-   put32(out, 20);
-   put16(out, 1);
-   put16(out, 0);
-   put32(out, 262144);
-   put32(out, 20);
+   // A section header (byte-order magic, version 1.0, length unknown), then
+   // an Ethernet interface with microsecond timestamps (the default).
+   for (uint32_t word : {0x0A0D0D0Au, 28u, 0x1A2B3C4Du, 1u, 0xffffffffu, 0xffffffffu, 28u, 1u, 20u, 1u, 262144u, 20u}) {
+      put32(out, word);
+   }
    for (const auto &frame : frames) {
-      const uint32_t padded = (static_cast<uint32_t>(frame.bytes.size()) + 3u) & ~3u;
+      const auto size = static_cast<uint32_t>(frame.bytes.size());
+      const uint32_t padded = (size + 3u) & ~3u;
       const bool flags = frame.direction != replay::kDirUnknown;
       const uint32_t length = 32 + padded + (flags ? 12 : 0);
-      const uint64_t micros = static_cast<uint64_t>(frame.timeNs / 1000);
-      put32(out, 6);
-      put32(out, length);
-      put32(out, 0);
-      put32(out, static_cast<uint32_t>(micros >> 32));
-      put32(out, static_cast<uint32_t>(micros));
-      put32(out, static_cast<uint32_t>(frame.bytes.size()));
-      put32(out, static_cast<uint32_t>(frame.bytes.size()));
-      out.append(reinterpret_cast<const char *>(frame.bytes.data()), frame.bytes.size());
-      out.append(padded - frame.bytes.size(), '\0');
+      const auto micros = static_cast<uint64_t>(frame.timeNs / 1000);
+      for (uint32_t word : {6u, length, 0u, static_cast<uint32_t>(micros >> 32), static_cast<uint32_t>(micros), size, size}) {
+         put32(out, word);
+      }
+      out.append(reinterpret_cast<const char *>(frame.bytes.data()), size);
+      out.append(padded - size, '\0');
       if (flags) {
-         put16(out, 2);   // epb_flags: 1 inbound (to the VM), 2 outbound (from it)
-         put16(out, 4);
-         put32(out, frame.direction == replay::kDirToVm ? 1u : 2u);
-         put32(out, 0);   // end of options
+         // epb_flags: 1 inbound (to the VM), 2 outbound (from it); the end of options.
+         for (uint32_t word : {0x00040002u, frame.direction == replay::kDirToVm ? 1u : 2u, 0u}) {
+            put32(out, word);
+         }
       }
       put32(out, length);
    }
-   writeFile(path, out);
+   return out;
+}
+
+void writePcapng(const std::filesystem::path &path, const std::vector<CapturedFrame> &frames)
+{
+   writeFile(path, pcapngBytes(frames));
 }
 
 void writeFile(const std::filesystem::path &path, const std::string &bytes)
 {
    std::ofstream file(path, std::ios::binary);
    file << bytes;
+}
+
+std::string slurp(const std::filesystem::path &path)
+{
+   std::ifstream in(path, std::ios::binary);
+   std::ostringstream text;
+   text << in.rdbuf();
+   return text.str();
 }
 
 ToolRun runTool(const std::vector<std::string> &args, const std::string &shell)
@@ -156,12 +144,6 @@ ToolRun runTool(const std::vector<std::string> &args, const std::string &shell)
    const int raw = std::system(command.c_str());
    ToolRun run;
    run.status = WIFEXITED(raw) ? WEXITSTATUS(raw) : -1;
-   auto slurp = [](const std::filesystem::path &p) {
-      std::ifstream in(p);
-      std::ostringstream text;
-      text << in.rdbuf();
-      return text.str();
-   };
    run.out = slurp(dir.path() / "out");
    run.err = slurp(dir.path() / "err");
    return run;

@@ -46,8 +46,12 @@ struct CapturedFrame {
 };
 
 std::vector<CapturedFrame> readCapture(const std::filesystem::path &path);
+// A pcapng file: a section, an interface, then a packet block per frame.
+std::string pcapngBytes(const std::vector<CapturedFrame> &frames);
 void writePcapng(const std::filesystem::path &path, const std::vector<CapturedFrame> &frames);
+void put32(std::string &out, uint32_t v);
 void writeFile(const std::filesystem::path &path, const std::string &bytes);
+std::string slurp(const std::filesystem::path &path);
 
 struct ToolRun {
    int status = 0;

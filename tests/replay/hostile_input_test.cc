@@ -335,23 +335,6 @@ TEST(HostileOutput, a_character_device_is_refused)
    EXPECT_TRUE(S_ISCHR(st.st_mode));
 }
 
-TEST(ReplayOutputPaths, a_link_is_followed_to_the_file_it_names_and_stays_a_link)
-{
-   TempDir dir;
-   writeFile(dir.path() / "target.pcap", "old contents");
-   std::filesystem::create_symlink("target.pcap", dir.path() / "link.pcap");
-   std::filesystem::create_symlink("new.pcap", dir.path() / "dangling.pcap");
-   const ToolRun run = runTool({"replay", "--vm-mac", kVmMac, "--config", enforcing(), "--write-passed",
-                                (dir.path() / "link.pcap").string(), "--write-dropped",
-                                (dir.path() / "dangling.pcap").string(), example()});
-   ASSERT_EQ(run.status, 0) << run.err;
-   EXPECT_TRUE(std::filesystem::is_symlink(dir.path() / "link.pcap"));
-   EXPECT_TRUE(std::filesystem::is_symlink(dir.path() / "dangling.pcap"));
-   EXPECT_EQ(readCapture(dir.path() / "target.pcap").size(), 14u);
-   EXPECT_EQ(readCapture(dir.path() / "new.pcap").size(), 4u);
-   EXPECT_EQ(dir.files(), (std::vector<std::string>{"dangling.pcap", "link.pcap", "new.pcap", "target.pcap"}));
-}
-
 TEST(ReplayOutputPaths, a_new_file_honours_the_umask_and_a_replaced_one_keeps_its_mode)
 {
    TempDir dir;

@@ -138,18 +138,12 @@ TEST(MultiPort, network_macs_make_every_other_source_the_vm)
 
 TEST(ReplayStreams, json_lines_are_the_document_one_frame_a_line_then_the_summary)
 {
-   const std::vector<std::string> ports = {"--config", enforcing(), "--port", std::string("a=") + kVmMacs[0],
-                                           "--port", std::string("b=") + kVmMacs[1]};
-   std::vector<std::string> document = {"replay", "--json"};
-   std::vector<std::string> lines = {"replay", "--json-lines"};
-   for (const auto &arg : ports) {
-      document.push_back(arg);
-      lines.push_back(arg);
-   }
-   document.push_back(bridgeCapture());
-   lines.push_back(bridgeCapture());
-   const ToolRun whole = runTool(document);
-   const ToolRun split = runTool(lines);
+   std::vector<std::string> args = {"replay", "--json", "--config", enforcing(), "--port",
+                                    std::string("a=") + kVmMacs[0], "--port", std::string("b=") + kVmMacs[1],
+                                    bridgeCapture()};
+   const ToolRun whole = runTool(args);
+   args[1] = "--json-lines";
+   const ToolRun split = runTool(args);
    ASSERT_EQ(whole.status, 0) << whole.err;
    ASSERT_EQ(split.status, 0) << split.err;
    const json doc = json::parse(whole.out);

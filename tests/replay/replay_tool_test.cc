@@ -204,15 +204,22 @@ TEST(ReplayIpv6, dual_stack_attacks_are_dropped_with_their_reasons_and_the_bindi
 
 // ---------------------------------------------------------------- captures and outputs
 
-TEST(ReplayOutputs, passed_and_dropped_frames_are_written_as_they_were_captured)
+// Each output holds its frames as they were captured; an output that is a
+// link is followed to the file it names (made where the link dangles) and
+// stays a link.
+TEST(ReplayOutputs, passed_and_dropped_frames_are_written_as_captured_through_links)
 {
    TempDir dir;
-   const auto passed = dir.path() / "passed.pcap";
-   const auto dropped = dir.path() / "dropped.pcap";
+   writeFile(dir.path() / "target.pcap", "old contents");
+   std::filesystem::create_symlink("target.pcap", dir.path() / "link.pcap");
+   std::filesystem::create_symlink("new.pcap", dir.path() / "dangling.pcap");
    const ToolRun run = runTool({"replay", "--json", "--vm-mac", kVmMac, "--config", enforcing(), "--write-passed",
-                                passed.string(), "--write-dropped", dropped.string(), example()});
+                                (dir.path() / "link.pcap").string(), "--write-dropped",
+                                (dir.path() / "dangling.pcap").string(), example()});
    ASSERT_EQ(run.status, 0) << run.err;
-   EXPECT_EQ(dir.files(), (std::vector<std::string>{"dropped.pcap", "passed.pcap"}));
+   EXPECT_TRUE(std::filesystem::is_symlink(dir.path() / "link.pcap"));
+   EXPECT_TRUE(std::filesystem::is_symlink(dir.path() / "dangling.pcap"));
+   EXPECT_EQ(dir.files(), (std::vector<std::string>{"dangling.pcap", "link.pcap", "new.pcap", "target.pcap"}));
    const auto input = readCapture(example());
    const auto doc = nlohmann::json::parse(run.out);
    std::vector<std::vector<uint8_t>> wantPassed;
@@ -229,9 +236,9 @@ TEST(ReplayOutputs, passed_and_dropped_frames_are_written_as_they_were_captured)
       return out;
    };
    EXPECT_EQ(wantDropped.size(), 4u);
-   EXPECT_EQ(bytesOf(readCapture(passed)), wantPassed);
-   EXPECT_EQ(bytesOf(readCapture(dropped)), wantDropped);
-   EXPECT_EQ(readCapture(dropped).front().timeNs / 1000, input.at(13).timeNs / 1000);
+   EXPECT_EQ(bytesOf(readCapture(dir.path() / "target.pcap")), wantPassed);
+   EXPECT_EQ(bytesOf(readCapture(dir.path() / "new.pcap")), wantDropped);
+   EXPECT_EQ(readCapture(dir.path() / "new.pcap").front().timeNs / 1000, input.at(13).timeNs / 1000);
 }
 
 TEST(ReplayReport, the_readable_report_shows_the_binding_the_spoofs_and_the_log)

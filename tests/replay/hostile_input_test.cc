@@ -110,6 +110,7 @@ TEST(HostileCapture, timestamps_that_overflow_go_back_or_lie_before_1970_are_war
    EXPECT_EQ(nlohmann::json::parse(run.out)["warnings"].size(), 1u);
 }
 
+// Every frame recorded as inbound: the flags win over the VM's MAC.
 TEST(HostileCapture, a_piped_pcapng_keeps_its_direction_flags)
 {
    TempDir dir;
@@ -120,7 +121,7 @@ TEST(HostileCapture, a_piped_pcapng_keeps_its_direction_flags)
    writePcapng(dir.path() / "in.pcapng", frames);
    for (const std::string &shell : {std::string("cat '") + (dir.path() / "in.pcapng").string() + "' |",
                                     std::string("<'") + (dir.path() / "in.pcapng").string() + "'"}) {
-      const ToolRun run = runTool({"replay", "--json", "-"}, shell);
+      const ToolRun run = runTool({"replay", "--json", "--vm-mac", kVmMac, "-"}, shell);
       ASSERT_EQ(run.status, 0) << run.err;
       const auto doc = nlohmann::json::parse(run.out);
       ASSERT_EQ(doc["frames"].size(), frames.size());

@@ -26,10 +26,10 @@ std::string sourceMac(const std::vector<uint8_t> &bytes)
 
 // ---------------------------------------------------------------- directions
 
-TEST(ReplayDirections, the_vm_mac_decides_unless_the_capture_records_a_direction)
+// (Recorded directions win over the MAC: HostileCapture.a_piped_pcapng_keeps_its_direction_flags.)
+TEST(ReplayDirections, the_vm_mac_decides_where_the_capture_records_no_direction)
 {
-   TempDir dir;
-   auto frames = readCapture(example());
+   const auto frames = readCapture(example());
    replay::ReplayOptions options;
    options.vmMac = session::parseMac(kVmMac, "test");
    options.capturePath = example();
@@ -37,16 +37,6 @@ TEST(ReplayDirections, the_vm_mac_decides_unless_the_capture_records_a_direction
    ASSERT_EQ(byMac.frames.size(), frames.size());
    for (size_t i = 0; i < frames.size(); ++i) {
       EXPECT_EQ(byMac.frames[i].direction, sourceMac(frames[i].bytes) == kVmMac ? replay::kDirFromVm : replay::kDirToVm);
-   }
-
-   // Every frame recorded as inbound: the flags win over the MAC.
-   for (auto &frame : frames) {
-      frame.direction = replay::kDirToVm;
-   }
-   writePcapng(dir.path() / "in.pcapng", frames);
-   options.capturePath = (dir.path() / "in.pcapng").string();
-   for (const auto &frame : replay::runReplay(options).frames) {
-      EXPECT_EQ(frame.direction, replay::kDirToVm) << frame.index;
    }
 }
 

@@ -31,9 +31,10 @@ bool parseCount(const std::string &text, Number &value)
    return error == std::errc{} && stop == end;
 }
 
+using NodeValues = std::map<std::string, std::string, std::less<>>;
+
 // The counters named in `fields` that a node's values hold as counts.
-DropCounters countersOf(std::span<const char *const> fields,
-                        const std::map<std::string, std::string, std::less<>> &values)
+DropCounters countersOf(std::span<const char *const> fields, const NodeValues &values)
 {
    DropCounters counters;
    for (const char *field : fields) {
@@ -49,6 +50,32 @@ DropCounters countersOf(std::span<const char *const> fields,
 std::string ipv6Path(uint32_t portID)
 {
    return "/ipv6/" + std::to_string(portID);
+}
+
+// The values of each instance of a node table ("/security/N/vmi"), in the
+// list's order; one removed since the list was taken is left out, and a
+// table that cannot be listed has none.
+std::vector<NodeValues> tableValues(host::Nexo &nexo, const std::string &table)
+{
+   std::vector<int64_t> instances;
+   std::vector<NodeValues> rows;
+   if (nexo.list(table, &instances) != ORR_OK) {
+      return rows;
+   }
+   for (int64_t instance : instances) {
+      host::NexoRecord record;
+      if (nexo.get(table + "/" + std::to_string(instance), &record) == ORR_OK) {
+         rows.push_back(record.values());
+      }
+   }
+   return rows;
+}
+
+// A field of a node's values; empty where it has none.
+std::string fieldOf(const NodeValues &values, const char *name)
+{
+   const auto found = values.find(name);
+   return found != values.end() ? found->second : std::string();
 }
 
 }  // namespace
@@ -401,26 +428,13 @@ std::optional<Ipv6PortState> ModuleSession::readIpv6State(uint32_t portID)
    state.summary = summary.values();
    state.summaryText = summary.text();
    state.counters = countersOf(kIpv6CounterFields, state.summary);
-   std::vector<int64_t> instances;
-   if (host_.nexo().list(port + "/bindings", &instances) != ORR_OK) {
-      return state;
-   }
-   for (int64_t instance : instances) {
-      host::NexoRecord record;
-      if (host_.nexo().get(port + "/bindings/" + std::to_string(instance), &record) != ORR_OK) {
-         continue;   // removed since the list was taken
-      }
-      const auto values = record.values();
-      auto field = [&values](const char *name) {
-         const auto found = values.find(name);
-         return found != values.end() ? found->second : std::string();
-      };
+   for (const NodeValues &values : tableValues(host_.nexo(), port + "/bindings")) {
       Ipv6Binding &binding = state.bindings.emplace_back();
-      (void)parseCount(field("vlanId"), binding.vlan);
-      binding.mac = field("mac");
-      binding.ip = ipv6Text(field("addr"));
-      binding.method = field("method");
-      binding.timeRemaining = field("timeRemaining");
+      (void)parseCount(fieldOf(values, "vlanId"), binding.vlan);
+      binding.mac = fieldOf(values, "mac");
+      binding.ip = ipv6Text(fieldOf(values, "addr"));
+      binding.method = fieldOf(values, "method");
+      binding.timeRemaining = fieldOf(values, "timeRemaining");
    }
    return state;
 }
@@ -436,31 +450,17 @@ PortState ModuleSession::readState(uint32_t portID)
       state.featureSummaryText = summary.text();
       state.counters = countersOf(kDropCounterFields, *state.featureSummary);
    }
-   std::vector<int64_t> instances;
-   if (host_.nexo().list(port + "/vmi", &instances) != ORR_OK) {
-      return state;
-   }
-   for (int64_t instance : instances) {
-      host::NexoRecord vmi;
-      // An entry removed since the list was taken is simply not shown.
-      if (host_.nexo().get(port + "/vmi/" + std::to_string(instance), &vmi) != ORR_OK) {
-         continue;
-      }
-      const auto values = vmi.values();
-      auto field = [&values](const char *name) {
-         const auto found = values.find(name);
-         return found != values.end() ? found->second : std::string();
-      };
+   for (const NodeValues &values : tableValues(host_.nexo(), port + "/vmi")) {
       PortDbEntry &entry = state.portDb.emplace_back();
-      (void)parseCount(field("vlanId"), entry.vlan);
-      entry.mac = field("macAddr");
-      entry.ip = field("ipAddr");
-      entry.method = field("discoveryMethod");
-      entry.timeRemaining = field("timeRemaining");
-      entry.chaddr = field("chaddr");
-      entry.clientIdLen = field("clientIdLen");
-      entry.serverIp = field("serverIp");
-      entry.leaseTime = field("leaseTime");
+      (void)parseCount(fieldOf(values, "vlanId"), entry.vlan);
+      entry.mac = fieldOf(values, "macAddr");
+      entry.ip = fieldOf(values, "ipAddr");
+      entry.method = fieldOf(values, "discoveryMethod");
+      entry.timeRemaining = fieldOf(values, "timeRemaining");
+      entry.chaddr = fieldOf(values, "chaddr");
+      entry.clientIdLen = fieldOf(values, "clientIdLen");
+      entry.serverIp = fieldOf(values, "serverIp");
+      entry.leaseTime = fieldOf(values, "leaseTime");
    }
    return state;
 }

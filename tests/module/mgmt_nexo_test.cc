@@ -66,7 +66,7 @@ TEST_F(NexoTest, only_ports_with_ip_discovery_are_listed_and_others_are_not_foun
    EXPECT_EQ(host().nexo().set(portPath(99, "clearVmi"), {"all"}), ORR_NOT_FOUND);
 }
 
-TEST_F(NexoTest, the_port_list_stops_at_the_first_refused_append_and_says_so)
+TEST_F(NexoTest, the_port_list_stops_at_the_first_refused_append_and_an_unreadable_port_argument_is_returned)
 {
    create();
    create({}, kOtherPort);
@@ -76,11 +76,6 @@ TEST_F(NexoTest, the_port_list_stops_at_the_first_refused_append_and_says_so)
    EXPECT_EQ(list("/security", ORR_LIMIT_EXCEEDED), (std::vector<int64_t>{kPort}));
    EXPECT_TRUE(loggedWithPrefix(host(), "Nexo_ParamListAddInt() failed: " + statusText(ORR_LIMIT_EXCEEDED),
                                 ORR_LOG_ERROR, "SwSecNexoListPortIds"));
-}
-
-TEST_F(NexoTest, an_unreadable_port_argument_is_logged_and_returned)
-{
-   create();
    host().faults().failOnce("Nexo_ParamListGetInt32", ORR_BAD_PARAM);
    (void)get(portPath(kPort, "featureSummary"), ORR_BAD_PARAM);
    EXPECT_TRUE(loggedWithPrefix(host(), "Nexo_ParamListGetInt32() failed: " + statusText(ORR_BAD_PARAM),
@@ -173,7 +168,7 @@ TEST_F(NexoTest, an_arp_snooped_vmi_counts_down_to_zero_once_expired_but_not_yet
    EXPECT_EQ(get(portPath(kPort, "vmi/0")).value("timeRemaining"), "0 sec");
 }
 
-TEST_F(NexoTest, vmi_indexes_at_or_past_the_count_are_not_found)
+TEST_F(NexoTest, vmi_indexes_at_or_past_the_count_a_missing_index_or_no_memory_find_nothing_and_let_the_port_go)
 {
    const host::FilterId id = create();
    (void)get(portPath(kPort, "vmi/0"), ORR_NOT_FOUND);   // empty database
@@ -184,20 +179,12 @@ TEST_F(NexoTest, vmi_indexes_at_or_past_the_count_are_not_found)
    EXPECT_EQ(get(portPath(kPort, "vmi/1")).value("vlanId"), "2");
    (void)get(portPath(kPort, "vmi/2"), ORR_NOT_FOUND);
    (void)get(portPath(kPort, "vmi/4294967295"), ORR_NOT_FOUND);
-}
-
-TEST_F(NexoTest, a_vmi_summary_without_an_index_or_memory_fails_and_lets_the_port_go)
-{
-   const host::FilterId id = create();
-   configure(id, {.statics = {binding(1, kVmMac, kVmIp)}});
 
    (void)get(portPath(kPort, "vmi"), ORR_NOT_FOUND);
    EXPECT_TRUE(loggedWithPrefix(host(), "Nexo_ParamListGetUInt32() failed: " + statusText(ORR_NOT_FOUND),
                                 ORR_LOG_ERROR, "SwSecNexoVmiSummaryGet"));
-
    host().faults().failOnce("orr_HeapAllocWithRA", ORR_NO_MEMORY);
    (void)get(portPath(kPort, "vmi/0"), ORR_NO_MEMORY);
-
    // The configLock was let go: a clear takes it exclusively.
    EXPECT_EQ(host().nexo().set(portPath(kPort, "clearVmi"), {"all"}), ORR_OK);
 }

@@ -77,16 +77,6 @@ TEST_F(ModuleLoadTest, registers_the_builtin_agent_its_property_and_the_client_p
                                 ORR_LOG_INFO, "SifraGenericFWInitProperty"));
 }
 
-TEST_F(ModuleLoadTest, creates_its_locks_in_rank_order)
-{
-   Strings locks;
-   for (const auto &lock : host().locks().live()) {
-      locks.push_back(lock.name + " " + std::to_string(lock.type) + " " + std::to_string(lock.rank));
-   }
-   EXPECT_EQ(locks, (Strings{"sifg.fastpath 1 2", "sifg.sec.portFilterMapDb 1 5",
-                             "sifg.sec.testConfig 3 7"}));
-}
-
 TEST_F(ModuleLoadTest, unload_withdraws_everything)
 {
    EXPECT_EQ(host().unload(), ORR_OK);

@@ -84,11 +84,12 @@ TEST(MgmtIpText, reads_like_inet_aton)
    }
 }
 
-TEST(MgmtFeatureText, names_the_enabled_features_in_bit_order)
+TEST(MgmtFeatureText, names_the_enabled_features_in_bit_order_and_a_small_field_is_cut_and_stays_terminated)
 {
    struct Case {
       uint32_t features;
       const char *expected;
+      size_t size = 1024;
    };
    const Case cases[] = {
       {0x09, "BPDU Filter,DAI"},
@@ -97,20 +98,14 @@ TEST(MgmtFeatureText, names_the_enabled_features_in_bit_order)
       {0x14, "IP Discovery,IP source guard"},
       {0x20, ""},                              // only unnamed bits: nothing written, nothing cut
       {0x22, "Block DHCP server functionality"},
+      {0x1f, "BPDU F", 8},
    };
    for (const Case &c : cases) {
       char text[1024];
       std::memset(text, 'Z', sizeof text);
-      SwSecNexoFormatFeatures(text, sizeof text, c.features);
+      SwSecNexoFormatFeatures(text, c.size, c.features);
       EXPECT_STREQ(text, c.expected) << std::hex << c.features;
    }
-}
-
-TEST(MgmtFeatureText, a_small_field_is_cut_and_stays_terminated)
-{
-   char text[8];
-   SwSecNexoFormatFeatures(text, sizeof text, 0x1f);
-   EXPECT_EQ(std::strlen(text), 6u);
 }
 
 }  // namespace

@@ -6,14 +6,18 @@
  * other frame is punted to user space, where the module judges it:
  *
  *   passed   TC_ACT_OK      the module would pass it and change nothing
- *   dropped  TC_ACT_SHOT    IP source guard: an IPv4 source not bound
+ *   dropped  TC_ACT_SHOT    IP source guard: an IPv4 or IPv6 source not bound
  *   punted   TC_ACT_STOLEN  copied to the ring buffer for the module
  *
  * Punted: every frame while the port is not ready; ARP; DHCP (UDP port 67
  * or 68 either side; DHCPv6 server replies where they are blocked); BPDU
  * destinations where they are filtered; an inner tag; IPv4 fragments,
- * options or short headers; every frame from the VM in the error-rate-limit
- * state; and, on a trusted port, IPv4 from a binding the module refreshes.
+ * options or short headers; every frame from the VM in either agent's
+ * error state; and, on a trusted port, IPv4 from a binding the module
+ * refreshes. With the IPv6 agent on the port, also: IPv6 with an extension
+ * header (fragments included) or a header it does not parse whole, DHCPv6
+ * both ways, ND, RA, redirects and MLD from the VM, and a frame from a
+ * first-come-first-served binding once in SWSEC_FP_FCFS_REFRESH_NS.
  *
  * The outer VLAN tag is metadata on tc (vlan_present, vlan_tci); a frame
  * that carries it in its bytes (BPF_PROG_TEST_RUN, a device without
@@ -40,6 +44,13 @@ struct {
    __type(key, struct swsec_fp_binding_key);
    __type(value, struct swsec_fp_binding);
 } swsec_bindings SEC(".maps");
+
+struct {
+   __uint(type, BPF_MAP_TYPE_HASH);
+   __uint(max_entries, SWSEC_FP_MAX_BINDINGS6);
+   __type(key, struct swsec_fp_binding6_key);
+   __type(value, struct swsec_fp_binding6);
+} swsec_bindings6 SEC(".maps");
 
 struct {
    __uint(type, BPF_MAP_TYPE_PERCPU_ARRAY);
@@ -77,8 +88,12 @@ struct {
 #define ETH_P_QINQ_ 0x9100
 #define DHCP_SERVER_PORT 67
 #define DHCP_CLIENT_PORT 68
+#define DHCPV6_CLIENT_PORT 546
 #define DHCPV6_SERVER_PORT 547
+#define IPPROTO_TCP_ 6
 #define IPPROTO_UDP_ 17
+#define IPPROTO_ICMPV6_ 58
+#define IPV6_HEADER_LEN 40
 
 static __always_inline void swsec_count(__u32 reason)
 {
@@ -147,6 +162,99 @@ static __always_inline int swsec_pass(struct __sk_buff *skb, __u32 direction)
    return TC_ACT_OK;
 }
 
+/* Counts a punt from the VM against this second's budget `limit`
+ * (ARP's, or with `nd` ND's); true when the frame is over it. */
+static __always_inline int swsec_over_budget(__u32 limit, int nd)
+{
+   __u32 zero = 0;
+   struct swsec_fp_arp_budget *budget = bpf_map_lookup_elem(&swsec_arp_budget, &zero);
+   if (limit == 0 || !budget)
+      return 0;
+   const __u64 second = bpf_ktime_get_ns() / 1000000000ull;
+   if (budget->second != second) {
+      budget->second = second;
+      budget->punts = 0;
+      budget->nd_punts = 0;
+   }
+   /* Not atomic: CPUs racing may punt a few more, never fewer. */
+   __u32 *used = nd ? &budget->nd_punts : &budget->punts;
+   return (*used)++ >= limit;
+}
+
+/* The IPv6 extension headers the IPv6 agent walks. */
+static __always_inline int swsec_is_ipv6_extension(__u8 next)
+{
+   return next == 0 || next == 43 || next == 44 || next == 51 || next == 60 || next == 135 || next == 139 ||
+          next == 140;
+}
+
+/*
+ * IPv6 on a port with the IPv6 agent, after the IPv4 agent's checks. The
+ * program decides a packet whose fixed header is followed directly by its
+ * upper-layer header, both whole in the frame; anything else the agent's
+ * header-chain walk must see is punted, as is every frame it learns from
+ * or judges beyond the source: DHCPv6 either way, and ND, RA, redirects
+ * and MLD from the VM (to the VM, ICMPv6 changes nothing in the module).
+ */
+static __always_inline int swsec_judge_ipv6(struct __sk_buff *skb, const struct swsec_fp_port *port,
+                                            const struct swsec_fp_frame *frame, const __u8 *data,
+                                            const __u8 *l3, const __u8 *end)
+{
+   if (l3 + IPV6_HEADER_LEN > end || (l3[0] >> 4) != 6)
+      return swsec_punt(skb, port, frame, SWSEC_FP_PUNT_UNPARSED);
+   const __u32 packet_len = IPV6_HEADER_LEN + swsec_load_be16(l3 + 4);
+   if (packet_len > skb->len - (__u32)(l3 - data))
+      return swsec_punt(skb, port, frame, SWSEC_FP_PUNT_UNPARSED);
+   const __u8 next = l3[6];
+   if (swsec_is_ipv6_extension(next))
+      return swsec_punt(skb, port, frame, SWSEC_FP_PUNT_IPV6_CHAIN);
+   const __u32 upper_len = next == IPPROTO_TCP_ ? 20 : next == IPPROTO_UDP_ ? 8 : next == IPPROTO_ICMPV6_ ? 4 : 0;
+   const __u8 *upper = l3 + IPV6_HEADER_LEN;
+   if (IPV6_HEADER_LEN + upper_len > packet_len || upper + upper_len > end)
+      return swsec_punt(skb, port, frame, SWSEC_FP_PUNT_UNPARSED);
+   const int from_vm = frame->direction == SWSEC_FP_DIR_FROM_VM;
+   if (next == IPPROTO_ICMPV6_ && upper + 1 <= end) {
+      const __u8 type = upper[0];
+      /* Router solicitation to redirect: what the ND limiter counts. */
+      if (from_vm && type >= 133 && type <= 137) {
+         if (swsec_over_budget(port->nd_punts, 1)) {
+            swsec_count(SWSEC_FP_DROP_ND_BUDGET);
+            return TC_ACT_SHOT;
+         }
+         return swsec_punt(skb, port, frame, SWSEC_FP_PUNT_ND);
+      }
+      /* MLD queries and reports, which may come from no address. */
+      if (from_vm && ((type >= 130 && type <= 132) || type == 143))
+         return swsec_punt(skb, port, frame, SWSEC_FP_PUNT_ND);
+   }
+   if (next == IPPROTO_UDP_ && upper + 4 <= end) {
+      const __u16 sport = swsec_load_be16(upper);
+      const __u16 dport = swsec_load_be16(upper + 2);
+      if (dport == DHCPV6_CLIENT_PORT || dport == DHCPV6_SERVER_PORT || sport == DHCPV6_SERVER_PORT)
+         return swsec_punt(skb, port, frame, SWSEC_FP_PUNT_DHCPV6);
+   }
+   if (!from_vm || (port->flags & SWSEC_FP_PORT_FHS_TRUSTED) || !(port->fhs_features & SWSEC_FP_FHS_SOURCE_GUARD))
+      return swsec_pass(skb, frame->direction);
+
+   /* Source guard. The unspecified source is the module's only for the ICMPv6 punted above. */
+   struct swsec_fp_binding6_key key = {.vlan = frame->vlan};
+   __builtin_memcpy(key.mac, data + 6, 6);
+   __builtin_memcpy(key.addr, l3 + 8, 16);
+   struct swsec_fp_binding6 *binding = bpf_map_lookup_elem(&swsec_bindings6, &key);
+   if (!binding) {
+      swsec_count(SWSEC_FP_DROP_IPV6_SOURCE_GUARD);
+      return TC_ACT_SHOT;
+   }
+   if (binding->fcfs) {
+      const __u64 now = bpf_ktime_get_ns();
+      if (now >= binding->refresh_ns) {
+         binding->refresh_ns = now + SWSEC_FP_FCFS_REFRESH_NS;
+         return swsec_punt(skb, port, frame, SWSEC_FP_PUNT_REFRESH);
+      }
+   }
+   return swsec_pass(skb, frame->direction);
+}
+
 static __always_inline int swsec_judge(struct __sk_buff *skb, __u32 direction)
 {
    /* Re-injected after the module passed it: counted when it was punted. */
@@ -184,8 +292,8 @@ static __always_inline int swsec_judge(struct __sk_buff *skb, __u32 direction)
    if (!port || !(port->flags & SWSEC_FP_PORT_READY))
       return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_NOT_READY);
    const __u32 features = port->features;
-   /* A port with every feature off passes every frame untouched. */
-   if (features == 0)
+   /* A port with every feature of both agents off passes every frame untouched. */
+   if (features == 0 && port->fhs_features == 0)
       return swsec_pass(skb, direction);
    /* A frame without an Ethernet header passes unexamined, as in the module. */
    if (data + ETH_HLEN > end)
@@ -196,34 +304,31 @@ static __always_inline int swsec_judge(struct __sk_buff *skb, __u32 direction)
    const __u16 ethertype = swsec_load_be16(type);
    const __u8 *l3 = type + 2;
 
-   /* A VM's ARP flood, and its frames in the error state, are cut here
-    * above the module's own limit: the VM cannot flood user space. */
-   if (direction == SWSEC_FP_DIR_FROM_VM && port->arp_punts != 0 &&
-       (ethertype == ETH_P_ARP || (port->flags & SWSEC_FP_PORT_ERR_STATE))) {
-      struct swsec_fp_arp_budget *budget = bpf_map_lookup_elem(&swsec_arp_budget, &zero);
-      if (budget) {
-         const __u64 second = bpf_ktime_get_ns() / 1000000000ull;
-         if (budget->second != second) {
-            budget->second = second;
-            budget->punts = 0;
-         }
-         /* Not atomic: CPUs racing may punt a few more, never fewer. */
-         if (budget->punts++ >= port->arp_punts) {
-            swsec_count(SWSEC_FP_DROP_ARP_BUDGET);
-            return TC_ACT_SHOT;
-         }
+   /* A VM's ARP or ND flood, and its frames in an error state, are cut
+    * here above the module's own limits: the VM cannot flood user space. */
+   const __u32 err_state = port->flags & (SWSEC_FP_PORT_ERR_STATE | SWSEC_FP_PORT_ND_ERR_STATE);
+   if (direction == SWSEC_FP_DIR_FROM_VM && err_state) {
+      const int arp = port->arp_punts != 0 && (ethertype == ETH_P_ARP || (port->flags & SWSEC_FP_PORT_ERR_STATE));
+      if (arp ? swsec_over_budget(port->arp_punts, 0)
+              : (port->flags & SWSEC_FP_PORT_ND_ERR_STATE) && swsec_over_budget(port->nd_punts, 1)) {
+         swsec_count(arp ? SWSEC_FP_DROP_ARP_BUDGET : SWSEC_FP_DROP_ND_BUDGET);
+         return TC_ACT_SHOT;
       }
-   }
-   if (direction == SWSEC_FP_DIR_FROM_VM && (port->flags & SWSEC_FP_PORT_ERR_STATE))
       return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_ERR_STATE);
+   }
+   if (direction == SWSEC_FP_DIR_FROM_VM && ethertype == ETH_P_ARP && features != 0 &&
+       swsec_over_budget(port->arp_punts, 0)) {
+      swsec_count(SWSEC_FP_DROP_ARP_BUDGET);
+      return TC_ACT_SHOT;
+   }
    if ((features & SWSEC_FP_FEATURE_BPDU_FILTER) &&
        (swsec_is_mac(data, 0x01, 0x80, 0xc2, 0x00, 0x00, 0x00) ||
         swsec_is_mac(data, 0x01, 0x00, 0x0c, 0xcc, 0xcc, 0xcd)))
       return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_BPDU);
    if (ethertype == ETH_P_8021Q || ethertype == ETH_P_8021AD_ || ethertype == ETH_P_QINQ_)
       return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_TAGGED);
-   /* The frame guard's ethertype list, as the module checks it first on frames from the VM. */
-   if (direction == SWSEC_FP_DIR_FROM_VM && port->num_ether_types != 0) {
+   /* The IPv4 agent's frame guard (its ethertype list) and checks, where it has features on. */
+   if (direction == SWSEC_FP_DIR_FROM_VM && features != 0 && port->num_ether_types != 0) {
       int listed = 0;
       for (__u32 i = 0; i < SWSEC_FP_MAX_ETHER_TYPES; i++)
          listed |= i < port->num_ether_types && port->ether_types[i] == ethertype;
@@ -232,23 +337,26 @@ static __always_inline int swsec_judge(struct __sk_buff *skb, __u32 direction)
          return TC_ACT_SHOT;
       }
    }
-   if (ethertype == ETH_P_ARP)
+   if (ethertype == ETH_P_ARP && features != 0)
       return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_ARP);
 
    if (ethertype == ETH_P_IPV6) {
-      if (direction != SWSEC_FP_DIR_FROM_VM || !(features & SWSEC_FP_FEATURE_BLOCK_DHCP_SERVER))
-         return swsec_pass(skb, direction);
-      if (l3 + 40 > end)
-         return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_UNPARSED);
-      if (l3[6] != IPPROTO_UDP_)
-         return swsec_pass(skb, direction); /* the module looks at a UDP header right after IPv6 only */
-      if (l3 + 48 > end)
-         return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_UNPARSED);
-      if (swsec_load_be16(l3 + 40) == DHCPV6_SERVER_PORT)
-         return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_DHCP);
+      /* The IPv4 agent's DHCP server block looks at a UDP header right after IPv6 only. */
+      if (direction == SWSEC_FP_DIR_FROM_VM && (features & SWSEC_FP_FEATURE_BLOCK_DHCP_SERVER)) {
+         if (l3 + 40 > end)
+            return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_UNPARSED);
+         if (l3[6] == IPPROTO_UDP_) {
+            if (l3 + 48 > end)
+               return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_UNPARSED);
+            if (swsec_load_be16(l3 + 40) == DHCPV6_SERVER_PORT)
+               return swsec_punt(skb, port, &frame, SWSEC_FP_PUNT_DHCP);
+         }
+      }
+      if (port->fhs_features != 0)
+         return swsec_judge_ipv6(skb, port, &frame, data, l3, end);
       return swsec_pass(skb, direction);
    }
-   if (ethertype != ETH_P_IP)
+   if (ethertype != ETH_P_IP || features == 0)
       return swsec_pass(skb, direction);
 
    /* IPv4: a plain 20-byte header, not a fragment, else the module decides. */

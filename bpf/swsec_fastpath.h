@@ -6,11 +6,13 @@
  * Map                 kind          key                    value
  * swsec_port          array (1)     u32 0                  struct swsec_fp_port
  * swsec_bindings      hash          struct swsec_fp_binding_key  struct swsec_fp_binding
+ * swsec_bindings6     hash          struct swsec_fp_binding6_key struct swsec_fp_binding6
  * swsec_counters      per-CPU array u32 reason             u64 frames
  * swsec_punts         ring buffer   -                      struct swsec_fp_punt + frame bytes
  *
  * User space owns every value: the program only reads the port and the
- * bindings, and writes counters and punt records.
+ * bindings, and writes counters, punt records, the punt budget and an IPv6
+ * binding's refresh_ns.
  */
 #ifndef SWSEC_FASTPATH_H
 #define SWSEC_FASTPATH_H
@@ -34,6 +36,8 @@
 #define SWSEC_FP_PORT_TRUSTED 0x2u   /* the port's IP discovery is in trusted mode */
 #define SWSEC_FP_PORT_ERR_STATE 0x4u /* the port is in the error-rate-limit state */
 #define SWSEC_FP_PORT_OWN_QDISC 0x8u /* user space made the VM interface's clsact qdisc (the program ignores it) */
+#define SWSEC_FP_PORT_FHS_TRUSTED 0x10u   /* the IPv6 agent's port is trusted (a router's) */
+#define SWSEC_FP_PORT_ND_ERR_STATE 0x20u  /* the IPv6 agent is in its ND error state */
 
 /*
  * A frame the module passed goes back where it was going through the
@@ -57,8 +61,13 @@ struct swsec_fp_port {
                         at most, the rest dropped; 0: all */
    __u32 num_ether_types; /* 0: the VM may send every ethertype; else only the first these of: */
    __u16 ether_types[SWSEC_FP_MAX_ETHER_TYPES]; /* host order */
+   __u32 fhs_features; /* the IPv6 agent's featuresEnabled bits; 0: no IPv6 agent, or none on */
+   __u32 nd_punts;     /* ND frames, and frames in the ND error state, from the VM punted a second
+                          at most, the rest dropped; 0: all */
 };
-SWSEC_FP_STATIC_ASSERT(sizeof(struct swsec_fp_port) == 40, "swsec_fp_port layout");
+SWSEC_FP_STATIC_ASSERT(sizeof(struct swsec_fp_port) == 48, "swsec_fp_port layout");
+SWSEC_FP_STATIC_ASSERT(offsetof(struct swsec_fp_port, fhs_features) == 40, "swsec_fp_port layout");
+SWSEC_FP_STATIC_ASSERT(offsetof(struct swsec_fp_port, nd_punts) == 44, "swsec_fp_port layout");
 SWSEC_FP_STATIC_ASSERT(offsetof(struct swsec_fp_port, num_ether_types) == 20, "swsec_fp_port layout");
 SWSEC_FP_STATIC_ASSERT(offsetof(struct swsec_fp_port, ether_types) == 24, "swsec_fp_port layout");
 SWSEC_FP_STATIC_ASSERT(offsetof(struct swsec_fp_port, flags) == 4, "swsec_fp_port layout");
@@ -66,15 +75,16 @@ SWSEC_FP_STATIC_ASSERT(offsetof(struct swsec_fp_port, port_id) == 8, "swsec_fp_p
 SWSEC_FP_STATIC_ASSERT(offsetof(struct swsec_fp_port, vm_ifindex) == 12, "swsec_fp_port layout");
 SWSEC_FP_STATIC_ASSERT(offsetof(struct swsec_fp_port, arp_punts) == 16, "swsec_fp_port layout");
 
-/* The ARP and error-state punts of the current second (swsec_arp_budget, array of 1). */
+/* The ARP, ND and error-state punts of the current second (swsec_arp_budget, array of 1). */
 struct swsec_fp_arp_budget {
-   __u64 second; /* bpf_ktime_get_ns() / 1e9 of the count */
-   __u32 punts;
-   __u32 reserved;
+   __u64 second; /* bpf_ktime_get_ns() / 1e9 of the counts */
+   __u32 punts;    /* against arp_punts */
+   __u32 nd_punts; /* against nd_punts */
 };
 SWSEC_FP_STATIC_ASSERT(sizeof(struct swsec_fp_arp_budget) == 16, "swsec_fp_arp_budget layout");
+SWSEC_FP_STATIC_ASSERT(offsetof(struct swsec_fp_arp_budget, nd_punts) == 12, "swsec_fp_arp_budget layout");
 
-/* The module's ARP rate limit times this, and at least the floor, is the punt budget. */
+/* The module's ARP (ND) rate limit times this, and at least the floor, is the punt budget. */
 #define SWSEC_FP_ARP_PUNT_FACTOR 4u
 #define SWSEC_FP_ARP_PUNT_FLOOR 1000u
 
@@ -104,6 +114,40 @@ SWSEC_FP_STATIC_ASSERT(sizeof(struct swsec_fp_binding) == 4, "swsec_fp_binding l
 /* The most bindings a port's map holds: the module's 32, and room for changes in flight. */
 #define SWSEC_FP_MAX_BINDINGS 64
 
+/* The IPv6 agent's feature bit that the program reads (the module's value). */
+#define SWSEC_FP_FHS_SOURCE_GUARD 0x20u
+
+/* An IPv6 binding's key: the IPv6 agent's (VLAN, MAC, IPv6 address in network order). */
+struct swsec_fp_binding6_key {
+   __u16 vlan;
+   __u8 mac[6];
+   __u8 addr[16];
+};
+SWSEC_FP_STATIC_ASSERT(sizeof(struct swsec_fp_binding6_key) == 24, "swsec_fp_binding6_key layout");
+SWSEC_FP_STATIC_ASSERT(offsetof(struct swsec_fp_binding6_key, mac) == 2, "swsec_fp_binding6_key layout");
+SWSEC_FP_STATIC_ASSERT(offsetof(struct swsec_fp_binding6_key, addr) == 8, "swsec_fp_binding6_key layout");
+
+struct swsec_fp_binding6 {
+   __u8 fcfs;          /* first come, first served: the VM's traffic from it renews its lifetime */
+   __u8 reserved[7];
+   __u64 refresh_ns;   /* the program's: bpf_ktime_get_ns() from which the next frame is punted to renew it */
+};
+SWSEC_FP_STATIC_ASSERT(sizeof(struct swsec_fp_binding6) == 16, "swsec_fp_binding6 layout");
+SWSEC_FP_STATIC_ASSERT(offsetof(struct swsec_fp_binding6, refresh_ns) == 8, "swsec_fp_binding6 layout");
+
+/* The most IPv6 bindings a port's map holds: the module's most (1024), and room for changes in flight. */
+#define SWSEC_FP_MAX_BINDINGS6 1088
+
+/*
+ * A first-come-first-served binding lives while the VM sends from it: the
+ * module notes such a frame and, at its next 10 s tick, moves the expiry on.
+ * One frame a binding in this interval is punted for that, and the rest
+ * decided here, so a lifetime the module keeps lags the VM's traffic by at
+ * most this (against a lifetime of minutes), and a busy source costs one
+ * punt in five seconds instead of one a frame.
+ */
+#define SWSEC_FP_FCFS_REFRESH_NS 5000000000ull
+
 /*
  * What the program did with a frame, one per-CPU counter each. A frame is
  * passed, dropped with its reason, or punted to user space (with why) for
@@ -122,9 +166,14 @@ SWSEC_FP_STATIC_ASSERT(sizeof(struct swsec_fp_binding) == 4, "swsec_fp_binding l
    X(SWSEC_FP_PUNT_UNPARSED, "punted: header not parsed")                     \
    X(SWSEC_FP_PUNT_ERR_STATE, "punted: error-rate-limit state")               \
    X(SWSEC_FP_PUNT_REFRESH, "punted: binding refresh")                        \
+   X(SWSEC_FP_PUNT_ND, "punted: ND, RA, redirect or MLD")                    \
+   X(SWSEC_FP_PUNT_DHCPV6, "punted: DHCPv6")                                  \
+   X(SWSEC_FP_PUNT_IPV6_CHAIN, "punted: IPv6 extension header or fragment")  \
    X(SWSEC_FP_PUNT_LOST, "lost: punt ring full")                             \
    X(SWSEC_FP_DROP_ARP_BUDGET, "dropped: over the punt budget")              \
-   X(SWSEC_FP_DROP_ETHER_TYPE, "dropped: ethertype not listed")
+   X(SWSEC_FP_DROP_ETHER_TYPE, "dropped: ethertype not listed")              \
+   X(SWSEC_FP_DROP_IPV6_SOURCE_GUARD, "IPv6 source guard")                   \
+   X(SWSEC_FP_DROP_ND_BUDGET, "dropped: over the ND punt budget")
 
 #define SWSEC_FP_REASON_ENUM(name, text) name,
 enum swsec_fp_reason { SWSEC_FP_REASON_LIST(SWSEC_FP_REASON_ENUM) SWSEC_FP_REASON_COUNT };

@@ -1,16 +1,22 @@
 // The kernel fast path against the module alone: generated frames (outer and
 // inner tags, IPv4 fragments and options, DHCP and DHCPv6 ports, ARP, BPDU
-// destinations, any ethertype, truncations) through both, with the clock moved
-// between them; the first frame whose verdict or drop counters differ aborts.
+// destinations, any ethertype, IPv6 extension headers, fragments, ND, RA and
+// MLD, truncations) through both, with the clock moved between them; the
+// first frame whose verdict or drop counters differ aborts.
 // Needs root and BPF (scripts/fuzz.sh runs it only as root).
 //
-// Input: [config] then frames, each [clock] [shape] [choices] [cut] ...
-//   config  bits 0-4 features, bit 5 trusted, bit 6 ARP rate limit (3/s, 1/s, 10 s)
+// Input: [config] [config6 when config bit 7] then frames, each [clock] [shape] [choices] [cut] ...
+//   config  bits 0-4 features, bit 5 trusted, bit 6 ARP rate limit (3/s, 1/s, 10 s),
+//           bit 7 the IPv6 agent too
+//   config6 bits 0-6 the IPv6 agent's features (ND rate limit 3/s, 1/s, 10 s)
 //   shape   bit 0 to the VM, bits 1-2 outer tag, bits 3-4 inner tag (none,
 //           802.1Q, 802.1ad, 0x9100), bits 5-7 kind: IPv4 UDP, TCP, ICMP,
-//           ARP, IPv6 UDP, any ethertype (2 bytes)
+//           ARP, IPv6, any ethertype (2 bytes)
 //   choices bits 0-1 source, 2-3 destination MAC, 4-5 addresses, 6-7 ports,
-//           with a raw byte for the IPv4 flags and fragment offset, and IHL
+//           with a raw byte for the IPv4 flags and fragment offset, and IHL;
+//           for IPv6 a byte: bits 0-2 next header, 3 upper layer behind an
+//           extension header, 4 a later fragment, 5-7 ICMPv6 type; and a
+//           byte whose bit 0 makes the payload length overrun the frame
 #include "fuzz_input.h"
 #include "session/config_file.h"
 #include "twin.h"
@@ -28,18 +34,82 @@ constexpr std::array<uint8_t, 6> kMacs[4] = {{0x02, 0x00, 0x5e, 0xc0, 0x00, 0x01
 constexpr std::array<uint8_t, 4> kIps[4] = {{192, 0, 2, 101}, {192, 0, 2, 66}, {0, 0, 0, 0}, {192, 0, 2, 60}};
 constexpr uint16_t kPorts[4] = {67, 68, 547, 1024};
 constexpr uint16_t kTpids[4] = {0, 0x8100, 0x88a8, 0x9100};
+// Bound (static), unbound, unspecified, link-local.
+constexpr std::array<uint8_t, 16> kIp6s[4] = {{0x20, 0x01, 0x0d, 0xb8, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0x65},
+                                              {0x20, 0x01, 0x0d, 0xb8, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0x66},
+                                              {},
+                                              {0xfe, 0x80, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 1}};
+// UDP, TCP, ICMPv6, hop-by-hop, fragment, destination options, no next header, routing.
+constexpr uint8_t kNextHeaders[8] = {17, 6, 58, 0, 44, 60, 59, 43};
+// Echo request, router solicitation and advertisement, neighbour solicitation and advertisement, MLDv2 report, an error, redirect.
+constexpr uint8_t kIcmp6Types[8] = {128, 133, 134, 135, 136, 143, 1, 137};
+constexpr uint16_t kPorts6[4] = {546, 547, 53, 1024};
 
-// Two static bindings of the VM, on VLAN 0 and 100.
-Bytes configRecord(uint8_t bits)
+// Two static bindings of the VM, on VLAN 0 and 100, of each family.
+swsec::session::PortSecurityConfig config(FuzzInput &in)
 {
-   return swsec::session::configRecord({.features = bits & 0x1fu, .trusted = (bits & 0x20u) != 0,
-                                       .arpRateLimit = (bits & 0x40u) != 0 ? 3u : 0u, .errRateLimit = 1,
-                                       .errRateLimitPeriod = 10, .statics = {{0, kMacs[0], kIps[0]}, {100, kMacs[0], kIps[0]}}});
+   const uint8_t bits = in.byte();
+   swsec::session::PortSecurityConfig out;
+   static_cast<swsec::contract::PortSecurityConfig &>(out) = {
+      .features = bits & 0x1fu, .trusted = (bits & 0x20u) != 0, .arpRateLimit = (bits & 0x40u) != 0 ? 3u : 0u,
+      .errRateLimit = 1, .errRateLimitPeriod = 10, .statics = {{0, kMacs[0], kIps[0]}, {100, kMacs[0], kIps[0]}}};
+   if ((bits & 0x80u) != 0) {
+      const uint8_t features = in.byte() & 0x7fu;
+      out.ipv6 = swsec::contract::Ipv6SecurityConfig{.features = features, .trusted = out.trusted, .ndRateLimit = 3,
+                                                     .errRateLimit = 1, .errRateLimitPeriod = 10};
+      for (const uint16_t vlan : {0, 100}) {
+         FhsBindingKey key{.vlanId = vlan, .mac = {}, .addr = {}};
+         std::copy(kMacs[0].begin(), kMacs[0].end(), key.mac);
+         std::copy(kIp6s[0].begin(), kIp6s[0].end(), key.addr);
+         out.ipv6->statics.push_back(key);
+      }
+   }
+   return out;
 }
 
 void put16(Bytes &out, uint16_t value)
 {
    out.insert(out.end(), {static_cast<uint8_t>(value >> 8), static_cast<uint8_t>(value)});
+}
+
+// An IPv6 packet from `src`: at most one extension header, then the upper layer.
+void ipv6(FuzzInput &in, Bytes &out, uint8_t choices, const std::array<uint8_t, 16> &src)
+{
+   const uint8_t shape = in.byte();
+   const bool overrun = (in.byte() & 1u) != 0;
+   const uint8_t first = kNextHeaders[shape & 7u];
+   const bool extension = first == 0 || first == 44 || first == 60 || first == 43;
+   const uint8_t upper = extension ? ((shape & 8u) != 0 ? 58 : 17) : first;
+   Bytes payload;
+   if (extension) {
+      // A fragment header: offset 0 (more to come) or a later fragment.
+      const uint8_t fragment = (shape & 0x10u) != 0 ? 0x08 : 0x01;
+      payload.insert(payload.end(), {upper, 0, first == 44 ? uint8_t{0} : uint8_t{1}, first == 44 ? fragment : uint8_t{4}, 0, 0, 0, 1});
+   }
+   if (upper == 58) {
+      const uint8_t type = kIcmp6Types[shape >> 5];
+      payload.insert(payload.end(), {type, 0, 0, 0, 0, 0, 0, 0});
+      if (type == 135 || type == 136) {
+         payload.insert(payload.end(), kIp6s[choices >> 6].begin(), kIp6s[choices >> 6].end());
+         payload.insert(payload.end(), {static_cast<uint8_t>(type == 135 ? 1 : 2), 1});
+         payload.insert(payload.end(), kMacs[choices & 3u].begin(), kMacs[choices & 3u].end());
+      }
+   } else if (upper == 17 || upper == 6) {
+      put16(payload, kPorts6[(choices >> 6) & 3u]);
+      put16(payload, kPorts6[(choices >> 2) & 3u]);
+      payload.resize(payload.size() + (upper == 17 ? 4 : 16), 0);
+      if (upper == 17) {
+         payload.push_back(static_cast<uint8_t>(1 + (choices & 0x0fu)));   // a DHCPv6 message type
+      }
+   }
+   put16(out, 0x86dd);
+   out.insert(out.end(), {0x60, 0, 0, 0});
+   put16(out, static_cast<uint16_t>(payload.size() + (overrun ? 64 : 0)));
+   out.insert(out.end(), {first, 255});
+   out.insert(out.end(), src.begin(), src.end());
+   const std::array<uint8_t, 16> to = {0xff, 0x02, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 1};
+   out.insert(out.end(), to.begin(), to.end());
+   out.insert(out.end(), payload.begin(), payload.end());
 }
 
 Bytes frame(FuzzInput &in, uint32_t &direction)
@@ -79,15 +149,15 @@ Bytes frame(FuzzInput &in, uint32_t &direction)
       out.insert(out.end(), kIps[choices >> 6].begin(), kIps[choices >> 6].end());
       break;
    case 4:
-      put16(out, 0x86dd);
-      out.insert(out.end(), {0x60, 0, 0, 0, 0, 16, static_cast<uint8_t>(in.byte() & 0x11u), 64});
-      out.resize(out.size() + 32, 0xfe);
+      ipv6(in, out, choices, kIp6s[(choices >> 4) & 3u]);
       break;
    default:
       put16(out, in.u16());
    }
-   put16(out, kPorts[(choices >> 6) & 3u]);
-   put16(out, kPorts[(choices >> 4) & 3u]);
+   if ((shape >> 5) != 4) {
+      put16(out, kPorts[(choices >> 6) & 3u]);
+      put16(out, kPorts[(choices >> 4) & 3u]);
+   }
    out.resize(std::max<size_t>(out.size(), 60), 0);
    if (cut >= 14 && cut < out.size()) {
       out.resize(cut);
@@ -105,7 +175,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size)
    FuzzInput in(data, size);
    // Each input configures the ports anew (counters, limiters and the
    // error state restart; learned bindings stay as the module keeps them).
-   if (!twin->configure(configRecord(in.byte()))) {
+   if (!twin->configure(config(in))) {
       return 0;   // a configuration the module refuses changes nothing
    }
    for (int frames = 0; frames < 64 && in.remaining() != 0; ++frames) {

@@ -42,7 +42,7 @@ TEST(FastPathOrder, a_binding_from_a_dhcp_ack_is_in_the_map_when_the_ack_goes_on
       ASSERT_EQ(program.testRun(frames[i], direction).action, TC_ACT_STOLEN) << "frame " << i + 1;
       std::vector<fastpath::Punt> punts;
       program.drainPunts([&punts](fastpath::Punt &&punt) { punts.push_back(std::move(punt)); });
-      live::judgePunts(session.host().sifra(), filter, feed, punts, counters, [&](fastpath::Punt &) {
+      live::judgePunts(session, filter, feed, punts, counters, [&](fastpath::Punt &) {
          ++handedOn;
          if (i == 3) {
             EXPECT_EQ(program.testRun(frames[6], SWSEC_FP_DIR_FROM_VM).action, TC_ACT_OK) << "as the ACK goes on";

@@ -32,8 +32,10 @@ std::vector<Case> allCases()
             cases.emplace_back(entry, file.path());
          }
       }
-      // Every capture, and the stacked tags above all, under a frame guard with an ethertype list.
+      // Every capture, and the stacked tags above all, under a frame guard with an ethertype list;
+      // the IPv6 agent alone, the IPv4 agent's features off.
       cases.emplace_back(entry, kSource / "tests/fastpath/frame-guard.json");
+      cases.emplace_back(entry, kSource / "tests/fastpath/ipv6-only.json");
    }
    return cases;
 }
@@ -47,7 +49,7 @@ TEST_P(OneVerdict, the_fast_path_and_the_module_alone_agree_on_every_frame)
    }
    Twin twin(host(), 1);
    const auto &[entry, config] = GetParam();
-   ASSERT_TRUE(twin.configure(session::configRecord(session::loadConfigFile(config))));
+   ASSERT_TRUE(twin.configure(session::loadConfigFile(config)));
    replay::CaptureReader capture(kSource / "tests/data" / entry["file"].get<std::string>());
    replay::CaptureFrame frame;
    // The port is configured half a second before the first frame, as replay does.

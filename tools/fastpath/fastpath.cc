@@ -5,6 +5,7 @@
 #include <linux/pkt_cls.h>
 #include <sys/stat.h>
 #include <sys/statfs.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
@@ -19,7 +20,7 @@ namespace swsec::fastpath {
 namespace {
 
 constexpr long kBpfFsMagic = 0xcafe4a11;
-constexpr const char *kPinnedMaps[] = {"swsec_port", "swsec_bindings", "swsec_counters", "swsec_punts"};
+constexpr const char *kPinnedMaps[] = {"swsec_port", "swsec_bindings", "swsec_bindings6", "swsec_counters", "swsec_punts"};
 
 #define SWSEC_FP_REASON_NAME(name, text) text,
 constexpr std::string_view kReasonNames[] = {SWSEC_FP_REASON_LIST(SWSEC_FP_REASON_NAME)};
@@ -51,6 +52,22 @@ swsec_fp_binding_key keyOf(const Binding &binding)
    std::memcpy(key.mac, binding.mac.data(), sizeof key.mac);
    key.ip = binding.ip;
    return key;
+}
+
+swsec_fp_binding6_key keyOf(const Binding6 &binding)
+{
+   swsec_fp_binding6_key key{};
+   key.vlan = binding.vlan;
+   std::memcpy(key.mac, binding.mac.data(), sizeof key.mac);
+   std::memcpy(key.addr, binding.addr.data(), sizeof key.addr);
+   return key;
+}
+
+// The punts a second a VM may cause for a module's rate limit (0: none, no budget).
+uint32_t puntBudget(uint32_t rateLimit)
+{
+   const uint64_t punts = std::max<uint64_t>(SWSEC_FP_ARP_PUNT_FLOOR, uint64_t{rateLimit} * SWSEC_FP_ARP_PUNT_FACTOR);
+   return rateLimit == 0 ? 0 : static_cast<uint32_t>(std::min<uint64_t>(punts, UINT32_MAX));
 }
 
 void makePinDir(const std::string &dir)
@@ -164,6 +181,12 @@ uint64_t Counters::punted() const
    return sum;
 }
 
+uint64_t Counters::dropped() const
+{
+   return frames[SWSEC_FP_DROP_IP_SOURCE_GUARD] + frames[SWSEC_FP_DROP_ARP_BUDGET] + frames[SWSEC_FP_DROP_ETHER_TYPE] +
+          frames[SWSEC_FP_DROP_IPV6_SOURCE_GUARD] + frames[SWSEC_FP_DROP_ND_BUDGET];
+}
+
 std::string_view reasonName(uint32_t reason)
 {
    return reason < SWSEC_FP_REASON_COUNT ? kReasonNames[reason] : "unknown";
@@ -199,7 +222,9 @@ std::optional<std::string> unavailable()
    try {
       const Program probe(Program::Options{});
    } catch (const Error &error) {
-      if (error.error() == EPERM || error.error() == EACCES || error.error() == ENOSYS || error.error() == EOPNOTSUPP) {
+      // EACCES is also the verifier's refusal of the program: for root that is a fault, not a missing privilege.
+      const bool denied = error.error() == EPERM || (error.error() == EACCES && geteuid() != 0);
+      if (denied || error.error() == ENOSYS || error.error() == EOPNOTSUPP) {
          return error.what();
       }
       throw;
@@ -321,9 +346,10 @@ void Program::describe(const PortDescription &description)
    if (description.etherTypes.size() > SWSEC_FP_MAX_ETHER_TYPES) {
       throw Error("a list of " + std::to_string(description.etherTypes.size()) + " ethertypes", E2BIG);
    }
-   if (description.bindings.size() > SWSEC_FP_MAX_BINDINGS) {
-      throw Error("a port of " + std::to_string(description.bindings.size()) + " bindings (at most " +
-                     std::to_string(SWSEC_FP_MAX_BINDINGS) + ")",
+   if (description.bindings.size() > SWSEC_FP_MAX_BINDINGS || description.bindings6.size() > SWSEC_FP_MAX_BINDINGS6) {
+      throw Error("a port of " + std::to_string(description.bindings.size()) + " IPv4 and " +
+                     std::to_string(description.bindings6.size()) + " IPv6 bindings (at most " +
+                     std::to_string(SWSEC_FP_MAX_BINDINGS) + " and " + std::to_string(SWSEC_FP_MAX_BINDINGS6) + ")",
                   E2BIG);
    }
    // Not ready while the bindings change, so that no frame is judged on a half-filled map.
@@ -335,7 +361,15 @@ void Program::describe(const PortDescription &description)
       check(bpf_map_delete_elem(fd, &key), "cannot remove a binding");
    }
    for (const Binding &binding : description.bindings) {
-      apply({.added = true, .binding = binding});
+      apply({.added = true, .binding = binding, .ipv6 = std::nullopt});
+   }
+   const int fd6 = mapFd("swsec_bindings6");
+   for (const Binding6 &binding : bindings6()) {
+      const swsec_fp_binding6_key key = keyOf(binding);
+      check(bpf_map_delete_elem(fd6, &key), "cannot remove an IPv6 binding");
+   }
+   for (const Binding6 &binding : description.bindings6) {
+      apply({.added = true, .binding = {}, .ipv6 = binding});
    }
    swsec_fp_port value{};
    value.features = description.features;
@@ -343,10 +377,13 @@ void Program::describe(const PortDescription &description)
    value.vm_ifindex = before.vm_ifindex;
    value.num_ether_types = static_cast<uint32_t>(description.etherTypes.size());
    std::copy(description.etherTypes.begin(), description.etherTypes.end(), value.ether_types);
-   const uint64_t punts = std::max<uint64_t>(SWSEC_FP_ARP_PUNT_FLOOR, uint64_t{description.arpRateLimit} * SWSEC_FP_ARP_PUNT_FACTOR);
-   value.arp_punts = description.arpRateLimit == 0 ? 0 : static_cast<uint32_t>(std::min<uint64_t>(punts, UINT32_MAX));
+   value.arp_punts = puntBudget(description.arpRateLimit);
+   value.fhs_features = description.ipv6Features;
+   value.nd_punts = description.ipv6Trusted ? 0 : puntBudget(description.ndRateLimit);
    value.flags = (before.flags & SWSEC_FP_PORT_OWN_QDISC) | SWSEC_FP_PORT_READY | (description.trusted ? SWSEC_FP_PORT_TRUSTED : 0u) |
-                 (description.errorState ? SWSEC_FP_PORT_ERR_STATE : 0u);
+                 (description.errorState ? SWSEC_FP_PORT_ERR_STATE : 0u) |
+                 (description.ipv6Trusted ? SWSEC_FP_PORT_FHS_TRUSTED : 0u) |
+                 (description.ndErrorState ? SWSEC_FP_PORT_ND_ERR_STATE : 0u);
    const uint32_t zero = 0;
    check(bpf_map_update_elem(mapFd("swsec_port"), &zero, &value, BPF_ANY), "cannot write the port map");
 }
@@ -359,16 +396,37 @@ void Program::setNotReady()
    check(bpf_map_update_elem(mapFd("swsec_port"), &zero, &value, BPF_ANY), "cannot write the port map");
 }
 
-void Program::setErrorState(bool on)
+void Program::setErrorState(bool on, bool nd)
 {
    swsec_fp_port value = port();
-   value.flags = on ? (value.flags | SWSEC_FP_PORT_ERR_STATE) : (value.flags & ~SWSEC_FP_PORT_ERR_STATE);
+   const uint32_t flags = (value.flags & ~(SWSEC_FP_PORT_ERR_STATE | SWSEC_FP_PORT_ND_ERR_STATE)) |
+                          (on ? SWSEC_FP_PORT_ERR_STATE : 0u) | (nd ? SWSEC_FP_PORT_ND_ERR_STATE : 0u);
+   if (flags == value.flags) {
+      return;
+   }
+   value.flags = flags;
    const uint32_t zero = 0;
    check(bpf_map_update_elem(mapFd("swsec_port"), &zero, &value, BPF_ANY), "cannot write the port map");
 }
 
 void Program::apply(const BindingChange &change)
 {
+   if (change.ipv6) {
+      const swsec_fp_binding6_key key = keyOf(*change.ipv6);
+      const int fd = mapFd("swsec_bindings6");
+      if (change.added) {
+         // refresh_ns 0: the VM's next frame from it is punted, then one in SWSEC_FP_FCFS_REFRESH_NS.
+         swsec_fp_binding6 value{};
+         value.fcfs = change.ipv6->fcfs ? 1 : 0;
+         check(bpf_map_update_elem(fd, &key, &value, BPF_ANY), "cannot add an IPv6 binding");
+         return;
+      }
+      const int result = bpf_map_delete_elem(fd, &key);
+      if (result != -ENOENT) {
+         check(result, "cannot remove an IPv6 binding");
+      }
+      return;
+   }
    const swsec_fp_binding_key key = keyOf(change.binding);
    const int fd = mapFd("swsec_bindings");
    if (change.added) {
@@ -399,6 +457,29 @@ std::vector<Binding> Program::bindings() const
          std::memcpy(binding.mac.data(), next.mac, sizeof next.mac);
          binding.ip = next.ip;
          binding.authoritative = value.authoritative != 0;
+         out.push_back(binding);
+      }
+      key = next;
+      previous = &key;
+   }
+   return out;
+}
+
+std::vector<Binding6> Program::bindings6() const
+{
+   const int fd = mapFd("swsec_bindings6");
+   std::vector<Binding6> out;
+   swsec_fp_binding6_key key{};
+   swsec_fp_binding6_key next{};
+   const void *previous = nullptr;
+   for (int guard = 0; guard <= SWSEC_FP_MAX_BINDINGS6 && bpf_map_get_next_key(fd, previous, &next) == 0; ++guard) {
+      swsec_fp_binding6 value{};
+      if (bpf_map_lookup_elem(fd, &next, &value) == 0) {
+         Binding6 binding;
+         binding.vlan = next.vlan;
+         std::memcpy(binding.mac.data(), next.mac, sizeof next.mac);
+         std::memcpy(binding.addr.data(), next.addr, sizeof next.addr);
+         binding.fcfs = value.fcfs != 0;
          out.push_back(binding);
       }
       key = next;

@@ -57,6 +57,15 @@ struct Binding {
    auto operator<=>(const Binding &) const = default;
 };
 
+// An IPv6 binding of the IPv6 agent.
+struct Binding6 {
+   uint16_t vlan = 0;
+   std::array<uint8_t, 6> mac{};
+   std::array<uint8_t, 16> addr{};   // network order
+   bool fcfs = false;            // first come, first served: renewed by the VM's traffic
+   auto operator<=>(const Binding6 &) const = default;
+};
+
 // A port as the module has it, all the program needs of it.
 struct PortDescription {
    uint32_t portId = 0;
@@ -66,11 +75,18 @@ struct PortDescription {
    uint32_t arpRateLimit = 0;    // ARP frames a second; 0: none
    std::vector<uint16_t> etherTypes;   // the frame guard's list; empty: every ethertype
    std::vector<Binding> bindings;
+   // The IPv6 agent's part; features 0 where the port has no IPv6 agent.
+   uint32_t ipv6Features = 0;
+   bool ipv6Trusted = false;
+   bool ndErrorState = false;    // in the ND error state
+   uint32_t ndRateLimit = 0;     // ND frames a second it limits from the VM; 0: none
+   std::vector<Binding6> bindings6;
 };
 
 struct BindingChange {
    bool added = false;           // else removed
    Binding binding;
+   std::optional<Binding6> ipv6; // set: the change is of this IPv6 binding instead
 };
 
 // A frame the program handed to user space, with its outer tag taken off
@@ -92,6 +108,7 @@ struct Counters {
    std::array<uint64_t, SWSEC_FP_REASON_COUNT> frames{};
    uint64_t operator[](swsec_fp_reason reason) const { return frames[reason]; }
    uint64_t punted() const;
+   uint64_t dropped() const;   // all from the VM
 };
 std::string_view reasonName(uint32_t reason);
 
@@ -140,9 +157,11 @@ public:
    void describe(const PortDescription &port);
    // Marks the port not ready: every frame is punted.
    void setNotReady();
-   void setErrorState(bool on);
+   // The IPv4 agent's error-rate-limit state and the IPv6 agent's ND error state.
+   void setErrorState(bool on, bool nd);
    void apply(const BindingChange &change);
    std::vector<Binding> bindings() const;
+   std::vector<Binding6> bindings6() const;
    swsec_fp_port port() const;
 
    Counters counters() const;

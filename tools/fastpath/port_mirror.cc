@@ -1,6 +1,7 @@
 #include "port_mirror.h"
 
 #include "contract/config_record.h"
+#include "contract/fhs_binding.h"
 #include "contract/notification.h"
 
 #include <charconv>
@@ -28,6 +29,17 @@ constexpr size_t kEntryVlanOffset = kEntryOffset + offsetof(SwSecPortDbEntry, vl
 constexpr size_t kEntryMacOffset = kEntryOffset + offsetof(SwSecPortDbEntry, macAddr);
 constexpr size_t kEntryIpOffset = kEntryOffset + offsetof(SwSecPortDbEntry, ipAddr);
 constexpr size_t kEntryAuthoritativeOffset = kEntryOffset + offsetof(SwSecPortDbEntry, authoritative);
+
+// The IPv6 agent: its name, its security property and the binding queries it exports.
+constexpr std::string_view kIpv6Agent = "sifra-generic-tarlin-fhs";
+constexpr std::string_view kIpv6SecurityProperty = "sifra-generic-tarlin-fhs.security";
+constexpr std::string_view kExportNamespace = "switchSecurity#1.0";
+
+static_assert(SWSEC_FP_FHS_SOURCE_GUARD == FhsFeatureSourceGuard);
+static_assert(sizeof(swsec_fp_binding6_key) == sizeof(FhsBindingKey));
+static_assert(offsetof(swsec_fp_binding6_key, mac) == offsetof(FhsBindingKey, mac));
+static_assert(offsetof(swsec_fp_binding6_key, addr) == offsetof(FhsBindingKey, addr));
+static_assert(SWSEC_FP_MAX_BINDINGS6 >= FHS_BINDING_LIMIT_MAX);
 
 std::string portPath(uint32_t portId)
 {
@@ -72,6 +84,75 @@ std::array<uint8_t, N> parseParts(std::string_view text, char separator, int bas
 
 }  // namespace
 
+std::optional<host::FilterId> ipv6FilterOf(host::Host &host, uint32_t portId)
+{
+   for (const host::FilterInfo &filter : host.sifra().filters()) {
+      if (filter.portID == portId && filter.agent == kIpv6Agent) {
+         return filter.id;
+      }
+   }
+   return std::nullopt;
+}
+
+bool readNdErrorState(host::Host &host, uint32_t portId, uint32_t ipv6Features, uint32_t ndRateLimit)
+{
+   if ((ipv6Features & FhsFeatureNdInspection) == 0 || ndRateLimit == 0) {
+      return false;
+   }
+   host::NexoRecord summary;
+   if (host.nexo().get("/ipv6/" + std::to_string(portId) + "/summary", &summary) != ORR_OK) {
+      throw std::runtime_error("cannot read the IPv6 summary of port " + std::to_string(portId));
+   }
+   return field(summary, "ndRateLimitErr") == "yes";
+}
+
+namespace {
+
+// The IPv6 agent's configuration and bindings of the port, by its security
+// property and its exported query; nothing where the port has no IPv6 agent.
+void readIpv6Part(host::Host &host, uint32_t portId, PortDescription &port)
+{
+   const std::optional<host::FilterId> filter = ipv6FilterOf(host, portId);
+   if (!filter) {
+      return;
+   }
+   const std::optional<uint32_t> length = host.sifra().pollProperty(kIpv6SecurityProperty, *filter);
+   std::vector<uint8_t> config(length.value_or(0));
+   if (config.size() < sizeof(FhsConfig) || host.sifra().readProperty(kIpv6SecurityProperty, *filter, config) != ORR_OK) {
+      throw std::runtime_error("cannot read the IPv6 configuration of port " + std::to_string(portId));
+   }
+   FhsConfig header{};
+   std::memcpy(&header, config.data(), sizeof header);
+   port.ipv6Features = header.featuresEnabled;
+   port.ipv6Trusted = header.trusted != 0;
+   port.ndRateLimit = (header.featuresEnabled & FhsFeatureNdInspection) != 0 ? header.ndRateLimit : 0;
+   port.ndErrorState = readNdErrorState(host, portId, port.ipv6Features, port.ndRateLimit);
+
+   using GetEntries = orr_Status (*)(uint32_t, uint32_t, void **, uint32_t *, void **);
+   using ReleaseBuf = orr_Status (*)(void *);
+   const auto get = reinterpret_cast<GetEntries>(host.resolveExport(kExportNamespace, "Fhs_BindingsGetEntries"));
+   const auto release = reinterpret_cast<ReleaseBuf>(host.resolveExport(kExportNamespace, "Fhs_BindingsReleaseBuf"));
+   void *entries = nullptr;
+   void *buffer = nullptr;
+   uint32_t count = 0;
+   if (get == nullptr || release == nullptr || get(portId, FhsBindingsAll, &entries, &count, &buffer) != ORR_OK) {
+      throw std::runtime_error("cannot read the IPv6 bindings of port " + std::to_string(portId));
+   }
+   for (uint32_t i = 0; i < count; ++i) {
+      FhsBindingEntry entry{};
+      std::memcpy(&entry, static_cast<const uint8_t *>(entries) + i * sizeof entry, sizeof entry);
+      Binding6 binding{.vlan = entry.key.vlanId, .mac = {}, .addr = {}, .fcfs = entry.method == FhsBindFcfs};
+      std::memcpy(binding.mac.data(), entry.key.mac, binding.mac.size());
+      std::memcpy(binding.addr.data(), entry.key.addr, binding.addr.size());
+      port.bindings6.push_back(binding);
+   }
+   if (count != 0) {
+      (void)release(buffer);
+   }
+}
+
+}  // namespace
+
 bool readErrorState(host::Host &host, uint32_t portId, uint32_t features)
 {
    if ((features & SWSEC_FP_FEATURE_DAI) == 0) {
@@ -108,6 +189,7 @@ PortDescription readPort(host::Host &host, host::FilterId filter, uint32_t portI
       }
    }
    port.errorState = readErrorState(host, portId, port.features);
+   readIpv6Part(host, portId, port);
 
    std::vector<int64_t> instances;
    const std::string vmiPath = portPath(portId) + "/vmi";
@@ -140,6 +222,17 @@ PortDescription readPort(host::Host &host, host::FilterId filter, uint32_t portI
 
 std::optional<BindingChange> bindingChange(const host::PostedMessage &message)
 {
+   if (message.name == FHS_MSG_ADDED || message.name == FHS_MSG_REMOVED) {
+      if (message.payload.size() < sizeof(FhsBindingMsgPayload)) {
+         return std::nullopt;
+      }
+      FhsBindingMsgPayload payload{};
+      std::memcpy(&payload, message.payload.data(), sizeof payload);
+      Binding6 binding{.vlan = payload.key.vlanId, .mac = {}, .addr = {}, .fcfs = payload.method == FhsBindFcfs};
+      std::memcpy(binding.mac.data(), payload.key.mac, binding.mac.size());
+      std::memcpy(binding.addr.data(), payload.key.addr, binding.addr.size());
+      return BindingChange{.added = message.name == FHS_MSG_ADDED, .binding = {}, .ipv6 = binding};
+   }
    if ((message.name != kAdded && message.name != kRemoved) || message.payload.size() < kNotificationLen) {
       return std::nullopt;
    }
@@ -162,6 +255,8 @@ void Mirror::start()
 {
    const PortDescription port = readPort(host_, filter_, portId_);
    features_ = port.features;
+   ipv6Features_ = port.ipv6Features;
+   ndRateLimit_ = port.ndRateLimit;
    program_.describe(port);
 }
 
@@ -174,7 +269,8 @@ void Mirror::follow(std::span<const host::PostedMessage> messages)
          }
       }
    }
-   program_.setErrorState(readErrorState(host_, portId_, features_));
+   program_.setErrorState(readErrorState(host_, portId_, features_),
+                          readNdErrorState(host_, portId_, ipv6Features_, ndRateLimit_));
 }
 
 }  // namespace swsec::fastpath

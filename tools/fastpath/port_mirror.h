@@ -1,7 +1,9 @@
 // What the kernel fast path mirrors of a port, read from the module through
 // the host facade as the daemon reads it: the configuration (security
 // property), the error-rate-limit state ("featureSummary") and the port
-// database ("vmi" nodes), then kept by the port database notifications.
+// database ("vmi" nodes); of the IPv6 agent, where the port has it, its
+// configuration (its security property), ND error state ("summary") and
+// bindings (its exported query). Then kept by both agents' notifications.
 #pragma once
 
 #include "fastpath.h"
@@ -21,7 +23,14 @@ PortDescription readPort(host::Host &host, host::FilterId filter, uint32_t portI
 // discovery has no summary to read).
 bool readErrorState(host::Host &host, uint32_t portId, uint32_t features);
 
-// A port database notification as a binding change; none for any other
+// Whether the port's IPv6 agent, whose features are `ipv6Features` and ND
+// rate limit `ndRateLimit`, is in its ND error state now.
+bool readNdErrorState(host::Host &host, uint32_t portId, uint32_t ipv6Features, uint32_t ndRateLimit);
+
+// The port's IPv6 agent's filter, where it has one.
+std::optional<host::FilterId> ipv6FilterOf(host::Host &host, uint32_t portId);
+
+// A port database notification, or the IPv6 agent's binding one, as a binding change; none for any other
 // message or one whose payload is not a whole entry.
 std::optional<BindingChange> bindingChange(const host::PostedMessage &message);
 
@@ -43,6 +52,8 @@ private:
    host::FilterId filter_;
    uint32_t portId_;
    uint32_t features_ = 0;
+   uint32_t ipv6Features_ = 0;
+   uint32_t ndRateLimit_ = 0;
 };
 
 }  // namespace swsec::fastpath

@@ -12,13 +12,14 @@
 # a duplicate-address claim of vm2's address, a flood of claims past the
 # port's binding limit. Everything is checked through `swsec ctl --json`.
 #
-#   dual_stack_e2e.sh SWSEC_BINARY
+#   dual_stack_e2e.sh SWSEC_BINARY [kernel|user]   (the data path, kernel by default)
 #
 # Exit 0 passed, 1 failed, 77 skipped (not root, or a tool or kernel
 # feature missing; the reason is printed). Every process started is stopped
 # by its PID, every namespace removed, also on failure.
 set -uo pipefail
 source "$(dirname "$0")/lib.sh" "$@"
+datapath=${2:-kernel}
 need ip dnsmasq dhclient ping scapy
 traffic="$here/ipv6_traffic.py"
 config=${SWSEC_E2E_CONFIG:-$examples/dual-stack.json}
@@ -79,6 +80,8 @@ state="$work/state"
 mkdir "$state"
 start_inline() { inline_start --bridge br0 --port vm1=vm1p --port vm2=vm2p --config "$config" --state-dir "$state"; }
 start_inline
+sw_ctl ports --json | json "all(p['datapath']=='$datapath' for p in d)" | grep -qx True \
+  || fail "not every port on the $datapath data path: $(sw_ctl ports --json)"
 ip -n "$vm1" link set eth0 up; ip -n "$vm2" link set eth0 up
 
 # ---------------------------------------------------------------- addresses
@@ -143,6 +146,9 @@ wait "$listen_pid"
 grep -qx "$vm1_ip6" "$work/udp.out" || fail "the VM's own datagram did not arrive: $(cat "$work/udp.out")"
 ! grep -qx 2001:db8:1::66 "$work/udp.out" || fail "the spoofed datagram arrived"
 [ "$(counter vm1 "['drops']['sourceGuardDropCnt']")" -ge 1 ] || fail "the spoofed source was not counted"
+if [ "$datapath" = kernel ]; then
+  [ "$(counter vm1 "['kernel']['IPv6 source guard']")" -ge 1 ] || fail "the spoofed source was not dropped in the kernel"
+fi
 
 # attack NAME COUNTER [ARG]: an attack from vm1, dropped, counted in COUNTER
 # (or, with "", dropped by the IPv4 agent before the IPv6 one sees it).

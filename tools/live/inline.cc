@@ -176,15 +176,6 @@ bool InlineDaemon::saveState(Port &port, host::FilterId filter)
    }
 }
 
-session::PortSecurityConfig InlineDaemon::checkedFor(const Port &port, session::PortSecurityConfig config)
-{
-   if (config.ipv6 && port.guarded->options().datapath == Datapath::kernel) {
-      throw session::InputError(config.origin + ": IPv6 keys need the user data path; port " + port.portSpec.name +
-                                " is on the kernel data path");
-   }
-   return config;
-}
-
 void InlineDaemon::startPort(Port &port)
 {
    port.datapathReason.clear();
@@ -202,15 +193,6 @@ void InlineDaemon::startPort(Port &port)
       restore = [this, &port](host::FilterId filter) { restoreState(port.portSpec, filter); };
    }
    const session::PortSecurityConfig config = configFor(port.portSpec);
-   if (config.ipv6 && options.datapath == Datapath::kernel) {
-      // The kernel program passes IPv6 on its own: only the user path hands it to the IPv6 agent.
-      if (options_.datapath) {
-         throw session::InputError(config.origin + ": IPv6 keys need the user data path (--datapath user)");
-      }
-      events_.log("info", "inline", port.portSpec.name + ": IPv6 keys: the port uses the user data path");
-      options.datapath = Datapath::user;
-      port.datapathReason = "IPv6 keys";
-   }
    const auto log = [this](const std::string &line) { events_.log("info", "inline", line); };
    port.guarded = std::make_unique<GuardedPort>(session_, options, log, nullptr);
    try {
@@ -570,7 +552,7 @@ void InlineDaemon::reload()
       }
       const std::string &name = port.portSpec.name;
       try {
-         session_.configure(port.guarded->filter(), checkedFor(port, configFor(port.portSpec)));
+         session_.configure(port.guarded->filter(), configFor(port.portSpec));
          configured(port);
          port.configSource = port.portSpec.configPath;
          events_.log("info", "inline", name + ": configuration re-read from " + port.portSpec.configPath);
@@ -701,8 +683,7 @@ nlohmann::json InlineDaemon::countersJson(Port &port)
       entry["kernel"] = byReason;
       frames["from-vm"]["passed"] = frames["from-vm"]["passed"].get<uint64_t>() + counts[SWSEC_FP_PASSED];
       frames["to-vm"]["passed"] = frames["to-vm"]["passed"].get<uint64_t>() + counts[SWSEC_FP_PASSED_TO_VM];
-      frames["from-vm"]["dropped"] = frames["from-vm"]["dropped"].get<uint64_t>() + counts[SWSEC_FP_DROP_IP_SOURCE_GUARD] +
-                                     counts[SWSEC_FP_DROP_ARP_BUDGET] + counts[SWSEC_FP_DROP_ETHER_TYPE];
+      frames["from-vm"]["dropped"] = frames["from-vm"]["dropped"].get<uint64_t>() + counts.dropped();
    }
    entry["frames"] = frames;
    entry["truncated"] = counters.truncated.load();
@@ -713,6 +694,9 @@ nlohmann::json InlineDaemon::countersJson(Port &port)
    }
    const session::PortState state = session_.readState(port.guarded->options().portID);
    entry["drops"] = state.counters;
+   if (state.ipv6) {
+      entry["drops"].update(state.ipv6->counters);
+   }
    if (kernel != nullptr) {
       for (const auto &[name, drops] : kernel->dropsSinceConfigured()) {
          if (entry["drops"].contains(name)) {
@@ -726,7 +710,6 @@ nlohmann::json InlineDaemon::countersJson(Port &port)
    }
    entry["bindings"] = methods;
    if (state.ipv6) {
-      entry["drops"].update(state.ipv6->counters);
       nlohmann::json ipv6 = {{"DHCPv6", 0}, {"Static", 0}, {"First come first served", 0}};
       for (const auto &binding : state.ipv6->bindings) {
          ipv6[binding.method] = ipv6.value(binding.method, 0) + 1;
@@ -763,8 +746,26 @@ nlohmann::json InlineDaemon::handle(const nlohmann::json &request)
    if (command == "summary") {
       Port &port = runningPort(request);
       const session::PortState state = session_.readState(port.guarded->options().portID);
-      const nlohmann::json ipv6 = session::ipv6Json(state);
-      const std::string ipv6Text = state.ipv6 ? "\n" + session::ipv6Text(*state.ipv6) : "";
+      nlohmann::json ipv6 = session::ipv6Json(state);
+      std::string ipv6Text = state.ipv6 ? "\n" + session::ipv6Text(*state.ipv6) : "";
+      KernelPath *kernel = port.guarded->kernel();
+      const std::map<std::string, uint64_t> inKernel = kernel ? kernel->dropsSinceConfigured() : std::map<std::string, uint64_t>{};
+      // The module's summaries with the program's drops added.
+      const auto addKernelDrops = [&inKernel](nlohmann::json &fields) {
+         uint64_t added = 0;
+         for (const auto &[name, drops] : inKernel) {
+            if (fields.is_object() && fields.contains(name) && fields[name].is_number()) {
+               fields[name] = fields[name].get<uint64_t>() + drops;
+               added += drops;
+            }
+         }
+         return added;
+      };
+      if (!ipv6.is_null()) {
+         if (const uint64_t added = addKernelDrops(ipv6["summary"]); kernel != nullptr) {
+            ipv6Text += "IPv6 drops made in the kernel, not in the counts above: " + std::to_string(added) + "\n";
+         }
+      }
       if (!state.featureSummary) {
          return {{"port", port.portSpec.name},
                  {"fields", nullptr},
@@ -773,16 +774,9 @@ nlohmann::json InlineDaemon::handle(const nlohmann::json &request)
       }
       nlohmann::json fields = session::featureSummaryJson(state);
       std::string text = state.featureSummaryText;
-      if (KernelPath *kernel = port.guarded->kernel()) {
-         // The module's summary with the program's drops added.
-         uint64_t inKernel = 0;
-         for (const auto &[name, drops] : kernel->dropsSinceConfigured()) {
-            if (fields.contains(name) && fields[name].is_number()) {
-               fields[name] = fields[name].get<uint64_t>() + drops;
-            }
-            inKernel += drops;
-         }
-         text += "Data path: kernel (" + std::to_string(inKernel) + " of the drops above made in the kernel)\n";
+      if (kernel != nullptr) {
+         const uint64_t added = addKernelDrops(fields);
+         text += "Data path: kernel (" + std::to_string(added) + " of the drops above made in the kernel)\n";
       } else {
          text += "Data path: user\n";
       }
@@ -826,7 +820,7 @@ nlohmann::json InlineDaemon::handle(const nlohmann::json &request)
       const std::string text = requiredString(request, "text");
       const std::string origin = request.value("origin", std::string("(control request)"));
       try {
-         session_.configure(port.guarded->filter(), checkedFor(port, session::parseConfig(text, origin)));
+         session_.configure(port.guarded->filter(), session::parseConfig(text, origin));
          configured(port);
       } catch (const session::InputError &e) {
          throw CtlError(e.what());

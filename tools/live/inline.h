@@ -140,9 +140,6 @@ private:
    nlohmann::json bindingsJson(const Port &port);
    nlohmann::json countersJson(Port &port);
    session::PortSecurityConfig configFor(const PortSpec &portSpec);
-   // `config`, refused (InputError) when it has IPv6 keys and the port is on
-   // the kernel data path, which does not hand IPv6 to the module.
-   session::PortSecurityConfig checkedFor(const Port &port, session::PortSecurityConfig config);
    std::string statePath(const PortSpec &portSpec) const;
    void restoreState(const PortSpec &portSpec, host::FilterId filter);
    // Restores one state file into the filter `filterOf` gives, aged by the time since its save.

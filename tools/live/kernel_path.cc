@@ -68,24 +68,46 @@ uint16_t fold(uint32_t sum)
 // A frame the sending stack left for the device to checksum (its TCP or UDP
 // checksum field holds the pseudo-header's sum alone) would reach the VM
 // with a wrong checksum once copied out: its checksum is completed, as the
-// device would have. Any other frame is left as it is.
+// device would have. IPv4 without fragments, and IPv6 with its upper-layer
+// header right after the fixed one; any other frame is left as it is.
 void completeChecksum(std::vector<uint8_t> &frame)
 {
    constexpr size_t l3 = 14;
-   if (frame.size() < l3 + 20 || frame[12] != 0x08 || frame[13] != 0x00 || (frame[l3] >> 4) != 4) {
+   if (frame.size() < l3 + 20) {
       return;
    }
-   const size_t headerLen = static_cast<size_t>(frame[l3] & 0x0f) * 4;
-   const size_t totalLen = static_cast<size_t>(frame[l3 + 2] << 8 | frame[l3 + 3]);
-   const uint8_t protocol = frame[l3 + 9];
-   const bool fragment = (frame[l3 + 6] & 0x3f) != 0 || frame[l3 + 7] != 0;
+   const uint16_t etherType = static_cast<uint16_t>(frame[12] << 8 | frame[13]);
+   size_t l4 = 0;
+   size_t l4Len = 0;
+   uint8_t protocol = 0;
+   uint32_t pseudo = 0;
+   if (etherType == 0x0800 && (frame[l3] >> 4) == 4) {
+      const size_t headerLen = static_cast<size_t>(frame[l3] & 0x0f) * 4;
+      const size_t totalLen = static_cast<size_t>(frame[l3 + 2] << 8 | frame[l3 + 3]);
+      const bool fragment = (frame[l3 + 6] & 0x3f) != 0 || frame[l3 + 7] != 0;
+      if (fragment || headerLen < 20 || totalLen < headerLen || l3 + totalLen > frame.size()) {
+         return;
+      }
+      protocol = frame[l3 + 9];
+      l4 = l3 + headerLen;
+      l4Len = totalLen - headerLen;
+      pseudo = addWords(std::span(frame).subspan(l3 + 12, 8), 0);
+   } else if (etherType == 0x86dd && frame.size() >= l3 + 40 && (frame[l3] >> 4) == 6) {
+      l4Len = static_cast<size_t>(frame[l3 + 4] << 8 | frame[l3 + 5]);
+      if (l3 + 40 + l4Len > frame.size()) {
+         return;
+      }
+      protocol = frame[l3 + 6];
+      l4 = l3 + 40;
+      pseudo = addWords(std::span(frame).subspan(l3 + 8, 32), 0);
+   } else {
+      return;
+   }
    const size_t checkAt = protocol == 6 ? 16 : protocol == 17 ? 6 : 0;
-   if (checkAt == 0 || fragment || headerLen < 20 || totalLen < headerLen + checkAt + 2 || l3 + totalLen > frame.size()) {
+   if (checkAt == 0 || l4Len < checkAt + 2) {
       return;
    }
-   const size_t l4 = l3 + headerLen;
-   const size_t l4Len = totalLen - headerLen;
-   uint32_t pseudo = addWords(std::span(frame).subspan(l3 + 12, 8), 0) + protocol + static_cast<uint32_t>(l4Len);
+   pseudo += protocol + static_cast<uint32_t>(l4Len);
    const uint16_t field = static_cast<uint16_t>(frame[l4 + checkAt] << 8 | frame[l4 + checkAt + 1]);
    if (field != fold(pseudo)) {
       return;
@@ -236,7 +258,9 @@ std::map<std::string, uint64_t> KernelPath::dropsSinceConfigured() const
    std::lock_guard guard(baseMutex_);
    return {{"ipSrcGuardDropCnt", now[SWSEC_FP_DROP_IP_SOURCE_GUARD] - base_[SWSEC_FP_DROP_IP_SOURCE_GUARD]},
            {"txRateLimitDropCnt", now[SWSEC_FP_DROP_ARP_BUDGET] - base_[SWSEC_FP_DROP_ARP_BUDGET]},
-           {"etherTypeDropCnt", now[SWSEC_FP_DROP_ETHER_TYPE] - base_[SWSEC_FP_DROP_ETHER_TYPE]}};
+           {"etherTypeDropCnt", now[SWSEC_FP_DROP_ETHER_TYPE] - base_[SWSEC_FP_DROP_ETHER_TYPE]},
+           {"sourceGuardDropCnt", now[SWSEC_FP_DROP_IPV6_SOURCE_GUARD] - base_[SWSEC_FP_DROP_IPV6_SOURCE_GUARD]},
+           {"ndRateLimitDropCnt", now[SWSEC_FP_DROP_ND_BUDGET] - base_[SWSEC_FP_DROP_ND_BUDGET]}};
 }
 
 void KernelPath::inject(fastpath::Punt &punt)
@@ -263,7 +287,7 @@ void KernelPath::inject(fastpath::Punt &punt)
    (void)sendto(sockets_[punt.direction], bytes.data(), bytes.size(), 0, reinterpret_cast<sockaddr *>(&to), sizeof to);
 }
 
-void judgePunts(host::Sifra &sifra, host::FilterId filter, PostedFeed &feed, std::span<fastpath::Punt> punts,
+void judgePunts(session::ModuleSession &session, host::FilterId filter, PostedFeed &feed, std::span<fastpath::Punt> punts,
                 PortCounters &counters, const std::function<void(fastpath::Punt &)> &pass)
 {
    std::vector<fastpath::Punt *> passed;
@@ -275,7 +299,7 @@ void judgePunts(host::Sifra &sifra, host::FilterId filter, PostedFeed &feed, std
       // A runt is judged and goes on padded, as on the user path.
       punt.bytes.resize(host::switchPaddedLength(punt.bytes.size()), 0);
       const host::FrameView view{.bytes = punt.bytes, .vlanId = punt.vlan};
-      const bool kept = sifra.processPackets(filter, punt.direction, std::span(&view, 1)).kept.size() == 1;
+      const bool kept = session.judge(filter, punt.direction, std::span(&view, 1)).kept.size() == 1;
       (kept ? counters.passed : counters.dropped)[punt.direction].fetch_add(1, std::memory_order_relaxed);
       if (kept) {
          passed.push_back(&punt);
@@ -294,7 +318,6 @@ void judgePunts(host::Sifra &sifra, host::FilterId filter, PostedFeed &feed, std
 void KernelPath::run(int stopEvent, PortCounters &counters, const std::function<void(const std::string &)> &vanish)
 {
    std::vector<fastpath::Punt> punts;
-   host::Sifra &sifra = session_.host().sifra();
    for (;;) {
       pollfd fds[2] = {{program_->puntFd(), POLLIN, 0}, {stopEvent, POLLIN, 0}};
       if (poll(fds, 2, kLivenessMs) < 0 && errno != EINTR) {
@@ -311,7 +334,7 @@ void KernelPath::run(int stopEvent, PortCounters &counters, const std::function<
       }
       punts.clear();
       program_->drainPunts([&punts](fastpath::Punt &&punt) { punts.push_back(std::move(punt)); });
-      judgePunts(sifra, filter_, feed_, punts, counters, [this](fastpath::Punt &punt) { inject(punt); });
+      judgePunts(session_, filter_, feed_, punts, counters, [this](fastpath::Punt &punt) { inject(punt); });
    }
 }
 

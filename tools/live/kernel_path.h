@@ -51,10 +51,10 @@ private:
    std::vector<host::PostedMessage> kept_;
 };
 
-// Judges punted frames with the module's port `filter`, brings every mirror
-// of `feed` up to date with what they taught it, and only then hands each
-// passed frame to `pass`, in order.
-void judgePunts(host::Sifra &sifra, host::FilterId filter, PostedFeed &feed, std::span<fastpath::Punt> punts,
+// Judges punted frames with the module's port `filter` (both agents, where
+// it has the IPv6 agent), brings every mirror of `feed` up to date with what
+// they taught it, and only then hands each passed frame to `pass`, in order.
+void judgePunts(session::ModuleSession &session, host::FilterId filter, PostedFeed &feed, std::span<fastpath::Punt> punts,
                 PortCounters &counters, const std::function<void(fastpath::Punt &)> &pass);
 
 class KernelPath {
@@ -92,7 +92,8 @@ public:
    // drops counted so far are no longer to be added to them.
    void configured();
    // The program's drops since then, by the module's drop counter they add
-   // to (IP source guard; ARP over the punt budget to the rate limit's).
+   // to (IP source guard of either agent; ARP and ND over their punt
+   // budgets to their rate limits'; the ethertype list).
    std::map<std::string, uint64_t> dropsSinceConfigured() const;
 
 private:
@@ -117,8 +118,8 @@ private:
 // interface (its hooks at the kernel path's priority); true when it did.
 bool removeLeftoverProgram(int vmIfindex);
 
-// Completes the TCP or UDP checksum of an IPv4 frame whose checksum field
-// holds the pseudo-header's sum alone (its stack left the rest to the device).
+// Completes the TCP or UDP checksum of an IPv4 or IPv6 frame whose checksum
+// field holds the pseudo-header's sum alone (its stack left the rest to the device).
 void completeChecksum(std::vector<uint8_t> &frame);
 
 // Mounts a BPF file system on /sys/fs/bpf when none is there; true when it did.

@@ -57,7 +57,7 @@ swsec::session::PortSecurityConfig config(FuzzInput &in)
       const uint8_t features = in.byte() & 0x7fu;
       out.ipv6 = swsec::contract::Ipv6SecurityConfig{.features = features, .trusted = out.trusted, .ndRateLimit = 3,
                                                      .errRateLimit = 1, .errRateLimitPeriod = 10};
-      for (const uint16_t vlan : {0, 100}) {
+      for (const uint16_t vlan : {uint16_t{0}, uint16_t{100}}) {
          FhsBindingKey key{.vlanId = vlan, .mac = {}, .addr = {}};
          std::copy(kMacs[0].begin(), kMacs[0].end(), key.mac);
          std::copy(kIp6s[0].begin(), kIp6s[0].end(), key.addr);

@@ -1,5 +1,6 @@
 // swsec-fastpath-cost: what the kernel fast path program costs a frame on
-// the IPv4 common path of an enforcing port, by BPF_PROG_TEST_RUN's mean
+// the IPv4 and IPv6 common paths of a port enforcing every feature of both
+// agents (as examples/dual-stack.json), by BPF_PROG_TEST_RUN's mean
 // over many runs and by the kernel's BPF statistics (run time over run
 // count, switched on only for their own runs). Needs root.
 //
@@ -11,6 +12,7 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <array>
 #include <cstdio>
 #include <cstring>
 #include <string>
@@ -20,6 +22,7 @@
 namespace {
 
 using swsec::fastpath::Binding;
+using swsec::fastpath::Binding6;
 using swsec::fastpath::Program;
 
 // An IPv4/UDP frame of 60 bytes from 02:00:5e:c0:00:01, 192.0.2.<host>, to port 53.
@@ -29,6 +32,21 @@ std::vector<uint8_t> udpFrame(uint8_t host)
                                  0x45, 0x00, 0x00, 0x2e, 0x00, 0x01, 0x00, 0x00, 0x40, 0x11, 0x00, 0x00, 192,  0,
                                  2,    host, 192,  0,    2,    1,    0x04, 0x00, 0x00, 0x35, 0x00, 0x1a, 0x00, 0x00};
    frame.resize(60, 0);
+   return frame;
+}
+
+// An IPv6/UDP frame of 66 bytes from 02:00:5e:c0:00:01, 2001:db8::<host>, to port 53.
+std::vector<uint8_t> udp6Frame(uint8_t host)
+{
+   std::vector<uint8_t> frame = {0x02, 0x00, 0x5e, 0xc0, 0x00, 0xfe, 0x02, 0x00, 0x5e, 0xc0, 0x00, 0x01, 0x86, 0xdd,
+                                 0x60, 0x00, 0x00, 0x00, 0x00, 0x0c, 0x11, 0x40};
+   const std::array<uint8_t, 16> source = {0x20, 0x01, 0x0d, 0xb8, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, host};
+   std::array<uint8_t, 16> destination = source;
+   destination[15] = 1;
+   frame.insert(frame.end(), source.begin(), source.end());
+   frame.insert(frame.end(), destination.begin(), destination.end());
+   frame.insert(frame.end(), {0x04, 0x00, 0x00, 0x35, 0x00, 0x0c, 0x00, 0x00});
+   frame.resize(66, 0);
    return frame;
 }
 
@@ -90,18 +108,25 @@ int main(int argc, char **argv)
       for (const uint32_t count : {1u, 16u, 32u}) {
          swsec::fastpath::PortDescription port;
          port.portId = 1;
-         port.features = 0x1f;   // every feature, untrusted
+         port.features = 0x1f;       // every feature of each agent, untrusted
+         port.ipv6Features = 0x7f;
+         port.ndRateLimit = 10;
          for (uint32_t n = 0; n < count; ++n) {
-            // The VM's own address first, then others of its MAC.
+            // The VM's own address first, then others of its MAC; of each family.
             Binding binding;
             binding.mac = {0x02, 0x00, 0x5e, 0xc0, 0x00, 0x01};
             binding.ip = 0x6502'00c0u + (n << 24);   // 192.0.2.101 + n, network order
             binding.authoritative = true;
             port.bindings.push_back(binding);
+            Binding6 binding6;
+            binding6.mac = binding.mac;
+            binding6.addr = {0x20, 0x01, 0x0d, 0xb8, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, static_cast<uint8_t>(101 + n)};
+            port.bindings6.push_back(binding6);   // learned by DHCPv6: no refresh punts
          }
          program.describe(port);
-         for (const auto &[name, host] : {std::pair{"bound", uint8_t{101}}, std::pair{"spoofed", uint8_t{66}}}) {
-            const Figures figures = measure(program, udpFrame(host), runs);
+         for (const auto &[name, frame] : {std::pair{"bound", udpFrame(101)}, std::pair{"spoofed", udpFrame(66)},
+                                           std::pair{"bound6", udp6Frame(101)}, std::pair{"spoofed6", udp6Frame(66)}}) {
+            const Figures figures = measure(program, frame, runs);
             if (json) {
                out += std::string(out.empty() ? "" : ",") + "{\"bindings\":" + std::to_string(count) +
                       ",\"frame\":\"" + name + "\",\"testRunNs\":" + std::to_string(figures.testRunNs) +

@@ -86,6 +86,26 @@ void makePinDir(const std::string &dir)
    }
 }
 
+// A map pinned by a run of an older program whose layout differs (a killed
+// run before an upgrade) cannot be reused: it is unpinned, and the program
+// it served keeps it until the new one replaces that on the hooks.
+void dropStalePin(const bpf_map *map, const std::string &path)
+{
+   const int fd = bpf_obj_get(path.c_str());
+   if (fd < 0) {
+      return;   // none pinned there
+   }
+   bpf_map_info info{};
+   uint32_t length = sizeof info;
+   const bool same = bpf_obj_get_info_by_fd(fd, &info, &length) == 0 && info.type == bpf_map__type(map) &&
+                     info.key_size == bpf_map__key_size(map) && info.value_size == bpf_map__value_size(map) &&
+                     info.max_entries == bpf_map__max_entries(map);
+   ::close(fd);
+   if (!same && ::unlink(path.c_str()) != 0) {
+      throw Error("cannot unpin the stale map " + path, errno);
+   }
+}
+
 // A ring buffer record, read only within `size`.
 int takePunt(void *context, void *data, size_t size)
 {
@@ -249,6 +269,7 @@ Program::Program(const Options &options) : pinDir_(options.pinDir)
             bpf_map *map = bpf_object__find_map_by_name(object_, name);
             const std::string path = pinDir_ + "/" + name;
             check(map != nullptr ? bpf_map__set_pin_path(map, path.c_str()) : -ENOENT, "cannot pin " + path);
+            dropStalePin(map, path);
          }
       }
       check(bpf_object__load(object_), "cannot load the fast path program");

@@ -1,7 +1,7 @@
 // Frames the kernel fast path punted, their checksum completed before they
 // go on: no byte past the frame is read (ASan), only the two bytes of a TCP
 // or UDP checksum change, and a checksum written verifies over the
-// pseudo-header and the segment.
+// pseudo-header (IPv4 or IPv6) and the segment.
 #include "live/kernel_path.h"
 
 #include <cstdint>
@@ -21,9 +21,12 @@ uint32_t words(const uint8_t *bytes, size_t length, uint32_t sum)
 bool verifies(const std::vector<uint8_t> &frame)
 {
    const size_t l3 = 14;
-   const size_t headerLen = static_cast<size_t>(frame[l3] & 0x0f) * 4;
-   const size_t l4Len = static_cast<size_t>(frame[l3 + 2] << 8 | frame[l3 + 3]) - headerLen;
-   uint32_t sum = words(frame.data() + l3 + 12, 8, 0) + frame[l3 + 9] + static_cast<uint32_t>(l4Len);
+   const bool ipv6 = frame[12] == 0x86 && frame[13] == 0xdd;
+   const size_t headerLen = ipv6 ? 40 : static_cast<size_t>(frame[l3] & 0x0f) * 4;
+   const size_t l4Len = ipv6 ? static_cast<size_t>(frame[l3 + 4] << 8 | frame[l3 + 5])
+                             : static_cast<size_t>(frame[l3 + 2] << 8 | frame[l3 + 3]) - headerLen;
+   uint32_t sum = (ipv6 ? words(frame.data() + l3 + 8, 32, 0) : words(frame.data() + l3 + 12, 8, 0)) +
+                  frame[l3 + (ipv6 ? 6 : 9)] + static_cast<uint32_t>(l4Len);
    sum = words(frame.data() + l3 + headerLen, l4Len, sum);
    while (sum >> 16 != 0) {
       sum = (sum & 0xffff) + (sum >> 16);

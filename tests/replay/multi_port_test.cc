@@ -177,11 +177,8 @@ TEST(ReplayStreams, numbers_are_json_numbers_and_text_stays_text)
    const ToolRun run = runTool({"replay", "--json", "--vm-mac", kVmMac, "--config", enforcing(), example()});
    ASSERT_EQ(run.status, 0) << run.err;
    const json doc = json::parse(run.out);
+   // (A binding's numbers: StateTool.a_saved_state_is_shown_and_restored_by_the_tool.)
    const json &port = doc["ports"][0];
-   const json &lease = port["portDb"][0];
-   EXPECT_EQ(lease["timeRemaining"], 118);
-   EXPECT_EQ(lease["leaseTime"], 120);
-   EXPECT_EQ(lease["clientIdLen"], 0);
    EXPECT_EQ(port["featureSummary"]["daiDropCnt"], 2);
    EXPECT_EQ(port["featureSummary"]["portMode"], "Untrusted");
    EXPECT_TRUE(port["featureSummary"]["featuresEnabled"].is_string());
@@ -198,7 +195,6 @@ TEST(ReplayStreams, numbers_are_json_numbers_and_text_stays_text)
    }
    EXPECT_EQ(severities, (std::map<std::string, int>{{"Configured successfully", 2},
                                                      {"Registered security rules property handler", 1}}));
-   EXPECT_EQ(doc["frames"][13]["reason"], "IP source guard");
 }
 
 TEST(ReplayStreams, the_vlan_option_replays_one_vlan_and_unseen_vm_macs_are_warned)

@@ -65,7 +65,7 @@ TEST_F(PortDbNotifyTest, a_failed_post_is_logged_and_leaves_the_change_and_the_p
    EXPECT_EQ(delivered_, (std::vector<Notice>{removed({1, 1, 1}, 0)}));
 }
 
-TEST_F(PortDbNotifyTest, a_caller_holding_the_portset_keeps_its_hold_and_delivery_waits)
+TEST_F(PortDbNotifyTest, a_caller_holding_the_portset_keeps_its_hold_and_one_turned_exclusive_is_released_as_such)
 {
    orr_PortsetLockShared(ctx_.portset);
    ASSERT_EQ(add({1, 1, 1}, kArp), 0);
@@ -73,18 +73,13 @@ TEST_F(PortDbNotifyTest, a_caller_holding_the_portset_keeps_its_hold_and_deliver
    EXPECT_TRUE(delivered_.empty());
    EXPECT_EQ(host().portsets().pendingDeliveries(), 1u);
    orr_PortsetUnlockShared(ctx_.portset);
-
    EXPECT_EQ(delivered_, (std::vector<Notice>{added({1, 1, 1}, 0)}));
-}
 
-TEST_F(PortDbNotifyTest, a_hold_turned_exclusive_by_the_post_is_released_as_exclusive)
-{
+   // A hold the post turned exclusive.
    host().portsets().upgradeHoldOnNextPost();
-
-   ASSERT_EQ(add({1, 1, 1}, kArp), 0);
-
+   ASSERT_EQ(add({1, 2, 2}, kArp), 0);
    EXPECT_EQ(orr_PortsetHoldState(ctx_.portset), ORR_PORTSET_HOLD_NONE);
-   EXPECT_EQ(delivered_, (std::vector<Notice>{added({1, 1, 1}, 0)}));
+   EXPECT_EQ(delivered_.back(), added({1, 2, 2}, 0));
 }
 
 class PortDbQueryTest : public HandMadePortTest {

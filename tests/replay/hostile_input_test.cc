@@ -16,15 +16,12 @@
 #include <nlohmann/json.hpp>
 
 #include <sys/stat.h>
-#include <sys/sysmacros.h>
 #include <unistd.h>
 
 #include <chrono>
 #include <cstdlib>
 #include <cstring>
 #include <optional>
-#include <fstream>
-#include <sstream>
 #include <tuple>
 
 namespace swsec::testing {
@@ -315,22 +312,6 @@ TEST(HostileCommandLine, until_takes_decimal_and_exponent_seconds)
 }
 
 // ---------------------------------------------------------------- outputs
-
-TEST(HostileOutput, a_character_device_is_refused)
-{
-   TempDir dir;
-   // The null device's numbers, made in the test's own directory (as root).
-   if (mknod((dir.path() / "null").c_str(), S_IFCHR | 0666, makedev(1, 3)) != 0) {
-      GTEST_SKIP() << "cannot make a device node here";
-   }
-   const ToolRun run = runTool({"replay", "--vm-mac", kVmMac, "--write-dropped", (dir.path() / "null").string(),
-                                example()});
-   EXPECT_EQ(run.status, 2);
-   EXPECT_NE(run.err.find("null: cannot write: not a regular file"), std::string::npos) << run.err;
-   struct stat st {};
-   ASSERT_EQ(lstat((dir.path() / "null").c_str(), &st), 0);
-   EXPECT_TRUE(S_ISCHR(st.st_mode));
-}
 
 TEST(ReplayOutputPaths, a_new_file_honours_the_umask_and_a_replaced_one_keeps_its_mode)
 {

@@ -11,8 +11,6 @@
 #include <gtest/gtest.h>
 #include <nlohmann/json.hpp>
 
-#include <fstream>
-#include <iostream>
 #include <set>
 #include <tuple>
 

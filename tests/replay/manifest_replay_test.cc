@@ -64,12 +64,14 @@ bool authoritativeMethod(const std::string &method)
 using Counters = std::map<std::string, uint64_t, std::less<>>;
 Counters nonZeroCounters(const replay::PortResult &port)
 {
+   session::DropCounters all = port.counters;
+   if (port.ipv6) {
+      all.insert(port.ipv6->counters.begin(), port.ipv6->counters.end());
+   }
    Counters counters;
-   for (const auto *agent : {&port.counters, port.ipv6 ? &port.ipv6->counters : nullptr}) {
-      for (const auto &[name, value] : agent != nullptr ? *agent : session::DropCounters{}) {
-         if (value != 0) {
-            counters[name] = value;
-         }
+   for (const auto &[name, value] : all) {
+      if (value != 0) {
+         counters[name] = value;
       }
    }
    return counters;

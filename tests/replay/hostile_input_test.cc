@@ -51,12 +51,11 @@ std::vector<uint8_t> firstExampleFrame()
 // ---------------------------------------------------------------- reading
 
 // 248 bytes: a section, an interface and a packet block that says it is
-// 0xFFFFFFF0 bytes long (refused from a file in BadUsage).
-std::string hugeBlockCapture()
+// `length` bytes long (refused from a file in BadUsage).
+std::string longBlockCapture(uint32_t length)
 {
    std::string bytes = pcapngBytes({{.timeNs = 1000, .bytes = std::vector<uint8_t>(156, 0x11), .direction = replay::kDirFromVm}});
-   const uint32_t huge = 0xFFFFFFF0u;
-   std::memcpy(bytes.data() + 28 + 20 + 4, &huge, 4);
+   std::memcpy(bytes.data() + 28 + 20 + 4, &length, 4);
    return bytes;
 }
 
@@ -65,7 +64,7 @@ std::string hugeBlockCapture()
 TEST(HostileCapture, a_piped_pcapng_block_past_the_block_limit_is_refused)
 {
    TempDir dir;
-   writeFile(dir.path() / "huge.pcapng", hugeBlockCapture());
+   writeFile(dir.path() / "huge.pcapng", longBlockCapture(0xFFFFFFF0u));
    const ToolRun piped = runTool({"replay", "-"}, "cat '" + (dir.path() / "huge.pcapng").string() + "' |");
    EXPECT_EQ(piped.status, 2);
    EXPECT_NE(piped.err.find("-: corrupt pcapng block at offset 48 (length 4294967280)"), std::string::npos)
@@ -215,7 +214,7 @@ TEST(BadUsage, is_named_in_one_short_line_with_status_2_and_nothing_written)
       {capture, "corrupt capture after frame 1", pcap + pcapRecord(60, 60, 60) + pcapRecord(60, 60, 20)},
       {capture, "frame 2 is truncated (40 of 60 bytes captured)",
        pcap + pcapRecord(60, 60, 60) + pcapRecord(40, 60, 40)},
-      {capture, "corrupt pcapng block at offset 48 (length 4294967280, 200 bytes left", hugeBlockCapture()},
+      {capture, "corrupt pcapng block at offset 48 (length 1000, 200 bytes left", longBlockCapture(1000)},
       {capture, "not an Ethernet capture (link type IEEE802_11)", pcapFile(105, {{1, frame}})},
       {capture, "not an Ethernet capture (link type 4000)", pcapFile(4000, {{1, frame}})},
       // Outputs that are the input, a link to it, each other, a FIFO or a directory.

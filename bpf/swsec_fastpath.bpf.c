@@ -236,11 +236,15 @@ static __always_inline int swsec_judge_ipv6(struct __sk_buff *skb, const struct 
    if (!from_vm || (port->flags & SWSEC_FP_PORT_FHS_TRUSTED) || !(port->fhs_features & SWSEC_FP_FHS_SOURCE_GUARD))
       return swsec_pass(skb, frame->direction);
 
-   /* Source guard. The unspecified source is the module's only for the ICMPv6 punted above. */
+   /* Source guard. The unspecified source passes only for the ICMPv6 punted
+    * above, even where a claim bound it. */
    struct swsec_fp_binding6_key key = {.vlan = frame->vlan};
    __builtin_memcpy(key.mac, data + 6, 6);
    __builtin_memcpy(key.addr, l3 + 8, 16);
-   struct swsec_fp_binding6 *binding = bpf_map_lookup_elem(&swsec_bindings6, &key);
+   __u64 halves[2];
+   __builtin_memcpy(halves, key.addr, 16);
+   struct swsec_fp_binding6 *binding =
+      (halves[0] | halves[1]) != 0 ? bpf_map_lookup_elem(&swsec_bindings6, &key) : (void *)0;
    if (!binding) {
       swsec_count(SWSEC_FP_DROP_IPV6_SOURCE_GUARD);
       return TC_ACT_SHOT;

@@ -27,6 +27,9 @@ rm -rf "$dir/seeds"
 # Capture files are their own seeds, with the hand-made hostile ones.
 mkdir -p "$dir/seeds/capture_fuzz"
 cp tests/data/*.pcap fuzz/capture_seeds/*.pcap* "$dir/seeds/capture_fuzz/"
+# Inputs on which the fast path once disagreed with the module.
+mkdir -p "$dir/seeds/fastpath_fuzz"
+cp fuzz/fastpath_seeds/* "$dir/seeds/fastpath_fuzz/"
 "$dir/fuzz/state_seeds" "$dir/seeds" tests/data/manifest.json examples/enforcing.json >/dev/null
 # Control requests (an even first byte).
 mkdir -p "$dir/seeds/ctl_request_fuzz"

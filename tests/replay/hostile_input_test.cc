@@ -230,6 +230,11 @@ TEST(BadUsage, is_named_in_one_short_line_with_status_2_and_nothing_written)
       // A FIFO as the configuration, refused without waiting for a writer.
       {fifoIn, "fifo: not a regular file", std::nullopt, 2, makeFifo},
       {{"ctl", "--ctl", "DIR/ctl.sock", "config", "vm1", "DIR/fifo"}, "fifo: not a regular file", std::nullopt, 2, makeFifo},
+      // Files past their size limit are refused before they are read (sparse: nothing is written).
+      {{"replay", "--vm-mac", kVmMac, "--config", "DIR/big", "EXAMPLE"}, "1048577 bytes is too large", std::nullopt, 2,
+       [](const std::filesystem::path &dir) { writeFile(dir / "big", ""), std::filesystem::resize_file(dir / "big", (1u << 20) + 1); }},
+      {{"state", "show", "DIR/big"}, "16777217 bytes is too large", std::nullopt, 2,
+       [](const std::filesystem::path &dir) { writeFile(dir / "big", ""), std::filesystem::resize_file(dir / "big", (16u << 20) + 1); }},
    };
    for (const Case &c : cases) {
       TempDir dir;

@@ -140,24 +140,6 @@ INSTANTIATE_TEST_SUITE_P(
                   {kRemoved}, nullptr}),
    [](const auto &test) { return std::string(test.param.name); });
 
-TEST_F(IpDiscoveryTest, repeated_request_takes_the_new_xid_but_not_a_new_lifetime)
-{
-   ASSERT_EQ(fromVm(clientMsg(kDhcpRequest, 0x900)).status, ORR_OK);
-   const int64_t firstExpiry = requests().at(0)->expiryTime;
-   advanceSeconds(30);
-   ASSERT_EQ(fromVm(clientMsg(kDhcpRequest, 0x901)).status, ORR_OK);
-   ASSERT_EQ(requests().size(), 1u);
-   EXPECT_EQ(requests()[0]->expiryTime, firstExpiry);
-
-   EXPECT_EQ(fromServer(serverMsg(kDhcpAck, 0x900, kLeased)).verdict, SwSecVerdictDrop);
-   // 61 s after the first request the pending request has aged out.
-   advanceSeconds(31);
-   SwSecPortDbTimerCb(&ctx_);
-   EXPECT_EQ(ctx_.numDhcpReqs, 0u);
-   EXPECT_EQ(fromServer(serverMsg(kDhcpAck, 0x901, kLeased)).verdict, SwSecVerdictDrop);
-   EXPECT_TRUE(vmis().empty());
-}
-
 TEST_F(IpDiscoveryTest, dhcp_under_the_shared_lock_asks_for_the_write_lock_before_parsing)
 {
    auto frame = wrap(dhcpFrame({.src = kVmMac, .dhcp = clientMsg(kDhcpRequest, 0xa00)}));

@@ -157,7 +157,9 @@ TEST_F(SavedStateTest, the_error_rate_limit_state_keeps_its_remaining_seconds)
    (void)send(source, kTx, std::vector<Bytes>(12, arpRequest(kVmMac, Ip4{})));
    host().clock().advance(20s);
    const Bytes blob = save(source);
-   const int64_t left = session::decodeSavedState(blob).txRateLimitErrRemaining;
+   const session::SavedPortState saved = session::decodeSavedState(blob);
+   EXPECT_TRUE(saved.allowTagged && saved.etherTypes == std::vector<uint16_t>{0x0806} && saved.etherTypeDropCnt == 1);
+   const int64_t left = saved.txRateLimitErrRemaining;
    ASSERT_GT(left, 30);
 
    host().clock().advance(2h);

@@ -51,38 +51,31 @@ protected:
 
 // ---------------------------------------------------------------- filters
 
-TEST_F(FilterTest, a_filter_for_another_endpoint_asks_for_no_uuid_or_vnic_index)
+TEST_F(FilterTest, a_filter_reads_the_uuid_and_vnic_index_of_a_vm_alone_and_refuses_a_configuration_it_cannot_read)
 {
    const uint64_t uuidCalls = host().faults().calls("orr_SifraGetVMUUID");
    const uint64_t vnicCalls = host().faults().calls("orr_SifraGetVnicIndex");
-   const host::FilterId id = create({.name = "uplink", .endPointType = 1, .vmUuid = "4220-aa", .vnicIndex = 3});
-
+   const host::FilterId uplink = create({.name = "uplink", .endPointType = 1, .vmUuid = "4220-aa", .vnicIndex = 3});
    EXPECT_EQ(host().faults().calls("orr_SifraGetVMUUID"), uuidCalls);
    EXPECT_EQ(host().faults().calls("orr_SifraGetVnicIndex"), vnicCalls);
-   EXPECT_STREQ(record(id)->name, "uplink");
-   EXPECT_STREQ(record(id)->vmUuid, "");
-   EXPECT_EQ(record(id)->vnicIndex, -1);
-   EXPECT_EQ(record(id)->endPointType, 1u);
-}
+   EXPECT_STREQ(record(uplink)->name, "uplink");
+   EXPECT_STREQ(record(uplink)->vmUuid, "");
+   EXPECT_EQ(record(uplink)->vnicIndex, -1);
+   EXPECT_EQ(record(uplink)->endPointType, 1u);
 
-TEST_F(FilterTest, a_vm_without_uuid_still_gets_its_vnic_index)
-{
-   const host::FilterId id = create({.vnicIndex = 4});
+   // A VM without UUID still gets its vNIC index; a configuration change renames.
+   const host::FilterId id = create({.vnicIndex = 4}, kOtherPort);
    EXPECT_STREQ(record(id)->vmUuid, "");
    EXPECT_EQ(record(id)->vnicIndex, 4);
-
    EXPECT_EQ(host().sifra().changeConfiguration(id, {.name = "renamed", .vmUuid = "4220-bb", .vnicIndex = 4}), ORR_OK);
    EXPECT_STREQ(record(id)->vmUuid, "4220-bb");
    EXPECT_STREQ(record(id)->name, "renamed");
-}
 
-TEST_F(FilterTest, an_unreadable_configuration_refuses_the_filter_without_leaks)
-{
    host().faults().failOnce("orr_SifraGetVnicIndex", ORR_FAILURE);
-   host::FilterId id = 0;
-   EXPECT_EQ(host().sifra().createFilter(kAgent, kPort, {}, &id), ORR_FAILURE);
+   host::FilterId refused = 0;
+   EXPECT_EQ(host().sifra().createFilter(kAgent, kPort, {}, &refused), ORR_FAILURE);
    EXPECT_TRUE(logged("filter: Could not get filter vnic index (0xbad0001): Failure"));
-   EXPECT_TRUE(host().sifra().filters().empty());
+   EXPECT_EQ(host().sifra().filters().size(), 2u);
 }
 
 TEST_F(FilterTest, a_new_port_maps_its_headers_and_runs_its_timer)
@@ -159,19 +152,16 @@ TEST_F(FilterTest, echo_answers_only_a_request_with_an_id_and_set_features_answe
    EXPECT_EQ(replies[1].bytes, (Bytes{1, 0, 0, 0, 'Q', 'Z'}));
 
    host().sifra().clearIoctlReplies();
-   EXPECT_EQ(host().sifra().sendIoctl(id, 0, setFeaturesPayload({})), ORR_OK);
-   ASSERT_EQ(host().sifra().ioctlReplies().size(), 1u);
-   EXPECT_EQ(host().sifra().ioctlReplies()[0].bytes, (Bytes{8, 0, 0, 0, 1, 0, 0, 0}));
-}
-
-TEST_F(FilterTest, short_unknown_and_reply_types_are_ignored)
-{
-   const host::FilterId id = create();
+   // Short payloads, unknown types and the reply types are ignored.
    for (const Bytes &payload : {Bytes{}, Bytes{1, 0, 0}, typeOnly(8), typeOnly(10), typeOnly(2), typeOnly(0xffff)}) {
       EXPECT_EQ(host().sifra().sendIoctl(id, 3, payload), ORR_OK);
    }
    EXPECT_TRUE(host().sifra().ioctlReplies().empty());
    EXPECT_EQ(+context(id)->config.featuresEnabled, SwSecFeatureIpDiscovery);
+
+   EXPECT_EQ(host().sifra().sendIoctl(id, 0, setFeaturesPayload({})), ORR_OK);
+   ASSERT_EQ(host().sifra().ioctlReplies().size(), 1u);
+   EXPECT_EQ(host().sifra().ioctlReplies()[0].bytes, (Bytes{8, 0, 0, 0, 1, 0, 0, 0}));
 }
 
 TEST_F(FilterTest, set_features_and_clear_payloads_shorter_than_their_records_are_refused)
@@ -222,7 +212,9 @@ TEST_F(FilterTest, get_vmi_lists_entries_of_every_method_and_an_empty_database_a
 TEST_F(FilterTest, the_security_property_reads_back_the_header_and_the_static_keys_alone)
 {
    const PortConfig config{.statics = {binding(1, kVmMac, kVmIp), binding(2, kPeerMac, kPeerIp),
-                                       binding(3, kVmMac, kPeerIp)}};
+                                       binding(3, kVmMac, kPeerIp)},
+                           .allowTagged = true,
+                           .etherTypes = {0x0800, 0x0806}};
    const host::FilterId id = create();
    ASSERT_TRUE(passes(id, kTx, arpFrom(kPeerMac, Ip4::parse("10.0.0.77"), 1)));   // a learned binding, listed first
    ASSERT_EQ(writeConfig(id, config), ORR_OK);
@@ -284,7 +276,9 @@ INSTANTIATE_TEST_SUITE_P(
                  "Invalid ARP rate limit config: 20 20 10"},
       ConfigCase{"error_period_too_short", {kDai, 0, 32, 20, 5, 9}, false, "Invalid ARP rate limit config: 20 5 9"},
       ConfigCase{"no_rate_limit_ignores_the_rest", {kDai, 0, 32, 0, 999, 0}, true, ""},
-      ConfigCase{"unknown_bits_are_kept", {.features = 0x105}, true, ""}),
+      ConfigCase{"unknown_bits_are_kept", {.features = 0x105}, true, ""},
+      ConfigCase{"nine_ethertypes", {.etherTypes = std::vector<uint16_t>(9, 0x0800)}, false,
+                 "Invalid frame guard config: 9 ethertypes (at most 8)"}),
    [](const auto &test) { return std::string(test.param.name); });
 
 // ---------------------------------------------------------------- policy
@@ -329,18 +323,6 @@ TEST_F(FilterTest, the_frame_guard_drops_stacked_tags_and_unlisted_ethertypes_fr
                             ctx->counters.daiDropCnt}),
                 c.drops);
    }
-}
-
-TEST_F(FilterTest, a_version_2_record_reads_back_with_its_frame_guard_and_a_list_of_nine_is_refused)
-{
-   const PortConfig config{.allowTagged = true, .etherTypes = {0x0800, 0x0806}};
-   const host::FilterId id = create();
-   Bytes read(26 + 18);
-   ASSERT_EQ(writeConfig(id, config), ORR_OK);
-   EXPECT_EQ(host().sifra().readProperty("sifra-generic-tarlin-swsec.security", id, read), ORR_OK);
-   EXPECT_EQ(read, configRecord(config));
-   EXPECT_EQ(setFeatures(id, {.etherTypes = std::vector<uint16_t>(9, 0x0800)}), 0u);
-   EXPECT_TRUE(logged("filter: Invalid frame guard config: 9 ethertypes (at most 8)"));
 }
 
 class RateLimitTest : public FilterTest {

@@ -53,25 +53,11 @@ TEST_F(NexoTest, the_branch_is_installed_while_the_module_is_loaded)
    EXPECT_THROW((void)host().nexo().set("/startTest", {}), std::invalid_argument);
 }
 
-TEST_F(NexoTest, only_ports_with_ip_discovery_are_listed_and_others_are_not_found)
+TEST_F(NexoTest, only_ports_with_ip_discovery_are_listed_the_list_stops_at_a_refused_append)
 {
    create();
-   configure(create({}, kOtherPort), {.features = SwSecFeatureBpduFilter});
-
-   EXPECT_EQ(list("/security"), (std::vector<int64_t>{kPort}));
-   (void)get(portPath(kOtherPort, "featureSummary"), ORR_NOT_FOUND);
-   (void)list(portPath(kOtherPort, "vmi"), ORR_NOT_FOUND);
-   (void)get(portPath(kOtherPort, "vmi/0"), ORR_NOT_FOUND);
-   EXPECT_EQ(host().nexo().set(portPath(kOtherPort, "clearVmi"), {"all"}), ORR_NOT_FOUND);
-   EXPECT_EQ(host().nexo().set(portPath(99, "clearVmi"), {"all"}), ORR_NOT_FOUND);
-}
-
-TEST_F(NexoTest, the_port_list_stops_at_the_first_refused_append_and_an_unreadable_port_argument_is_returned)
-{
-   create();
-   create({}, kOtherPort);
+   const host::FilterId other = create({}, kOtherPort);
    EXPECT_EQ(list("/security"), (std::vector<int64_t>{kPort, kOtherPort}));
-
    host().faults().failOnce("Nexo_ParamListAddInt", ORR_LIMIT_EXCEEDED, 2);
    EXPECT_EQ(list("/security", ORR_LIMIT_EXCEEDED), (std::vector<int64_t>{kPort}));
    EXPECT_TRUE(loggedWithPrefix(host(), "Nexo_ParamListAddInt() failed: " + statusText(ORR_LIMIT_EXCEEDED),
@@ -80,11 +66,19 @@ TEST_F(NexoTest, the_port_list_stops_at_the_first_refused_append_and_an_unreadab
    (void)get(portPath(kPort, "featureSummary"), ORR_BAD_PARAM);
    EXPECT_TRUE(loggedWithPrefix(host(), "Nexo_ParamListGetInt32() failed: " + statusText(ORR_BAD_PARAM),
                                 ORR_LOG_ERROR, "SwSecNexoGetFilter"));
+
+   configure(other, {.features = SwSecFeatureBpduFilter});
+   EXPECT_EQ(list("/security"), (std::vector<int64_t>{kPort}));
+   (void)get(portPath(kOtherPort, "featureSummary"), ORR_NOT_FOUND);
+   (void)list(portPath(kOtherPort, "vmi"), ORR_NOT_FOUND);
+   (void)get(portPath(kOtherPort, "vmi/0"), ORR_NOT_FOUND);
+   EXPECT_EQ(host().nexo().set(portPath(kOtherPort, "clearVmi"), {"all"}), ORR_NOT_FOUND);
+   EXPECT_EQ(host().nexo().set(portPath(99, "clearVmi"), {"all"}), ORR_NOT_FOUND);
 }
 
 // ---------------------------------------------------------------- feature summary
 
-TEST_F(NexoTest, feature_summary_of_an_untrusted_dai_port_with_rate_limits)
+TEST_F(NexoTest, feature_summary_of_untrusted_dai_ports_with_and_without_rate_limits)
 {
    const host::FilterId id = create();
    configure(id, {SwSecFeatureIpDiscovery | SwSecFeatureDai, 0, 16, 100, 10, 30, {binding(5, kVmMac, kVmIp)}});
@@ -107,17 +101,12 @@ TEST_F(NexoTest, feature_summary_of_an_untrusted_dai_port_with_rate_limits)
    const auto limited = get(portPath(kPort, "featureSummary"));
    EXPECT_EQ(limited.value("txRateLimitErr"), "Yes");
    EXPECT_EQ(limited.value("txRateLimitErrEntryCnt"), "1");
-}
 
-TEST_F(NexoTest, dai_without_an_arp_rate_limit_shows_na_for_the_rate_fields_but_counts_dai_drops)
-{
-   const host::FilterId id = create();
-   configure(id, {.features = SwSecFeatureIpDiscovery | SwSecFeatureDai | SwSecFeatureIpSrcGuard, .trusted = 0});
-   // An ARP from an address the port database does not hold: DAI drops it.
-   sendFromVm(id, arpRequest(kVmMac, kVmIp));
-
-   const auto record = get(portPath(kPort, "featureSummary"));
-   EXPECT_EQ(record.value("portMode"), "Untrusted");
+   // Without an ARP rate limit the rate fields are N/A, DAI drops still counted.
+   const host::FilterId plain = create({}, kOtherPort);
+   configure(plain, {.features = SwSecFeatureIpDiscovery | SwSecFeatureDai | SwSecFeatureIpSrcGuard, .trusted = 0});
+   sendFromVm(plain, arpRequest(kVmMac, kVmIp));   // from an address the port database does not hold
+   const auto record = get(portPath(kOtherPort, "featureSummary"));
    EXPECT_EQ(record.value("featuresEnabled"), "IP Discovery,DAI,IP source guard");
    EXPECT_EQ(record.value("daiDropCnt"), "1");
    EXPECT_EQ(record.value("ipSrcGuardDropCnt"), "0");
@@ -191,19 +180,6 @@ TEST_F(NexoTest, vmi_indexes_at_or_past_the_count_a_missing_index_or_no_memory_f
 
 // ---------------------------------------------------------------- clearVmi
 
-TEST_F(NexoTest, clear_with_other_than_one_or_four_arguments_is_refused_before_the_port_is_looked_up)
-{
-   for (const std::vector<std::string> &args :
-        {std::vector<std::string>{}, std::vector<std::string>{"a", "b"}, std::vector<std::string>{"a", "b", "c"},
-         std::vector<std::string>{"a", "0", "02:00:00:01:02:03", "10.0.0.5", "e"}}) {
-      host().log().clear();
-      // Port 99 does not exist: the count is checked first.
-      EXPECT_EQ(host().nexo().set(portPath(99, "clearVmi"), args), ORR_BAD_PARAM);
-      EXPECT_TRUE(loggedWithPrefix(host(), "Invalid no. of arguments: " + std::to_string(args.size()),
-                                   ORR_LOG_ERROR, "SwSecNexoClearVmi"));
-   }
-}
-
 // A static binding, and two learned ones (the VM's and the peer's), cleared
 // through the management node and through the clear ioctl.
 struct ClearCase {
@@ -257,42 +233,38 @@ INSTANTIATE_TEST_SUITE_P(
                 {"10.0.0.254", "10.0.0.5", "10.0.0.9"}}),
    [](const auto &test) { return std::string(test.param.name); });
 
-TEST_F(NexoTest, clear_texts_that_do_not_parse_are_refused_and_change_nothing)
+TEST_F(NexoTest, clear_requests_it_cannot_read_are_refused_and_change_nothing)
 {
-   const host::FilterId id = create();
+   // Port 99 does not exist: the argument count is checked first.
+   for (const std::vector<std::string> &args :
+        {std::vector<std::string>{}, std::vector<std::string>{"a", "b"}, std::vector<std::string>{"a", "b", "c"},
+         std::vector<std::string>{"a", "0", "02:00:00:01:02:03", "10.0.0.5", "e"}}) {
+      EXPECT_EQ(host().nexo().set(portPath(99, "clearVmi"), args), ORR_BAD_PARAM);
+      EXPECT_TRUE(loggedWithPrefix(host(), "Invalid no. of arguments: " + std::to_string(args.size()),
+                                   ORR_LOG_ERROR, "SwSecNexoClearVmi"));
+   }
+
+   const host::FilterId id = create({.name = "vm-7.eth0"});
    sendFromVm(id, arpRequest(kVmMac, kVmIp));
    const std::string clear = portPath(kPort, "clearVmi");
-   struct Case {
-      const char *vlan;
-      const char *mac;
-      const char *ip;
-   };
-   for (const Case &c : {Case{"x", "02:00:00:01:02:03", "10.0.0.5"}, Case{"0", "02:00:00:01:02", "10.0.0.5"},
-                         Case{"0", "02:00:00:01:02:03", "10.0.0.256"}, Case{"0", "02:00:00:01:02:03", "ten"}}) {
-      EXPECT_EQ(host().nexo().set(clear, {"one", c.vlan, c.mac, c.ip}), ORR_BAD_PARAM)
-         << c.vlan << " " << c.mac << " " << c.ip;
+   for (const std::vector<std::string> &args : {std::vector<std::string>{"one", "x", "02:00:00:01:02:03", "10.0.0.5"},
+                                                std::vector<std::string>{"one", "0", "02:00:00:01:02", "10.0.0.5"},
+                                                std::vector<std::string>{"one", "0", "02:00:00:01:02:03", "10.0.0.256"},
+                                                std::vector<std::string>{"one", "0", "02:00:00:01:02:03", "ten"}}) {
+      EXPECT_EQ(host().nexo().set(clear, args), ORR_BAD_PARAM) << args[1] << " " << args[2] << " " << args[3];
+   }
+   // Arguments that are not text, each logged with the filter's name.
+   uint64_t nth = 1;
+   for (const char *message : {"vm-7.eth0: Invalid vlan str = (argument 1)", "vm-7.eth0: Invalid Mac str = (argument 2)",
+                               "vm-7.eth0: Invalid IP str = (argument 3)"}) {
+      host().faults().failOnce("Nexo_ParamListGetString", ORR_NOT_SUPPORTED, nth++);
+      EXPECT_EQ(host().nexo().set(clear, {"one", "0", "02:00:00:01:02:03", "10.0.0.5"}), ORR_NOT_SUPPORTED);
+      EXPECT_TRUE(loggedWithPrefix(host(), message, ORR_LOG_ERROR, "SwSecNexoReadClearKey"));
    }
    EXPECT_EQ(list(portPath(kPort, "vmi")).size(), 1u);
    // The parsers take the C library's forms: "0" "10.5" is 10.0.0.5 in inet_aton's short form.
    EXPECT_EQ(host().nexo().set(clear, {"one", " 0", "2:0:0:0:0:1", "10.5"}), ORR_OK);
    EXPECT_TRUE(list(portPath(kPort, "vmi")).empty());
-}
-
-TEST_F(NexoTest, a_clear_argument_that_is_not_text_is_logged_with_the_filter_name)
-{
-   create({.name = "vm-7.eth0"});
-   struct Case {
-      uint64_t nth;
-      const char *message;
-   };
-   for (const Case &c : {Case{1, "vm-7.eth0: Invalid vlan str = (argument 1)"},
-                         Case{2, "vm-7.eth0: Invalid Mac str = (argument 2)"},
-                         Case{3, "vm-7.eth0: Invalid IP str = (argument 3)"}}) {
-      host().faults().failOnce("Nexo_ParamListGetString", ORR_NOT_SUPPORTED, c.nth);
-      EXPECT_EQ(host().nexo().set(portPath(kPort, "clearVmi"), {"one", "0", "02:00:00:01:02:03", "10.0.0.5"}),
-                ORR_NOT_SUPPORTED);
-      EXPECT_TRUE(loggedWithPrefix(host(), c.message, ORR_LOG_ERROR, "SwSecNexoReadClearKey"));
-   }
 }
 
 // ---------------------------------------------------------------- createAgent

@@ -78,7 +78,7 @@ TEST_F(FilterTest, a_filter_reads_the_uuid_and_vnic_index_of_a_vm_alone_and_refu
    EXPECT_EQ(host().sifra().filters().size(), 2u);
 }
 
-TEST_F(FilterTest, a_new_port_maps_its_headers_and_runs_its_timer)
+TEST_F(FilterTest, a_new_port_maps_its_headers_runs_its_timer_and_is_destroyed_once_unreferenced)
 {
    const size_t timers = host().clock().pendingTimers();
    const host::FilterId id = create();
@@ -86,11 +86,8 @@ TEST_F(FilterTest, a_new_port_maps_its_headers_and_runs_its_timer)
    EXPECT_EQ(host().sifra().filter(id)->minMappedLen, 66u);
    EXPECT_EQ(host().sifra().filter(id)->minMappedDirections, 3u);
    EXPECT_EQ(host().portsets().outstandingAcquisitions(), 0u);
-}
 
-TEST_F(FilterTest, destroy_is_refused_while_a_reference_is_held_and_unlinks_the_filter)
-{
-   const host::FilterId id = create();
+   // Destroy is refused while a reference is held, and unlinks the filter.
    SifraGenericFastPathAgent *agent = record(id)->agent;
    record(id)->refCount = 2;   // as a slow path request in flight holds it
    EXPECT_EQ(host().sifra().destroyFilter(id), ORR_BUSY);
@@ -108,7 +105,7 @@ TEST_F(FilterTest, destroy_is_refused_while_a_reference_is_held_and_unlinks_the_
 
 // ---------------------------------------------------------------- frame loop
 
-TEST_F(FilterTest, a_port_without_features_leaves_the_list_untouched)
+TEST_F(FilterTest, without_features_every_frame_stays_dropped_ones_leave_the_list_and_are_released_a_runt_passes)
 {
    const host::FilterId id = port({.features = 0});
    ASSERT_EQ(setFeatures(id, {.features = 0}), 1u) << "switching off twice succeeds";
@@ -116,12 +113,8 @@ TEST_F(FilterTest, a_port_without_features_leaves_the_list_untouched)
    const uint64_t releases = host().frames().releases();
    EXPECT_THAT(kept(id, kTx, {bpduFrame(kVmMac), Bytes(6, 0xff), udpFrom(kVmIp, 67, 68)}), ElementsAre(0u, 1u, 2u));
    EXPECT_EQ(host().frames().releases(), releases);
-}
 
-TEST_F(FilterTest, dropped_frames_leave_the_list_and_are_released_and_one_too_short_for_ethernet_passes)
-{
-   const host::FilterId id = port({.features = SwSecFeatureBpduFilter});
-   const uint64_t releases = host().frames().releases();
+   ASSERT_EQ(setFeatures(id, {.features = SwSecFeatureBpduFilter}), 1u);
    // The last starts with the spanning-tree address but is too short to be Ethernet.
    const Bytes stub = {0x01, 0x80, 0xc2, 0x00, 0x00, 0x00, 0x02, 0x00};
    const auto result =
@@ -331,7 +324,6 @@ protected:
    {
       return port({kDai, 0, 32, arp, err, period});
    }
-   void advance(std::chrono::microseconds by) { host().clock().advance(by); }
 };
 
 TEST_F(RateLimitTest, too_many_arps_from_the_vm_enter_the_error_state_once_until_a_tick_after_its_period)
@@ -346,14 +338,14 @@ TEST_F(RateLimitTest, too_many_arps_from_the_vm_enter_the_error_state_once_until
    EXPECT_EQ(ctx->counters.txRateLimitDropCnt, 2u);
 
    // Each later second allows errRateLimit frames of any kind.
-   advance(1500ms);
+   host().clock().advance(1500ms);
    EXPECT_EQ(kept(id, kTx, std::vector<Bytes>(5, udpFrom(kVmIp))).size(), 2u);
    EXPECT_EQ(ctx->counters.txRateLimitErrEntryCnt, 1u);
 
    // The first tick (10 s after creation) is not past the end; the next one is.
-   advance(8500ms);
+   host().clock().advance(8500ms);
    EXPECT_EQ(ctx->txRateLimitErr, 1u);
-   advance(10s);
+   host().clock().advance(10s);
    EXPECT_EQ(ctx->txRateLimitErr, 0u);
    EXPECT_EQ(kept(id, kTx, std::vector<Bytes>(10, udpFrom(kVmIp))).size(), 10u);
    EXPECT_EQ(kept(id, kTx, std::vector<Bytes>(10, arpProbe())).size(), 10u);

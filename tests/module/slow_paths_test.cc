@@ -96,64 +96,34 @@ protected:
 
 // ---------------------------------------------------------------- attaching
 
-TEST_F(SlowPathTest, a_registration_while_the_callback_has_its_locks_released_makes_it_scan_again)
+// The walks of the filter list release both locks around each request:
+// meanwhile a filter after the current one may be destroyed (its record
+// freed and poisoned), so the walk reads its successor only afterwards, and
+// a slow path may register, which makes the running walk scan again.
+TEST_F(SlowPathTest, a_walk_goes_past_a_filter_destroyed_meanwhile_and_scans_again_for_a_registration_meanwhile)
 {
-   const host::FilterId first = create({.name = "a"});
-   const host::FilterId second = create({.name = "b"});
+   const host::FilterId a = create({.name = "a"});
+   const host::FilterId b = create({.name = "b"});
+   const host::FilterId c = create({.name = "c"});
    registerSlowPath(1);
-   // a's request lets slow path 2 register meanwhile; b's is refused, so
-   // only a second scan can attach b.
+   // c's first request is refused: only a second scan can attach it.
    host().faults().failOnce("orr_SifraSetSlowPath", ORR_NO_MEMORY, 2);
    slowPaths().onRequest([&](const host::SlowPathRequest &request) {
       EXPECT_NE(agent()->attachTimer, 0u) << "attachTimer stays set until the last scan ends";
-      if (request.filter == first) {
+      if (request.filter == a) {
+         EXPECT_EQ(host().sifra().destroyFilter(b), ORR_OK);
          registerSlowPath(2);
       }
    });
    const size_t timers = host().clock().pendingTimers();
    runAttach();
    slowPaths().onRequest(nullptr);
-   EXPECT_THAT(setRequests(), ElementsAre(std::to_string(first) + "->1", std::to_string(second) + "->2",
-                                          std::to_string(second) + "->2"));
-   EXPECT_EQ(host().clock().pendingTimers(), timers - 1) << "the second registration scheduled no callback";
+   EXPECT_THAT(setRequests(),
+               ElementsAre(std::to_string(a) + "->1", std::to_string(c) + "->2", std::to_string(c) + "->2"));
+   EXPECT_EQ(host().clock().pendingTimers(), timers - 2) << "b's timer and the attach callback gone, none added";
    deliver();
-   EXPECT_EQ(moduleSlowPath(second), 2u);
+   EXPECT_EQ(moduleSlowPath(c), 2u);
    expectConsistent();
-}
-
-// The walks of the filter list release both locks around each request; a
-// filter after the current one may be destroyed meanwhile (its record
-// freed and poisoned), so the walk must read its successor only afterwards.
-TEST_F(SlowPathTest, a_walk_goes_on_past_a_filter_destroyed_while_its_locks_were_released)
-{
-   const host::FilterId a = create({.name = "a"});
-   const host::FilterId b = create({.name = "b"});
-   const host::FilterId c = create({.name = "c"});
-   registerSlowPath(1);
-   slowPaths().onRequest([&](const host::SlowPathRequest &request) {
-      if (request.filter == a && host().sifra().filter(b)) {
-         EXPECT_EQ(host().sifra().destroyFilter(b), ORR_OK);
-      }
-   });
-   runAttach();
-   slowPaths().onRequest(nullptr);
-   EXPECT_THAT(setRequests(), ElementsAre(std::to_string(a) + "->1", std::to_string(c) + "->1"));
-   deliver();
-   expectConsistent();
-}
-
-// The filter waits through a refused scheduling; the next registration's
-// callback puts it on the oldest of two equally loaded slow paths.
-TEST_F(SlowPathTest, a_failed_scheduling_leaves_filters_for_the_next_registration)
-{
-   const host::FilterId id = create({.name = "a"});
-   host().faults().failOnce("orr_TimerSchedule", ORR_NO_MEMORY);
-   registerSlowPath(1);
-   EXPECT_EQ(agent()->attachTimer, 0u);
-   registerSlowPath(2);
-   runAttach();
-   deliver();
-   EXPECT_EQ(moduleSlowPath(id), 1u) << "the least loaded, the oldest on a tie";
 }
 
 // ---------------------------------------------------------------- replies and retries
@@ -192,40 +162,39 @@ TEST_F(SlowPathTest, failed_replies_are_retried_at_once_numbered_from_each_new_a
 
 TEST_F(SlowPathTest, unregistering_moves_only_its_own_filters_to_another_slow_path_or_detaches_them)
 {
-   for (const bool another : {true, false}) {
-      SCOPED_TRACE(another ? "another slow path" : "no other slow path");
-      registerSlowPath(1);
-      const host::FilterId a = create({.name = "a"});
-      host::FilterId b = 0;
-      deliver();
-      if (another) {
-         registerSlowPath(2);
-         runAttach();
-         b = create({.name = "b"});   // the least loaded: 2
-         deliver();
-      }
-      slowPaths().clearRequests();
-      const uint64_t blocks = host().heap().liveBlocks();
+   // The filter waits through a refused scheduling; the next registration's
+   // callback puts it on the oldest of two equally loaded slow paths.
+   const host::FilterId a = create({.name = "a"});
+   host().faults().failOnce("orr_TimerSchedule", ORR_NO_MEMORY);
+   registerSlowPath(1);
+   EXPECT_EQ(agent()->attachTimer, 0u);
+   registerSlowPath(2);
+   runAttach();
+   deliver();
+   EXPECT_EQ(moduleSlowPath(a), 1u) << "the least loaded, the oldest on a tie";
+   const host::FilterId b = create({.name = "b"});   // the least loaded: 2
+   deliver();
+   slowPaths().clearRequests();
+   const uint64_t blocks = host().heap().liveBlocks();
 
-      EXPECT_EQ(slowPaths().unregisterSlowPath(1), ORR_OK);
-      EXPECT_EQ(host().heap().liveBlocks(), blocks - 1) << "the record is freed";
-      EXPECT_EQ(state(a), another ? SifraGenericAttachAttaching : SifraGenericAttachDetached);
-      EXPECT_EQ(host().sifra().filter(a)->slowPathID, std::nullopt) << "the host was asked to clear it";
-      for (const auto &request : slowPaths().requests()) {
-         EXPECT_EQ(request.filter, a) << "b was not on slow path 1";
-      }
-      deliver();
-      EXPECT_EQ(moduleSlowPath(a), another ? std::optional<uint32_t>(2) : std::nullopt);
-      expectConsistent();
-      for (const host::FilterId id : {a, b}) {
-         if (id != 0) {
-            EXPECT_EQ(host().sifra().destroyFilter(id), ORR_OK);
-         }
-      }
-      if (another) {
-         EXPECT_EQ(slowPaths().unregisterSlowPath(2), ORR_OK);
-      }
+   EXPECT_EQ(slowPaths().unregisterSlowPath(1), ORR_OK);
+   EXPECT_EQ(host().heap().liveBlocks(), blocks - 1) << "the record is freed";
+   EXPECT_EQ(state(a), SifraGenericAttachAttaching);
+   EXPECT_EQ(host().sifra().filter(a)->slowPathID, std::nullopt) << "the host was asked to clear it";
+   for (const auto &request : slowPaths().requests()) {
+      EXPECT_EQ(request.filter, a) << "b was not on slow path 1";
    }
+   deliver();
+   EXPECT_EQ(moduleSlowPath(a), 2u);
+   expectConsistent();
+
+   // The last slow path leaves its filters detached.
+   EXPECT_EQ(slowPaths().unregisterSlowPath(2), ORR_OK);
+   for (const host::FilterId id : {a, b}) {
+      EXPECT_EQ(state(id), SifraGenericAttachDetached);
+      EXPECT_EQ(host().sifra().filter(id)->slowPathID, std::nullopt);
+   }
+   expectConsistent();
 }
 
 TEST_F(SlowPathTest, a_failed_reply_for_a_slow_path_being_unregistered_moves_the_filter_on)

@@ -111,7 +111,8 @@ TEST_F(FilterTest, without_features_every_frame_stays_dropped_ones_leave_the_lis
    ASSERT_EQ(setFeatures(id, {.features = 0}), 1u) << "switching off twice succeeds";
    EXPECT_EQ(+context(id)->config.featuresEnabled, 0u);
    const uint64_t releases = host().frames().releases();
-   EXPECT_THAT(kept(id, kTx, {bpduFrame(kVmMac), Bytes(6, 0xff), udpFrom(kVmIp, 67, 68)}), ElementsAre(0u, 1u, 2u));
+   EXPECT_THAT(send(id, kTx, {bpduFrame(kVmMac), Bytes(6, 0xff), udpFrom(kVmIp, 67, 68)}).kept,
+               ElementsAre(0u, 1u, 2u));
    EXPECT_EQ(host().frames().releases(), releases);
 
    ASSERT_EQ(setFeatures(id, {.features = SwSecFeatureBpduFilter}), 1u);
@@ -332,14 +333,14 @@ TEST_F(RateLimitTest, too_many_arps_from_the_vm_enter_the_error_state_once_until
    SwSecContext *ctx = context(id);
    std::vector<Bytes> frames(11, arpProbe());        // the 11th: over the limit
    frames.insert(frames.end(), 3, udpFrom(kVmIp));   // two pass in the error state
-   EXPECT_THAT(kept(id, kTx, frames), ElementsAre(0u, 1u, 2u, 3u, 4u, 5u, 6u, 7u, 8u, 9u, 11u, 12u));
+   EXPECT_THAT(send(id, kTx, frames).kept, ElementsAre(0u, 1u, 2u, 3u, 4u, 5u, 6u, 7u, 8u, 9u, 11u, 12u));
    EXPECT_EQ(ctx->txRateLimitErr, 1u);
    EXPECT_EQ(ctx->counters.txRateLimitErrEntryCnt, 1u);
    EXPECT_EQ(ctx->counters.txRateLimitDropCnt, 2u);
 
    // Each later second allows errRateLimit frames of any kind.
    host().clock().advance(1500ms);
-   EXPECT_EQ(kept(id, kTx, std::vector<Bytes>(5, udpFrom(kVmIp))).size(), 2u);
+   EXPECT_EQ(send(id, kTx, std::vector<Bytes>(5, udpFrom(kVmIp))).kept.size(), 2u);
    EXPECT_EQ(ctx->counters.txRateLimitErrEntryCnt, 1u);
 
    // The first tick (10 s after creation) is not past the end; the next one is.
@@ -347,15 +348,15 @@ TEST_F(RateLimitTest, too_many_arps_from_the_vm_enter_the_error_state_once_until
    EXPECT_EQ(ctx->txRateLimitErr, 1u);
    host().clock().advance(10s);
    EXPECT_EQ(ctx->txRateLimitErr, 0u);
-   EXPECT_EQ(kept(id, kTx, std::vector<Bytes>(10, udpFrom(kVmIp))).size(), 10u);
-   EXPECT_EQ(kept(id, kTx, std::vector<Bytes>(10, arpProbe())).size(), 10u);
+   EXPECT_EQ(send(id, kTx, std::vector<Bytes>(10, udpFrom(kVmIp))).kept.size(), 10u);
+   EXPECT_EQ(send(id, kTx, std::vector<Bytes>(10, arpProbe())).kept.size(), 10u);
    EXPECT_EQ(ctx->counters.txRateLimitErrEntryCnt, 1u);
 }
 
 TEST_F(RateLimitTest, an_error_limit_of_zero_drops_everything_the_vm_sends_until_a_new_configuration)
 {
    const host::FilterId id = limited(1, 0);
-   EXPECT_THAT(kept(id, kTx, {arpProbe(), arpProbe(), udpFrom(kVmIp), arpProbe()}), ElementsAre(0u));
+   EXPECT_THAT(send(id, kTx, {arpProbe(), arpProbe(), udpFrom(kVmIp), arpProbe()}).kept, ElementsAre(0u));
    EXPECT_TRUE(passes(id, kRx, udpFrom(kPeerIp)));
    ASSERT_EQ(context(id)->txRateLimitErr, 1u);
    ASSERT_EQ(setFeatures(id, {kDai, 0, 32, 1, 0, 10}), 1u);
@@ -367,8 +368,8 @@ TEST_F(RateLimitTest, an_error_limit_of_zero_drops_everything_the_vm_sends_until
 TEST_F(RateLimitTest, without_an_arp_limit_nothing_is_limited_and_an_arp_header_cut_short_is_not_inspected)
 {
    const host::FilterId id = limited(0, 0, 0);
-   EXPECT_EQ(kept(id, kTx, std::vector<Bytes>(50, arpProbe())).size(), 50u);
-   EXPECT_EQ(kept(id, kRx, std::vector<Bytes>(50, arpFrom(kPeerMac, kPeerIp))).size(), 50u);
+   EXPECT_EQ(send(id, kTx, std::vector<Bytes>(50, arpProbe())).kept.size(), 50u);
+   EXPECT_EQ(send(id, kRx, std::vector<Bytes>(50, arpFrom(kPeerMac, kPeerIp))).kept.size(), 50u);
    Bytes cut = arpFrom(kPeerMac, kPeerIp);   // an unbound sender, one byte short of the header
    cut.resize(14 + 27);
    EXPECT_TRUE(passes(id, kTx, cut));

@@ -150,13 +150,9 @@ protected:
       }
       return host().sifra().processPackets(id, direction, specs);
    }
-   std::vector<size_t> kept(host::FilterId id, uint32_t direction, const std::vector<Bytes> &frames)
-   {
-      return send(id, direction, frames).kept;
-   }
    bool passes(host::FilterId id, uint32_t direction, const Bytes &frame)
    {
-      return kept(id, direction, {frame}).size() == 1;
+      return send(id, direction, {frame}).kept.size() == 1;
    }
 };
 

@@ -5,11 +5,7 @@
 #include "port_fixture.h"
 
 #include "framework/sifra_generic_agent.h"
-#include "framework/sifra_generic_saved_state.h"
 #include "session/saved_state_format.h"
-#include "swsec/swsec_saved_state.h"
-
-#include <gmock/gmock.h>
 
 #include <atomic>
 #include <chrono>

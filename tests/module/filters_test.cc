@@ -129,7 +129,7 @@ TEST_F(FilterTest, without_features_every_frame_stays_dropped_ones_leave_the_lis
 
 // ---------------------------------------------------------------- ioctls
 
-TEST_F(FilterTest, echo_answers_only_a_request_with_an_id_and_set_features_answers_every_one)
+TEST_F(FilterTest, echo_answers_only_a_request_with_an_id_set_features_every_one_and_get_vmi_lists_every_method)
 {
    const host::FilterId id = create();
    const Bytes echo = {1, 0, 0, 0, 'a', 'b', 'c', 0, 'x', 'y', '1'};
@@ -156,6 +156,21 @@ TEST_F(FilterTest, echo_answers_only_a_request_with_an_id_and_set_features_answe
    EXPECT_EQ(host().sifra().sendIoctl(id, 0, setFeaturesPayload({})), ORR_OK);
    ASSERT_EQ(host().sifra().ioctlReplies().size(), 1u);
    EXPECT_EQ(host().sifra().ioctlReplies()[0].bytes, (Bytes{8, 0, 0, 0, 1, 0, 0, 0}));
+
+   // Get-VMI: an empty database as count 0, then entries of every method.
+   EXPECT_EQ(host().sifra().sendIoctl(id, 12, typeOnly(9)), ORR_OK);
+   ASSERT_EQ(host().sifra().ioctlReplies().size(), 2u);
+   EXPECT_EQ(host().sifra().ioctlReplies()[1].bytes, (Bytes{10, 0, 0, 0, 0, 0, 0, 0}));
+
+   ASSERT_EQ(setFeatures(id, {.statics = {binding(5, kVmMac, kVmIp)}}), 1u);
+   bindByDhcp(id, {.mac = kPeerMac, .ip = Ip4::parse("10.0.0.20"), .server = kPeerIp});
+   ASSERT_TRUE(passes(id, kTx, arpFrom(kPeerMac, kPeerIp, 1)));
+   EXPECT_EQ(host().sifra().sendIoctl(id, 13, typeOnly(9)), ORR_OK);
+   EXPECT_EQ(host().sifra().ioctlReplies().back().bytes,
+             (Bytes{10, 0, 0, 0, 3, 0, 0, 0,                        // type, count
+                    5, 0, 0x02, 0, 0, 0, 0, 0x01, 10, 0, 0, 5,      // static
+                    0, 0, 0x02, 0, 0, 0, 0, 0x02, 10, 0, 0, 20,     // DHCP
+                    0, 0, 0x02, 0, 0, 0, 0, 0x02, 10, 0, 0, 9}));   // ARP
 }
 
 TEST_F(FilterTest, set_features_and_clear_payloads_shorter_than_their_records_are_refused)
@@ -183,24 +198,6 @@ TEST_F(FilterTest, set_features_and_clear_payloads_shorter_than_their_records_ar
    EXPECT_EQ(host().sifra().sendIoctl(id, 4, clear), ORR_OK);
    EXPECT_EQ(host().log().count("Clear VMI payload of"), 2u);
    EXPECT_EQ(+context(id)->config.numStatic, 1u);
-}
-
-TEST_F(FilterTest, get_vmi_lists_entries_of_every_method_and_an_empty_database_as_count_zero)
-{
-   const host::FilterId id = create();
-   EXPECT_EQ(host().sifra().sendIoctl(id, 12, typeOnly(9)), ORR_OK);
-   ASSERT_EQ(host().sifra().ioctlReplies().size(), 1u);
-   EXPECT_EQ(host().sifra().ioctlReplies()[0].bytes, (Bytes{10, 0, 0, 0, 0, 0, 0, 0}));
-
-   ASSERT_EQ(setFeatures(id, {.statics = {binding(5, kVmMac, kVmIp)}}), 1u);
-   bindByDhcp(id, {.mac = kPeerMac, .ip = Ip4::parse("10.0.0.20"), .server = kPeerIp});
-   ASSERT_TRUE(passes(id, kTx, arpFrom(kPeerMac, kPeerIp, 1)));
-   EXPECT_EQ(host().sifra().sendIoctl(id, 13, typeOnly(9)), ORR_OK);
-   EXPECT_EQ(host().sifra().ioctlReplies().back().bytes,
-             (Bytes{10, 0, 0, 0, 3, 0, 0, 0,                        // type, count
-                    5, 0, 0x02, 0, 0, 0, 0, 0x01, 10, 0, 0, 5,      // static
-                    0, 0, 0x02, 0, 0, 0, 0, 0x02, 10, 0, 0, 20,     // DHCP
-                    0, 0, 0x02, 0, 0, 0, 0, 0x02, 10, 0, 0, 9}));   // ARP
 }
 
 TEST_F(FilterTest, the_security_property_reads_back_the_header_and_the_static_keys_alone)

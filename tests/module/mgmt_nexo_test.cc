@@ -246,8 +246,8 @@ TEST_F(NexoTest, clear_requests_it_cannot_read_are_refused_and_change_nothing)
    }
    // Arguments that are not text, each logged with the filter's name.
    uint64_t nth = 1;
-   for (const char *message : {"vm-7.eth0: Invalid vlan str = (argument 1)",
-                               "vm-7.eth0: Invalid Mac str = (argument 2)", "vm-7.eth0: Invalid IP str = (argument 3)"}) {
+   for (const char *message : {"vm-7.eth0: Invalid vlan str = (argument 1)", "vm-7.eth0: Invalid Mac str = (argument 2)",
+                               "vm-7.eth0: Invalid IP str = (argument 3)"}) {
       host().faults().failOnce("Nexo_ParamListGetString", ORR_NOT_SUPPORTED, nth++);
       EXPECT_EQ(host().nexo().set(clear, {"one", "0", "02:00:00:01:02:03", "10.0.0.5"}), ORR_NOT_SUPPORTED);
       EXPECT_TRUE(loggedWithPrefix(host(), message, ORR_LOG_ERROR, "SwSecNexoReadClearKey"));

@@ -303,10 +303,7 @@ INSTANTIATE_TEST_SUITE_P(
       RestoreCase{"a_slow_path_part_one_byte_past_the_end",
                   [](Bytes &b) { putLe(b, 40, 1); }, ORR_FAILURE, "Buffer not large enough (expected "},
       RestoreCase{"a_slow_path_sum_that_wraps",
-                  [](Bytes &b) {
-                     putLe(b, 32, UINT64_MAX);
-                     putLe(b, 40, 2);
-                  },
+                  [](Bytes &b) { putLe(b, 32, UINT64_MAX); putLe(b, 40, 2); },
                   ORR_FAILURE, "dest: Buffer not large enough (expected 1, got "},
       RestoreCase{"an_agent_part_inside_the_header", [](Bytes &b) { putLe(b, 16, 40); }, ORR_FAILURE,
                   "dest: Bad state header offsets (40 "},
@@ -316,10 +313,7 @@ INSTANTIATE_TEST_SUITE_P(
                   [](Bytes &b) { putLe(b, 24, UINT64_MAX - 40); }, ORR_FAILURE,
                   "dest: Bad state header offsets (48 18446744073709551575 "},
       RestoreCase{"an_agent_part_too_short_for_its_fixed_bytes",
-                  [](Bytes &b) {
-                     putLe(b, 24, 95);
-                     putLe(b, 32, 48 + 95);
-                  },
+                  [](Bytes &b) { putLe(b, 24, 95); putLe(b, 32, 48 + 95); },
                   ORR_FAILURE, "dest: Failed to restore fast path agent state"},
       RestoreCase{"a_count_that_runs_past_the_part",
                   [](Bytes &b) { putLe(b, kAgent0 + 28, get32(b, kAgent0 + 28) + 1, 4); }, ORR_FAILURE,

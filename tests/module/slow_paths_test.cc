@@ -12,6 +12,7 @@
 
 #include <gmock/gmock.h>
 
+#include <algorithm>
 #include <functional>
 #include <map>
 #include <optional>
@@ -247,10 +248,8 @@ protected:
    void withdraw(uint32_t id)
    {
       step("unregister", [&] {
-         bool known = false;
-         for (const auto &info : slowPaths().registered()) {
-            known |= info.id == id;
-         }
+         const bool known =
+            std::ranges::any_of(slowPaths().registered(), [&](const auto &info) { return info.id == id; });
          orr_Status status = known ? slowPaths().unregisterSlowPath(id) : ORR_OK;   // else its registration failed
          for (int round = 0; status == ORR_BUSY && round < 10; ++round) {
             deliver();
@@ -319,11 +318,9 @@ TEST_P(SlowPathSweepTest, each_failure_in_turn_is_reported_and_undone)
       if (c.point != nullptr) {
          hit = host().faults().calls(c.point) - callsBefore >= n;
       } else {
-         size_t accepted = 0;
-         for (const auto &request : slowPaths().requests()) {
-            accepted += request.kind == SlowPathRequestKind::Set && request.result == ORR_OK;
-         }
-         hit = accepted >= n;
+         hit = std::ranges::count_if(slowPaths().requests(), [](const auto &request) {
+                  return request.kind == SlowPathRequestKind::Set && request.result == ORR_OK;
+               }) >= static_cast<std::ptrdiff_t>(n);
       }
       host().faults().clear();
       if (hit) {

@@ -390,9 +390,45 @@ def example():
     print(f"make-attacks: {c.name}: {len(c.frames)} frames")
 
 
+def lifetimes():
+    """Lifetimes against the port timer, which ticks every 10 s from the port's creation half a
+    second before frame 1 (capture times 9.5, 19.5, ...; uptime 1000 s at creation, so a tick at
+    capture time 10k - 0.5 reads uptime 1000 + 10k). Something whose lifetime ends at second E
+    goes at the first tick reading more than E."""
+    c = Capture("lifetimes")
+    req = lambda t, xid, **kw: c.add(t, from_vm_udp("0.0.0.0", "255.255.255.255", 68, 67,
+                                                    dhcp(REQUEST, xid, VM_MAC, **kw)))
+    renew = lambda t, xid: c.add(t, from_vm_udp(VM_IP, SRV_IP, 68, 67, dhcp(REQUEST, xid, VM_MAC, ciaddr=VM_IP),
+                                                dmac=SRV_MAC))
+    ack = lambda t, xid: c.add(t, to_vm_udp(VM_IP, dhcp(ACK, xid, VM_MAC, yiaddr=VM_IP, lease=60, server_id=SRV_IP)))
+    udp = lambda t, src: c.add(t, from_vm_udp(src, SRV_IP, 40000, 5353, b"traffic", dmac=SRV_MAC))
+    # A request at uptime 1000 is pending until 1060: the tick reading 1060 keeps it, its repeat
+    # (a new xid) keeps that lifetime, and the answer to the repeat binds VM_IP until 1120.
+    req(0.0, 0x7a000001, requested=VM_IP, server_id=SRV_IP)
+    c.add(1.0, arp(1, VM_MAC, "192.0.2.150", "00:00:00:00:00:00", SRV_IP))  # learned until 1181
+    req(30.0, 0x7a000002, requested=VM_IP, server_id=SRV_IP)
+    ack(60.0, 0x7a000002)
+    # A renewal pending until 1121, repeated: the repeat does not extend it, so the tick
+    # reading 1130 ends it and the answer at 130 s answers nothing.
+    renew(61.0, 0x7a000003)
+    renew(100.0, 0x7a000004)
+    udp(100.5, "192.0.2.150")  # renews the ARP-learned binding of a trusted port to 1281
+    udp(125.0, VM_IP)          # the tick reading 1120 kept the lease ending at 1120
+    ack(130.0, 0x7a000004)
+    # An ARP flood at uptime 1140: the error state lasts to 1150, so the tick reading 1150
+    # keeps it and the one reading 1160 ends it.
+    for k in range(11):
+        c.add(140.0 + 0.01 * k, arp(1, VM_MAC, "192.0.2.151", "00:00:00:00:00:00", SRV_IP))
+    for t in (155.0, 160.0):  # ARP probes: every one counts in the error state, none is inspected
+        for k in range(6):
+            c.add(t + 0.01 * k, arp(1, VM_MAC, "0.0.0.0", "00:00:00:00:00:00", f"192.0.2.{160 + k}"))
+    udp(190.0, "192.0.2.150")  # after the tick reading 1190: the renewed binding is still there
+    c.write()
+
+
 if __name__ == "__main__":
     os.makedirs(OUT, exist_ok=True)
     for make in (ip_spoof, arp_spoof, arp_flood, rogue_dhcp_server, bpdu, unsolicited_ack,
                  chaddr_mismatch, malformed_dhcp, ip_fragments, vlan100, stacked_tags, policy_edges,
-                 client_edges, example):
+                 client_edges, example, lifetimes):
         make()

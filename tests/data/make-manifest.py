@@ -16,9 +16,11 @@ configurations:
 Times: the port's clock is the capture's time; each capture starts 0.5 s after
 the port was configured, so the rate limiters' first interval opens with the
 first counted frame. VLAN: untagged frames are VLAN 0, 802.1Q-tagged frames
-carry their VID. No capture is long enough (all under 60 s) for a pending
-request or a lease to age out, and no error-rate-limit state can end before
-the capture does (it lasts at least 10 s, the flood capture ends 4 s later).
+carry their VID. Ageing: the port timer ticks every 10 s from the port's
+creation, the port's uptime then 1000 s; a pending request (60 s), a lease or
+a learned ARP entry (180 s, renewed by the VM's traffic on a trusted port)
+goes at the first tick past its expiry second, and the error-rate-limit state
+ends at the first tick past its period (the lifetimes capture shows each).
 """
 import ipaddress
 import json
@@ -57,6 +59,10 @@ CAPTURES = [
     ("attack-ip-spoof", "02:00:5e:c0:00:10", "crafted",
      "make-attacks.py: the VM is bound to 192.0.2.110 by a REQUEST/ACK, then sends IPv4 with its own and "
      "with spoofed source addresses (and once with a foreign source MAC)."),
+    ("lifetimes", "02:00:5e:c0:00:10", "crafted",
+     "make-attacks.py: over 190 s, a pending DHCP request and its repeat, the lease of 60 s its answer "
+     "gives, a renewal and its repeat answered too late, an ARP-learned binding renewed by traffic, and "
+     "an ARP flood's error state, each ending at a tick of the port timer."),
     ("attack-arp-spoof", "02:00:5e:c0:00:10", "crafted",
      "make-attacks.py: VM bound to 192.0.2.110, then ARP claiming other hosts' addresses."),
     ("attack-arp-flood", "02:00:5e:c0:00:10", "crafted",
@@ -297,6 +303,15 @@ def kind(p, frame):
     return "other"
 
 
+UPTIME_AT_START = 1000  # the host's uptime, in seconds, when the port is made half a second before frame 1
+TICK_US = 10_000_000    # the port timer's period
+
+
+def uptime(t):
+    """Whole seconds of uptime at capture time t (seconds after frame 1)."""
+    return (UPTIME_AT_START * 1_000_000 + 500_000 + round(t * 1e6)) // 1_000_000
+
+
 class Limiter:
     def __init__(self, limit, now):
         self.limit, self.end, self.count = limit, now, 0
@@ -319,7 +334,23 @@ class Port:
                                         "taggedDropCnt")}
         self.tx = Limiter(cfg["arpRateLimit"], t_start)
         self.rx = Limiter(cfg["arpRateLimit"], t_start)
-        self.err = False
+        self.err, self.err_end, self.ticks = False, 0, 0
+
+    def age(self, idx, t):
+        """The port timer's ticks due by capture time t, every 10 s from the port's creation: a
+        binding or request is removed by the first tick past its expiry second, the error state
+        ends at the first tick past its period. Removals show after the frame before idx."""
+        f = self.cfg["featuresEnabled"]
+        while (self.ticks + 1) * TICK_US - 500_000 <= round(t * 1e6):
+            self.ticks += 1
+            now = UPTIME_AT_START + self.ticks * TICK_US // 1_000_000
+            if not f & 0x4:
+                continue
+            for v in [v for v in self.vmis if v["method"] != "Static" and v["expiry"] < now]:
+                self.delete(v, idx - 1)
+            self.reqs = [r for r in self.reqs if r["expiry"] >= now]
+            if f & 0x8 and self.cfg["arpRateLimit"] and self.err and now > self.err_end:
+                self.tx, self.err = Limiter(self.cfg["arpRateLimit"], self.ticks * 10 - 0.5), False
 
     def find(self, vlan, m, a):
         return next((v for v in self.vmis if (v["vlan"], v["mac"], v["ip"]) == (vlan, m, a)), None)
@@ -340,6 +371,7 @@ class Port:
 
     def judge(self, idx, t, frame, p, from_vm):
         """Returns None (pass) or the rule that drops the frame."""
+        self.age(idx, t)
         f, c = self.cfg["featuresEnabled"], self.counters
         if from_vm and p["tags"]:
             c["taggedDropCnt"] += 1
@@ -357,6 +389,7 @@ class Port:
                             return "error-rate-limit state (txRateLimitDropCnt)"
                     elif is_arp and self.tx.reached(t):
                         self.tx, self.err = Limiter(self.cfg["errRateLimit"], t), True
+                        self.err_end = uptime(t) + self.cfg["errRateLimitPeriod"]
                         c["txRateLimitErrEntryCnt"] += 1
                         c["txRateLimitDropCnt"] += 1
                         return "ARP rate limit exceeded, port enters the error-rate-limit state"
@@ -385,20 +418,28 @@ class Port:
         v4, u = p.get("ipv4"), p.get("udp")
         if v4 and u and not v4["frag"]:
             if from_vm and u["dport"] == 67:
-                return self.client_dhcp(idx, frame, p)
+                return self.client_dhcp(idx, t, frame, p)
             if not from_vm:
-                return self.server_dhcp(idx, frame, p) if u["dport"] == 68 else None
+                return self.server_dhcp(idx, t, frame, p) if u["dport"] == 68 else None
         if not from_vm or not self.cfg["trusted"]:
             return None
         a = p.get("arp")
         if p["etype"] == 0x0806:
             if a and a["ok"] and a["spa"] != "0.0.0.0" and (a["op"] == 1 or (a["op"] == 2 and a["spa"] == a["tpa"])):
-                if not self.find(p["vlan"], a["sha"], a["spa"]):
+                v = self.find(p["vlan"], a["sha"], a["spa"])
+                if not v:
                     self.add({"vlan": p["vlan"], "mac": a["sha"], "ip": a["spa"], "method": "ARP Snooping",
-                              "leaseSeconds": 180}, idx)
+                              "leaseSeconds": 180, "expiry": uptime(t) + 180}, idx)
+                elif v["method"] == "ARP Snooping":
+                    v["expiry"] = uptime(t) + 180
+        elif "ipv4" in p:
+            # Traffic from a learned (not authoritative) binding renews it.
+            v = self.find(p["vlan"], p["src"], p["ipv4"]["src"])
+            if v and v["method"] == "ARP Snooping":
+                v["expiry"] = uptime(t) + 180
         return None
 
-    def client_dhcp(self, idx, frame, p):
+    def client_dhcp(self, idx, t, frame, p):
         d, _ = parse_dhcp(frame, p["udp"])
         if not d:
             return None
@@ -421,10 +462,11 @@ class Port:
             if req:
                 req["xid"] = d["xid"]
             else:
-                self.reqs.append({"vlan": vlan, "xid": d["xid"], "chaddr": d["chaddr"], "cid": d["cid"]})
+                self.reqs.append({"vlan": vlan, "xid": d["xid"], "chaddr": d["chaddr"], "cid": d["cid"],
+                                  "expiry": uptime(t) + 60})
         return None
 
-    def server_dhcp(self, idx, frame, p):
+    def server_dhcp(self, idx, t, frame, p):
         d, _ = parse_dhcp(frame, p["udp"])
         if not d or d["type"] not in (5, 6):
             return None
@@ -439,9 +481,9 @@ class Port:
         elif not v:
             self.add({"vlan": req["vlan"], "mac": req["chaddr"], "ip": d["yiaddr"], "method": "DHCP Snooping",
                       "leaseSeconds": d["lease"], "chaddr": req["chaddr"], "cid": req["cid"],
-                      "serverIp": d["siaddr"]}, idx)
+                      "serverIp": d["siaddr"], "expiry": uptime(t) + d["lease"]}, idx)
         else:
-            v["leaseSeconds"] = d["lease"]
+            v["leaseSeconds"], v["expiry"] = d["lease"], uptime(t) + d["lease"]
             if v["ip"] != d["yiaddr"]:
                 self.events.append({"index": idx, "event": "portdb.entry.removed", **key(v)})
                 v["ip"] = d["yiaddr"]
@@ -997,6 +1039,17 @@ NOTES = {
     "attack-bpdu":
         "IEEE 802.3 frames with LLC (STP) or LLC/SNAP (PVST+). The BPDU filter drops them in both "
         "directions; nothing else looks at them.",
+    "lifetimes":
+        "Ticks at 9.5 s, 19.5 s, ... read uptime 1010, 1020, ... The request of frame 1 (uptime 1000) "
+        "is pending until 1060: the tick reading 1060 keeps it, and its repeat (frame 3, a new xid) "
+        "keeps that lifetime, so frame 4 answers it and binds 192.0.2.110 until 1120. The tick reading "
+        "1120 keeps the lease (frame 8 passes source guard), the one reading 1130 removes it (after "
+        "frame 8). The renewal of frame 5 is pending until 1121, its repeat (frame 6) does not extend "
+        "it, so the tick reading 1130 ends it and frame 9 answers nothing. Learning: frame 2 learns "
+        "192.0.2.150 until 1181, frame 7 renews it to 1281, so it outlives the tick reading 1190. "
+        "Enforcing: frame 20 enters the error state at 1140 until 1150; at 155 s every frame counts "
+        "against errRateLimit 5 (frame 26 dropped); the tick reading 1160 ends it, so at 160 s the "
+        "six ARP probes pass.",
     "attack-policy-edges":
         "Enforcing: the DHCP server block drops only UDP from the server port of the frame's own family "
         "sent by the VM, so all four UDP frames pass the IPv4 agent. ARP inspection reads only "
@@ -1086,8 +1139,11 @@ snooping, ARP snooping), IP source guard. Two port configurations:
   arpRateLimit 10, errRateLimit 5, errRateLimitPeriod 10.
 
 The port's clock is the capture's clock (the port configured 0.5 s before the
-first frame). No capture lasts long enough for ageing (pending requests 60 s,
-leases 120 s, ARP entries 180 s) or for the error-rate-limit state to end.
+first frame, at uptime 1000 s). The port timer ticks every 10 s from then: a
+pending request (60 s), a lease, or an ARP entry (180 s, renewed by the VM's
+traffic on a trusted port) goes at the first tick whose uptime second is past
+its expiry, and the error-rate-limit state ends at the first tick past its
+period; only the lifetimes capture lasts long enough for any of it.
 DHCP bindings are keyed by VLAN, chaddr and client identifier (option 61) when
 present, which is how a renewal, release or NAK finds the client's entry.
 

@@ -198,9 +198,10 @@ TEST_P(ManifestReplay, verdicts_events_database_and_counters_match_the_manifest_
 
    EXPECT_EQ(nonZeroCounters(result.ports[0]), expectedCounters(expected));
 
-   // No capture lasts long enough for a timer to matter, so frames handed
-   // over in lists decide as single frames do; a list's events are seen
-   // after its last frame, never before the frame that made them.
+   // A list spans at most a millisecond and no capture puts a timer tick
+   // inside one, so frames handed over in lists decide as single frames do;
+   // a list's events are seen after its last frame, never before the frame
+   // that made them.
    const replay::ReplayResult batched = replayCase(32);
    ASSERT_EQ(batched.frames.size(), result.frames.size());
    for (size_t i = 0; i < result.frames.size(); ++i) {

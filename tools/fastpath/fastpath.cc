@@ -462,50 +462,55 @@ void Program::apply(const BindingChange &change)
    }
 }
 
-std::vector<Binding> Program::bindings() const
+namespace {
+
+// Calls `visit` with each key and value of a hash map holding at most
+// `limit` keys (the bound keeps a walk finite while the map changes).
+template <typename Key, typename Value, typename Visit>
+void forEachEntry(int fd, int limit, Visit visit)
 {
-   const int fd = mapFd("swsec_bindings");
-   std::vector<Binding> out;
-   swsec_fp_binding_key key{};
-   swsec_fp_binding_key next{};
+   Key key{};
+   Key next{};
    const void *previous = nullptr;
-   // The map holds at most SWSEC_FP_MAX_BINDINGS keys.
-   for (int guard = 0; guard <= SWSEC_FP_MAX_BINDINGS && bpf_map_get_next_key(fd, previous, &next) == 0; ++guard) {
-      swsec_fp_binding value{};
+   for (int guard = 0; guard <= limit && bpf_map_get_next_key(fd, previous, &next) == 0; ++guard) {
+      Value value{};
       if (bpf_map_lookup_elem(fd, &next, &value) == 0) {
-         Binding binding;
-         binding.vlan = next.vlan;
-         std::memcpy(binding.mac.data(), next.mac, sizeof next.mac);
-         binding.ip = next.ip;
-         binding.authoritative = value.authoritative != 0;
-         out.push_back(binding);
+         visit(next, value);
       }
       key = next;
       previous = &key;
    }
+}
+
+}  // namespace
+
+std::vector<Binding> Program::bindings() const
+{
+   std::vector<Binding> out;
+   forEachEntry<swsec_fp_binding_key, swsec_fp_binding>(
+      mapFd("swsec_bindings"), SWSEC_FP_MAX_BINDINGS, [&out](const auto &key, const auto &value) {
+         Binding binding;
+         binding.vlan = key.vlan;
+         std::memcpy(binding.mac.data(), key.mac, sizeof key.mac);
+         binding.ip = key.ip;
+         binding.authoritative = value.authoritative != 0;
+         out.push_back(binding);
+      });
    return out;
 }
 
 std::vector<Binding6> Program::bindings6() const
 {
-   const int fd = mapFd("swsec_bindings6");
    std::vector<Binding6> out;
-   swsec_fp_binding6_key key{};
-   swsec_fp_binding6_key next{};
-   const void *previous = nullptr;
-   for (int guard = 0; guard <= SWSEC_FP_MAX_BINDINGS6 && bpf_map_get_next_key(fd, previous, &next) == 0; ++guard) {
-      swsec_fp_binding6 value{};
-      if (bpf_map_lookup_elem(fd, &next, &value) == 0) {
+   forEachEntry<swsec_fp_binding6_key, swsec_fp_binding6>(
+      mapFd("swsec_bindings6"), SWSEC_FP_MAX_BINDINGS6, [&out](const auto &key, const auto &value) {
          Binding6 binding;
-         binding.vlan = next.vlan;
-         std::memcpy(binding.mac.data(), next.mac, sizeof next.mac);
-         std::memcpy(binding.addr.data(), next.addr, sizeof next.addr);
+         binding.vlan = key.vlan;
+         std::memcpy(binding.mac.data(), key.mac, sizeof key.mac);
+         std::memcpy(binding.addr.data(), key.addr, sizeof key.addr);
          binding.fcfs = value.fcfs != 0;
          out.push_back(binding);
-      }
-      key = next;
-      previous = &key;
-   }
+      });
    return out;
 }
 

@@ -8,6 +8,7 @@
 #include <sys/socket.h>
 
 #include <cstring>
+#include <tuple>
 
 namespace swsec::live {
 namespace {
@@ -91,14 +92,9 @@ TEST(LinkMessages, whole_cut_and_malformed)
    }
    const auto events = parseLinkMessages(two);
    ASSERT_EQ(events.size(), 2u);
-   EXPECT_FALSE(events[0].removed);
-   EXPECT_EQ(events[0].ifindex, 7);
-   EXPECT_EQ(events[0].master, 4);
-   EXPECT_EQ(events[0].mtu, 9000u);
-   EXPECT_EQ(events[0].mac, "fe:54:00:01:02:03");
-   EXPECT_EQ(events[0].kind, "tun");
-   EXPECT_TRUE(events[1].removed);
-   EXPECT_FALSE(events[1].hasMaster);
+   const auto fields = [](const LinkEvent &e) { return std::tuple(e.removed, e.ifindex, e.master, e.hasMaster, e.mtu, e.mac, e.kind); };
+   EXPECT_EQ(fields(events[0]), std::tuple(false, 7, 4, true, 9000u, "fe:54:00:01:02:03", "tun"));
+   EXPECT_EQ(fields(events[1]), std::tuple(true, 8, 0, false, 9000u, "fe:54:00:01:02:03", "tun"));
 }
 
 TEST(WatchRule, joins_and_leaves)

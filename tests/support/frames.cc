@@ -1,6 +1,9 @@
 #include "frames.h"
 
-#include <charconv>
+#include <arpa/inet.h>
+
+#include <algorithm>
+#include <cstdio>
 #include <cstring>
 #include <stdexcept>
 #include <string>
@@ -8,18 +11,6 @@
 namespace swsec::testing {
 
 namespace {
-
-void put16(Bytes &out, uint16_t v)
-{
-   out.push_back(static_cast<uint8_t>(v >> 8));
-   out.push_back(static_cast<uint8_t>(v));
-}
-
-void put32(Bytes &out, uint32_t v)
-{
-   put16(out, static_cast<uint16_t>(v >> 16));
-   put16(out, static_cast<uint16_t>(v));
-}
 
 template <size_t N>
 void putArray(Bytes &out, const std::array<uint8_t, N> &bytes)
@@ -44,39 +35,28 @@ uint16_t checksum(const uint8_t *data, size_t length)
    return static_cast<uint16_t>(~sum);
 }
 
-template <size_t N>
-std::array<uint8_t, N> parseParts(std::string_view text, char separator, int base,
-                                   std::string_view what)
-{
-   std::array<uint8_t, N> out{};
-   size_t pos = 0;
-   for (size_t i = 0; i < N; ++i) {
-      size_t end = text.find(separator, pos);
-      if ((i + 1 < N) == (end == std::string_view::npos)) {
-         throw std::invalid_argument("bad " + std::string(what) + ": " + std::string(text));
-      }
-      std::string_view part = text.substr(pos, end == std::string_view::npos ? text.npos : end - pos);
-      unsigned value = 0;
-      auto [p, ec] = std::from_chars(part.data(), part.data() + part.size(), value, base);
-      if (ec != std::errc{} || p != part.data() + part.size() || part.empty() || value > 255) {
-         throw std::invalid_argument("bad " + std::string(what) + ": " + std::string(text));
-      }
-      out[i] = static_cast<uint8_t>(value);
-      pos = end + 1;
-   }
-   return out;
-}
-
 }  // namespace
 
 Mac Mac::parse(std::string_view text)
 {
-   return Mac{parseParts<6>(text, ':', 16, "MAC")};
+   Mac mac;
+   unsigned b[6];
+   int end = 0;
+   if (std::sscanf(std::string(text).c_str(), "%2x:%2x:%2x:%2x:%2x:%2x%n", &b[0], &b[1], &b[2], &b[3], &b[4], &b[5], &end) != 6 ||
+       size_t(end) != text.size()) {
+      throw std::invalid_argument("bad MAC: " + std::string(text));
+   }
+   std::copy(b, b + 6, mac.bytes.begin());
+   return mac;
 }
 
 Ip4 Ip4::parse(std::string_view text)
 {
-   return Ip4{parseParts<4>(text, '.', 10, "IPv4 address")};
+   Ip4 ip;
+   if (inet_pton(AF_INET, std::string(text).c_str(), ip.bytes.data()) != 1) {
+      throw std::invalid_argument("bad IPv4 address: " + std::string(text));
+   }
+   return ip;
 }
 
 uint32_t Ip4::raw() const
@@ -92,10 +72,10 @@ Bytes ethernet(const EthernetHeader &header, const Bytes &payload)
    putArray(out, header.dst.bytes);
    putArray(out, header.src.bytes);
    if (header.vlanTag) {
-      put16(out, kEtherVlan);
-      put16(out, static_cast<uint16_t>(*header.vlanTag & 0x0fff));
+      put16be(out, kEtherVlan);
+      put16be(out, static_cast<uint16_t>(*header.vlanTag & 0x0fff));
    }
-   put16(out, header.etherType);
+   put16be(out, header.etherType);
    append(out, payload);
    return out;
 }
@@ -103,11 +83,10 @@ Bytes ethernet(const EthernetHeader &header, const Bytes &payload)
 static Bytes arpPayload(const Arp &arp)
 {
    Bytes out;
-   put16(out, arp.hardwareType);
-   put16(out, arp.protocolType);
-   out.push_back(arp.hardwareLength);
-   out.push_back(arp.protocolLength);
-   put16(out, arp.op);
+   put16be(out, 1);   // Ethernet
+   put16be(out, arp.protocolType);
+   out.insert(out.end(), {6, 4});
+   put16be(out, arp.op);
    putArray(out, arp.senderMac.bytes);
    putArray(out, arp.senderIp.bytes);
    putArray(out, arp.targetMac.bytes);
@@ -120,12 +99,12 @@ Bytes ipv4(const Ipv4Header &header, const Bytes &payload)
    Bytes out;
    out.push_back(0x45);
    out.push_back(0);
-   put16(out, static_cast<uint16_t>(20 + payload.size()));
-   put16(out, header.id);
-   put16(out, static_cast<uint16_t>(header.fragmentOffset & 0x1fff));
+   put16be(out, static_cast<uint16_t>(20 + payload.size()));
+   put16be(out, header.id);
+   put16be(out, static_cast<uint16_t>(header.fragmentOffset & 0x1fff));
    out.push_back(64);   // TTL
    out.push_back(header.protocol);
-   put16(out, 0);
+   put16be(out, 0);
    putArray(out, header.src.bytes);
    putArray(out, header.dst.bytes);
    uint16_t sum = checksum(out.data(), 20);
@@ -138,10 +117,10 @@ Bytes ipv4(const Ipv4Header &header, const Bytes &payload)
 Bytes ipv6(const Ipv6Header &header, const Bytes &payload)
 {
    Bytes out;
-   put32(out, 0x60000000u);
-   put16(out, static_cast<uint16_t>(payload.size()));
+   put32be(out, 0x60000000u);
+   put16be(out, static_cast<uint16_t>(payload.size()));
    out.push_back(header.nextHeader);
-   out.push_back(header.hopLimit);
+   out.push_back(64);
    putArray(out, header.src);
    putArray(out, header.dst);
    append(out, payload);
@@ -151,10 +130,10 @@ Bytes ipv6(const Ipv6Header &header, const Bytes &payload)
 Bytes udp(const UdpHeader &header, const Bytes &payload)
 {
    Bytes out;
-   put16(out, header.srcPort);
-   put16(out, header.dstPort);
-   put16(out, static_cast<uint16_t>(8 + payload.size()));
-   put16(out, 0);  // no checksum, as IPv4 allows
+   put16be(out, header.srcPort);
+   put16be(out, header.dstPort);
+   put16be(out, static_cast<uint16_t>(8 + payload.size()));
+   put16be(out, 0);  // no checksum, as IPv4 allows
    append(out, payload);
    return out;
 }
@@ -166,13 +145,13 @@ static Bytes dhcpPayload(const Dhcp &dhcp)
    out.push_back(dhcp.htype);
    out.push_back(dhcp.hlen);
    out.push_back(0);
-   put32(out, dhcp.xid);
-   put16(out, 0);
-   put16(out, 0);
+   put32be(out, dhcp.xid);
+   put16be(out, 0);
+   put16be(out, 0);
    putArray(out, dhcp.ciaddr.bytes);
    putArray(out, dhcp.yiaddr.bytes);
    putArray(out, dhcp.siaddr.bytes);
-   putArray(out, dhcp.giaddr.bytes);
+   out.resize(out.size() + 4, 0);              // giaddr
    putArray(out, dhcp.chaddr.bytes);
    out.resize(out.size() + 10 + 64 + 128, 0);  // rest of chaddr, sname, file
    putArray(out, dhcp.cookie);
@@ -189,7 +168,7 @@ static Bytes dhcpPayload(const Dhcp &dhcp)
    }
    if (dhcp.leaseTime) {
       Bytes lease;
-      put32(lease, *dhcp.leaseTime);
+      put32be(lease, *dhcp.leaseTime);
       option(51, lease);
    }
    for (const auto &o : dhcp.options) {
@@ -207,13 +186,10 @@ static Bytes dhcpPayload(const Dhcp &dhcp)
 
 Bytes dhcpFrame(const DhcpFrame &frame)
 {
-   Bytes payload = dhcpPayload(frame.dhcp);
-   UdpHeader udpHeader{.srcPort = static_cast<uint16_t>(frame.fromServer ? 67 : 68),
-                       .dstPort = static_cast<uint16_t>(frame.fromServer ? 68 : 67)};
-   Bytes l3 = ipv4({.src = frame.ipSrc, .dst = frame.ipDst, .protocol = 17}, udp(udpHeader, payload));
-   return ethernet({.dst = frame.dst, .src = frame.src, .etherType = kEtherIpv4,
-                    .vlanTag = frame.vlanTag},
-                   l3);
+   const uint16_t client = 68, server = 67;
+   return udpFrame({.src = frame.src, .dst = frame.dst, .ipSrc = frame.ipSrc, .ipDst = frame.ipDst,
+                    .srcPort = frame.fromServer ? server : client, .dstPort = frame.fromServer ? client : server,
+                    .payload = dhcpPayload(frame.dhcp), .vlanTag = frame.vlanTag});
 }
 
 Bytes pushTag(Bytes frame, uint16_t tpid, uint16_t vlanId, int count)
@@ -251,13 +227,10 @@ Bytes udp6Frame(const Udp6Frame &frame)
 
 Bytes bpduFrame(const Mac &src, const Mac &dst)
 {
-   Bytes out;
-   putArray(out, dst.bytes);
-   putArray(out, src.bytes);
-   put16(out, 38);   // an 802.3 length, not an ethertype: LLC, then a configuration BPDU of zeros
-   append(out, {0x42, 0x42, 0x03});
-   out.resize(out.size() + 35, 0);
-   return out;
+   // An 802.3 length, not an ethertype: LLC, then a configuration BPDU of zeros.
+   Bytes llc{0x42, 0x42, 0x03};
+   llc.resize(38, 0);
+   return ethernet({.dst = dst, .src = src, .etherType = 38}, llc);
 }
 
 }  // namespace swsec::testing

@@ -14,6 +14,11 @@ namespace swsec::testing {
 
 using Bytes = std::vector<uint8_t>;
 
+// Big-endian writers and concatenation, for the builders here and in ipv6_frames.h.
+inline void put16be(Bytes &out, uint32_t v) { out.insert(out.end(), {uint8_t(v >> 8), uint8_t(v)}); }
+inline void put32be(Bytes &out, uint32_t v) { put16be(out, v >> 16), put16be(out, v); }
+inline Bytes cat(Bytes a, const Bytes &b) { return a.insert(a.end(), b.begin(), b.end()), a; }
+
 struct Mac {
    std::array<uint8_t, 6> bytes{};
    static Mac parse(std::string_view text);  // "02:00:00:00:00:01"
@@ -54,10 +59,7 @@ struct Arp {
    Ip4 senderIp;
    Mac targetMac;
    Ip4 targetIp;
-   uint16_t hardwareType = 1;
    uint16_t protocolType = kEtherIpv4;
-   uint8_t hardwareLength = 6;
-   uint8_t protocolLength = 4;
 };
 
 struct Ipv4Header {
@@ -73,7 +75,6 @@ struct Ipv6Header {
    std::array<uint8_t, 16> src{};
    std::array<uint8_t, 16> dst{};
    uint8_t nextHeader = 17;
-   uint8_t hopLimit = 64;
 };
 Bytes ipv6(const Ipv6Header &header, const Bytes &payload);
 
@@ -85,13 +86,11 @@ Bytes udp(const UdpHeader &header, const Bytes &payload);
 
 enum DhcpType : uint8_t {
    kDhcpDiscover = 1,
-   kDhcpOffer = 2,
    kDhcpRequest = 3,
    kDhcpDecline = 4,
    kDhcpAck = 5,
    kDhcpNak = 6,
    kDhcpRelease = 7,
-   kDhcpInform = 8,
 };
 
 struct DhcpOption {
@@ -109,7 +108,6 @@ struct Dhcp {
    Ip4 ciaddr;
    Ip4 yiaddr;
    Ip4 siaddr;
-   Ip4 giaddr;
    Mac chaddr;
    std::optional<uint8_t> type;
    std::optional<Bytes> clientId;

@@ -22,9 +22,6 @@ inline Addr6 a6(const std::string &text)
    return addr;
 }
 
-inline void put16be(Bytes &out, uint32_t v) { out.insert(out.end(), {uint8_t(v >> 8), uint8_t(v)}); }
-inline void put32be(Bytes &out, uint32_t v) { put16be(out, v >> 16), put16be(out, v); }
-inline Bytes cat(Bytes a, const Bytes &b) { return a.insert(a.end(), b.begin(), b.end()), a; }
 
 // An extension header of (units + 1) * 8 bytes (AH: (units + 2) * 4) before `next`.
 inline Bytes ext(uint8_t next, uint8_t units = 0, bool ah = false)

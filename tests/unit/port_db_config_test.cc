@@ -115,13 +115,6 @@ TEST_F(PortDbConfigTest, the_built_in_agent_port_is_mapped_and_gets_one_timer)
    ASSERT_EQ(configure(config(kOn, 0, 16)), ORR_OK);
    EXPECT_EQ(portFilterMapDb.numPfm, 1u);
    EXPECT_EQ(ctx_.portDbTimer, timer);
-
-   // The timer runs the ageing pass every 10 s under configLock.
-   ASSERT_EQ(add({1, 1, 1}, kArp, uptime() + 10), 0);   // due with the first tick
-   host().clock().advance(std::chrono::seconds(10));
-   EXPECT_EQ(ctx_.numVmiEntries, 1u);
-   host().clock().advance(std::chrono::seconds(10));
-   EXPECT_EQ(ctx_.numVmiEntries, 0u);
 }
 
 TEST_F(PortDbConfigTest, ports_of_other_agents_stay_out_of_the_map)

@@ -20,6 +20,7 @@
 #include "fuzz_input.h"
 #include "session/config_file.h"
 #include "twin.h"
+#include "tests/support/frames.h"
 
 #include <cstdio>
 #include <cstdlib>
@@ -27,7 +28,8 @@
 namespace {
 
 using swsec::fuzz::FuzzInput;
-using Bytes = std::vector<uint8_t>;
+using swsec::testing::Bytes;
+using swsec::testing::put16be;
 
 constexpr std::array<uint8_t, 6> kMacs[4] = {{0x02, 0x00, 0x5e, 0xc0, 0x00, 0x01}, {0x02, 0x00, 0x5e, 0xc0, 0x00, 0x99},
                                              {0xff, 0xff, 0xff, 0xff, 0xff, 0xff}, {0x01, 0x80, 0xc2, 0x00, 0x00, 0x00}};
@@ -67,11 +69,6 @@ swsec::session::PortSecurityConfig config(FuzzInput &in)
    return out;
 }
 
-void put16(Bytes &out, uint16_t value)
-{
-   out.insert(out.end(), {static_cast<uint8_t>(value >> 8), static_cast<uint8_t>(value)});
-}
-
 // An IPv6 packet from `src`: at most one extension header, then the upper layer.
 void ipv6(FuzzInput &in, Bytes &out, uint8_t choices, const std::array<uint8_t, 16> &src)
 {
@@ -95,16 +92,16 @@ void ipv6(FuzzInput &in, Bytes &out, uint8_t choices, const std::array<uint8_t, 
          payload.insert(payload.end(), kMacs[choices & 3u].begin(), kMacs[choices & 3u].end());
       }
    } else if (upper == 17 || upper == 6) {
-      put16(payload, kPorts6[(choices >> 6) & 3u]);
-      put16(payload, kPorts6[(choices >> 2) & 3u]);
+      put16be(payload, kPorts6[(choices >> 6) & 3u]);
+      put16be(payload, kPorts6[(choices >> 2) & 3u]);
       payload.resize(payload.size() + (upper == 17 ? 4 : 16), 0);
       if (upper == 17) {
          payload.push_back(static_cast<uint8_t>(1 + (choices & 0x0fu)));   // a DHCPv6 message type
       }
    }
-   put16(out, 0x86dd);
+   put16be(out, 0x86dd);
    out.insert(out.end(), {0x60, 0, 0, 0});
-   put16(out, static_cast<uint16_t>(payload.size() + (overrun ? 64 : 0)));
+   put16be(out, static_cast<uint16_t>(payload.size() + (overrun ? 64 : 0)));
    out.insert(out.end(), {first, 255});
    out.insert(out.end(), src.begin(), src.end());
    const std::array<uint8_t, 16> to = {0xff, 0x02, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 1};
@@ -124,15 +121,15 @@ Bytes frame(FuzzInput &in, uint32_t &direction)
    out.insert(out.end(), src.begin(), src.end());
    for (const uint16_t tpid : {kTpids[(shape >> 1) & 3u], kTpids[(shape >> 3) & 3u]}) {
       if (tpid != 0) {
-         put16(out, tpid);
-         put16(out, (choices & 0x40u) != 0 ? 100 : 0);
+         put16be(out, tpid);
+         put16be(out, (choices & 0x40u) != 0 ? 100 : 0);
       }
    }
    switch (const unsigned kind = shape >> 5) {
    case 0: case 1: case 2: {
       const uint8_t flags = in.byte();
       const uint8_t words = 5 + (in.byte() & 1u);
-      put16(out, 0x0800);
+      put16be(out, 0x0800);
       out.insert(out.end(), {static_cast<uint8_t>(0x40 | words), 0, 0, 60, 0, 1, flags, in.byte(), 64,
                 static_cast<uint8_t>(kind == 0 ? 17 : kind == 1 ? 6 : 1), 0, 0});
       out.insert(out.end(), ip.begin(), ip.end());
@@ -141,7 +138,7 @@ Bytes frame(FuzzInput &in, uint32_t &direction)
       break;
    }
    case 3:
-      put16(out, 0x0806);
+      put16be(out, 0x0806);
       out.insert(out.end(), {0, 1, 8, 0, 6, 4, 0, static_cast<uint8_t>(1 + (choices >> 7))});
       out.insert(out.end(), src.begin(), src.end());
       out.insert(out.end(), ip.begin(), ip.end());
@@ -152,11 +149,11 @@ Bytes frame(FuzzInput &in, uint32_t &direction)
       ipv6(in, out, choices, kIp6s[(choices >> 4) & 3u]);
       break;
    default:
-      put16(out, in.u16());
+      put16be(out, in.u16());
    }
    if ((shape >> 5) != 4) {
-      put16(out, kPorts[(choices >> 6) & 3u]);
-      put16(out, kPorts[(choices >> 4) & 3u]);
+      put16be(out, kPorts[(choices >> 6) & 3u]);
+      put16be(out, kPorts[(choices >> 4) & 3u]);
    }
    out.resize(std::max<size_t>(out.size(), 60), 0);
    if (cut >= 14 && cut < out.size()) {

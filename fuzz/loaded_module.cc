@@ -30,16 +30,6 @@ host::FilterId createFilter(host::Host &host, std::string_view agent, uint32_t p
    return id;
 }
 
-host::FilterId createPort(host::Host &host, uint32_t portId, const testing::PortConfig &config)
-{
-   return createFilter(host, kAgent, portId, kSecurityProperty, testing::configRecord(config));
-}
-
-void addIpv6Agent(host::Host &host, uint32_t portId, const contract::Ipv6SecurityConfig &config)
-{
-   (void)createFilter(host, kFhsAgent, portId, std::string(kFhsAgent) + ".security", contract::fhsConfigRecord(config));
-}
-
 LoadedModule *make()
 {
    auto *module = new LoadedModule();
@@ -52,14 +42,15 @@ LoadedModule *make()
    module->host.portsets().addPort("vs0", kRestoredPort);
    // The VM of the test captures, bound statically so that source checks pass for it.
    const testing::StaticBinding vm{.vlan = 0, .mac = {0x02, 0x00, 0x5e, 0xc0, 0x00, 0x01}, .ip = {192, 0, 2, 101}};
-   module->enforcing = createPort(module->host, kEnforcingPort, testing::enforcingConfig({vm}));
-   module->learning = createPort(module->host, kLearningPort, testing::learningConfig());
+   module->enforcing = createFilter(module->host, kAgent, kEnforcingPort, kSecurityProperty, testing::configRecord(testing::enforcingConfig({vm})));
+   module->learning = createFilter(module->host, kAgent, kLearningPort, kSecurityProperty, testing::configRecord(testing::learningConfig()));
    if (module->host.plex().write(kAgentProperty, kFhsAgent) != ORR_OK) {
       fail("IPv6 agent");
    }
-   addIpv6Agent(module->host, kEnforcingPort,
-                {.features = FhsFeaturesKnown, .trusted = false, .ndRateLimit = 10, .errRateLimit = 5, .errRateLimitPeriod = 10});
-   addIpv6Agent(module->host, kLearningPort, {});
+   const std::string fhsProperty = std::string(kFhsAgent) + ".security";
+   (void)createFilter(module->host, kFhsAgent, kEnforcingPort, fhsProperty,
+                      contract::fhsConfigRecord({.features = FhsFeaturesKnown, .trusted = false, .ndRateLimit = 10, .errRateLimit = 5, .errRateLimitPeriod = 10}));
+   (void)createFilter(module->host, kFhsAgent, kLearningPort, fhsProperty, contract::fhsConfigRecord({}));
    module->forgetRecords();
    return module;
 }

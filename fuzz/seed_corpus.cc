@@ -38,11 +38,6 @@ void write(const fs::path &path, const Bytes &prefix, const Bytes &body)
    out.write(reinterpret_cast<const char *>(body.data()), static_cast<std::streamsize>(body.size()));
 }
 
-Bytes textBytes(std::string_view text)
-{
-   return Bytes(text.begin(), text.end());
-}
-
 }  // namespace
 
 int main(int argc, char **argv)
@@ -90,8 +85,9 @@ int main(int argc, char **argv)
       // Request ID 1, then the message type as the payload's first u32.
       write(controlDir / ("ioctl-" + std::to_string(type)), {1, 0, 0, 0, 0, 1}, {type, 0, 0, 0, 0, 0, 0, 0});
    }
-   write(controlDir / "agent-one", {2, 0}, textBytes("swsec-extra"));
-   write(controlDir / "agent-args", {2, 0}, textBytes("a:b,c"));
+   const auto text = [](std::string_view chars) { return Bytes(chars.begin(), chars.end()); };
+   write(controlDir / "agent-one", {2, 0}, text("swsec-extra"));
+   write(controlDir / "agent-args", {2, 0}, text("a:b,c"));
    std::printf("seed_corpus: %zu frames\n", count);
    return 0;
 }

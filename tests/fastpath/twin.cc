@@ -2,8 +2,8 @@
 
 #include <linux/pkt_cls.h>
 
+#include <algorithm>
 #include <map>
-#include <set>
 #include <utility>
 
 namespace swsec::testing {
@@ -175,13 +175,11 @@ std::string Twin::databases()
          return std::string("the two ports' ") + suffix + " nodes differ";
       }
    }
-   const auto inMap = program_.bindings();
    const fastpath::PortDescription inModule = fastpath::readPort(host_, kernel_, kernelPort_);
-   if (std::set(inMap.begin(), inMap.end()) != std::set(inModule.bindings.begin(), inModule.bindings.end())) {
+   if (!std::ranges::is_permutation(program_.bindings(), inModule.bindings)) {
       return "the binding map is not the kernel port's database";
    }
-   const auto inMap6 = program_.bindings6();
-   if (std::set(inMap6.begin(), inMap6.end()) != std::set(inModule.bindings6.begin(), inModule.bindings6.end())) {
+   if (!std::ranges::is_permutation(program_.bindings6(), inModule.bindings6)) {
       return "the IPv6 binding map is not the kernel port's IPv6 bindings";
    }
    return {};

@@ -27,9 +27,7 @@ std::vector<uint8_t> linkMessage(uint16_t type, int index, const char *name, uin
                                  uint8_t family = AF_UNSPEC)
 {
    std::vector<uint8_t> body(sizeof(ifinfomsg));
-   ifinfomsg info{};
-   info.ifi_family = family;
-   info.ifi_index = index;
+   const ifinfomsg info{.ifi_family = family, .ifi_index = index};
    std::memcpy(body.data(), &info, sizeof info);
    attr(body, IFLA_IFNAME, name, std::strlen(name) + 1);
    if (master != 0) {
@@ -42,9 +40,7 @@ std::vector<uint8_t> linkMessage(uint16_t type, int index, const char *name, uin
    std::vector<uint8_t> kind;
    attr(kind, IFLA_INFO_KIND, "tun", 4);
    attr(body, IFLA_LINKINFO, kind.data(), kind.size());
-   nlmsghdr header{};
-   header.nlmsg_len = static_cast<uint32_t>(NLMSG_HDRLEN + body.size());
-   header.nlmsg_type = type;
+   const nlmsghdr header{.nlmsg_len = static_cast<uint32_t>(NLMSG_HDRLEN + body.size()), .nlmsg_type = type};
    std::vector<uint8_t> out(NLMSG_HDRLEN + body.size());
    std::memcpy(out.data(), &header, sizeof header);
    std::memcpy(out.data() + NLMSG_HDRLEN, body.data(), body.size());

@@ -2,7 +2,6 @@
 
 #include <arpa/inet.h>
 
-#include <algorithm>
 #include <cstdio>
 #include <cstring>
 #include <stdexcept>
@@ -12,15 +11,11 @@ namespace swsec::testing {
 
 namespace {
 
-template <size_t N>
-void putArray(Bytes &out, const std::array<uint8_t, N> &bytes)
+// Appends bytes: an address's array or a payload.
+template <typename Range>
+void append(Bytes &out, const Range &bytes)
 {
    out.insert(out.end(), bytes.begin(), bytes.end());
-}
-
-void append(Bytes &out, const Bytes &tail)
-{
-   out.insert(out.end(), tail.begin(), tail.end());
 }
 
 uint16_t checksum(const uint8_t *data, size_t length)
@@ -40,13 +35,12 @@ uint16_t checksum(const uint8_t *data, size_t length)
 Mac Mac::parse(std::string_view text)
 {
    Mac mac;
-   unsigned b[6];
+   auto &b = mac.bytes;
    int end = 0;
-   if (std::sscanf(std::string(text).c_str(), "%2x:%2x:%2x:%2x:%2x:%2x%n", &b[0], &b[1], &b[2], &b[3], &b[4], &b[5], &end) != 6 ||
+   if (std::sscanf(std::string(text).c_str(), "%2hhx:%2hhx:%2hhx:%2hhx:%2hhx:%2hhx%n", &b[0], &b[1], &b[2], &b[3], &b[4], &b[5], &end) != 6 ||
        size_t(end) != text.size()) {
       throw std::invalid_argument("bad MAC: " + std::string(text));
    }
-   std::copy(b, b + 6, mac.bytes.begin());
    return mac;
 }
 
@@ -69,8 +63,8 @@ uint32_t Ip4::raw() const
 Bytes ethernet(const EthernetHeader &header, const Bytes &payload)
 {
    Bytes out;
-   putArray(out, header.dst.bytes);
-   putArray(out, header.src.bytes);
+   append(out, header.dst.bytes);
+   append(out, header.src.bytes);
    if (header.vlanTag) {
       put16be(out, kEtherVlan);
       put16be(out, static_cast<uint16_t>(*header.vlanTag & 0x0fff));
@@ -87,26 +81,23 @@ static Bytes arpPayload(const Arp &arp)
    put16be(out, arp.protocolType);
    out.insert(out.end(), {6, 4});
    put16be(out, arp.op);
-   putArray(out, arp.senderMac.bytes);
-   putArray(out, arp.senderIp.bytes);
-   putArray(out, arp.targetMac.bytes);
-   putArray(out, arp.targetIp.bytes);
+   append(out, arp.senderMac.bytes);
+   append(out, arp.senderIp.bytes);
+   append(out, arp.targetMac.bytes);
+   append(out, arp.targetIp.bytes);
    return out;
 }
 
 Bytes ipv4(const Ipv4Header &header, const Bytes &payload)
 {
    Bytes out;
-   out.push_back(0x45);
-   out.push_back(0);
+   out.insert(out.end(), {0x45, 0});
    put16be(out, static_cast<uint16_t>(20 + payload.size()));
    put16be(out, header.id);
    put16be(out, static_cast<uint16_t>(header.fragmentOffset & 0x1fff));
-   out.push_back(64);   // TTL
-   out.push_back(header.protocol);
-   put16be(out, 0);
-   putArray(out, header.src.bytes);
-   putArray(out, header.dst.bytes);
+   out.insert(out.end(), {64, header.protocol, 0, 0});   // TTL, protocol, checksum
+   append(out, header.src.bytes);
+   append(out, header.dst.bytes);
    uint16_t sum = checksum(out.data(), 20);
    out[10] = static_cast<uint8_t>(sum >> 8);
    out[11] = static_cast<uint8_t>(sum);
@@ -119,10 +110,9 @@ Bytes ipv6(const Ipv6Header &header, const Bytes &payload)
    Bytes out;
    put32be(out, 0x60000000u);
    put16be(out, static_cast<uint16_t>(payload.size()));
-   out.push_back(header.nextHeader);
-   out.push_back(64);
-   putArray(out, header.src);
-   putArray(out, header.dst);
+   out.insert(out.end(), {header.nextHeader, 64});
+   append(out, header.src);
+   append(out, header.dst);
    append(out, payload);
    return out;
 }
@@ -141,23 +131,18 @@ Bytes udp(const UdpHeader &header, const Bytes &payload)
 static Bytes dhcpPayload(const Dhcp &dhcp)
 {
    Bytes out;
-   out.push_back(dhcp.op);
-   out.push_back(dhcp.htype);
-   out.push_back(dhcp.hlen);
-   out.push_back(0);
+   out.insert(out.end(), {dhcp.op, dhcp.htype, dhcp.hlen, 0});
    put32be(out, dhcp.xid);
-   put16be(out, 0);
-   put16be(out, 0);
-   putArray(out, dhcp.ciaddr.bytes);
-   putArray(out, dhcp.yiaddr.bytes);
-   putArray(out, dhcp.siaddr.bytes);
+   put32be(out, 0);   // secs, flags
+   append(out, dhcp.ciaddr.bytes);
+   append(out, dhcp.yiaddr.bytes);
+   append(out, dhcp.siaddr.bytes);
    out.resize(out.size() + 4, 0);              // giaddr
-   putArray(out, dhcp.chaddr.bytes);
+   append(out, dhcp.chaddr.bytes);
    out.resize(out.size() + 10 + 64 + 128, 0);  // rest of chaddr, sname, file
-   putArray(out, dhcp.cookie);
+   append(out, dhcp.cookie);
    auto option = [&out](uint8_t code, const Bytes &value) {
-      out.push_back(code);
-      out.push_back(static_cast<uint8_t>(value.size()));
+      out.insert(out.end(), {code, static_cast<uint8_t>(value.size())});
       append(out, value);
    };
    if (dhcp.type) {

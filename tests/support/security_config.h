@@ -15,23 +15,15 @@ using contract::StaticBinding;
 using PortConfig = contract::PortSecurityConfig;
 
 // Learning: IP discovery alone on a trusted port, as every new port starts.
-inline PortConfig learningConfig()
-{
-   return PortConfig{};
-}
+inline PortConfig learningConfig() { return PortConfig{}; }
 
 // Enforcing: every feature on an untrusted port, with rate limits.
 inline PortConfig enforcingConfig(std::vector<StaticBinding> statics = {})
 {
-   PortConfig config;
-   config.features = SwSecFeatureBpduFilter | SwSecFeatureBlockDhcpServer | SwSecFeatureIpDiscovery |
-                     SwSecFeatureDai | SwSecFeatureIpSrcGuard;
-   config.trusted = false;
-   config.arpRateLimit = 10;
-   config.errRateLimit = 5;
-   config.errRateLimitPeriod = 10;
-   config.statics = std::move(statics);
-   return config;
+   return PortConfig{.features = SwSecFeatureBpduFilter | SwSecFeatureBlockDhcpServer | SwSecFeatureIpDiscovery |
+                                 SwSecFeatureDai | SwSecFeatureIpSrcGuard,
+                     .trusted = false, .arpRateLimit = 10, .errRateLimit = 5, .errRateLimitPeriod = 10,
+                     .statics = std::move(statics)};
 }
 
 }  // namespace swsec::testing

@@ -65,13 +65,13 @@ TEST_F(PortDbExportTest, each_selector_counts_its_entries_and_a_held_buffer_keep
    ASSERT_EQ(getEntries(kPort, 0, &entries, &count, &buffer), ORR_OK);
    ASSERT_EQ(count, 2u);
    EXPECT_EQ(entries, buffer);
+   // 32-byte records in list order: VLAN, MAC, type 1, address, authoritative 1, every other byte zero.
+   auto record = [](uint8_t vlan, const Mac &mac, uint8_t ip) {
+      return cat(cat(Bytes{vlan, 0}, Bytes(mac.bytes.begin(), mac.bytes.end())),
+                 {1, 0, 0, 0, 10, 0, 0, ip, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 1, 0, 0, 0});
+   };
    const auto *bytes = static_cast<const uint8_t *>(entries);
-   EXPECT_EQ(bytes[0], 5u);
-   EXPECT_EQ(bytes[7], 1u);
-   EXPECT_EQ(bytes[15], 1u);
-   EXPECT_EQ(bytes[28], 1u);
-   EXPECT_EQ(bytes[32 + 0], 6u);
-   EXPECT_EQ(bytes[32 + 15], 2u);
+   EXPECT_EQ(Bytes(bytes, bytes + 64), cat(record(5, kVmMac, 1), record(6, kPeerMac, 2)));
    EXPECT_EQ(host().useCount(), 1u);
    EXPECT_EQ(host().unload(), ORR_BUSY);
    EXPECT_EQ(releaseBuf(buffer), ORR_OK);

@@ -1,5 +1,4 @@
-// Port database messages on the portset, and the formats a database is
-// read out in.
+// Port database messages on the portset.
 #include "unit/hand_made_port.h"
 
 namespace swsec::testing {
@@ -80,55 +79,6 @@ TEST_F(PortDbNotifyTest, a_caller_holding_the_portset_keeps_its_hold_and_one_tur
    ASSERT_EQ(add({1, 2, 2}, kArp), 0);
    EXPECT_EQ(orr_PortsetHoldState(ctx_.portset), ORR_PORTSET_HOLD_NONE);
    EXPECT_EQ(delivered_.back(), added({1, 2, 2}, 0));
-}
-
-class PortDbQueryTest : public HandMadePortTest {
-protected:
-   // Two statics and three ARP entries, interleaved in list order: even MACs are static.
-   void fillFive()
-   {
-      for (uint8_t i = 1; i <= 5; i++) {
-         ASSERT_EQ(add({1, i, i}, i % 2 == 0 ? kStatic : kArp, 1000), 0);
-      }
-   }
-};
-
-TEST_F(PortDbQueryTest, each_format_writes_the_selected_entries_in_list_order)
-{
-   fillFive();
-   struct Row {
-      uint8_t mask;
-      std::vector<uint8_t> macs;
-   };
-   const Row rows[] = {{SwSecDiscAuthoritativeMask, {2, 4}},
-                       {SwSecDiscNonAuthoritativeMask, {1, 3, 5}},
-                       {SwSecDiscAllMask, {1, 2, 3, 4, 5}}};
-   for (const Row &row : rows) {
-      SCOPED_TRACE(int(row.mask));
-      const size_t n = row.macs.size();
-      // One record more than needed, filled with a canary, shows nothing is written past the end.
-      std::vector<uint8_t> entries(32 * (n + 1), 0xee);
-      std::vector<uint8_t> keys(12 * (n + 1), 0xee);
-      std::vector<SwSecVmi> vmis(n + 1);
-      SwSecQueryPortDb(&ctx_, entries.data(), SWSEC_QUERY_ENTRY, row.mask);
-      SwSecQueryPortDb(&ctx_, keys.data(), SWSEC_QUERY_KEY, row.mask);
-      SwSecQueryPortDb(&ctx_, vmis.data(), SWSEC_QUERY_VMI, row.mask);
-      for (size_t i = 0; i < n; i++) {
-         const Key want{1, row.macs[i], row.macs[i]};
-         // An entry is a message's payload after its operation and count.
-         std::array<uint8_t, 40> payload{0, 0, 0, 0, 1};
-         std::memcpy(payload.data() + 8, entries.data() + 32 * i, 32);
-         EXPECT_EQ(decodeNotice("", payload.data()), (Notice{"", 0, want, uint8_t(row.macs[i] % 2 == 0)}));
-         SwSecVmiKey key{};
-         std::memcpy(&key, keys.data() + 12 * i, 12);
-         const SwSecVmiKey wantKey = want.raw();
-         EXPECT_EQ(std::memcmp(&key, &wantKey, 12), 0);
-         EXPECT_EQ(keyOf(&vmis[i]), want);
-         EXPECT_EQ(vmis[i].discoveryMethod, row.macs[i] % 2 == 0 ? kStatic : kArp);
-      }
-      EXPECT_EQ(entries[32 * n], 0xee);
-      EXPECT_EQ(keys[12 * n], 0xee);
-   }
 }
 
 }  // namespace

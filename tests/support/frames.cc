@@ -37,8 +37,8 @@ Mac Mac::parse(std::string_view text)
    Mac mac;
    auto &b = mac.bytes;
    int end = 0;
-   if (std::sscanf(std::string(text).c_str(), "%2hhx:%2hhx:%2hhx:%2hhx:%2hhx:%2hhx%n", &b[0], &b[1], &b[2], &b[3], &b[4], &b[5], &end) != 6 ||
-       size_t(end) != text.size()) {
+   if (std::sscanf(std::string(text).c_str(), "%2hhx:%2hhx:%2hhx:%2hhx:%2hhx:%2hhx%n", &b[0], &b[1], &b[2], &b[3], &b[4],
+                   &b[5], &end) != 6 || size_t(end) != text.size()) {
       throw std::invalid_argument("bad MAC: " + std::string(text));
    }
    return mac;
@@ -188,15 +188,13 @@ Bytes pushTag(Bytes frame, uint16_t tpid, uint16_t vlanId, int count)
 
 Bytes arpFrame(const Mac &src, const Mac &dst, const Arp &arp, std::optional<uint16_t> vlanTag)
 {
-   return ethernet({.dst = dst, .src = src, .etherType = kEtherArp, .vlanTag = vlanTag},
-                   arpPayload(arp));
+   return ethernet({.dst = dst, .src = src, .etherType = kEtherArp, .vlanTag = vlanTag}, arpPayload(arp));
 }
 
 Bytes udpFrame(const UdpFrame &frame)
 {
    Bytes l4 = udp({.srcPort = frame.srcPort, .dstPort = frame.dstPort}, frame.payload);
-   return ethernet({.dst = frame.dst, .src = frame.src, .etherType = kEtherIpv4,
-                    .vlanTag = frame.vlanTag},
+   return ethernet({.dst = frame.dst, .src = frame.src, .etherType = kEtherIpv4, .vlanTag = frame.vlanTag},
                    ipv4({.src = frame.ipSrc, .dst = frame.ipDst, .protocol = 17}, l4));
 }
 

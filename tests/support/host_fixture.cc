@@ -1,5 +1,8 @@
 #include "host_fixture.h"
 
+#include <algorithm>
+#include <iterator>
+
 namespace swsec::testing {
 
 void HostTest::SetUp()
@@ -21,21 +24,8 @@ void HostTest::TearDown()
 std::vector<std::string> HostTest::logTexts() const
 {
    std::vector<std::string> texts;
-   for (const auto &record : host_->log().records()) {
-      texts.push_back(record.text);
-   }
+   std::ranges::transform(host_->log().records(), std::back_inserter(texts), &host::LogRecord::text);
    return texts;
-}
-
-bool HostTest::logged(std::string_view needle) const
-{
-   return host_->log().contains(needle);
-}
-
-void ModuleTest::SetUp()
-{
-   HostTest::SetUp();
-   ASSERT_EQ(host().load(), 0) << "module failed to load";
 }
 
 }  // namespace swsec::testing

@@ -25,7 +25,7 @@ protected:
    // Log texts, in order, for readable failure output.
    std::vector<std::string> logTexts() const;
    // True when some log record contains `needle`.
-   bool logged(std::string_view needle) const;
+   bool logged(std::string_view needle) const { return host_->log().contains(needle); }
 
 private:
    std::unique_ptr<host::Host> host_;
@@ -33,7 +33,11 @@ private:
 
 class ModuleTest : public HostTest {
 protected:
-   void SetUp() override;
+   void SetUp() override
+   {
+      HostTest::SetUp();
+      ASSERT_EQ(host().load(), 0) << "module failed to load";
+   }
 };
 
 }  // namespace swsec::testing

@@ -328,11 +328,9 @@ TEST_F(RateLimitTest, an_error_limit_of_zero_drops_everything_the_vm_sends_until
    EXPECT_TRUE(passes(id, kTx, arpProbe()));
 }
 
-TEST_F(RateLimitTest, without_an_arp_limit_nothing_is_limited_and_an_arp_header_cut_short_is_not_inspected)
+TEST_F(FilterTest, an_arp_header_cut_short_is_not_inspected)
 {
    const host::FilterId id = port({kDai, 0, 32, 0, 0, 0});
-   EXPECT_EQ(send(id, kTx, std::vector<Bytes>(50, arpProbe())).kept.size(), 50u);
-   EXPECT_EQ(send(id, kRx, std::vector<Bytes>(50, arpFrom(kPeerMac, kPeerIp))).kept.size(), 50u);
    Bytes cut = arpFrom(kPeerMac, kPeerIp);   // an unbound sender, one byte short of the header
    cut.resize(14 + 27);
    EXPECT_TRUE(passes(id, kTx, cut));

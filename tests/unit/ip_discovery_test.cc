@@ -114,7 +114,9 @@ TEST_P(RenewalTest, the_ack_of_a_renewal_refiles_or_retires_the_binding)
    EXPECT_EQ(posts(), c.posts);
    EXPECT_EQ(ctx_.numDhcpReqs, 0u);
    expectCountersAgree();
-   if (const SwSecVmi *vmi = find(c.address); vmi != nullptr && vmi->discoveryMethod == kDhcp) {
+   const SwSecVmi *vmi = find(c.address);
+   ASSERT_NE(vmi, nullptr) << "found under its new address: refiled in the hash table";
+   if (vmi->discoveryMethod == kDhcp) {
       EXPECT_EQ(vmi->leaseTime, kInfiniteLease);
       EXPECT_EQ(vmi->expiryTime, uptime() + int64_t{kInfiniteLease});
    }

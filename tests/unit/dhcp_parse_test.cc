@@ -226,38 +226,36 @@ TEST_F(DhcpParseTest, header_inside_one_unmapped_element_is_read_in_place)
    EXPECT_EQ(*frame->info.dhcpMsgType, kDhcpRequest);
 }
 
-TEST_F(DhcpParseTest, failed_copy_is_reported_twice_and_leaves_no_copy)
+// A failed copy, or no memory for one, is reported with what needed it and leaves no copy.
+TEST_F(DhcpParseTest, failed_copies_are_reported_with_what_needed_them_and_leave_no_copy)
 {
-   auto frame = wrap(frameOf(request()), 0, {kDhcpOffset + 100}, kDhcpOffset + 100);
-   host().faults().failOnce("orr_PktCopyBytesOut", ORR_FAILURE);
-   EXPECT_EQ(parse(*frame), -1);
-   const auto logged = errors();
-   ASSERT_EQ(logged.size(), 2u) << ::testing::PrintToString(logTexts());
-   EXPECT_NE(logged[0].find("Failed to copy pkt: Failure(" + std::to_string(frame->info.frameLen) +
-                            ")\n"),
-             std::string::npos)
-      << logged[0];
-   EXPECT_NE(logged[1].find("port-7: Can't access DHCP hdr\n"), std::string::npos) << logged[1];
-   EXPECT_EQ(frame->info.pktCopy, nullptr);
-}
-
-TEST_F(DhcpParseTest, failed_copy_allocation_is_reported_with_the_option_that_needed_it)
-{
-   // The header is mapped; the client identifier's value straddles the elements.
-   Dhcp dhcp = request();
-   dhcp.clientId = Bytes{1, 2, 3};
-   auto frame = wrap(frameOf(dhcp), 0, {kBareEnd + 6}, kBareEnd + 6);
-   host().faults().failOnce("orr_HeapAllocWithRA", ORR_NO_MEMORY);
-   EXPECT_EQ(parse(*frame), -1);
-   const auto logged = errors();
-   ASSERT_EQ(logged.size(), 2u) << ::testing::PrintToString(logTexts());
-   EXPECT_NE(logged[0].find("Failed to alloc pktCopy: " + std::to_string(frame->info.frameLen) + "\n"),
-             std::string::npos)
-      << logged[0];
-   EXPECT_NE(logged[1].find("port-7: Can't access DHCP option: " + std::to_string(kBareEnd + 5)),
-             std::string::npos)
-      << logged[1];
-   EXPECT_EQ(frame->info.pktCopy, nullptr);
+   Dhcp withId = request();
+   withId.clientId = Bytes{1, 2, 3};   // the header mapped, the identifier's value across the elements
+   const struct {
+      Dhcp dhcp;
+      uint32_t split;   // the mapped length and the first element's end
+      const char *op;
+      orr_Status status;
+      std::string copy;
+      std::string access;
+   } cases[] = {
+      {request(), kDhcpOffset + 100, "orr_PktCopyBytesOut", ORR_FAILURE, "Failed to copy pkt: Failure(",
+       "port-7: Can't access DHCP hdr\n"},
+      {withId, kBareEnd + 6, "orr_HeapAllocWithRA", ORR_NO_MEMORY, "Failed to alloc pktCopy: ",
+       "port-7: Can't access DHCP option: " + std::to_string(kBareEnd + 5)},
+   };
+   for (const auto &c : cases) {
+      SCOPED_TRACE(c.op);
+      host().log().clear();
+      auto frame = wrap(frameOf(c.dhcp), 0, {c.split}, c.split);
+      host().faults().failOnce(c.op, c.status);
+      EXPECT_EQ(parse(*frame), -1);
+      const auto logged = errors();
+      ASSERT_EQ(logged.size(), 2u) << ::testing::PrintToString(logTexts());
+      EXPECT_NE(logged[0].find(c.copy + std::to_string(frame->info.frameLen)), std::string::npos) << logged[0];
+      EXPECT_NE(logged[1].find(c.access), std::string::npos) << logged[1];
+      EXPECT_EQ(frame->info.pktCopy, nullptr);
+   }
 }
 
 TEST_F(DhcpParseTest, mapped_access_refuses_ranges_beyond_the_frame_and_keeps_the_offset)

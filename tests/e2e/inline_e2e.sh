@@ -48,7 +48,7 @@ start_inline() {
 
 step "swsec inline guards vm1 and vm2 (no saved state yet)"
 start_inline --state-dir "$state"
-grep -q "vm1: no saved state" "$work/inline.log" || fail "a missing state file was not reported"
+wait_for 5 grep -q "vm1: no saved state" "$work/inline.log" || fail "a missing state file was not reported"
 if [ "$datapath" = kernel ]; then
   [ "$(master_of vm1p)" = br0 ] || fail "vm1p is not in the bridge on the kernel data path"
   tc -n "$sw" filter show dev vm1p ingress | grep -q swsec_from_vm || fail "no program on vm1p's ingress"
@@ -98,7 +98,7 @@ step "a damaged state file is reported and skipped: vm2 starts empty, vm1 keeps 
 inline_stop
 truncate -s $(($(stat -c %s "$state/vm2.state") / 2)) "$state/vm2.state"
 start_inline --state-dir "$state"
-grep -q "vm2: .*saved state refused: .*the port starts empty" "$work/inline.log" \
+wait_for 5 grep -q "vm2: .*saved state refused: .*the port starts empty" "$work/inline.log" \
   || fail "the damaged state file was not reported"
 sw_ctl ports --json | json "all(p['running'] for p in d)" | grep -qx True || fail "a port did not start"
 sw_ctl bindings vm2 --json | json "len(d)" | grep -qx 0 || fail "vm2 not empty: $(sw_ctl bindings vm2 --json)"
@@ -289,11 +289,12 @@ step "fail open: restarted on a port left closed, stopped, vm1 back on the bridg
 # After a killed kernel-path run, on the user path: the program left behind must go.
 if [ "$datapath" = kernel ]; then
   datapath=user inline_start --bridge br0 --port vm1=vm1p --fail open
-  grep -q "removed the fast path program a killed run left" "$work/inline.log" || fail "the killed run's program stayed"
+  wait_for 5 grep -q "removed the fast path program a killed run left" "$work/inline.log" || fail "the killed run's program stayed"
 else
   inline_start --bridge br0 --port vm1=vm1p --fail open
 fi
-grep -q "left by an earlier run" "$work/inline.log" || fail "the killed run's pair was not replaced"
+# The control socket answers before the ports are up: wait for the port's own line.
+wait_for 5 grep -q "left by an earlier run" "$work/inline.log" || fail "the killed run's pair was not replaced"
 # The failed pings above left the server's address unresolved (FAILED),
 # which the kernel does not probe again for a while.
 ip -n "$vm1" neigh flush all

@@ -56,7 +56,7 @@ start_inline() {
 step "a FIFO where a state file belongs does not hold up the start"
 mkfifo "$state/vm2.state"
 start_inline
-grep -q "vm2: .*not a regular file; the port starts empty" "$work/inline.log" || fail "the FIFO was not reported"
+wait_for 5 grep -q "vm2: .*not a regular file; the port starts empty" "$work/inline.log" || fail "the FIFO was not reported"
 rm "$state/vm2.state"
 
 step "leases learned as bindings"
